@@ -1,0 +1,58 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+
+#include "AssetService/RemoteObjectFactory.h"
+#include "platform/DispatchQueue.h"
+#include "platform/PlistValue.h"
+#include "store-runtime/VendStoreClient.h"
+
+namespace larder {
+
+class SoftwareMap;
+
+// One client connection: the client's store client and the queue its
+// requests run on. It holds nothing else; every request resolves the
+// object that does the work anew.
+class AssetServiceInterface {
+ public:
+  AssetServiceInterface(std::string peer, SoftwareMap& softwareMap,
+                        std::shared_ptr<RemoteObjectFactory> remoteObjects);
+
+  [[nodiscard]] const std::string& peer() const { return peer_; }
+  [[nodiscard]] const std::shared_ptr<DispatchQueue>& requestQueue() const { return requestQueue_; }
+
+  [[nodiscard]] std::optional<VendStoreClient> storeClient() const;
+  void setStoreClient(VendStoreClient storeClient);
+  void startService();
+  // For the requests that name a client type of their own: sets a client
+  // of that type when the connection has none, and leaves an existing one.
+  void setStoreClientFromTypeIfNeeded(std::int64_t clientType);
+
+  // Installed software.
+  [[nodiscard]] PlistDictionary productForBundleIdentifier(const std::string& bundleIdentifier);
+  [[nodiscard]] PlistDictionary productForItemIdentifier(std::uint64_t itemIdentifier);
+  [[nodiscard]] PlistArray allProducts();
+  [[nodiscard]] PlistDictionary createSoftwareProductForAppAtPath(const std::string& path);
+  [[nodiscard]] PlistDictionary bundleInfoFromBundleAtPath(const std::string& path);
+  [[nodiscard]] PlistData iconForApplicationWithBundeID(const std::string& bundleIdentifier);
+  [[nodiscard]] std::string addSoftwareMapObserver(const std::string& objectPath);
+  void removeSoftwareMapObserver(const std::string& token);
+
+  [[nodiscard]] SoftwareMap& softwareMap() const { return softwareMap_; }
+
+ private:
+  std::string peer_;
+  SoftwareMap& softwareMap_;
+  std::shared_ptr<RemoteObjectFactory> remoteObjects_;
+  std::shared_ptr<DispatchQueue> requestQueue_;
+  mutable std::mutex storeClientMutex_;
+  std::optional<VendStoreClient> storeClient_;
+};
+
+}  // namespace larder

@@ -1,0 +1,55 @@
+#include "AssetService/ServiceClient.h"
+
+#include <stdexcept>
+
+#include "AssetService/DBusValueCodec.h"
+#include "AssetService/RequestTable.h"
+#include "platform/Environment.h"
+#include "store-runtime/VendStoreClient.h"
+
+namespace larder {
+
+ServiceClient::ServiceClient(const std::string& serviceName, std::uint64_t timeoutMicroseconds)
+    : ServiceClient(Environment::variable("LARDER_BUS") == "system"
+                        ? sdbus::createSystemBusConnection()
+                        : sdbus::createSessionBusConnection(),
+                    serviceName, timeoutMicroseconds) {}
+
+ServiceClient::ServiceClient(std::unique_ptr<sdbus::IConnection> connection,
+                             const std::string& serviceName, std::uint64_t timeoutMicroseconds)
+    : connection_(std::move(connection)),
+      proxy_(sdbus::createProxy(*connection_, serviceName, std::string(RequestTable::kObjectPath))),
+      timeout_(timeoutMicroseconds) {
+  connection_->enterEventLoopAsync();
+}
+
+void ServiceClient::presentStoreClient(std::int64_t clientType) {
+  call("SetStoreClient", {VendStoreClient::initWithStoreClientType(clientType).toDictionary()});
+  call("StartService", {});
+}
+
+PlistArray ServiceClient::call(const std::string& member, const PlistArray& arguments) {
+  const RequestDescriptor* request = RequestTable::find(member);
+  if (!request) throw std::invalid_argument("unknown request " + member);
+  sdbus::MethodCall message =
+      proxy_->createMethodCall(std::string(RequestTable::kInterfaceName), member);
+  DBusValueCodec::writeAll(message, request->inSignature, arguments);
+  sdbus::MethodReply reply = proxy_->callMethod(message, timeout_);
+  return DBusValueCodec::readAll(reply, request->outSignature);
+}
+
+void ServiceClient::exportSoftwareMapObserver(
+    const std::string& objectPath, std::function<void(const PlistValue&, std::int64_t)> onChange) {
+  observer_ = sdbus::createObject(*connection_, objectPath);
+  observer_->registerMethod(
+      std::string(RequestTable::kCallbackInterfacePrefix) + "VendSoftwareMapObserver",
+      "SoftwareProductUpdatedState", "a{sv}x", "",
+      [onChange = std::move(onChange)](sdbus::MethodCall call) {
+        PlistArray arguments = DBusValueCodec::readAll(call, "a{sv}x");
+        onChange(arguments.at(0), arguments.at(1).int64Value());
+        if (!call.doesntExpectReply()) call.createReply().send();
+      });
+  observer_->finishRegistration();
+}
+
+}  // namespace larder

@@ -1,0 +1,46 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <string>
+
+#include <sdbus-c++/IConnection.h>
+#include <sdbus-c++/IObject.h>
+#include <sdbus-c++/IProxy.h>
+
+#include "platform/PlistValue.h"
+
+namespace larder {
+
+// A client's side of the bus (larderctl, tests): calls requests of the service by their
+// D-Bus name with property-list arguments, and exports callback objects.
+class ServiceClient {
+ public:
+  ServiceClient(const std::string& serviceName, std::uint64_t timeoutMicroseconds);
+  // On a given connection, for instance to a bus at a private address.
+  ServiceClient(std::unique_ptr<sdbus::IConnection> connection, const std::string& serviceName,
+                std::uint64_t timeoutMicroseconds);
+
+  // Presents a store client of that type, as every client does first.
+  void presentStoreClient(std::int64_t clientType);
+
+  // Calls `member`; the reply's arguments in order. Throws sdbus::Error on
+  // a D-Bus error and std::invalid_argument for an unknown request.
+  PlistArray call(const std::string& member, const PlistArray& arguments);
+
+  // Exports a software map observer at `objectPath` that hands every
+  // callback to `onChange`.
+  void exportSoftwareMapObserver(const std::string& objectPath,
+                                 std::function<void(const PlistValue&, std::int64_t)> onChange);
+
+  sdbus::IConnection& connection() { return *connection_; }
+
+ private:
+  std::unique_ptr<sdbus::IConnection> connection_;
+  std::unique_ptr<sdbus::IProxy> proxy_;
+  std::unique_ptr<sdbus::IObject> observer_;
+  std::uint64_t timeout_;
+};
+
+}  // namespace larder

@@ -1,0 +1,159 @@
+#include "AssetService/ServiceListener.h"
+
+#include <sdbus-c++/Error.h>
+#include <sdbus-c++/IProxy.h>
+
+#include "AssetService/DBusValueCodec.h"
+#include "platform/Environment.h"
+#include "software-map/SoftwareMap.h"
+#include "store-runtime/TillLogManager.h"
+
+namespace larder {
+
+namespace {
+
+constexpr std::string_view kSpeaker = "ServiceListener";
+
+std::unique_ptr<sdbus::IConnection> connectToBus() {
+  if (Environment::variable("LARDER_BUS") == "system") return sdbus::createSystemBusConnection();
+  return sdbus::createSessionBusConnection();
+}
+
+// An observer that lives in a client: each call is sent without waiting
+// for an answer, and a client that has gone simply never receives it.
+class DBusSoftwareMapObserver final : public VendSoftwareMapObserver {
+ public:
+  DBusSoftwareMapObserver(sdbus::IConnection& connection, const std::string& peer,
+                          const std::string& objectPath)
+      : proxy_(sdbus::createProxy(connection, peer, objectPath)) {}
+
+  void softwareProductUpdatedState(const LedgerSoftwareProductRef& product,
+                                   std::int64_t state) override {
+    try {
+      sdbus::MethodCall call = proxy_->createMethodCall(
+          std::string(RequestTable::kCallbackInterfacePrefix) + "VendSoftwareMapObserver",
+          "SoftwareProductUpdatedState");
+      DBusValueCodec::writeAll(call, "a{sv}x", {product->toDictionary(), state});
+      call.dontExpectReply();
+      proxy_->callMethod(call);
+    } catch (const sdbus::Error& error) {
+      TILL_LOG(3, "%@: observer call dropped: %@", kSpeaker, error.what());
+    }
+  }
+
+ private:
+  std::unique_ptr<sdbus::IProxy> proxy_;
+};
+
+}  // namespace
+
+class ServiceListener::RemoteObjects final : public RemoteObjectFactory {
+ public:
+  explicit RemoteObjects(sdbus::IConnection& connection) : connection_(connection) {}
+
+  std::shared_ptr<VendSoftwareMapObserver> softwareMapObserver(
+      const std::string& peer, const std::string& objectPath) override {
+    return std::make_shared<DBusSoftwareMapObserver>(connection_, peer, objectPath);
+  }
+
+ private:
+  sdbus::IConnection& connection_;
+};
+
+ServiceListener::ServiceListener(std::string serviceName, SoftwareMap& softwareMap)
+    : serviceName_(std::move(serviceName)), softwareMap_(softwareMap) {}
+
+ServiceListener::~ServiceListener() {
+  if (connection_) connection_->leaveEventLoop();
+}
+
+void ServiceListener::setDelegate(std::shared_ptr<AssetServiceDelegate> delegate) {
+  delegate_ = std::move(delegate);
+}
+
+void ServiceListener::resume() {
+  connection_ = connectToBus();
+  remoteObjects_ = std::make_shared<RemoteObjects>(*connection_);
+  object_ = sdbus::createObject(*connection_, std::string(RequestTable::kObjectPath));
+  for (const RequestDescriptor& request : RequestTable::requests()) {
+    object_->registerMethod(
+        std::string(RequestTable::kInterfaceName), std::string(request.member),
+        std::string(request.inSignature), std::string(request.outSignature),
+        [this, &request](sdbus::MethodCall call) { dispatch(request, std::move(call)); });
+  }
+  object_->finishRegistration();
+  connection_->addMatch(
+      "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop.DBus',"
+      "member='NameOwnerChanged',path='/org/freedesktop/DBus'",
+      [this](sdbus::Message& signal) { peerDidChangeOwner(signal); }, sdbus::floating_slot);
+  // The name is taken last, so that no client can reach the service before
+  // every request is in place.
+  connection_->requestName(serviceName_);
+  connection_->enterEventLoopAsync();
+}
+
+std::size_t ServiceListener::connectionCount() const {
+  std::lock_guard lock(peersMutex_);
+  return peers_.size();
+}
+
+std::shared_ptr<AssetServiceInterface> ServiceListener::interfaceForPeer(const std::string& peer) {
+  std::lock_guard lock(peersMutex_);
+  auto found = peers_.find(peer);
+  if (found != peers_.end()) return found->second;
+  auto interface = AssetServiceDelegate::clientInterface(peer, softwareMap_, remoteObjects_);
+  peers_.emplace(peer, interface);
+  TILL_LOG(3, "%@: accepted connection from %@", kSpeaker, peer);
+  return interface;
+}
+
+void ServiceListener::peerDidChangeOwner(sdbus::Message& signal) {
+  std::string name;
+  std::string oldOwner;
+  std::string newOwner;
+  signal >> name >> oldOwner >> newOwner;
+  if (!newOwner.empty()) return;
+  std::lock_guard lock(peersMutex_);
+  // Work the peer left queued still runs: its items hold the object.
+  if (peers_.erase(name) > 0) TILL_LOG(3, "%@: connection from %@ ended", kSpeaker, name);
+}
+
+void ServiceListener::dispatch(const RequestDescriptor& request, sdbus::MethodCall call) {
+  PlistArray arguments;
+  try {
+    arguments = DBusValueCodec::readAll(call, request.inSignature);
+  } catch (const sdbus::Error& error) {
+    call.createErrorReply(error).send();
+    return;
+  }
+  std::shared_ptr<AssetServiceInterface> interface = interfaceForPeer(call.getSender());
+  auto pending = std::make_shared<sdbus::MethodCall>(std::move(call));
+  ReplyHandler reply;
+  if (!pending->doesntExpectReply()) {
+    reply = [pending, signature = request.outSignature](PlistArray outArguments) {
+      sdbus::MethodReply message = pending->createReply();
+      DBusValueCodec::writeAll(message, signature, outArguments);
+      message.send();
+    };
+  }
+  auto work = [&request, interface, arguments = std::move(arguments), reply, pending] {
+    try {
+      RequestTable::perform(request, *interface, arguments, reply);
+      if (request.outSignature.empty() && reply) reply({});
+    } catch (const std::exception& exception) {
+      TILL_LOG(1, "%@: %@ failed: %@", kSpeaker, request.selector, exception.what());
+      if (reply) {
+        pending
+            ->createErrorReply(sdbus::Error("org.freedesktop.DBus.Error.Failed", exception.what()))
+            .send();
+      }
+    }
+  };
+  if (request.direct) {
+    work();
+  } else {
+    interface->requestQueue()->async(std::move(work));
+  }
+}
+
+}  // namespace larder

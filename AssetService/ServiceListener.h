@@ -1,0 +1,56 @@
+#pragma once
+
+#include <map>
+#include <memory>
+#include <mutex>
+#include <string>
+
+#include <sdbus-c++/IConnection.h>
+#include <sdbus-c++/IObject.h>
+#include <sdbus-c++/Message.h>
+
+#include "AssetService/AssetServiceDelegate.h"
+#include "AssetService/AssetServiceInterface.h"
+#include "AssetService/RequestTable.h"
+
+namespace larder {
+
+class SoftwareMap;
+
+// The service on the bus: owns the bus name, exports the request table on
+// the service object and routes each call to the object of its peer. A
+// peer (unique bus name) is one client connection; its object ends when
+// the peer leaves the bus, and nothing else does.
+class ServiceListener {
+ public:
+  ServiceListener(std::string serviceName, SoftwareMap& softwareMap);
+  ~ServiceListener();
+  ServiceListener(const ServiceListener&) = delete;
+  ServiceListener& operator=(const ServiceListener&) = delete;
+
+  void setDelegate(std::shared_ptr<AssetServiceDelegate> delegate);
+  // Connects, exports the object, takes the name and starts delivering
+  // requests on the bus thread. Throws sdbus::Error when the bus refuses.
+  void resume();
+
+  [[nodiscard]] std::size_t connectionCount() const;
+
+ private:
+  class RemoteObjects;
+
+  void dispatch(const RequestDescriptor& request, sdbus::MethodCall call);
+  std::shared_ptr<AssetServiceInterface> interfaceForPeer(const std::string& peer);
+  void peerDidChangeOwner(sdbus::Message& signal);
+
+  std::string serviceName_;
+  SoftwareMap& softwareMap_;
+  std::shared_ptr<AssetServiceDelegate> delegate_;
+  std::unique_ptr<sdbus::IConnection> connection_;
+  std::unique_ptr<sdbus::IObject> object_;
+  std::shared_ptr<RemoteObjects> remoteObjects_;
+
+  mutable std::mutex peersMutex_;
+  std::map<std::string, std::shared_ptr<AssetServiceInterface>, std::less<>> peers_;
+};
+
+}  // namespace larder

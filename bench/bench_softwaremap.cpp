@@ -1,0 +1,74 @@
+// Lookups and load of the software map with 10,000 products.
+#include <benchmark/benchmark.h>
+
+#include <memory>
+#include <random>
+
+#include "ProductStoreFixture.h"
+#include "software-map/SoftwareMap.h"
+#include "store-runtime/TillLogManager.h"
+
+namespace {
+
+using larder::SoftwareMap;
+using larder::bench::ProductStoreFixture;
+
+constexpr std::size_t kProducts = 10'000;
+
+struct Shared {
+  Shared() : fixture(kProducts) {
+    larder::TillLogManager::sharedManager().setLevel(0);
+    map = std::make_unique<SoftwareMap>(
+        SoftwareMap::Options{fixture.storePath(), /*discoverApplications=*/false});
+    map->waitUntilIdle();
+    for (std::size_t i = 0; i < kProducts; ++i) {
+      identifiers.push_back(ProductStoreFixture::bundleIdentifier(i));
+    }
+  }
+  ProductStoreFixture fixture;
+  std::unique_ptr<SoftwareMap> map;
+  std::vector<std::string> identifiers;
+};
+
+Shared& shared() {
+  static Shared instance;
+  return instance;
+}
+
+void BM_ProductForBundleIdentifier(benchmark::State& state) {
+  Shared& s = shared();
+  std::minstd_rand random(static_cast<unsigned>(state.thread_index()) + 1);
+  benchmark::IterationCount found = 0;
+  for (auto _ : state) {
+    const std::string& identifier = s.identifiers[random() % kProducts];
+    found += s.map->productForBundleIdentifier(identifier) != nullptr;
+  }
+  if (found != state.iterations()) state.SkipWithError("a lookup found nothing");
+  state.SetItemsProcessed(state.iterations());
+}
+BENCHMARK(BM_ProductForBundleIdentifier)->Threads(1)->Threads(2)->UseRealTime();
+
+void BM_ProductForItemIdentifier(benchmark::State& state) {
+  Shared& s = shared();
+  std::minstd_rand random(7);
+  for (auto _ : state) {
+    benchmark::DoNotOptimize(s.map->productForItemIdentifier(400000000 + random() % kProducts));
+  }
+  state.SetItemsProcessed(state.iterations());
+}
+BENCHMARK(BM_ProductForItemIdentifier);
+
+// From construction to the first answered lookup: the whole load of the
+// persisted store, decode and secondary maps included.
+void BM_LoadPersistedStore(benchmark::State& state) {
+  Shared& s = shared();
+  for (auto _ : state) {
+    SoftwareMap map(SoftwareMap::Options{s.fixture.storePath(), false});
+    if (!map.productForBundleIdentifier(s.identifiers[42])) state.SkipWithError("not loaded");
+  }
+}
+BENCHMARK(BM_LoadPersistedStore)->Unit(benchmark::kMillisecond);
+
+}  // namespace
+
+BENCHMARK_MAIN();

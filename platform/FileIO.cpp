@@ -1,0 +1,118 @@
+#include "platform/FileIO.h"
+
+#include "platform/FileDescriptor.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <filesystem>
+#include <random>
+#include <utility>
+
+namespace larder {
+
+namespace {
+
+bool fail(std::string* error, const std::string& what) {
+  if (error) *error = what + ": " + std::strerror(errno);
+  return false;
+}
+
+bool writeAll(int fd, std::span<const std::uint8_t> bytes) {
+  while (!bytes.empty()) {
+    ssize_t written = ::write(fd, bytes.data(), bytes.size());
+    if (written < 0) {
+      if (errno == EINTR) continue;
+      return false;
+    }
+    bytes = bytes.subspan(static_cast<std::size_t>(written));
+  }
+  return true;
+}
+
+std::string temporarySibling(const std::string& path) {
+  thread_local std::mt19937_64 generator{std::random_device{}()};
+  return path + ".tmp-" + std::to_string(::getpid()) + "-" + std::to_string(generator());
+}
+
+void syncParentDirectory(const std::string& path) {
+  std::string parent = std::filesystem::path(path).parent_path().string();
+  FileDescriptor directory(::open(parent.empty() ? "." : parent.c_str(), O_RDONLY | O_DIRECTORY));
+  if (directory.valid()) ::fsync(directory.get());
+}
+
+}  // namespace
+
+std::optional<std::vector<std::uint8_t>> FileIO::read(const std::string& path, std::size_t maxBytes,
+                                                      std::string* error) {
+  FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  if (!file.valid()) {
+    fail(error, "open " + path);
+    return std::nullopt;
+  }
+  struct stat info {};
+  if (::fstat(file.get(), &info) != 0 || !S_ISREG(info.st_mode)) {
+    if (error) *error = path + " is not a regular file";
+    return std::nullopt;
+  }
+  std::vector<std::uint8_t> contents;
+  contents.reserve(static_cast<std::size_t>(info.st_size));
+  std::uint8_t buffer[65536];
+  for (;;) {
+    ssize_t count = ::read(file.get(), buffer, sizeof buffer);
+    if (count < 0) {
+      if (errno == EINTR) continue;
+      fail(error, "read " + path);
+      return std::nullopt;
+    }
+    if (count == 0) break;
+    if (contents.size() + static_cast<std::size_t>(count) > maxBytes) {
+      if (error) *error = path + " is larger than " + std::to_string(maxBytes) + " bytes";
+      return std::nullopt;
+    }
+    contents.insert(contents.end(), buffer, buffer + count);
+  }
+  return contents;
+}
+
+bool FileIO::createDirectories(const std::string& path, std::string* error) {
+  std::error_code code;
+  std::filesystem::create_directories(path, code);
+  if (code && !std::filesystem::is_directory(path)) {
+    if (error) *error = "create " + path + ": " + code.message();
+    return false;
+  }
+  return true;
+}
+
+bool FileIO::writeAtomically(const std::string& path, std::span<const std::uint8_t> bytes,
+                             std::string* error) {
+  std::string parent = std::filesystem::path(path).parent_path().string();
+  if (!parent.empty() && !createDirectories(parent, error)) return false;
+  std::string temporary = temporarySibling(path);
+  FileDescriptor file(
+      ::open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, S_IRUSR | S_IWUSR));
+  if (!file.valid()) return fail(error, "create " + temporary);
+  if (!writeAll(file.get(), bytes) || ::fsync(file.get()) != 0) {
+    fail(error, "write " + temporary);
+    ::unlink(temporary.c_str());
+    return false;
+  }
+  if (::close(file.release()) != 0 || ::rename(temporary.c_str(), path.c_str()) != 0) {
+    fail(error, "replace " + path);
+    ::unlink(temporary.c_str());
+    return false;
+  }
+  syncParentDirectory(path);
+  return true;
+}
+
+bool FileIO::writeAtomically(const std::string& path, std::string_view text, std::string* error) {
+  return writeAtomically(
+      path, std::span(reinterpret_cast<const std::uint8_t*>(text.data()), text.size()), error);
+}
+
+}  // namespace larder

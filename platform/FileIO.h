@@ -1,0 +1,32 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <optional>
+#include <span>
+#include <string>
+#include <vector>
+
+namespace larder {
+
+// Whole-file reads and crash-safe writes.
+class FileIO {
+ public:
+  // Contents of the file, or nullopt when it cannot be read or is larger
+  // than `maxBytes` (outside data never gets to allocate without bound).
+  static std::optional<std::vector<std::uint8_t>> read(const std::string& path,
+                                                       std::size_t maxBytes = 256u << 20u,
+                                                       std::string* error = nullptr);
+
+  // Writes to a temporary file beside `path`, flushes it to disk and
+  // renames it over `path`, so that a reader sees the old or the new
+  // contents and never a torn file. Creates missing parent folders.
+  static bool writeAtomically(const std::string& path, std::span<const std::uint8_t> bytes,
+                              std::string* error = nullptr);
+  static bool writeAtomically(const std::string& path, std::string_view text,
+                              std::string* error = nullptr);
+
+  static bool createDirectories(const std::string& path, std::string* error = nullptr);
+};
+
+}  // namespace larder

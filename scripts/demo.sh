@@ -1,0 +1,93 @@
+#!/usr/bin/env bash
+# Installs what is missing, builds, and shows the service at work: larderd
+# on a private bus over a temporary platform with sample bundles, asked by
+# larderctl. Usage: scripts/demo.sh [build-dir]
+set -euo pipefail
+cd "$(dirname "$0")/.."
+build=${1:-build}
+if [ -z "${LARDER_DEMO_ON_BUS:-}" ]; then
+  ./scripts/install-deps.sh
+  cmake -S . -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
+  cmake --build "$build" -j"$(nproc)" --target larderd larderctl
+  exec env LARDER_DEMO_ON_BUS=1 dbus-run-session -- "$0" "$build"
+fi
+
+larderd="$PWD/$build/larderd"
+larderctl="$PWD/$build/larderctl"
+demo=$(mktemp -d /tmp/larder-demo-XXXXXX)
+export LARDER_ROOT="$demo/root" HOME="$demo/home"
+export XDG_CACHE_HOME="$HOME/.cache" XDG_STATE_HOME="$HOME/.local/state"
+mkdir -p "$LARDER_ROOT/Applications" "$HOME/Applications"
+
+plist_header='<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0">'
+
+# bundle FOLDER NAME IDENTIFIER VERSION [ITEM-ID]
+bundle() {
+  local path="$1/$2.app"
+  mkdir -p "$path/resources" "$path/bin"
+  cat >"$path/bundle.plist" <<PLIST
+$plist_header
+<dict>
+  <key>HostBundleIdentifier</key><string>$3</string>
+  <key>HostBundleShortVersionString</key><string>$4</string>
+  <key>HostBundleVersion</key><string>$4</string>
+  <key>HostBundleExecutable</key><string>$2</string>
+</dict>
+</plist>
+PLIST
+  [ -n "${5:-}" ] && purchase "$path" "$3" "$4" "$5"
+  return 0
+}
+
+# purchase BUNDLE IDENTIFIER VERSION ITEM-ID [VERSION-ID]
+purchase() {
+  cat >"$1/purchase.plist" <<PLIST
+$plist_header
+<dict>
+  <key>bundleIdentifier</key><string>$2</string>
+  <key>bundleVersion</key><string>$3</string>
+  <key>wareID</key><integer>$4</integer>
+  <key>installerVersionID</key><integer>${5:-1}</integer>
+  <key>opaqueAccountIDString</key><string>demo-account</string>
+  <key>purchaseDate</key><date>2026-01-15T10:00:00Z</date>
+</dict>
+</plist>
+PLIST
+}
+
+bundle "$LARDER_ROOT/Applications" "Ledgerly" com.example.ledgerly 2.4 400100
+bundle "$LARDER_ROOT/Applications" "Sketchpad" com.example.sketchpad 1.9 400200
+bundle "$HOME/Applications" "Sketchpad" com.example.sketchpad 1.10 400200
+bundle "$LARDER_ROOT/Applications" "Terminal Helper" com.example.helper 1.0
+
+echo "== starting larderd (log: $XDG_STATE_HOME/larderd.log)"
+mkdir -p "$XDG_STATE_HOME"
+"$larderd" 2>"$XDG_STATE_HOME/larderd.log" &
+service=$!
+trap 'kill $service 2>/dev/null; rm -rf "$demo"' EXIT
+for _ in $(seq 50); do
+  "$larderctl" products >/dev/null 2>&1 && break
+  sleep 0.1
+done
+
+echo; echo "== larderctl products  (Terminal Helper has no purchase record: not store software)"
+"$larderctl" products
+echo; echo "== larderctl product --bundle-id com.example.sketchpad  (1.10 is newer than 1.9)"
+"$larderctl" product --bundle-id com.example.sketchpad
+echo; echo "== larderctl product --item-id 400100 --json"
+"$larderctl" product --item-id 400100 --json
+
+echo; echo "== larderctl watch, while Ledgerly is updated to 2.5"
+"$larderctl" watch &
+watcher=$!
+sleep 0.3
+ledgerly="$LARDER_ROOT/Applications/Ledgerly.app"
+"$larderctl" call ProductAtPathWillBeUpdatedToBundleVersionStoreVersion "$ledgerly" 2.5 2
+purchase "$ledgerly" com.example.ledgerly 2.5 400100 2
+"$larderctl" call ProductAtPathWasUpdatedToBundleVersionStoreVersion "$ledgerly" true 2.5 2
+sleep 0.3
+kill -INT $watcher
+wait $watcher || true
+echo; echo "== larderctl call ProductForBundleIdentifier com.example.ledgerly --json"
+"$larderctl" call ProductForBundleIdentifier com.example.ledgerly --json

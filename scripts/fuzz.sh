@@ -1,0 +1,25 @@
+#!/usr/bin/env bash
+# Builds every libFuzzer target with clang under ASan/UBSan and runs each
+# over its corpus for a bounded time. Usage: scripts/fuzz.sh [seconds-per-target] [build-dir]
+set -euo pipefail
+cd "$(dirname "$0")/.."
+seconds=${1:-60}
+build=${2:-build-fuzz}
+./scripts/install-deps.sh
+cmake -S . -B "$build" -G Ninja -DCMAKE_CXX_COMPILER=clang++ -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+  -DLARDER_FUZZ=ON -DLARDER_SANITIZE=address -DLARDER_TESTS=OFF -DLARDER_BENCH=OFF
+cmake --build "$build" -j"$(nproc)"
+for target in "$build"/fuzz_*; do
+  [ -x "$target" ] || continue
+  name=$(basename "$target")
+  corpus="fuzz/corpus/${name#fuzz_}"
+  corpus="${corpus#fuzz/corpus/platform_}"
+  corpus="fuzz/corpus/$(basename "$corpus")"
+  work=$(mktemp -d)
+  seeds=()
+  [ -d "$corpus" ] && seeds=("$corpus")
+  echo "== $name for ${seconds}s (seeds: ${seeds[*]:-none})"
+  "$target" -max_total_time="$seconds" -timeout=10 -rss_limit_mb=4096 -print_final_stats=1 \
+    "$work" "${seeds[@]}" 2>&1 | tail -n 12
+  rm -rf "$work"
+done

@@ -1,0 +1,380 @@
+#include "software-map/SoftwareMap.h"
+
+#include <malloc.h>
+
+#include <set>
+
+#include "platform/Bundle.h"
+#include "platform/DispatchSemaphore.h"
+#include "platform/Environment.h"
+#include "platform/FileIO.h"
+#include "platform/KeyedArchive.h"
+#include "platform/Uuid.h"
+#include "store-runtime/TillLogManager.h"
+#include "store-runtime/VendFileManager.h"
+#include "store-runtime/VendPurchaseRecord.h"
+
+namespace larder {
+
+namespace {
+
+constexpr std::string_view kSpeaker = "SoftwareMap";
+constexpr std::string_view kAppsByPathKey = "appsByPath";
+constexpr std::size_t kMostRecordsInLogLine = 5;
+
+const char* stateName(std::int64_t state) {
+  switch (state) {
+    case kSoftwareProductAdded:
+      return "Added";
+    case kSoftwareProductChanged:
+      return "Changed";
+    default:
+      return "Removed";
+  }
+}
+
+bool isInApplicationsFolder(const std::string& path) {
+  return Environment::isBelowRootedPrefix(path, "/Applications/");
+}
+
+bool isOnBootVolume(const std::string& path) {
+  return VendFileManager::volumePath(path) == "/";
+}
+
+// Decoding the store builds a property-list tree several times the size of
+// the records it yields. The allocator keeps what was freed in the queue
+// thread's arena; handing it back keeps an idle service small.
+void returnFreedMemoryToSystem() {
+#ifdef __GLIBC__
+  malloc_trim(0);
+#endif
+}
+
+}  // namespace
+
+SoftwareMap& SoftwareMap::sharedInstance() {
+  static SoftwareMap instance(Options{});
+  return instance;
+}
+
+SoftwareMap::SoftwareMap(Options options)
+    : options_(std::move(options)),
+      dispatchQueue_(DispatchQueue::create("SoftwareMap Queue", DispatchQueue::Kind::Concurrent)),
+      metadataQueryQueue_(
+          DispatchQueue::create("SoftwareMap MetadataQuery Queue", DispatchQueue::Kind::Serial)),
+      observerQueue_(
+          DispatchQueue::create("SoftwareMap Observer Queue", DispatchQueue::Kind::Serial)) {
+  // The load is a barrier enqueued first, so every later lookup waits for
+  // the persisted records and then answers while the discovery runs.
+  dispatchQueue_->barrierAsync([this] { asyncInitializeAndLoadPersistedStore(); });
+  if (options_.discoverApplications) {
+    dispatchQueue_->async([this] { initialDiscovery(); });
+  }
+}
+
+SoftwareMap::~SoftwareMap() {
+  waitUntilIdle();
+}
+
+void SoftwareMap::waitUntilIdle() {
+  // A barrier runs after everything queued before it; the notification
+  // tasks a barrier enqueues need a second round, and the observer queue
+  // a third.
+  for (int round = 0; round < 3; ++round) {
+    dispatchQueue_->barrierSync([] {});
+    metadataQueryQueue_->sync([] {});
+    observerQueue_->sync([] {});
+  }
+}
+
+// MARK: load and store
+
+std::string SoftwareMap::persistedStoreURL() const {
+  if (!options_.persistedStorePath.empty()) return options_.persistedStorePath;
+  return VendFileManager::cacheDirectoryPathWithName("com.orvane.tradeline") + "/SoftwareMap";
+}
+
+void SoftwareMap::asyncInitializeAndLoadPersistedStore() {
+  // The observer dictionary exists from construction, so an observer added
+  // while the load waits in the queue is kept and hears the discovery.
+  try {
+    loadPersistedStore();
+  } catch (const std::exception& exception) {
+    TILL_LOG(1, "%@: Exception loading persisted SoftwareMap - %@", kSpeaker, exception.what());
+  }
+  std::size_t count = appsByPath_ ? appsByPath_->size() : 0;
+  logAppsByPath({2,
+                 2,
+                 __func__,
+                 "%@: After loading persisted store, SoftwareMap is %@",
+                 {kSpeaker},
+                 "%@: After loading persisted store, SoftwareMap has %ld items",
+                 {kSpeaker, LogArgument::number(count)}});
+  if (!appsByPath_) appsByPath_.emplace();
+  returnFreedMemoryToSystem();
+}
+
+void SoftwareMap::loadPersistedStore() {
+  std::optional<PlistData> data = FileIO::read(persistedStoreURL());
+  if (!data || data->empty()) {
+    TILL_LOG(2, "%@: Persisted SoftwareMap not found", kSpeaker);
+  } else {
+    static const std::set<std::string, std::less<>> kAllowedClasses{
+        std::string(KeyedArchive::kDictionaryClass), std::string(KeyedArchive::kStringClass),
+        std::string(LedgerSoftwareProduct::kClassName)};
+    std::string error;
+    std::optional<PlistValue> root = KeyedArchive::unarchivedRoot(*data, kAllowedClasses, &error);
+    const PlistDictionary* byPath = root ? root->dictionary() : nullptr;
+    const PlistDictionary* records = byPath && byPath->contains(kAppsByPathKey)
+                                         ? (*byPath->find(kAppsByPathKey)).second.dictionary()
+                                         : nullptr;
+    if (records) {
+      StringMap<LedgerSoftwareProductRef> loaded;
+      loaded.reserve(records->size());
+      for (const auto& [path, encoded] : *records) {
+        LedgerSoftwareProductRef product = LedgerSoftwareProduct::initWithCoder(encoded);
+        // The key is the record's path by invariant; a record that breaks
+        // it is not ours to trust.
+        if (product && product->bundlePath() == path) loaded.emplace(path, std::move(product));
+      }
+      appsByPath_ = std::move(loaded);
+      rebuildSecondaryMaps();
+    } else {
+      TILL_LOG(1, "%@: Persisted SoftwareMap did not contain appsByPath dictionary.", kSpeaker);
+    }
+  }
+}
+
+void SoftwareMap::logAppsByPath(MapLogLine line) const {
+  auto& log = TillLogManager::sharedManager();
+  if (!log.isEnabled(line.level)) return;
+  PlistDictionary described;
+  if (appsByPath_) {
+    for (const auto& [path, product] : *appsByPath_)
+      described.emplace(path, product->toDictionary());
+  }
+  if (described.size() <= kMostRecordsInLogLine) {
+    line.smallArguments.push_back(describePlistValue(described));
+    log.logWithDescribedArguments(line.level, line.function, __FILE__, __LINE__, line.smallFormat,
+                                  line.smallArguments);
+    return;
+  }
+  log.logWithDescribedArguments(line.level, line.function, __FILE__, __LINE__, line.largeFormat,
+                                line.largeArguments);
+  log.logLevelForPlist(line.sideFileLevel, line.function, __FILE__, __LINE__, described,
+                       kAppsByPathKey);
+}
+
+void SoftwareMap::writePersistedStoreToDisk() {
+  if (!appsByPath_) return;
+  PlistDictionary records;
+  for (const auto& [path, product] : *appsByPath_) {
+    records.emplace(path, product->encodeWithCoder());
+  }
+  PlistValue root = KeyedArchive::dictionary(
+      {{std::string(kAppsByPathKey), KeyedArchive::dictionary(std::move(records))}});
+  PlistData data = KeyedArchive::archivedData(root);
+  std::string path = persistedStoreURL();
+  std::string error;
+  if (!data.empty() && !FileIO::writeAtomically(path, data, &error)) {
+    TILL_LOG(1, "%@: Exception writing persisted SoftwareMap to %@ - %@", kSpeaker, path, error);
+  }
+  TILL_LOG(2, "%@: Updated persisted SoftwareMap at %@", kSpeaker, path);
+}
+
+// MARK: secondary maps and lookups
+
+void SoftwareMap::rebuildSecondaryMaps() {
+  appsByBundleID_.clear();
+  appsByItemID_.clear();
+  if (!appsByPath_) return;
+  for (const auto& [path, product] : *appsByPath_) {
+    LedgerSoftwareProductFields fields = product->snapshot();
+    if (fields.bundleIdentifier) {
+      appsByBundleID_[*fields.bundleIdentifier].push_back(product);
+    } else {
+      TILL_LOG(3, "%@: App does not have bundleIdentifier, ignoring in secondary map: %@", kSpeaker,
+               product);
+    }
+    if (fields.itemIdentifier) {
+      appsByItemID_[*fields.itemIdentifier].push_back(product);
+    } else {
+      TILL_LOG(3, "%@: App does not have itemIdentifier, ignoring in secondary map: %@", kSpeaker,
+               product);
+    }
+  }
+}
+
+LedgerSoftwareProductRef SoftwareMap::productWithIdentifierInDictionary(
+    const ProductList* candidates, std::string_view identifierDescription) {
+  if (!candidates || candidates->empty()) return nullptr;
+  if (candidates->size() == 1) return candidates->front();
+  LedgerSoftwareProductRef best = candidates->front();
+  for (std::size_t i = 1; i < candidates->size(); ++i) {
+    if (productSearchResultIsPreferredOverProduct(*(*candidates)[i], *best)) {
+      best = (*candidates)[i];
+    }
+  }
+  TILL_LOG(1,
+           "%@: productWithIdentifier:inDictionary Warning, multiple matches for %@ found - "
+           "returning preferred result %@",
+           kSpeaker, identifierDescription, best);
+  return best;
+}
+
+bool SoftwareMap::productSearchResultIsPreferredOverProduct(const LedgerSoftwareProduct& candidate,
+                                                            const LedgerSoftwareProduct& other) {
+  LedgerSoftwareProductFields c = candidate.snapshot();
+  LedgerSoftwareProductFields o = other.snapshot();
+  std::string cVersion = c.bundleVersion.value_or("");
+  std::string oVersion = o.bundleVersion.value_or("");
+  auto decide = [&](bool candidateWins, const char* format) {
+    const auto& winner = candidateWins ? c : o;
+    const auto& loser = candidateWins ? o : c;
+    TILL_LOG(1, format, kSpeaker, winner.bundleVersion, winner.bundlePath, loser.bundleVersion,
+             loser.bundlePath);
+    return candidateWins;
+  };
+
+  bool candidateUpdatable = VendFileManager::isUpdatableAtPath(c.bundlePath);
+  bool otherUpdatable = VendFileManager::isUpdatableAtPath(o.bundlePath);
+  if (candidateUpdatable != otherUpdatable) {
+    return decide(candidateUpdatable,
+                  "%@: Preferring (updatable) app version %@ at %@ over non-updatable version %@ "
+                  "at %@");
+  }
+  if (int order = compareVersionStrings(oVersion, cVersion); order != 0) {
+    return decide(order < 0,
+                  "%@: Preferring (newer/higher) app version %@ at %@ over version %@ at %@");
+  }
+  bool candidateInApplications = isInApplicationsFolder(c.bundlePath);
+  if (candidateInApplications != isInApplicationsFolder(o.bundlePath)) {
+    return decide(candidateInApplications,
+                  "%@: Preferring (in /Applications) app version %@ at %@ over version %@ at %@");
+  }
+  bool candidateOnBoot = isOnBootVolume(c.bundlePath);
+  if (candidateOnBoot != isOnBootVolume(o.bundlePath)) {
+    return decide(candidateOnBoot,
+                  "%@: Preferring (on boot volume) app version %@ at %@ over version %@ at %@");
+  }
+  return decide(c.bundlePath.size() < o.bundlePath.size(),
+                "%@: Preferring (shortest path) app version %@ at %@ over version %@ at %@");
+}
+
+LedgerSoftwareProductRef SoftwareMap::productForBundleIdentifier(
+    std::string_view bundleIdentifier) {
+  LedgerSoftwareProductRef product;
+  dispatchQueue_->sync([&] {
+    auto found = appsByBundleID_.find(bundleIdentifier);
+    product = productWithIdentifierInDictionary(
+        found == appsByBundleID_.end() ? nullptr : &found->second, bundleIdentifier);
+  });
+  return product;
+}
+
+LedgerSoftwareProductRef SoftwareMap::productForItemIdentifier(std::uint64_t itemIdentifier) {
+  LedgerSoftwareProductRef product;
+  dispatchQueue_->sync([&] {
+    auto found = appsByItemID_.find(itemIdentifier);
+    if (found == appsByItemID_.end()) return;
+    product = productWithIdentifierInDictionary(&found->second, std::to_string(itemIdentifier));
+  });
+  return product;
+}
+
+SoftwareMap::ProductList SoftwareMap::allProducts() {
+  ProductList products;
+  dispatchQueue_->sync([&] {
+    if (!appsByPath_) return;
+    products.reserve(appsByPath_->size());
+    for (const auto& entry : *appsByPath_) products.push_back(entry.second);
+  });
+  return products;
+}
+
+// MARK: bundles
+
+LedgerSoftwareProductRef SoftwareMap::createSoftwareProductForAppAtPath(const std::string& path) {
+  std::optional<Bundle> bundle = Bundle::open(path);
+  if (!bundle) return nullptr;
+  LedgerSoftwareProductFields fields;
+  fields.bundlePath = path;
+  fields.installed = true;
+  fields.bundleIdentifier = bundle->identifier();
+  if (const std::string* version = bundle->infoValue("HostBundleShortVersionString").string()) {
+    fields.bundleVersion = *version;
+  }
+  if (std::optional<VendPurchaseRecord> record =
+          VendPurchaseRecord::purchaseRecordFromBundleAtPath(path)) {
+    if (!record->wareID.isNull()) fields.itemIdentifier = record->wareID.uint64Value();
+    if (!record->installerVersionID.isNull()) {
+      fields.versionIdentifier = record->installerVersionID.int64Value();
+    }
+    fields.accountOpaqueID = record->opaqueAccountIDString;
+  }
+  return std::make_shared<LedgerSoftwareProduct>(std::move(fields));
+}
+
+PlistDictionary SoftwareMap::bundleInfoFromBundleAtPath(const std::string& path) {
+  std::optional<Bundle> bundle = Bundle::open(path);
+  return bundle ? bundle->infoDictionary() : PlistDictionary{};
+}
+
+std::optional<PlistData> SoftwareMap::iconDataForApplicationWithBundleID(
+    std::string_view bundleIdentifier) {
+  std::optional<Bundle> bundle;
+  if (LedgerSoftwareProductRef product = productForBundleIdentifier(bundleIdentifier)) {
+    bundle = Bundle::open(product->bundlePath());
+  }
+  if (!bundle) bundle = Bundle::withIdentifier(bundleIdentifier);
+  if (!bundle) return std::nullopt;
+  const std::string* iconName = bundle->infoValue("HostBundleIconFile").string();
+  if (!iconName) return std::nullopt;
+  return bundle->resourceData(*iconName);
+}
+
+// MARK: observers
+
+std::string SoftwareMap::addObserver(std::shared_ptr<VendSoftwareMapObserver> observer) {
+  std::string token = Uuid::generateString();
+  if (observer) {
+    observerQueue_->sync([&] { observers_.emplace(token, std::move(observer)); });
+    TILL_LOG(3, "%@: SoftwareMap added observer with token: %@", kSpeaker, token);
+  }
+  return token;
+}
+
+void SoftwareMap::removeObserverWithToken(const std::string& token) {
+  bool removed = false;
+  observerQueue_->sync([&] { removed = observers_.erase(token) > 0; });
+  if (removed) {
+    TILL_LOG(3, "%@: Removed SoftwareMap observer for token: %@", kSpeaker, token);
+  } else {
+    TILL_LOG(3, "%@: Could not find SoftwareMap observer to remove for token: %@", kSpeaker, token);
+  }
+}
+
+void SoftwareMap::notifyObserversAboutProduct(const LedgerSoftwareProductRef& product,
+                                              std::int64_t state) {
+  TILL_LOG(3, "%@: Notifying observers of software product change: %@: %@", kSpeaker,
+           stateName(state), product);
+  observerQueue_->sync([&] {
+    for (const auto& entry : observers_) entry.second->softwareProductUpdatedState(product, state);
+  });
+}
+
+void SoftwareMap::enqueueNotifications(Changes changes) {
+  if (changes.added.empty() && changes.changed.empty() && changes.removed.empty()) return;
+  dispatchQueue_->async([this, changes = std::move(changes)] {
+    for (const auto& product : changes.added)
+      notifyObserversAboutProduct(product, kSoftwareProductAdded);
+    for (const auto& product : changes.changed) {
+      notifyObserversAboutProduct(product, kSoftwareProductChanged);
+    }
+    for (const auto& product : changes.removed) {
+      notifyObserversAboutProduct(product, kSoftwareProductRemoved);
+    }
+  });
+}
+
+}  // namespace larder

@@ -1,0 +1,158 @@
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+#include <vector>
+
+#include "platform/DispatchQueue.h"
+#include "platform/PlistValue.h"
+#include "software-map/VendSoftwareMapObserver.h"
+#include "store-runtime/LedgerSoftwareProduct.h"
+#include "store-runtime/TillLogManager.h"
+
+namespace larder {
+
+// The process's one index of the store software installed on the machine.
+// All maps are guarded by `dispatchQueue`: readers enter it synchronously,
+// every change is a barrier. Records are shared between the maps, so a
+// change of a record is seen through all of them at once.
+class SoftwareMap {
+ public:
+  struct Options {
+    // Where the persisted store lives; empty means the standard place in
+    // the user's caches folder.
+    std::string persistedStorePath;
+    // Run the discovery of the application registry after the load.
+    bool discoverApplications = true;
+  };
+
+  using ProductList = std::vector<LedgerSoftwareProductRef>;
+
+  static SoftwareMap& sharedInstance();
+
+  explicit SoftwareMap(Options options);
+  ~SoftwareMap();
+  SoftwareMap(const SoftwareMap&) = delete;
+  SoftwareMap& operator=(const SoftwareMap&) = delete;
+
+  // A new record for the bundle at `path`, read from the disk as it is now;
+  // not stored in any map. nullptr when the bundle cannot be opened.
+  static LedgerSoftwareProductRef createSoftwareProductForAppAtPath(const std::string& path);
+  // The bundle's information property list; empty when it has none.
+  static PlistDictionary bundleInfoFromBundleAtPath(const std::string& path);
+
+  LedgerSoftwareProductRef productForBundleIdentifier(std::string_view bundleIdentifier);
+  LedgerSoftwareProductRef productForItemIdentifier(std::uint64_t itemIdentifier);
+  ProductList allProducts();
+  std::optional<PlistData> iconDataForApplicationWithBundleID(std::string_view bundleIdentifier);
+
+  // Observers are kept by token; a null observer still gets a token.
+  std::string addObserver(std::shared_ptr<VendSoftwareMapObserver> observer);
+  void removeObserverWithToken(const std::string& token);
+  void notifyObserversAboutProduct(const LedgerSoftwareProductRef& product, std::int64_t state);
+
+  [[nodiscard]] const std::shared_ptr<DispatchQueue>& dispatchQueue() const {
+    return dispatchQueue_;
+  }
+  [[nodiscard]] const std::shared_ptr<DispatchQueue>& metadataQueryQueue() const {
+    return metadataQueryQueue_;
+  }
+  [[nodiscard]] const std::shared_ptr<DispatchQueue>& observerQueue() const {
+    return observerQueue_;
+  }
+  [[nodiscard]] std::string persistedStorePath() const { return persistedStoreURL(); }
+
+  // The update machinery's notice that the bundle at `path` is about to be
+  // replaced, so that the index's removal and addition are not taken for
+  // an uninstall; and its report that the replacement is done.
+  void productAtPathWillBeUpdatedToBundleVersionStoreVersion(const std::string& path,
+                                                             const std::string& bundleVersion,
+                                                             std::int64_t storeVersion);
+  void productAtPathWasUpdatedToBundleVersionStoreVersion(const std::string& path, bool wasUpdated,
+                                                          const std::string& bundleVersion,
+                                                          std::int64_t storeVersion);
+
+  // Scan and merge, as at start; returns once the merge is done (the
+  // notifications may still be on their way).
+  void reloadFromApplicationRegistry();
+
+  // Waits until every task enqueued on the map's queues so far has run.
+  void waitUntilIdle();
+
+ private:
+  struct Changes {
+    ProductList added;
+    ProductList changed;
+    ProductList removed;
+  };
+
+  // Load and store.
+  void asyncInitializeAndLoadPersistedStore();
+  void loadPersistedStore();
+  void writePersistedStoreToDisk();
+  [[nodiscard]] std::string persistedStoreURL() const;
+  // Logs a line about the primary map: with at most five records the line
+  // ends with the map (`smallFormat`, its last "%@"), with more it gives
+  // `largeFormat` and the map goes to the side file "appsByPath".
+  struct MapLogLine {
+    int level;
+    int sideFileLevel;
+    std::string_view function;
+    std::string_view smallFormat;
+    std::vector<LogArgument> smallArguments;
+    std::string_view largeFormat;
+    std::vector<LogArgument> largeArguments;
+  };
+  void logAppsByPath(MapLogLine line) const;
+
+  // Secondary maps and lookups, called inside the queue.
+  [[nodiscard]] LedgerSoftwareProductRef productAtPath(const std::string& path) const;
+  void rebuildSecondaryMaps();
+  LedgerSoftwareProductRef productWithIdentifierInDictionary(
+      const ProductList* candidates, std::string_view identifierDescription);
+  static bool productSearchResultIsPreferredOverProduct(const LedgerSoftwareProduct& candidate,
+                                                        const LedgerSoftwareProduct& other);
+
+  // Discovery and merge.
+  void initialDiscovery();
+  static ProductList discoverAppsUsingAppRegistry();
+  static LedgerSoftwareProductRef productFromPurchaseRecord(
+      const std::string& path, const struct VendPurchaseRecord& record);
+  void rebuildMapUsingDiscoveredApps(const ProductList& discovered);
+  void logRebuild(double seconds);
+  static void updateAppWithApp(LedgerSoftwareProduct& existing, const LedgerSoftwareProduct& fresh,
+                               bool* didChange);
+
+  void enqueueNotifications(Changes changes);
+
+  Options options_;
+  std::shared_ptr<DispatchQueue> dispatchQueue_;
+  std::shared_ptr<DispatchQueue> metadataQueryQueue_;
+  std::shared_ptr<DispatchQueue> observerQueue_;
+
+  struct StringHash {
+    using is_transparent = void;
+    std::size_t operator()(std::string_view text) const {
+      return std::hash<std::string_view>{}(text);
+    }
+  };
+  template <typename Value>
+  using StringMap = std::unordered_map<std::string, Value, StringHash, std::equal_to<>>;
+
+  // Guarded by dispatchQueue_.
+  std::optional<StringMap<LedgerSoftwareProductRef>> appsByPath_;
+  StringMap<ProductList> appsByBundleID_;
+  std::unordered_map<std::uint64_t, ProductList> appsByItemID_;
+
+  // Guarded by observerQueue_.
+  std::map<std::string, std::shared_ptr<VendSoftwareMapObserver>> observers_;
+};
+
+}  // namespace larder

@@ -1,0 +1,41 @@
+#pragma once
+
+#include <map>
+#include <memory>
+#include <mutex>
+#include <string>
+
+#include "store-runtime/VendStoreClient.h"
+
+namespace larder {
+
+// The per-client registries of the process: one object per store client
+// identifier, made on first use with the client that asked, kept until the
+// process ends. Two connections that present the same identifier share the
+// object. The lock guards the dictionary for the span of lookup and
+// creation; creation runs under it.
+template <typename Object>
+class StoreClientRegistry {
+ public:
+  // nullptr for a client without identifier.
+  std::shared_ptr<Object> objectForStoreClient(const VendStoreClient* storeClient) {
+    if (!storeClient || storeClient->identifier().empty()) return nullptr;
+    std::lock_guard lock(mutex_);
+    auto found = objects_.find(storeClient->identifier());
+    if (found != objects_.end()) return found->second;
+    auto object = std::make_shared<Object>(*storeClient);
+    objects_.emplace(storeClient->identifier(), object);
+    return object;
+  }
+
+  [[nodiscard]] std::size_t size() const {
+    std::lock_guard lock(mutex_);
+    return objects_.size();
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  std::map<std::string, std::shared_ptr<Object>, std::less<>> objects_;
+};
+
+}  // namespace larder

@@ -1,0 +1,321 @@
+// The service as its clients see it: larderd on a private bus with a
+// temporary platform, spoken to over D-Bus.
+#include <gtest/gtest.h>
+
+#include <sdbus-c++/Error.h>
+#include <sdbus-c++/IProxy.h>
+#include <filesystem>
+#include <fstream>
+#include <mutex>
+#include <nlohmann/json.hpp>
+
+#include "AssetService/RequestTable.h"
+#include "platform/FileIO.h"
+#include "platform/KeyedArchive.h"
+#include "tests/integration/ServiceHarness.h"
+
+namespace larder::testing {
+namespace {
+
+namespace fs = std::filesystem;
+
+class ServiceTest : public ::testing::Test {
+ protected:
+  std::string installStoreApp(const std::string& folder, const std::string& name,
+                              const std::string& identifier, const std::string& version,
+                              std::uint64_t itemIdentifier, const std::string& icon = "") {
+    return platform.installBundle({folder, name, identifier, version, itemIdentifier, 1, icon});
+  }
+  std::string applications() const { return platform.root() + "/Applications"; }
+  std::string homeApplications() const { return platform.home() + "/Applications"; }
+
+  std::unique_ptr<ServiceProcess> startService(std::vector<std::string> arguments = {},
+                                               std::map<std::string, std::string> env = {}) {
+    auto service =
+        std::make_unique<ServiceProcess>(platform, bus, std::move(arguments), std::move(env));
+    EXPECT_TRUE(service->waitUntilServing()) << service->log();
+    return service;
+  }
+
+  TemporaryPlatform platform;
+  PrivateBus bus;
+};
+
+const PlistDictionary& dictionaryAt(const PlistArray& reply, std::size_t index) {
+  static const PlistDictionary kEmpty;
+  const PlistDictionary* dictionary = reply.at(index).dictionary();
+  return dictionary ? *dictionary : kEmpty;
+}
+
+std::string field(const PlistDictionary& record, const std::string& key) {
+  auto found = record.find(key);
+  if (found == record.end()) return "<absent>";
+  if (const std::string* text = found->second.string()) return *text;
+  return std::to_string(found->second.int64Value());
+}
+
+TEST_F(ServiceTest, AnswersLookupsForDiscoveredStoreSoftware) {
+  std::string foo =
+      installStoreApp(applications(), "Foo", "com.example.foo", "2.1", 1001, "PNGDATA");
+  installStoreApp(homeApplications(), "Bar", "com.example.bar", "1.0", 1002);
+  std::string plain = platform.installBundle({applications(), "Plain", "com.example.plain"});
+  auto service = startService();
+  ASSERT_TRUE(service->waitForLog("Software map rebuild took")) << service->log();
+  auto client = connectClient(bus);
+
+  PlistArray all = client->call("AllProducts", {});
+  ASSERT_TRUE(all.at(0).array());
+  EXPECT_EQ(all.at(0).array()->size(), 2u) << "software without purchase record is not in the map";
+
+  PlistDictionary byBundle =
+      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.example.foo"}), 0);
+  EXPECT_EQ(field(byBundle, "bundlePath"), foo);
+  EXPECT_EQ(field(byBundle, "bundleVersion"), "2.1");
+  EXPECT_EQ(field(byBundle, "itemIdentifier"), "1001");
+  EXPECT_EQ(field(byBundle, "accountOpaqueID"), "account-1");
+  EXPECT_EQ(field(byBundle, "source"), "4");
+  EXPECT_EQ(field(byBundle, "installed"), "1");
+
+  PlistDictionary byItem =
+      dictionaryAt(client->call("ProductForItemIdentifier", {std::uint64_t{1002}}), 0);
+  EXPECT_EQ(field(byItem, "bundleIdentifier"), "com.example.bar");
+  EXPECT_TRUE(
+      dictionaryAt(client->call("ProductForItemIdentifier", {std::uint64_t{0}}), 0).empty());
+  EXPECT_TRUE(
+      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.example.none"}), 0).empty());
+
+  PlistDictionary created =
+      dictionaryAt(client->call("CreateSoftwareProductForAppAtPath", {plain}), 0);
+  EXPECT_EQ(field(created, "bundleIdentifier"), "com.example.plain");
+  EXPECT_EQ(field(created, "itemIdentifier"), "<absent>");
+  EXPECT_TRUE(
+      dictionaryAt(client->call("CreateSoftwareProductForAppAtPath", {plain + "/missing"}), 0)
+          .empty());
+
+  PlistDictionary info = dictionaryAt(client->call("BundleInfoFromBundleAtPath", {foo}), 0);
+  EXPECT_EQ(field(info, "HostBundleIdentifier"), "com.example.foo");
+  PlistArray icon = client->call("IconForApplicationWithBundeID", {"com.example.foo"});
+  ASSERT_TRUE(icon.at(0).data());
+  EXPECT_EQ(std::string(icon.at(0).data()->begin(), icon.at(0).data()->end()), "PNGDATA");
+}
+
+TEST_F(ServiceTest, PrefersTheCopyInTheApplicationsFolder) {
+  installStoreApp(homeApplications(), "Twin", "com.example.twin", "3.0", 77);
+  std::string preferred = installStoreApp(applications(), "Twin", "com.example.twin", "3.0", 77);
+  auto service = startService();
+  ASSERT_TRUE(service->waitForLog("Software map rebuild took"));
+  auto client = connectClient(bus);
+  PlistDictionary product =
+      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.example.twin"}), 0);
+  EXPECT_EQ(field(product, "bundlePath"), preferred);
+  EXPECT_EQ(field(dictionaryAt(client->call("ProductForItemIdentifier", {std::uint64_t{77}}), 0),
+                  "bundlePath"),
+            preferred);
+  EXPECT_FALSE(service->logLines("Preferring (in /Applications)").empty());
+}
+
+TEST_F(ServiceTest, RecoveryModeAnswersFromThePersistedStoreAndNeverChangesIt) {
+  std::string foo = installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
+  {
+    auto first = startService();
+    ASSERT_TRUE(first->waitForLog("Updated persisted SoftwareMap at"));
+    first->stop();
+  }
+  fs::remove_all(foo);
+  auto before = FileIO::read(platform.persistedStorePath());
+  ASSERT_TRUE(before);
+
+  auto service = startService({}, {{"__OSINSTALL_ENVIRONMENT", "1"}});
+  auto client = connectClient(bus);
+  PlistDictionary product =
+      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.example.foo"}), 0);
+  EXPECT_EQ(field(product, "bundlePath"), foo) << "the persisted record answers";
+  EXPECT_EQ(
+      service->logLines("Running in recovery mode (1) - Disabling all software map sources").size(),
+      1u);
+  EXPECT_TRUE(service->logLines("Software map rebuild took").empty());
+  EXPECT_EQ(FileIO::read(platform.persistedStorePath()), before);
+}
+
+TEST_F(ServiceTest, DamagedStoreFilesCostOneLineAndAnEmptyMap) {
+  installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
+  {
+    auto first = startService();
+    ASSERT_TRUE(first->waitForLog("Updated persisted SoftwareMap at"));
+    first->stop();
+  }
+  PlistData good = *FileIO::read(platform.persistedStorePath());
+  PlistData wrongRoot = KeyedArchive::archivedData(KeyedArchive::array({PlistValue("x")}));
+  std::vector<std::pair<std::string, PlistData>> damaged{
+      {"truncated", PlistData(good.begin(), good.begin() + static_cast<long>(good.size() / 2))},
+      {"garbage", PlistData(300, 0xA5)},
+      {"wrong root", wrongRoot},
+  };
+  for (const auto& [name, bytes] : damaged) {
+    SCOPED_TRACE(name);
+    ASSERT_TRUE(FileIO::writeAtomically(platform.persistedStorePath(), bytes));
+    auto service = startService({}, {{"__OSINSTALL_ENVIRONMENT", "1"}});
+    auto client = connectClient(bus);
+    PlistArray all = client->call("AllProducts", {});
+    ASSERT_TRUE(all.at(0).array());
+    EXPECT_TRUE(all.at(0).array()->empty());
+    // Recovery mode keeps the discovery from refilling the map; its own
+    // line aside, the damage costs exactly one level 1 line.
+    EXPECT_EQ(service->logLines("<3>").size() - service->logLines("recovery mode").size(), 1u)
+        << service->log();
+    EXPECT_EQ(
+        service->logLines("Persisted SoftwareMap did not contain appsByPath dictionary.").size(),
+        1u);
+    EXPECT_TRUE(service->process().isRunning());
+  }
+}
+
+TEST_F(ServiceTest, BadArgumentsGetADBusErrorAndTheServiceGoesOn) {
+  installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
+  auto service = startService();
+  auto connection = bus.connect();
+  auto proxy = sdbus::createProxy(*connection, "com.orvane.larderd", "/com/orvane/larderd");
+  const std::string interface(RequestTable::kInterfaceName);
+  EXPECT_THROW(
+      proxy->callMethod("ProductForBundleIdentifier").onInterface(interface).withArguments(42),
+      sdbus::Error);
+  EXPECT_THROW(proxy->callMethod("ProductForItemIdentifier")
+                   .onInterface(interface)
+                   .withArguments(std::string("x")),
+               sdbus::Error);
+  EXPECT_THROW(proxy->callMethod("NoSuchRequest").onInterface(interface), sdbus::Error);
+  // A store client of the wrong shape is taken as it comes: no crash.
+  std::map<std::string, sdbus::Variant> odd{{"identifier", sdbus::Variant(std::int32_t{7})},
+                                            {"clientType", sdbus::Variant(std::string("x"))}};
+  EXPECT_NO_THROW(proxy->callMethod("SetStoreClient").onInterface(interface).withArguments(odd));
+
+  auto client = connectClient(bus);
+  ASSERT_TRUE(service->waitForLog("Software map rebuild took"));
+  EXPECT_EQ(field(dictionaryAt(client->call("ProductForBundleIdentifier", {"com.example.foo"}), 0),
+                  "itemIdentifier"),
+            "5");
+  EXPECT_TRUE(service->process().isRunning());
+}
+
+TEST_F(ServiceTest, RequestsWithoutTargetAnswerEmptyOrNotAtAll) {
+  auto service = startService();
+  auto client = connectClient(bus);
+  client->presentStoreClient(0);
+  PlistArray badge = client->call("AvailableUpdatesBadgeCount", {});
+  EXPECT_EQ(badge.at(0).uint64Value(), 0u);
+  PlistArray body =
+      client->call("HttpPostBodyWithInstalledAppsBundledAppsConditionally", {true, true, false});
+  ASSERT_EQ(body.size(), 3u);
+  auto quick = std::make_unique<ServiceClient>(bus.connect(), "com.orvane.larderd", 300'000);
+  EXPECT_THROW(quick->call("UnhideAllOSUpdates", {}), sdbus::Error)
+      << "its reply belongs to a controller";
+  EXPECT_TRUE(service->process().isRunning());
+}
+
+TEST_F(ServiceTest, ModeFollowsTheArguments) {
+  struct Case {
+    std::vector<std::string> arguments;
+    std::string busName;
+  };
+  for (const Case& c :
+       {Case{{"daemon"}, "com.orvane.larderd.daemon"},
+        Case{{"daemon", "extra"}, "com.orvane.larderd"}, Case{{"Daemon"}, "com.orvane.larderd"}}) {
+    SCOPED_TRACE(c.busName + " for " + std::to_string(c.arguments.size()) + " argument(s)");
+    ServiceProcess service(platform, bus, c.arguments);
+    EXPECT_TRUE(service.waitUntilServing(c.busName)) << service.log();
+    EXPECT_EQ(service.logLines("int main(int, const char **)").size(), 1u);
+    service.stop();
+  }
+}
+
+// Records the callbacks a client's observer object receives.
+struct ObserverRecord {
+  std::mutex mutex;
+  std::vector<std::pair<std::string, std::int64_t>> calls;  // (bundleVersion, state)
+  std::size_t size() {
+    std::lock_guard lock(mutex);
+    return calls.size();
+  }
+};
+
+TEST_F(ServiceTest, ObserversHearChangesAndAGoneClientCostsNothing) {
+  std::string foo = installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
+  auto service = startService();
+  ASSERT_TRUE(service->waitForLog("Software map rebuild took"));
+
+  auto staying = connectClient(bus);
+  ObserverRecord heard;
+  staying->exportSoftwareMapObserver(
+      "/test/Observer", [&](const PlistValue& product, std::int64_t state) {
+        std::lock_guard lock(heard.mutex);
+        heard.calls.emplace_back(
+            product["bundleVersion"].string() ? *product["bundleVersion"].string() : "", state);
+      });
+  std::string token = *staying->call("AddSoftwareMapObserver", {"/test/Observer"}).at(0).string();
+  {
+    auto leaving = connectClient(bus);
+    leaving->exportSoftwareMapObserver("/test/Observer", [](const PlistValue&, std::int64_t) {});
+    leaving->call("AddSoftwareMapObserver", {"/test/Observer"});
+  }
+  std::string emptyToken = *staying->call("AddSoftwareMapObserver", {"/"}).at(0).string();
+  EXPECT_NE(emptyToken, token);
+
+  auto updater = connectClient(bus);
+  updater->call("ProductAtPathWillBeUpdatedToBundleVersionStoreVersion",
+                {foo, "2.0", std::int64_t{9}});
+  TemporaryPlatform::writePurchaseRecord(foo, "com.example.foo", "2.0", 5, 9);
+  updater->call("ProductAtPathWasUpdatedToBundleVersionStoreVersion",
+                {foo, true, "2.0", std::int64_t{9}});
+
+  ASSERT_TRUE(eventually([&] { return heard.size() >= 1; })) << service->log();
+  {
+    std::lock_guard lock(heard.mutex);
+    ASSERT_EQ(heard.calls.size(), 1u);
+    EXPECT_EQ(heard.calls[0], std::make_pair(std::string("2.0"), std::int64_t{2}));
+  }
+  EXPECT_EQ(field(dictionaryAt(updater->call("ProductForBundleIdentifier", {"com.example.foo"}), 0),
+                  "bundleVersion"),
+            "2.0");
+  EXPECT_TRUE(service->logLines("does not match expected value").empty());
+
+  staying->call("RemoveSoftwareMapObserver", {token});
+  staying->call("RemoveSoftwareMapObserver", {emptyToken});
+  EXPECT_EQ(
+      service->logLines("Could not find SoftwareMap observer to remove for token: " + emptyToken)
+          .size(),
+      1u);
+  EXPECT_TRUE(service->process().isRunning());
+}
+
+TEST_F(ServiceTest, LarderctlWatchPrintsObserverCallbacks) {
+  std::string foo = installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
+  auto service = startService();
+  ASSERT_TRUE(service->waitForLog("Software map rebuild took"));
+  std::string output = platform.directory() + "/watch.out";
+  ChildProcess watch({LARDERCTL_PATH, "--json", "watch"}, platform.environment(bus), output,
+                     platform.directory() + "/watch.err");
+  ASSERT_TRUE(service->waitForLog("SoftwareMap added observer with token"));
+
+  auto updater = connectClient(bus);
+  updater->call("ProductAtPathWillBeUpdatedToBundleVersionStoreVersion",
+                {foo, "1.5", std::int64_t{3}});
+  TemporaryPlatform::writePurchaseRecord(foo, "com.example.foo", "1.5", 5, 3);
+  updater->call("ProductAtPathWasUpdatedToBundleVersionStoreVersion",
+                {foo, true, "1.5", std::int64_t{3}});
+
+  auto printed = [&] {
+    std::ifstream file(output);
+    std::string line;
+    std::getline(file, line);
+    return line;
+  };
+  ASSERT_TRUE(eventually([&] { return !printed().empty(); }));
+  auto line = nlohmann::json::parse(printed());
+  EXPECT_EQ(line["stateName"], "Changed");
+  EXPECT_EQ(line["product"]["bundleVersion"], "1.5");
+  EXPECT_EQ(watch.stop(SIGINT), 0);
+  EXPECT_TRUE(service->waitForLog("Removed SoftwareMap observer for token"));
+}
+
+}  // namespace
+}  // namespace larder::testing

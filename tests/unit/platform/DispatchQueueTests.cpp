@@ -1,0 +1,890 @@
+#include "platform/DispatchQueue.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <numeric>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <utility>
+#include <vector>
+
+#include "platform/DispatchSemaphore.h"
+
+namespace larder {
+namespace {
+
+using namespace std::chrono_literals;
+using Kind = DispatchQueue::Kind;
+using Clock = std::chrono::steady_clock;
+using ::testing::HasSubstr;
+
+// Waits that must succeed get this long, so that a fault fails the test instead of hanging it.
+constexpr auto kGenerous = 5s;
+// Time given to a faulty implementation to do what it must not, before checking it did not.
+constexpr auto kChance = 30ms;
+
+std::shared_ptr<DispatchQueue> makeQueue(Kind kind, std::string label = "test") {
+  return DispatchQueue::create(std::move(label), kind);
+}
+
+// A meeting point for `parties` threads; a thread that waits in vain gets false back instead of
+// blocking forever, so that a queue that fails to overlap its items fails the test.
+class Rendezvous {
+ public:
+  explicit Rendezvous(int parties) : missing_(parties) {}
+
+  bool arriveAndWaitFor(Clock::duration timeout) {
+    std::unique_lock lock(mutex_);
+    if (--missing_ == 0) {
+      allArrived_.notify_all();
+      return true;
+    }
+    return allArrived_.wait_for(lock, timeout, [this] { return missing_ <= 0; });
+  }
+
+ private:
+  std::mutex mutex_;
+  std::condition_variable allArrived_;
+  int missing_;
+};
+
+// Runs `work` on its own thread and tells whether it returned within `timeout`. When it did not,
+// the thread is left behind: the test has failed and must not hang as well.
+bool completesWithin(Clock::duration timeout, std::function<void()> work) {
+  auto finished = std::make_shared<DispatchSemaphore>();
+  std::thread runner([finished, work = std::move(work)] {
+    work();
+    finished->signal();
+  });
+  if (finished->waitFor(timeout)) {
+    runner.join();
+    return true;
+  }
+  runner.detach();
+  return false;
+}
+
+bool eventually(const std::function<bool()>& condition, Clock::duration timeout = kGenerous) {
+  const auto giveUpAt = Clock::now() + timeout;
+  while (!condition()) {
+    if (Clock::now() > giveUpAt) {
+      return false;
+    }
+    std::this_thread::sleep_for(1ms);
+  }
+  return true;
+}
+
+std::string kindName(const ::testing::TestParamInfo<Kind>& info) {
+  return info.param == Kind::Serial ? "Serial" : "Concurrent";
+}
+
+// ---------------------------------------------------------------------------------------------
+// Serial queues
+
+TEST(SerialQueue, AsyncItemsFromSeveralProducersRunOneAtATimeInSubmissionOrder) {
+  constexpr int kProducers = 4;
+  constexpr int kItemsEach = 300;
+  auto queue = makeQueue(Kind::Serial);
+  // Deliberately unsynchronised: the queue alone must keep its items apart.
+  std::vector<std::pair<int, int>> ran;
+  std::atomic<int> inside{0};
+  std::atomic<bool> overlapped{false};
+
+  std::vector<std::thread> producers;
+  for (int producer = 0; producer < kProducers; ++producer) {
+    producers.emplace_back([&, producer] {
+      for (int sequence = 0; sequence < kItemsEach; ++sequence) {
+        queue->async([&, producer, sequence] {
+          if (inside.fetch_add(1) != 0) {
+            overlapped = true;
+          }
+          ran.emplace_back(producer, sequence);
+          inside.fetch_sub(1);
+        });
+      }
+    });
+  }
+  for (auto& producer : producers) {
+    producer.join();
+  }
+  queue->sync([] {});
+
+  EXPECT_FALSE(overlapped);
+  ASSERT_EQ(ran.size(), std::size_t{kProducers * kItemsEach});
+  std::vector<int> nextExpected(kProducers, 0);
+  for (const auto& [producer, sequence] : ran) {
+    ASSERT_EQ(sequence, nextExpected[producer]) << "producer " << producer;
+    ++nextExpected[producer];
+  }
+}
+
+TEST(SerialQueue, SyncSeesEveryEarlierAsyncItemDone) {
+  auto queue = makeQueue(Kind::Serial);
+  int counter = 0;  // unsynchronised on purpose
+  for (int i = 0; i < 100; ++i) {
+    queue->async([&counter] { ++counter; });
+  }
+  int seen = -1;
+  queue->sync([&] { seen = counter; });
+  EXPECT_EQ(seen, 100);
+}
+
+TEST(SerialQueue, SyncWaitsWhileAnEarlierItemIsStillRunning) {
+  auto queue = makeQueue(Kind::Serial);
+  DispatchSemaphore firstStarted;
+  DispatchSemaphore releaseFirst;
+  bool firstFinished = false;
+  queue->async([&] {
+    firstStarted.signal();
+    releaseFirst.wait();
+    firstFinished = true;
+  });
+  ASSERT_TRUE(firstStarted.waitFor(kGenerous));
+
+  std::atomic<bool> syncReturned{false};
+  bool sawFirstFinished = false;
+  std::thread caller([&] {
+    queue->sync([&] { sawFirstFinished = firstFinished; });
+    syncReturned = true;
+  });
+  std::this_thread::sleep_for(kChance);
+  EXPECT_FALSE(syncReturned);
+  releaseFirst.signal();
+  caller.join();
+  EXPECT_TRUE(sawFirstFinished);
+}
+
+TEST(SerialQueue, SyncRunsOnTheCallingThread) {
+  auto queue = makeQueue(Kind::Serial);
+  queue->async([] {});
+  std::thread::id ranOn;
+  queue->sync([&] { ranOn = std::this_thread::get_id(); });
+  EXPECT_EQ(ranOn, std::this_thread::get_id());
+}
+
+TEST(SerialQueue, ItemsQueuedDuringASyncBlockWaitForItToReturn) {
+  auto queue = makeQueue(Kind::Serial);
+  std::atomic<bool> laterItemRan{false};
+  bool ranBeforeSyncReturned = true;
+  DispatchSemaphore laterItemDone;
+  queue->sync([&] {
+    queue->async([&] {
+      laterItemRan = true;
+      laterItemDone.signal();
+    });
+    std::this_thread::sleep_for(kChance);
+    ranBeforeSyncReturned = laterItemRan;
+  });
+  EXPECT_FALSE(ranBeforeSyncReturned);
+  EXPECT_TRUE(laterItemDone.waitFor(kGenerous));
+}
+
+TEST(SerialQueue, BarrierItemsKeepTheSameSingleOrder) {
+  auto queue = makeQueue(Kind::Serial);
+  std::vector<int> order;
+  queue->async([&] { order.push_back(1); });
+  queue->barrierAsync([&] { order.push_back(2); });
+  queue->sync([&] { order.push_back(3); });
+  queue->async([&] { order.push_back(4); });
+  queue->barrierSync([&] { order.push_back(5); });
+  EXPECT_EQ(order, (std::vector<int>{1, 2, 3, 4, 5}));
+  EXPECT_EQ(queue->kind(), Kind::Serial);
+}
+
+TEST(SerialQueue, SyncCallersFromManyThreadsNeverOverlapAsyncItems) {
+  auto queue = makeQueue(Kind::Serial);
+  std::atomic<int> inside{0};
+  std::atomic<bool> overlapped{false};
+  long total = 0;  // unsynchronised on purpose
+  auto exclusiveIncrement = [&] {
+    if (inside.fetch_add(1) != 0) {
+      overlapped = true;
+    }
+    ++total;
+    inside.fetch_sub(1);
+  };
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 4; ++t) {
+    threads.emplace_back([&, t] {
+      for (int i = 0; i < 250; ++i) {
+        if ((i + t) % 2 == 0) {
+          queue->sync(exclusiveIncrement);
+        } else {
+          queue->async(exclusiveIncrement);
+        }
+      }
+    });
+  }
+  for (auto& thread : threads) {
+    thread.join();
+  }
+  long seen = 0;
+  queue->sync([&] { seen = total; });
+  EXPECT_FALSE(overlapped);
+  EXPECT_EQ(seen, 1000);
+}
+
+// ---------------------------------------------------------------------------------------------
+// Concurrent queues
+
+TEST(ConcurrentQueue, SyncReadersOnDifferentThreadsRunAtTheSameTime) {
+  auto queue = makeQueue(Kind::Concurrent);
+  EXPECT_EQ(queue->kind(), Kind::Concurrent);
+  Rendezvous bothInside(2);
+  std::atomic<bool> firstMet{false};
+  std::atomic<bool> secondMet{false};
+  std::thread first([&] { queue->sync([&] { firstMet = bothInside.arriveAndWaitFor(2s); }); });
+  std::thread second([&] { queue->sync([&] { secondMet = bothInside.arriveAndWaitFor(2s); }); });
+  first.join();
+  second.join();
+  EXPECT_TRUE(firstMet);
+  EXPECT_TRUE(secondMet);
+}
+
+TEST(ConcurrentQueue, AsyncItemsRunInParallelUpToTheWorkerLimit) {
+  auto queue = DispatchQueue::create("wide", Kind::Concurrent, {.concurrentWorkers = 3});
+  DispatchSemaphore started;
+  DispatchSemaphore release;
+  Rendezvous allThree(3);
+  std::atomic<int> met{0};
+  for (int i = 0; i < 3; ++i) {
+    queue->async([&] {
+      met += allThree.arriveAndWaitFor(2s) ? 1 : 0;
+      started.signal();
+      release.wait();
+    });
+  }
+  std::atomic<bool> fourthStarted{false};
+  DispatchSemaphore fourthDone;
+  queue->async([&] {
+    fourthStarted = true;
+    fourthDone.signal();
+  });
+  for (int i = 0; i < 3; ++i) {
+    ASSERT_TRUE(started.waitFor(kGenerous));
+  }
+  EXPECT_EQ(met, 3);
+  std::this_thread::sleep_for(kChance);
+  EXPECT_FALSE(fourthStarted) << "more items ran at once than the queue's worker limit";
+  EXPECT_LE(queue->workerThreadCount(), 3u);
+  for (int i = 0; i < 3; ++i) {
+    release.signal();
+  }
+  EXPECT_TRUE(fourthDone.waitFor(kGenerous));
+  // The workers may still be returning from `release`: let them finish before it goes away.
+  queue->barrierSync([] {});
+}
+
+TEST(ConcurrentQueue, SyncReaderAndAsyncItemOverlap) {
+  auto queue = makeQueue(Kind::Concurrent);
+  Rendezvous both(2);
+  std::atomic<bool> asyncMet{false};
+  DispatchSemaphore asyncDone;
+  queue->async([&] {
+    asyncMet = both.arriveAndWaitFor(2s);
+    asyncDone.signal();
+  });
+  bool syncMet = false;
+  queue->sync([&] { syncMet = both.arriveAndWaitFor(2s); });
+  ASSERT_TRUE(asyncDone.waitFor(kGenerous));
+  EXPECT_TRUE(asyncMet);
+  EXPECT_TRUE(syncMet);
+}
+
+TEST(ConcurrentQueue, BarrierWaitsForEveryReaderQueuedBeforeIt) {
+  auto queue = makeQueue(Kind::Concurrent);
+  DispatchSemaphore readerInside;
+  DispatchSemaphore releaseSyncReaders;
+  DispatchSemaphore releaseAsyncReader;
+  std::atomic<int> readersFinished{0};
+  auto holdingReader = [&](DispatchSemaphore& release) {
+    return [&] {
+      readerInside.signal();
+      release.wait();
+      readersFinished.fetch_add(1);
+    };
+  };
+  std::thread syncReaderA([&] { queue->sync(holdingReader(releaseSyncReaders)); });
+  std::thread syncReaderB([&] { queue->sync(holdingReader(releaseSyncReaders)); });
+  queue->async(holdingReader(releaseAsyncReader));
+  for (int i = 0; i < 3; ++i) {
+    ASSERT_TRUE(readerInside.waitFor(kGenerous));
+  }
+
+  std::atomic<int> finishedWhenBarrierRan{-1};
+  DispatchSemaphore barrierRan;
+  queue->barrierAsync([&] {
+    finishedWhenBarrierRan = readersFinished.load();
+    barrierRan.signal();
+  });
+  std::atomic<int> finishedWhenSyncBarrierRan{-1};
+  std::thread syncBarrier([&] {
+    queue->barrierSync([&] { finishedWhenSyncBarrierRan = readersFinished.load(); });
+  });
+
+  EXPECT_FALSE(barrierRan.waitFor(kChance)) << "barrier started while readers were inside";
+  releaseAsyncReader.signal();
+  EXPECT_FALSE(barrierRan.waitFor(kChance)) << "barrier started while sync readers were inside";
+  // Nothing but the sync readers leaving can let the barriers in now.
+  releaseSyncReaders.signal();
+  releaseSyncReaders.signal();
+  EXPECT_TRUE(barrierRan.waitFor(kGenerous));
+  syncReaderA.join();
+  syncReaderB.join();
+  syncBarrier.join();
+  EXPECT_EQ(finishedWhenBarrierRan, 3);
+  EXPECT_EQ(finishedWhenSyncBarrierRan, 3);
+}
+
+TEST(ConcurrentQueue, ItemsQueuedAfterABarrierWaitForItAndSeeItsEffect) {
+  auto queue = makeQueue(Kind::Concurrent);
+  DispatchSemaphore earlyReaderInside;
+  DispatchSemaphore releaseEarlyReader;
+  std::thread earlyReader([&] {
+    queue->sync([&] {
+      earlyReaderInside.signal();
+      releaseEarlyReader.wait();
+    });
+  });
+  ASSERT_TRUE(earlyReaderInside.waitFor(kGenerous));
+
+  int value = 0;  // unsynchronised on purpose: the queue orders the accesses
+  queue->barrierAsync([&] { value = 42; });
+
+  std::atomic<bool> lateSyncReaderDone{false};
+  int seenBySyncReader = -1;
+  std::thread lateSyncReader([&] {
+    queue->sync([&] { seenBySyncReader = value; });
+    lateSyncReaderDone = true;
+  });
+  int seenByAsyncReader = -1;
+  DispatchSemaphore asyncReaderDone;
+  queue->async([&] {
+    seenByAsyncReader = value;
+    asyncReaderDone.signal();
+  });
+
+  EXPECT_FALSE(asyncReaderDone.waitFor(kChance)) << "reader passed a pending barrier";
+  EXPECT_FALSE(lateSyncReaderDone) << "reader passed a pending barrier";
+  releaseEarlyReader.signal();
+  earlyReader.join();
+  lateSyncReader.join();
+  ASSERT_TRUE(asyncReaderDone.waitFor(kGenerous));
+  EXPECT_EQ(seenBySyncReader, 42);
+  EXPECT_EQ(seenByAsyncReader, 42);
+}
+
+TEST(ConcurrentQueue, BarrierIsNotStarvedByAnEndlessRelayOfReaders) {
+  auto queue = makeQueue(Kind::Concurrent);
+  std::atomic<int> inside{0};
+  std::atomic<int> entries{0};
+  std::atomic<bool> stopReaders{false};
+  // Each reader leaves only while the other one is inside, so that a queue which lets readers
+  // pass a pending barrier never has a moment without a reader. A fair queue holds the next
+  // reader back; the one inside then gives up waiting and leaves.
+  auto relayReader = [&] {
+    while (!stopReaders) {
+      queue->sync([&] {
+        inside.fetch_add(1);
+        entries.fetch_add(1);
+        const auto giveUpAt = Clock::now() + 100ms;
+        for (;;) {
+          int bothInside = 2;
+          if (inside.compare_exchange_weak(bothInside, 1)) {
+            return;
+          }
+          if (Clock::now() > giveUpAt) {
+            inside.fetch_sub(1);
+            return;
+          }
+          std::this_thread::yield();
+        }
+      });
+    }
+  };
+  std::thread readerA(relayReader);
+  std::thread readerB(relayReader);
+  ASSERT_TRUE(eventually([&] { return entries >= 20; }));
+
+  DispatchSemaphore barrierRan;
+  queue->barrierAsync([&] { barrierRan.signal(); });
+  const bool barrierGotIn = barrierRan.waitFor(2s);
+  const bool syncBarrierGotIn = completesWithin(2s, [&] { queue->barrierSync([] {}); });
+  stopReaders = true;
+  readerA.join();
+  readerB.join();
+  EXPECT_TRUE(barrierGotIn);
+  EXPECT_TRUE(syncBarrierGotIn);
+}
+
+TEST(ConcurrentQueue, ReadersAndBarriersUnderLoadNeverOverlap) {
+  auto queue = makeQueue(Kind::Concurrent);
+  // Unsynchronised on purpose; barriers move one unit between two keys in two steps, so a reader
+  // overlapping a barrier may see a total that is off by one (and the thread sanitizer sees the
+  // race).
+  std::map<int, int> table{{0, 100}, {1, 100}, {2, 100}, {3, 100}};
+  constexpr int kTotal = 400;
+  std::atomic<int> readersInside{0};
+  std::atomic<bool> barrierInside{false};
+  std::atomic<int> violations{0};
+  std::atomic<int> barriersRun{0};
+
+  auto read = [&] {
+    readersInside.fetch_add(1);
+    if (barrierInside) {
+      violations.fetch_add(1);
+    }
+    int sum = 0;
+    for (const auto& [key, amount] : table) {
+      sum += amount;
+    }
+    if (sum != kTotal) {
+      violations.fetch_add(1);
+    }
+    readersInside.fetch_sub(1);
+  };
+  auto write = [&](int step) {
+    barrierInside = true;
+    if (readersInside != 0) {
+      violations.fetch_add(1);
+    }
+    table[step % 4] -= 1;
+    std::this_thread::yield();  // widens the window in which an overlapping reader would look
+    table[(step + 1) % 4] += 1;
+    barrierInside = false;
+    barriersRun.fetch_add(1);
+  };
+
+  std::atomic<bool> writerDone{false};
+  std::vector<std::thread> threads;
+  for (int t = 0; t < 3; ++t) {
+    threads.emplace_back([&] {
+      for (int i = 0; i < 300 || !writerDone; ++i) {
+        queue->sync(read);
+      }
+    });
+  }
+  threads.emplace_back([&] {
+    for (int i = 0; i < 150; ++i) {
+      if (i % 3 == 0) {
+        queue->barrierSync([&] { write(i); });
+      } else if (i % 3 == 1) {
+        queue->barrierAsync([&, i] { write(i); });
+      } else {
+        queue->async(read);
+      }
+    }
+    writerDone = true;
+  });
+  for (auto& thread : threads) {
+    thread.join();
+  }
+  queue->barrierSync([] {});
+  EXPECT_EQ(violations, 0);
+  EXPECT_EQ(barriersRun, 100);
+}
+
+TEST(ConcurrentQueue, ReaderHeldBackByABarrierIsNotHeldBackByTheWorkerLimit) {
+  auto queue = DispatchQueue::create("narrow", Kind::Concurrent, {.concurrentWorkers = 1});
+  DispatchSemaphore barrierStarted;
+  DispatchSemaphore releaseBarrier;
+  queue->barrierAsync([&] {
+    barrierStarted.signal();
+    releaseBarrier.wait();
+  });
+  ASSERT_TRUE(barrierStarted.waitFor(kGenerous));
+
+  DispatchSemaphore asyncStarted;
+  DispatchSemaphore releaseAsync;
+  queue->async([&] {
+    asyncStarted.signal();
+    releaseAsync.wait();
+  });
+  queue->async([] {});  // waits for the only worker
+  DispatchSemaphore readerDone;
+  std::thread reader([&] {
+    queue->sync([] {});
+    readerDone.signal();
+  });
+  // Lets the reader queue up behind the barrier; the outcome must be the same if it does not.
+  std::this_thread::sleep_for(kChance);
+  releaseBarrier.signal();
+  ASSERT_TRUE(asyncStarted.waitFor(kGenerous));
+  EXPECT_TRUE(readerDone.waitFor(kGenerous)) << "reader waited for a worker it does not need";
+  releaseAsync.signal();
+  reader.join();
+  queue->barrierSync([] {});  // the worker may still be returning from `releaseAsync`
+}
+
+TEST(ConcurrentQueue, SyncAndBarrierSyncRunOnTheCallingThread) {
+  auto queue = makeQueue(Kind::Concurrent);
+  std::thread::id readerRanOn;
+  std::thread::id barrierRanOn;
+  queue->sync([&] { readerRanOn = std::this_thread::get_id(); });
+  queue->barrierSync([&] { barrierRanOn = std::this_thread::get_id(); });
+  EXPECT_EQ(readerRanOn, std::this_thread::get_id());
+  EXPECT_EQ(barrierRanOn, std::this_thread::get_id());
+}
+
+// ---------------------------------------------------------------------------------------------
+// Behaviour shared by both kinds
+
+class EveryQueueKind : public ::testing::TestWithParam<Kind> {};
+
+INSTANTIATE_TEST_SUITE_P(DispatchQueue, EveryQueueKind,
+                         ::testing::Values(Kind::Serial, Kind::Concurrent), kindName);
+
+TEST_P(EveryQueueKind, LabelIsKept) {
+  auto queue = makeQueue(GetParam(), "com.example.label");
+  EXPECT_EQ(queue->label(), "com.example.label");
+}
+
+TEST_P(EveryQueueKind, SyncFromATaskOfAnotherQueueWorks) {
+  auto outer = makeQueue(Kind::Serial, "outer");
+  auto queue = makeQueue(GetParam(), "inner");
+  auto innermost = makeQueue(Kind::Serial, "innermost");
+  int value = 0;
+  std::atomic<bool> bothCurrent{false};
+  std::atomic<bool> allThreeCurrent{false};
+  DispatchSemaphore done;
+  outer->async([&] {
+    queue->sync([&] {
+      value = 1;
+      bothCurrent = outer->isCurrent() && queue->isCurrent();
+      innermost->sync([&] {
+        allThreeCurrent = outer->isCurrent() && queue->isCurrent() && innermost->isCurrent();
+      });
+    });
+    queue->barrierSync([&] { value += 1; });
+    done.signal();
+  });
+  ASSERT_TRUE(done.waitFor(kGenerous));
+  EXPECT_TRUE(bothCurrent);
+  EXPECT_TRUE(allThreeCurrent);
+  int seen = 0;
+  queue->sync([&] { seen = value; });
+  EXPECT_EQ(seen, 2);
+}
+
+TEST_P(EveryQueueKind, PendingItemsRunAfterTheLastReferenceIsDropped) {
+  auto queue = makeQueue(GetParam());
+  DispatchSemaphore firstStarted;
+  DispatchSemaphore releaseFirst;
+  queue->barrierAsync([&] {
+    firstStarted.signal();
+    releaseFirst.wait();
+  });
+  constexpr int kItems = 60;
+  std::atomic<int> ran{0};
+  DispatchSemaphore allRan;
+  auto countRun = [&] {
+    if (ran.fetch_add(1) + 1 == kItems) {
+      allRan.signal();
+    }
+  };
+  for (int i = 0; i < kItems; ++i) {
+    if (i % 20 == 10) {
+      queue->barrierAsync(countRun);
+    } else {
+      queue->async(countRun);
+    }
+  }
+  ASSERT_TRUE(firstStarted.waitFor(kGenerous));
+  queue.reset();
+  releaseFirst.signal();
+  EXPECT_TRUE(allRan.waitFor(kGenerous));
+  EXPECT_EQ(ran, kItems);
+}
+
+TEST_P(EveryQueueKind, LastReferenceDroppedInsideItsOwnTask) {
+  auto queue = makeQueue(GetParam());
+  std::weak_ptr<DispatchQueue> weak = queue;
+  DispatchSemaphore blockerStarted;
+  DispatchSemaphore releaseBlocker;
+  // A barrier, so that on a concurrent queue too the next item waits for the handle to go.
+  queue->barrierAsync([&] {
+    blockerStarted.signal();
+    releaseBlocker.wait();
+  });
+  DispatchSemaphore released;
+  std::atomic<bool> expiredInside{false};
+  queue->async([&released, &expiredInside, &weak, self = queue]() mutable {
+    self.reset();
+    expiredInside = weak.expired();
+    released.signal();
+  });
+  ASSERT_TRUE(blockerStarted.waitFor(kGenerous));
+  queue.reset();
+  releaseBlocker.signal();
+  ASSERT_TRUE(released.waitFor(kGenerous));
+  EXPECT_TRUE(expiredInside);
+}
+
+TEST_P(EveryQueueKind, LastReferenceReleasedWithAFinishedTaskCapture) {
+  // The queue's last handle goes when the worker lets go of the finished item's captures.
+  struct HandleHolder {
+    HandleHolder(std::shared_ptr<DispatchQueue> handle, DispatchSemaphore& onRelease)
+        : queue(std::move(handle)), released(&onRelease) {}
+    HandleHolder(const HandleHolder&) = delete;
+    HandleHolder& operator=(const HandleHolder&) = delete;
+    std::shared_ptr<DispatchQueue> queue;
+    DispatchSemaphore* released;
+    ~HandleHolder() {
+      queue.reset();
+      released->signal();
+    }
+  };
+  DispatchSemaphore released;
+  auto queue = makeQueue(GetParam());
+  std::weak_ptr<DispatchQueue> weak = queue;
+  DispatchSemaphore ran;
+  auto holder = std::make_shared<HandleHolder>(queue, released);
+  queue->async([holder, &ran] { ran.signal(); });
+  holder.reset();
+  queue.reset();
+  ASSERT_TRUE(ran.waitFor(kGenerous));
+  ASSERT_TRUE(released.waitFor(kGenerous));
+  EXPECT_TRUE(weak.expired());
+}
+
+TEST_P(EveryQueueKind, WorkersStartOnDemandAndExitWhenIdle) {
+  auto queue = DispatchQueue::create("idle", GetParam(),
+                                     {.concurrentWorkers = 2, .idleTimeout = 30ms});
+  queue->sync([] {});
+  queue->barrierSync([] {});
+  EXPECT_EQ(queue->workerThreadCount(), 0u) << "synchronous work must not start workers";
+
+  DispatchSemaphore ran;
+  queue->async([&] { ran.signal(); });
+  ASSERT_TRUE(ran.waitFor(kGenerous));
+  EXPECT_GE(queue->workerThreadCount(), 1u);
+  EXPECT_TRUE(eventually([&] { return queue->workerThreadCount() == 0; }));
+
+  queue->async([&] { ran.signal(); });
+  EXPECT_TRUE(ran.waitFor(kGenerous)) << "no worker came back for new work";
+}
+
+TEST_P(EveryQueueKind, IdleTimeoutWithoutLimitKeepsTheWorker) {
+  auto queue = DispatchQueue::create("keeper", GetParam(),
+                                     {.idleTimeout = std::chrono::milliseconds::max()});
+  DispatchSemaphore ran;
+  queue->async([&] { ran.signal(); });
+  ASSERT_TRUE(ran.waitFor(kGenerous));
+  std::this_thread::sleep_for(kChance);
+  EXPECT_EQ(queue->workerThreadCount(), 1u);
+  queue->async([&] { ran.signal(); });
+  EXPECT_TRUE(ran.waitFor(kGenerous));
+}
+
+TEST_P(EveryQueueKind, ManyIdleQueuesKeepNoThreads) {
+  std::vector<std::shared_ptr<DispatchQueue>> queues;
+  DispatchSemaphore ran;
+  for (int i = 0; i < 100; ++i) {
+    queues.push_back(DispatchQueue::create("connection-" + std::to_string(i), GetParam(),
+                                           {.idleTimeout = 20ms}));
+    queues.back()->async([&] { ran.signal(); });
+  }
+  for (int i = 0; i < 100; ++i) {
+    ASSERT_TRUE(ran.waitFor(kGenerous));
+  }
+  auto liveWorkers = [&] {
+    std::size_t total = 0;
+    for (const auto& queue : queues) {
+      total += queue->workerThreadCount();
+    }
+    return total;
+  };
+  EXPECT_TRUE(eventually([&] { return liveWorkers() == 0; }));
+}
+
+TEST_P(EveryQueueKind, AsyncItemThatThrowsIsReportedAndTheQueueGoesOn) {
+  auto queue = makeQueue(GetParam(), "throwing-queue");
+  DispatchSemaphore after;
+  ::testing::internal::CaptureStderr();
+  queue->async([] { throw std::runtime_error("boom from an async item"); });
+  queue->barrierAsync([] { throw 7; });
+  queue->barrierAsync([&] { after.signal(); });
+  const bool wentOn = after.waitFor(kGenerous);
+  const std::string errors = ::testing::internal::GetCapturedStderr();
+  ASSERT_TRUE(wentOn);
+  EXPECT_THAT(errors, HasSubstr("throwing-queue"));
+  EXPECT_THAT(errors, HasSubstr("boom from an async item"));
+  EXPECT_EQ(std::count(errors.begin(), errors.end(), '\n'), 2) << errors;
+  int value = 0;
+  queue->sync([&] { value = 1; });
+  EXPECT_EQ(value, 1);
+}
+
+TEST_P(EveryQueueKind, SyncItemThatThrowsPropagatesAndReleasesTheQueue) {
+  auto queue = makeQueue(GetParam());
+  EXPECT_THROW(queue->sync([] { throw std::runtime_error("reader"); }), std::runtime_error);
+  EXPECT_FALSE(queue->isCurrent());
+  EXPECT_TRUE(completesWithin(kGenerous, [&] { queue->barrierSync([] {}); }));
+  EXPECT_THROW(queue->barrierSync([] { throw std::logic_error("writer"); }), std::logic_error);
+  EXPECT_TRUE(completesWithin(kGenerous, [&] { queue->sync([] {}); }));
+  DispatchSemaphore ran;
+  queue->async([&] { ran.signal(); });
+  EXPECT_TRUE(ran.waitFor(kGenerous));
+}
+
+TEST_P(EveryQueueKind, SyncItemThatThrowsWhileQueuedBehindABarrierReleasesTheQueue) {
+  auto queue = makeQueue(GetParam());
+  DispatchSemaphore barrierStarted;
+  DispatchSemaphore releaseBarrier;
+  queue->barrierAsync([&] {
+    barrierStarted.signal();
+    releaseBarrier.wait();
+  });
+  ASSERT_TRUE(barrierStarted.waitFor(kGenerous));
+  std::atomic<bool> threw{false};
+  std::thread reader([&] {
+    try {
+      queue->sync([] { throw std::runtime_error("queued reader"); });
+    } catch (const std::runtime_error&) {
+      threw = true;
+    }
+  });
+  releaseBarrier.signal();
+  reader.join();
+  EXPECT_TRUE(threw);
+  EXPECT_TRUE(completesWithin(kGenerous, [&] { queue->barrierSync([] {}); }));
+}
+
+TEST_P(EveryQueueKind, IsCurrentOnlyWhileRunningATaskOfThatQueue) {
+  auto queue = makeQueue(GetParam());
+  auto other = makeQueue(GetParam());
+  EXPECT_FALSE(queue->isCurrent());
+  bool inSync = false;
+  bool otherInSync = true;
+  queue->sync([&] {
+    inSync = queue->isCurrent();
+    otherInSync = other->isCurrent();
+  });
+  bool inBarrierSync = false;
+  queue->barrierSync([&] { inBarrierSync = queue->isCurrent(); });
+  std::atomic<bool> inAsync{false};
+  std::atomic<bool> inBarrierAsync{false};
+  DispatchSemaphore done;
+  queue->async([&] { inAsync = queue->isCurrent(); });
+  queue->barrierAsync([&] {
+    inBarrierAsync = queue->isCurrent();
+    done.signal();
+  });
+  ASSERT_TRUE(done.waitFor(kGenerous));
+  EXPECT_TRUE(inSync);
+  EXPECT_FALSE(otherInSync);
+  EXPECT_TRUE(inBarrierSync);
+  EXPECT_TRUE(inAsync);
+  EXPECT_TRUE(inBarrierAsync);
+  EXPECT_FALSE(queue->isCurrent());
+}
+
+TEST_P(EveryQueueKind, EmptyWorkIsRejected) {
+  auto queue = makeQueue(GetParam());
+  EXPECT_THROW(queue->async(nullptr), std::invalid_argument);
+  EXPECT_THROW(queue->sync(nullptr), std::invalid_argument);
+  EXPECT_THROW(queue->barrierAsync(nullptr), std::invalid_argument);
+  EXPECT_THROW(queue->barrierSync(nullptr), std::invalid_argument);
+}
+
+class EveryQueueKindDeathTest : public EveryQueueKind {};
+
+INSTANTIATE_TEST_SUITE_P(DispatchQueue, EveryQueueKindDeathTest,
+                         ::testing::Values(Kind::Serial, Kind::Concurrent), kindName);
+
+TEST_P(EveryQueueKindDeathTest, SyncOnTheQueueOfTheRunningTaskAbortsInDebugBuilds) {
+#ifdef NDEBUG
+  GTEST_SKIP() << "the check is compiled into debug builds only";
+#else
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  const char* const message = "'self-deadlock'.*already running on it";
+  EXPECT_DEATH(
+      {
+        auto queue = makeQueue(GetParam(), "self-deadlock");
+        queue->sync([&] { queue->sync([] {}); });
+      },
+      message);
+  EXPECT_DEATH(
+      {
+        auto queue = makeQueue(GetParam(), "self-deadlock");
+        queue->async([&] { queue->barrierSync([] {}); });
+        DispatchSemaphore never;
+        never.wait();
+      },
+      message);
+#endif
+}
+
+// ---------------------------------------------------------------------------------------------
+// Semaphores
+
+TEST(DispatchSemaphore, WaitForTimesOutWithoutASignal) {
+  DispatchSemaphore semaphore;
+  const auto before = Clock::now();
+  EXPECT_FALSE(semaphore.waitFor(20ms));
+  EXPECT_GE(Clock::now() - before, 20ms);
+}
+
+TEST(DispatchSemaphore, EachSignalReleasesExactlyOneWait) {
+  DispatchSemaphore semaphore;
+  semaphore.signal();
+  semaphore.signal();
+  semaphore.signal();
+  EXPECT_TRUE(semaphore.waitFor(0ms));
+  semaphore.wait();
+  EXPECT_TRUE(semaphore.waitFor(0ms));
+  EXPECT_FALSE(semaphore.waitFor(0ms));
+}
+
+TEST(DispatchSemaphore, InitialCountIsAvailable) {
+  DispatchSemaphore semaphore(2);
+  EXPECT_TRUE(semaphore.waitFor(0ms));
+  EXPECT_TRUE(semaphore.waitFor(0ms));
+  EXPECT_FALSE(semaphore.waitFor(1ms));
+}
+
+TEST(DispatchSemaphore, LongestTimeoutMeansWaitingWithoutLimit) {
+  DispatchSemaphore semaphore;
+  std::thread signaller([&] { semaphore.signal(); });
+  EXPECT_TRUE(semaphore.waitFor(Clock::duration::max()));
+  signaller.join();
+  semaphore.signal();
+  EXPECT_TRUE(semaphore.waitFor(Clock::duration::max()));
+}
+
+TEST(DispatchSemaphore, SignalFromAnotherThreadWakesAWaiter) {
+  DispatchSemaphore semaphore;
+  std::atomic<bool> signalled{false};
+  std::thread signaller([&] {
+    std::this_thread::sleep_for(kChance);
+    signalled = true;
+    semaphore.signal();
+  });
+  EXPECT_TRUE(semaphore.waitFor(kGenerous));
+  EXPECT_TRUE(signalled);
+  signaller.join();
+}
+
+TEST(DispatchSemaphore, WaiterMayDestroyItRightAfterWaking) {
+  // The usual in-line completion pattern: the semaphore lives on the waiter's stack.
+  auto queue = makeQueue(Kind::Concurrent);
+  for (int i = 0; i < 200; ++i) {
+    auto semaphore = std::make_unique<DispatchSemaphore>();
+    queue->async([raw = semaphore.get()] { raw->signal(); });
+    semaphore->wait();
+  }
+  queue->barrierSync([] {});
+}
+
+}  // namespace
+}  // namespace larder

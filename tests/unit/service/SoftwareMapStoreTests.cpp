@@ -1,0 +1,304 @@
+// The software map's persisted store: what a discovery writes, what a later
+// process reads back, and how damaged files are survived.
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <random>
+#include <string>
+#include <vector>
+
+#include "ServiceTestSupport.h"
+#include "platform/FileIO.h"
+#include "platform/KeyedArchive.h"
+#include "software-map/SoftwareMap.h"
+
+namespace larder::testing {
+namespace {
+
+constexpr const char* kNoDictionaryLine =
+    "SoftwareMap: Persisted SoftwareMap did not contain appsByPath dictionary.";
+constexpr const char* kNotFoundLine = "SoftwareMap: Persisted SoftwareMap not found";
+constexpr const char* kEmptySummaryLine =
+    "SoftwareMap: After loading persisted store, SoftwareMap is {\n}";
+
+class SoftwareMapStoreTest : public ServiceTest {
+ protected:
+  LedgerSoftwareProductFields record(int index) const {
+    LedgerSoftwareProductFields fields;
+    fields.bundlePath = rootApplications() + "/Stored" + std::to_string(index) + ".app";
+    fields.bundleIdentifier = "com.example.stored" + std::to_string(index);
+    fields.bundleVersion = "1." + std::to_string(index);
+    fields.itemIdentifier = static_cast<std::uint64_t>(7000 + index);
+    fields.versionIdentifier = 100 + index;
+    fields.accountOpaqueID = "acct" + std::to_string(index);
+    fields.purchaseDate = PlistDate{1400000000.0 + index};
+    fields.installed = true;
+    fields.source = LedgerSoftwareProduct::kSourceRegistryOrPurchaseRecord;
+    return fields;
+  }
+
+  std::vector<LedgerSoftwareProductFields> records(int count) const {
+    std::vector<LedgerSoftwareProductFields> result;
+    for (int i = 0; i < count; ++i) result.push_back(record(i));
+    return result;
+  }
+
+  // Loads `bytes` as the store of a map that does not look at the disk
+  // otherwise; checks that nothing was loaded and that the damage was
+  // reported by `expectedLine` and nothing else.
+  void expectEmptyMapFrom(const std::optional<PlistData>& bytes, const std::string& what,
+                          const std::string& expectedLine, int expectedLevel) {
+    std::string path = storePath(what);
+    std::filesystem::create_directories(std::filesystem::path(path).parent_path());
+    if (bytes) writeBytes(path, *bytes);
+    LogCapture log;
+    {
+      SoftwareMap map(options(path, false));
+      map.waitUntilIdle();
+      EXPECT_TRUE(map.allProducts().empty()) << what;
+      EXPECT_EQ(map.productForBundleIdentifier("com.example.stored0"), nullptr) << what;
+    }
+    EXPECT_EQ(log.countExactly(expectedLine, expectedLevel), 1U) << what << "\n" << log.dump();
+    for (const char* other : {kNoDictionaryLine, kNotFoundLine}) {
+      if (expectedLine != other) {
+        EXPECT_EQ(log.countExactly(other), 0U) << what << "\n" << log.dump();
+      }
+    }
+    EXPECT_EQ(log.countContaining("Exception loading persisted SoftwareMap"), 0U) << what;
+    EXPECT_EQ(log.countExactly(kEmptySummaryLine, 2), 1U) << what << "\n" << log.dump();
+  }
+};
+
+TEST_F(SoftwareMapStoreTest, LaterMapAnswersFromWhatDiscoveryStored) {
+  Purchase numeric{"com.example.numeric", "2.4.1", PlistValue(5551), PlistValue(88),
+                   "opaque-numeric", 1300000000.0};
+  Purchase textual{"com.example.textual", "1.0", PlistValue("1234567890123"), PlistValue("42"),
+                   std::nullopt, std::nullopt};
+  std::string numericPath = makeBundle(rootApplications(), "Numeric", "com.example.numeric",
+                                       "2.4.1", numeric);
+  std::string textualPath =
+      makeBundle(homeApplications(), "Textual", "com.example.textual", "1.0", textual);
+  std::string installerPath = makeBundle(rootApplications() + "/Utilities", "Setup",
+                                         "com.orvane.SetupHerald.Helper", "5.0", std::nullopt, "512");
+
+  std::vector<LedgerSoftwareProductFields> discovered;
+  {
+    SoftwareMap first(options(storePath(), true));
+    first.waitUntilIdle();
+    ASSERT_EQ(first.allProducts().size(), 3U);
+    for (const auto& product : first.allProducts()) discovered.push_back(product->snapshot());
+  }
+  ASSERT_TRUE(std::filesystem::exists(storePath()));
+
+  // What discovery read, field by field.
+  auto fieldsAt = [&](const std::string& path) {
+    auto found = std::find_if(discovered.begin(), discovered.end(),
+                              [&](const auto& fields) { return fields.bundlePath == path; });
+    return found == discovered.end() ? LedgerSoftwareProductFields{} : *found;
+  };
+  LedgerSoftwareProductFields n = fieldsAt(numericPath);
+  EXPECT_EQ(n.bundleIdentifier, "com.example.numeric");
+  EXPECT_EQ(n.bundleVersion, "2.4.1");
+  EXPECT_EQ(n.itemIdentifier, 5551U);
+  EXPECT_EQ(n.versionIdentifier, 88);
+  EXPECT_EQ(n.accountOpaqueID, "opaque-numeric");
+  EXPECT_EQ(n.purchaseDate, PlistDate{1300000000.0});
+  EXPECT_TRUE(n.installed);
+  EXPECT_EQ(n.source, LedgerSoftwareProduct::kSourceRegistryOrPurchaseRecord);
+  LedgerSoftwareProductFields t = fieldsAt(textualPath);
+  EXPECT_EQ(t.itemIdentifier, 1234567890123U);
+  EXPECT_EQ(t.versionIdentifier, 42);
+  EXPECT_EQ(t.accountOpaqueID, std::nullopt);
+  EXPECT_EQ(t.purchaseDate, std::nullopt);
+  LedgerSoftwareProductFields s = fieldsAt(installerPath);
+  EXPECT_EQ(s.bundleIdentifier, "com.orvane.SetupHerald.Helper");
+  EXPECT_EQ(s.bundleVersion, "512");
+  EXPECT_EQ(s.itemIdentifier, std::nullopt);
+
+  // A second process, without discovery, gives the same answers.
+  SoftwareMap second(options(storePath(), false));
+  std::vector<std::string> expectedPaths{installerPath, numericPath, textualPath};
+  std::sort(expectedPaths.begin(), expectedPaths.end());
+  EXPECT_EQ(pathsOf(second.allProducts()), expectedPaths);
+  for (const LedgerSoftwareProductFields& fields : discovered) {
+    ASSERT_TRUE(fields.bundleIdentifier);
+    LedgerSoftwareProductRef loaded = second.productForBundleIdentifier(*fields.bundleIdentifier);
+    ASSERT_NE(loaded, nullptr) << *fields.bundleIdentifier;
+    EXPECT_EQ(loaded->snapshot(), fields) << loaded->description();
+    if (fields.itemIdentifier) {
+      LedgerSoftwareProductRef byItem = second.productForItemIdentifier(*fields.itemIdentifier);
+      EXPECT_EQ(byItem, loaded) << "both indexes hold the same record";
+    }
+  }
+  EXPECT_EQ(second.productForItemIdentifier(0), nullptr);
+}
+
+TEST_F(SoftwareMapStoreTest, DamagedStoresGiveAnEmptyMap) {
+  PlistData good = archivedStore(records(3));
+  ASSERT_GT(good.size(), 64U);
+  for (std::size_t length : {std::size_t{1}, std::size_t{8}, std::size_t{9}, good.size() / 3,
+                             good.size() / 2, good.size() - 33, good.size() - 1}) {
+    PlistData truncated(good.begin(), good.begin() + static_cast<std::ptrdiff_t>(length));
+    expectEmptyMapFrom(truncated, "truncated-" + std::to_string(length), kNoDictionaryLine, 1);
+  }
+
+  std::mt19937 generator(20240611);
+  PlistData noise(4096);
+  for (auto& byte : noise) byte = static_cast<std::uint8_t>(generator());
+  expectEmptyMapFrom(noise, "noise", kNoDictionaryLine, 1);
+  // Noise behind a valid header and a valid trailer's worth of bytes.
+  PlistData headed = noise;
+  std::copy_n(good.begin(), 8, headed.begin());
+  expectEmptyMapFrom(headed, "headed-noise", kNoDictionaryLine, 1);
+  // The real store with its middle scrambled.
+  PlistData scrambled = good;
+  for (std::size_t i = scrambled.size() / 4; i < scrambled.size() / 2; ++i) {
+    scrambled[i] = static_cast<std::uint8_t>(generator());
+  }
+  expectEmptyMapFrom(scrambled, "scrambled", kNoDictionaryLine, 1);
+
+  PlistDictionary evil = KeyedArchive::record("Evil");
+  evil.emplace("bundlePath", rootApplications() + "/Evil.app");
+  PlistDictionary byPath;
+  byPath.emplace(record(0).bundlePath, LedgerSoftwareProduct(record(0)).encodeWithCoder());
+  byPath.emplace(rootApplications() + "/Evil.app", evil);
+  expectEmptyMapFrom(KeyedArchive::archivedData(KeyedArchive::dictionary(
+                         {{"appsByPath", KeyedArchive::dictionary(std::move(byPath))}})),
+                     "evil-class", kNoDictionaryLine, 1);
+
+  expectEmptyMapFrom(KeyedArchive::archivedData(KeyedArchive::array(
+                         {LedgerSoftwareProduct(record(0)).encodeWithCoder()})),
+                     "array-root", kNoDictionaryLine, 1);
+  expectEmptyMapFrom(KeyedArchive::archivedData(PlistArray{"plain"}), "plain-array-root",
+                     kNoDictionaryLine, 1);
+  expectEmptyMapFrom(KeyedArchive::archivedData(KeyedArchive::dictionary({{"appsByPath", "text"}})),
+                     "string-entry", kNoDictionaryLine, 1);
+  expectEmptyMapFrom(KeyedArchive::archivedData(KeyedArchive::dictionary({{"other", "text"}})),
+                     "no-entry", kNoDictionaryLine, 1);
+  expectEmptyMapFrom(
+      PropertyListSerialization::writeBinary(PlistDictionary{{"appsByPath", PlistDictionary{}}}),
+      "not-an-archive", kNoDictionaryLine, 1);
+  PlistData xml;
+  std::string text = PropertyListSerialization::writeXml(PlistDictionary{{"appsByPath", 1}});
+  xml.assign(text.begin(), text.end());
+  expectEmptyMapFrom(xml, "xml", kNoDictionaryLine, 1);
+
+  expectEmptyMapFrom(PlistData{}, "empty", kNotFoundLine, 2);
+  expectEmptyMapFrom(std::nullopt, "missing", kNotFoundLine, 2);
+}
+
+TEST_F(SoftwareMapStoreTest, DamagedStoreIsReplacedByTheNextDiscovery) {
+  writeBytes(storePath(), PlistData{'b', 'p', 'l', 'i', 's', 't', '0', '0', 0xFF, 0xFF});
+  std::string app = makeStoreBundle(rootApplications(), "Fresh", "com.example.fresh", "1.0", 31);
+  {
+    SoftwareMap map(options(storePath(), false));
+    EXPECT_TRUE(map.allProducts().empty());
+    map.reloadFromApplicationRegistry();
+    EXPECT_EQ(pathsOf(map.allProducts()), std::vector<std::string>{app});
+  }
+  SoftwareMap reread(options(storePath(), false));
+  ASSERT_NE(reread.productForBundleIdentifier("com.example.fresh"), nullptr);
+  EXPECT_EQ(reread.productForItemIdentifier(31)->bundlePath(), app);
+}
+
+TEST_F(SoftwareMapStoreTest, RecordsThatBreakTheirOwnRulesAreDroppedAlone) {
+  PlistDictionary byPath;
+  byPath.emplace(record(0).bundlePath, LedgerSoftwareProduct(record(0)).encodeWithCoder());
+  // Keyed under another path than its own.
+  byPath.emplace(rootApplications() + "/Elsewhere.app",
+                 LedgerSoftwareProduct(record(1)).encodeWithCoder());
+  // A field of the wrong type.
+  PlistDictionary wrongType = LedgerSoftwareProduct(record(2)).encodeWithCoder();
+  wrongType["bundleVersion"] = 3;
+  byPath.emplace(record(2).bundlePath, wrongType);
+  writeBytes(storePath(), KeyedArchive::archivedData(KeyedArchive::dictionary(
+                              {{"appsByPath", KeyedArchive::dictionary(std::move(byPath))}})));
+  LogCapture log;
+  SoftwareMap map(options(storePath(), false));
+  EXPECT_EQ(pathsOf(map.allProducts()), std::vector<std::string>{record(0).bundlePath});
+  ASSERT_NE(map.productForBundleIdentifier("com.example.stored0"), nullptr);
+  EXPECT_EQ(map.productForBundleIdentifier("com.example.stored0")->snapshot(), record(0));
+  EXPECT_EQ(map.productForBundleIdentifier("com.example.stored1"), nullptr);
+  EXPECT_EQ(map.productForBundleIdentifier("com.example.stored2"), nullptr);
+  EXPECT_EQ(log.countExactly(kNoDictionaryLine), 0U);
+}
+
+TEST_F(SoftwareMapStoreTest, SmallStoreIsDescribedInTheLogLineLargeOneInASideFile) {
+  const std::string sideFile = stateFolder() + "/appsByPath.plist";
+  {
+    writeBytes(storePath("five"), archivedStore(records(5)));
+    LogCapture log;
+    SoftwareMap map(options(storePath("five"), false));
+    map.waitUntilIdle();
+    PlistDictionary described;
+    for (const auto& fields : records(5)) {
+      described.emplace(fields.bundlePath, LedgerSoftwareProduct(fields).toDictionary());
+    }
+    std::string expected = "SoftwareMap: After loading persisted store, SoftwareMap is " +
+                           describePlistValue(PlistValue(described));
+    EXPECT_EQ(log.countExactly(expected, 2), 1U) << log.dump();
+    EXPECT_NE(expected.find("bundleIdentifier = \"com.example.stored4\";"), std::string::npos);
+    EXPECT_EQ(log.countContaining("items"), 0U);
+    EXPECT_FALSE(std::filesystem::exists(sideFile));
+  }
+  {
+    writeBytes(storePath("six"), archivedStore(records(6)));
+    LogCapture log;
+    SoftwareMap map(options(storePath("six"), false));
+    map.waitUntilIdle();
+    EXPECT_EQ(log.countExactly("SoftwareMap: After loading persisted store, SoftwareMap has 6 items",
+                               2),
+              1U)
+        << log.dump();
+    EXPECT_EQ(log.countContaining("After loading persisted store, SoftwareMap is"), 0U);
+    std::optional<PlistData> bytes = FileIO::read(sideFile);
+    ASSERT_TRUE(bytes) << sideFile;
+    std::optional<PlistValue> side = PropertyListSerialization::read(*bytes);
+    ASSERT_TRUE(side && side->dictionary());
+    ASSERT_EQ(side->dictionary()->size(), 6U);
+    for (const auto& fields : records(6)) {
+      EXPECT_EQ((*side)[fields.bundlePath], PlistValue(LedgerSoftwareProduct(fields).toDictionary()))
+          << fields.bundlePath;
+    }
+  }
+}
+
+// The load is the first barrier of the map's queue: a lookup made at once
+// waits for it instead of answering from a map still being filled.
+TEST_F(SoftwareMapStoreTest, LookupRightAfterConstructionWaitsForTheLoad) {
+  constexpr int kRecords = 5000;
+  std::vector<LedgerSoftwareProductFields> many;
+  many.reserve(kRecords);
+  for (int i = 0; i < kRecords; ++i) {
+    LedgerSoftwareProductFields fields;
+    fields.bundlePath = "/Applications/Bulk" + std::to_string(i) + ".app";
+    fields.bundleIdentifier = "com.example.bulk" + std::to_string(i);
+    fields.bundleVersion = "1.0";
+    fields.itemIdentifier = static_cast<std::uint64_t>(900000 + i);
+    fields.installed = true;
+    many.push_back(std::move(fields));
+  }
+  writeBytes(storePath(), archivedStore(many));
+  // Detail logging would describe every record; the barrier is the subject.
+  TillLogManager::sharedManager().setLevel(1);
+
+  {
+    SoftwareMap map(options(storePath(), false));
+    LedgerSoftwareProductRef last = map.productForBundleIdentifier("com.example.bulk4999");
+    ASSERT_NE(last, nullptr);
+    EXPECT_EQ(last->bundlePath(), "/Applications/Bulk4999.app");
+  }
+  {
+    SoftwareMap map(options(storePath(), false));
+    LedgerSoftwareProductRef byItem = map.productForItemIdentifier(900000 + 2500);
+    ASSERT_NE(byItem, nullptr);
+    EXPECT_EQ(byItem->bundleIdentifier(), "com.example.bulk2500");
+  }
+  {
+    SoftwareMap map(options(storePath(), false));
+    EXPECT_EQ(map.allProducts().size(), static_cast<std::size_t>(kRecords));
+  }
+}
+
+}  // namespace
+}  // namespace larder::testing

@@ -1,0 +1,172 @@
+// larderctl: the command-line client of larderd.
+#include <signal.h>
+
+#include <sdbus-c++/Error.h>
+#include <CLI/CLI.hpp>
+#include <cstdio>
+#include <iostream>
+
+#include "AssetService/DBusValueCodec.h"
+#include "AssetService/RequestTable.h"
+#include "AssetService/ServiceClient.h"
+#include "tools/larderctl/JsonConversion.h"
+#include "tools/larderctl/ProductPrinter.h"
+
+namespace {
+
+using namespace larder;
+
+constexpr const char* kObserverPath = "/com/orvane/larderctl/SoftwareMapObserver";
+
+struct GlobalOptions {
+  bool json = false;
+  bool daemon = false;
+  std::int64_t clientType = 0;
+  double timeoutSeconds = 25;
+};
+
+ServiceClient connect(const GlobalOptions& options) {
+  ServiceClient client(options.daemon ? "com.orvane.larderd.daemon" : "com.orvane.larderd",
+                       static_cast<std::uint64_t>(options.timeoutSeconds * 1e6));
+  client.presentStoreClient(options.clientType);
+  return client;
+}
+
+// Arguments of `call`, read by the request's signature: scalars as
+// written, containers as JSON.
+PlistArray parseArguments(const RequestDescriptor& request, const std::vector<std::string>& words) {
+  std::vector<std::string> types = DBusValueCodec::splitSignature(request.inSignature);
+  if (types.size() != words.size()) {
+    throw CLI::ValidationError(std::string(request.member) + " takes " +
+                               std::to_string(types.size()) + " argument(s) of signature " +
+                               std::string(request.inSignature));
+  }
+  PlistArray arguments;
+  for (std::size_t i = 0; i < types.size(); ++i) {
+    const std::string& type = types[i];
+    const std::string& word = words[i];
+    if (type == "s" || type == "o") {
+      arguments.emplace_back(word);
+    } else if (type == "b") {
+      arguments.emplace_back(word == "true" || word == "1" || word == "yes");
+    } else if (type == "x") {
+      arguments.emplace_back(static_cast<std::int64_t>(std::stoll(word)));
+    } else if (type == "t") {
+      arguments.emplace_back(static_cast<std::uint64_t>(std::stoull(word)));
+    } else if (type == "d") {
+      arguments.emplace_back(std::stod(word));
+    } else {
+      arguments.push_back(JsonConversion::fromJson(nlohmann::json::parse(word)));
+    }
+  }
+  return arguments;
+}
+
+int runProducts(const GlobalOptions& options) {
+  ServiceClient client = connect(options);
+  PlistArray reply = client.call("AllProducts", {});
+  ProductPrinter(options.json).printProducts(reply.at(0));
+  return 0;
+}
+
+int runProduct(const GlobalOptions& options, const std::string& bundleIdentifier,
+               std::uint64_t itemIdentifier) {
+  ServiceClient client = connect(options);
+  PlistArray reply = bundleIdentifier.empty()
+                         ? client.call("ProductForItemIdentifier", {itemIdentifier})
+                         : client.call("ProductForBundleIdentifier", {bundleIdentifier});
+  const PlistDictionary* product = reply.at(0).dictionary();
+  if (!product || product->empty()) {
+    if (options.json)
+      std::cout << "null" << std::endl;
+    else
+      std::cerr << "larderctl: no such product" << std::endl;
+    return 1;
+  }
+  ProductPrinter(options.json).printProduct(reply.at(0));
+  return 0;
+}
+
+int runWatch(const GlobalOptions& options) {
+  sigset_t signals;
+  sigemptyset(&signals);
+  sigaddset(&signals, SIGINT);
+  sigaddset(&signals, SIGTERM);
+  pthread_sigmask(SIG_BLOCK, &signals, nullptr);
+
+  ServiceClient client = connect(options);
+  ProductPrinter printer(options.json);
+  client.exportSoftwareMapObserver(kObserverPath,
+                                   [&printer](const PlistValue& product, std::int64_t state) {
+                                     printer.printChange(product, state);
+                                   });
+  std::string token =
+      *client.call("AddSoftwareMapObserver", {std::string(kObserverPath)}).at(0).string();
+  if (!options.json)
+    std::cerr << "larderctl: watching the software map (token " << token << ")" << std::endl;
+  int received = 0;
+  sigwait(&signals, &received);
+  client.call("RemoveSoftwareMapObserver", {token});
+  return 0;
+}
+
+int runCall(const GlobalOptions& options, const std::string& member,
+            const std::vector<std::string>& words) {
+  const RequestDescriptor* request = RequestTable::find(member);
+  if (!request) {
+    std::cerr << "larderctl: no request named " << member << std::endl;
+    return 2;
+  }
+  ServiceClient client = connect(options);
+  PlistArray reply = client.call(member, parseArguments(*request, words));
+  ProductPrinter(options.json).printReply(*request, reply);
+  return 0;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  CLI::App app{"larderctl: talk to the larder store service"};
+  app.require_subcommand(1);
+  app.fallthrough();
+  GlobalOptions options;
+  app.add_flag("--json", options.json, "print JSON instead of tables");
+  app.add_flag("--daemon", options.daemon, "talk to com.orvane.larderd.daemon");
+  app.add_option("--client-type", options.clientType, "store client type to present (0-4)");
+  app.add_option("--timeout", options.timeoutSeconds, "seconds to wait for a reply");
+
+  auto* products = app.add_subcommand("products", "list the installed store software");
+  auto* product = app.add_subcommand("product", "show one product");
+  std::string bundleIdentifier;
+  std::uint64_t itemIdentifier = 0;
+  auto* byBundle = product->add_option("--bundle-id", bundleIdentifier, "bundle identifier");
+  auto* byItem = product->add_option("--item-id", itemIdentifier, "store item identifier");
+  byBundle->excludes(byItem);
+  product->callback([&] {
+    if (bundleIdentifier.empty() && byItem->count() == 0) {
+      throw CLI::ValidationError("give --bundle-id or --item-id");
+    }
+  });
+  auto* watch = app.add_subcommand("watch", "print software map changes until interrupted");
+  auto* call = app.add_subcommand("call", "call any request: call METHOD ARGS...");
+  std::string member;
+  std::vector<std::string> words;
+  call->add_option("method", member, "D-Bus method name, e.g. ProductForBundleIdentifier")
+      ->required();
+  call->add_option("arguments", words, "arguments; containers as JSON");
+
+  CLI11_PARSE(app, argc, argv);
+  try {
+    if (products->parsed()) return runProducts(options);
+    if (product->parsed()) return runProduct(options, bundleIdentifier, itemIdentifier);
+    if (watch->parsed()) return runWatch(options);
+    if (call->parsed()) return runCall(options, member, words);
+  } catch (const sdbus::Error& error) {
+    std::cerr << "larderctl: " << error.getName() << ": " << error.getMessage() << std::endl;
+    return 1;
+  } catch (const std::exception& error) {
+    std::cerr << "larderctl: " << error.what() << std::endl;
+    return 1;
+  }
+  return 0;
+}
