@@ -9,12 +9,13 @@ build=${2:-build-fuzz}
 cmake -S . -B "$build" -G Ninja -DCMAKE_CXX_COMPILER=clang++ -DCMAKE_BUILD_TYPE=RelWithDebInfo \
   -DLARDER_FUZZ=ON -DLARDER_SANITIZE=address -DLARDER_TESTS=OFF -DLARDER_BENCH=OFF
 cmake --build "$build" -j"$(nproc)"
-for target in "$build"/fuzz_*; do
+for target in "$build"/fuzz/fuzz_*; do
   [ -x "$target" ] || continue
   name=$(basename "$target")
-  corpus="fuzz/corpus/${name#fuzz_}"
-  corpus="${corpus#fuzz/corpus/platform_}"
-  corpus="fuzz/corpus/$(basename "$corpus")"
+  # fuzz_platform_plist reads fuzz/corpus/plist, fuzz_dmap_decode fuzz/corpus/dmap.
+  subject="${name#fuzz_}"
+  subject="${subject#platform_}"
+  corpus="fuzz/corpus/${subject%%_*}"
   work=$(mktemp -d)
   seeds=()
   [ -d "$corpus" ] && seeds=("$corpus")
