@@ -93,7 +93,8 @@ class XmlNestingScanner {
           case Tag::Close:
             if (depth > 0) --depth;
             break;
-          case Tag::Other: break;
+          case Tag::Other:
+            break;
         }
       }
     }
@@ -187,7 +188,9 @@ class LibplistTreeReader {
         out = PlistValue(value != 0);
         return true;
       }
-      case PLIST_UINT: out = integerValue(node); return true;
+      case PLIST_UINT:
+        out = integerValue(node);
+        return true;
       case PLIST_REAL: {
         double value = 0;
         plist_get_real_val(node, &value);
@@ -195,18 +198,27 @@ class LibplistTreeReader {
         return true;
       }
       case PLIST_STRING:
-      case PLIST_KEY: out = PlistValue(stringValue(node)); return true;
-      case PLIST_DATA: out = dataValue(node); return true;
-      case PLIST_DATE: out = dateValue(node); return true;
+      case PLIST_KEY:
+        out = PlistValue(stringValue(node));
+        return true;
+      case PLIST_DATA:
+        out = dataValue(node);
+        return true;
+      case PLIST_DATE:
+        out = dateValue(node);
+        return true;
       case PLIST_UID: {
         std::uint64_t value = 0;
         plist_get_uid_val(node, &value);
         out = PlistValue(PlistUid{value});
         return true;
       }
-      case PLIST_ARRAY: return enterContainer(depth) && convertArray(node, depth, out);
-      case PLIST_DICT: return enterContainer(depth) && convertDictionary(node, depth, out);
-      default: return fail("unsupported node type");
+      case PLIST_ARRAY:
+        return enterContainer(depth) && convertArray(node, depth, out);
+      case PLIST_DICT:
+        return enterContainer(depth) && convertDictionary(node, depth, out);
+      default:
+        return fail("unsupported node type");
     }
   }
 
@@ -318,23 +330,32 @@ class LibplistTreeWriter {
  public:
   static PlistNode build(const PlistValue& value) {
     switch (value.type()) {
-      case PlistValue::Type::Null: return PlistNode(plist_new_dict());
-      case PlistValue::Type::Boolean: return PlistNode(plist_new_bool(value.boolValue() ? 1 : 0));
+      case PlistValue::Type::Null:
+        return PlistNode(plist_new_dict());
+      case PlistValue::Type::Boolean:
+        return PlistNode(plist_new_bool(value.boolValue() ? 1 : 0));
       // libplist prints 64-bit integers signed, which is what the bit
       // pattern of an int64 needs.
-      case PlistValue::Type::Integer: return PlistNode(plist_new_uint(value.uint64Value()));
-      case PlistValue::Type::UnsignedInteger: return unsignedNode(value.uint64Value());
-      case PlistValue::Type::Real: return PlistNode(plist_new_real(value.doubleValue()));
+      case PlistValue::Type::Integer:
+        return PlistNode(plist_new_uint(value.uint64Value()));
+      case PlistValue::Type::UnsignedInteger:
+        return unsignedNode(value.uint64Value());
+      case PlistValue::Type::Real:
+        return PlistNode(plist_new_real(value.doubleValue()));
       case PlistValue::Type::String:
         return PlistNode(plist_new_string(toWellFormedUtf8(*value.string()).c_str()));
       case PlistValue::Type::Data: {
         const PlistData& bytes = *value.data();
         return PlistNode(plist_new_data(reinterpret_cast<const char*>(bytes.data()), bytes.size()));
       }
-      case PlistValue::Type::Date: return dateNode(value.date()->secondsSince1970);
-      case PlistValue::Type::Uid: return PlistNode(plist_new_uid(value.uid()->value));
-      case PlistValue::Type::Array: return arrayNode(*value.array());
-      case PlistValue::Type::Dictionary: return dictionaryNode(*value.dictionary());
+      case PlistValue::Type::Date:
+        return dateNode(value.date()->secondsSince1970);
+      case PlistValue::Type::Uid:
+        return PlistNode(plist_new_uid(value.uid()->value));
+      case PlistValue::Type::Array:
+        return arrayNode(*value.array());
+      case PlistValue::Type::Dictionary:
+        return dictionaryNode(*value.dictionary());
     }
     return PlistNode(plist_new_dict());
   }

@@ -97,8 +97,9 @@ std::string SoftwareMap::persistedStoreURL() const {
 void SoftwareMap::asyncInitializeAndLoadPersistedStore() {
   // The observer dictionary exists from construction, so an observer added
   // while the load waits in the queue is kept and hears the discovery.
+  std::optional<PlistValue> decoded;
   try {
-    loadPersistedStore();
+    decoded = loadPersistedStore();
   } catch (const std::exception& exception) {
     TILL_LOG(1, "%@: Exception loading persisted SoftwareMap - %@", kSpeaker, exception.what());
   }
@@ -111,38 +112,40 @@ void SoftwareMap::asyncInitializeAndLoadPersistedStore() {
                  "%@: After loading persisted store, SoftwareMap has %ld items",
                  {kSpeaker, LogArgument::number(count)}});
   if (!appsByPath_) appsByPath_.emplace();
-  returnFreedMemoryToSystem();
+  // Readers wait for this barrier; freeing the decoded archive and handing
+  // the memory back can happen after they have their answers.
+  dispatchQueue_->async([decoded = std::move(decoded)]() mutable {
+    decoded.reset();
+    returnFreedMemoryToSystem();
+  });
 }
 
-void SoftwareMap::loadPersistedStore() {
+std::optional<PlistValue> SoftwareMap::loadPersistedStore() {
   std::optional<PlistData> data = FileIO::read(persistedStoreURL());
   if (!data || data->empty()) {
     TILL_LOG(2, "%@: Persisted SoftwareMap not found", kSpeaker);
-  } else {
-    static const std::set<std::string, std::less<>> kAllowedClasses{
-        std::string(KeyedArchive::kDictionaryClass), std::string(KeyedArchive::kStringClass),
-        std::string(LedgerSoftwareProduct::kClassName)};
-    std::string error;
-    std::optional<PlistValue> root = KeyedArchive::unarchivedRoot(*data, kAllowedClasses, &error);
-    const PlistDictionary* byPath = root ? root->dictionary() : nullptr;
-    const PlistDictionary* records = byPath && byPath->contains(kAppsByPathKey)
-                                         ? (*byPath->find(kAppsByPathKey)).second.dictionary()
-                                         : nullptr;
-    if (records) {
-      StringMap<LedgerSoftwareProductRef> loaded;
-      loaded.reserve(records->size());
-      for (const auto& [path, encoded] : *records) {
-        LedgerSoftwareProductRef product = LedgerSoftwareProduct::initWithCoder(encoded);
-        // The key is the record's path by invariant; a record that breaks
-        // it is not ours to trust.
-        if (product && product->bundlePath() == path) loaded.emplace(path, std::move(product));
-      }
-      appsByPath_ = std::move(loaded);
-      rebuildSecondaryMaps();
-    } else {
-      TILL_LOG(1, "%@: Persisted SoftwareMap did not contain appsByPath dictionary.", kSpeaker);
-    }
+    return std::nullopt;
   }
+  static const std::set<std::string, std::less<>> kAllowedClasses{
+      std::string(KeyedArchive::kDictionaryClass), std::string(KeyedArchive::kStringClass),
+      std::string(LedgerSoftwareProduct::kClassName)};
+  std::optional<PlistValue> root = KeyedArchive::unarchivedRoot(*data, kAllowedClasses);
+  const PlistValue* records = root ? &(*root)[kAppsByPathKey] : nullptr;
+  if (!records || !records->isDictionary()) {
+    TILL_LOG(1, "%@: Persisted SoftwareMap did not contain appsByPath dictionary.", kSpeaker);
+    return root;
+  }
+  StringMap<LedgerSoftwareProductRef> loaded;
+  loaded.reserve(records->dictionary()->size());
+  for (const auto& [path, encoded] : *records->dictionary()) {
+    LedgerSoftwareProductRef product = LedgerSoftwareProduct::initWithCoder(encoded);
+    // The key is the record's path by invariant; a record that breaks it is
+    // not ours to trust.
+    if (product && product->bundlePath() == path) loaded.emplace(path, std::move(product));
+  }
+  appsByPath_ = std::move(loaded);
+  rebuildSecondaryMaps();
+  return root;
 }
 
 void SoftwareMap::logAppsByPath(MapLogLine line) const {
@@ -188,17 +191,22 @@ void SoftwareMap::rebuildSecondaryMaps() {
   appsByBundleID_.clear();
   appsByItemID_.clear();
   if (!appsByPath_) return;
+  appsByBundleID_.reserve(appsByPath_->size());
+  appsByItemID_.reserve(appsByPath_->size());
   for (const auto& [path, product] : *appsByPath_) {
-    LedgerSoftwareProductFields fields = product->snapshot();
-    if (fields.bundleIdentifier) {
-      appsByBundleID_[*fields.bundleIdentifier].push_back(product);
-    } else {
+    bool hasBundleIdentifier = false;
+    bool hasItemIdentifier = false;
+    product->read([&](const LedgerSoftwareProductFields& fields) {
+      hasBundleIdentifier = fields.bundleIdentifier.has_value();
+      hasItemIdentifier = fields.itemIdentifier.has_value();
+      if (hasBundleIdentifier) appsByBundleID_[*fields.bundleIdentifier].push_back(product);
+      if (hasItemIdentifier) appsByItemID_[*fields.itemIdentifier].push_back(product);
+    });
+    if (!hasBundleIdentifier) {
       TILL_LOG(3, "%@: App does not have bundleIdentifier, ignoring in secondary map: %@", kSpeaker,
                product);
     }
-    if (fields.itemIdentifier) {
-      appsByItemID_[*fields.itemIdentifier].push_back(product);
-    } else {
+    if (!hasItemIdentifier) {
       TILL_LOG(3, "%@: App does not have itemIdentifier, ignoring in secondary map: %@", kSpeaker,
                product);
     }

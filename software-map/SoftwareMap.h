@@ -95,7 +95,8 @@ class SoftwareMap {
 
   // Load and store.
   void asyncInitializeAndLoadPersistedStore();
-  void loadPersistedStore();
+  // Loads the records; returns the decoded archive for the caller to free.
+  std::optional<PlistValue> loadPersistedStore();
   void writePersistedStoreToDisk();
   [[nodiscard]] std::string persistedStoreURL() const;
   // Logs a line about the primary map: with at most five records the line

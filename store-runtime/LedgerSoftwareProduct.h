@@ -53,6 +53,12 @@ class LedgerSoftwareProduct {
   explicit LedgerSoftwareProduct(LedgerSoftwareProductFields fields) : fields_(std::move(fields)) {}
 
   [[nodiscard]] LedgerSoftwareProductFields snapshot() const;
+  // Reads under the record's lock without copying every field.
+  template <typename Reader>
+  auto read(Reader&& reader) const {
+    std::lock_guard lock(mutex_);
+    return reader(static_cast<const LedgerSoftwareProductFields&>(fields_));
+  }
   void update(const std::function<void(LedgerSoftwareProductFields&)>& change);
 
   [[nodiscard]] std::string bundlePath() const;
