@@ -114,8 +114,11 @@ void SoftwareMap::asyncInitializeAndLoadPersistedStore() {
   if (!appsByPath_) appsByPath_.emplace();
   // Readers wait for this barrier; freeing the decoded archive and handing
   // the memory back can happen after they have their answers.
-  dispatchQueue_->async([decoded = std::move(decoded)]() mutable {
-    decoded.reset();
+  // Held by a shared pointer: the task may be copied on its way to a worker,
+  // and the tree must be gone before the memory is handed back.
+  auto archive = std::make_shared<std::optional<PlistValue>>(std::move(decoded));
+  dispatchQueue_->async([archive] {
+    archive->reset();
     returnFreedMemoryToSystem();
   });
 }
