@@ -130,7 +130,7 @@ void ServiceListener::dispatch(const RequestDescriptor& request, sdbus::MethodCa
   auto pending = std::make_shared<sdbus::MethodCall>(std::move(call));
   ReplyHandler reply;
   if (!pending->doesntExpectReply()) {
-    reply = [pending, signature = request.outSignature](PlistArray outArguments) {
+    reply = [pending, signature = request.outSignature](const PlistArray& outArguments) {
       sdbus::MethodReply message = pending->createReply();
       DBusValueCodec::writeAll(message, signature, outArguments);
       message.send();

@@ -160,7 +160,7 @@ void SoftwareMap::logAppsByPath(MapLogLine line) const {
       described.emplace(path, product->toDictionary());
   }
   if (described.size() <= kMostRecordsInLogLine) {
-    line.smallArguments.push_back(describePlistValue(described));
+    line.smallArguments.emplace_back(describePlistValue(described));
     log.logWithDescribedArguments(line.level, line.function, __FILE__, __LINE__, line.smallFormat,
                                   line.smallArguments);
     return;
@@ -196,7 +196,8 @@ void SoftwareMap::rebuildSecondaryMaps() {
   if (!appsByPath_) return;
   appsByBundleID_.reserve(appsByPath_->size());
   appsByItemID_.reserve(appsByPath_->size());
-  for (const auto& [path, product] : *appsByPath_) {
+  for (const auto& entry : *appsByPath_) {
+    const LedgerSoftwareProductRef& product = entry.second;
     bool hasBundleIdentifier = false;
     bool hasItemIdentifier = false;
     product->read([&](const LedgerSoftwareProductFields& fields) {

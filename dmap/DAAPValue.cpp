@@ -1,0 +1,205 @@
+#include "dmap/DAAPValue.h"
+
+#include <cmath>
+#include <ctime>
+#include <limits>
+#include <sstream>
+
+#include "dmap/DAAPItem.h"
+#include "store-runtime/TillLogManager.h"
+
+namespace larder {
+
+namespace {
+
+void describeInto(std::ostringstream& out, const DAAPValue& value, int indent);
+
+void describeArrayInto(std::ostringstream& out, const DAAPArray& array, int indent) {
+  const std::string pad(static_cast<std::size_t>(indent + 4), ' ');
+  out << "(\n";
+  for (std::size_t index = 0; index < array.size(); ++index) {
+    out << pad;
+    describeInto(out, array[index], indent + 4);
+    out << (index + 1 < array.size() ? ",\n" : "\n");
+  }
+  out << std::string(static_cast<std::size_t>(indent), ' ') << ")";
+}
+
+void describeDictionaryInto(std::ostringstream& out, const DAAPDictionary& dictionary, int indent) {
+  const std::string pad(static_cast<std::size_t>(indent + 4), ' ');
+  out << "{\n";
+  for (const auto& [key, element] : dictionary) {
+    out << pad << key.view() << " = ";
+    describeInto(out, element, indent + 4);
+    out << ";\n";
+  }
+  out << std::string(static_cast<std::size_t>(indent), ' ') << "}";
+}
+
+// Dates read as a person reads them, "2020-09-13 12:26:40 +0000".
+void describeDateInto(std::ostringstream& out, const PlistDate& date) {
+  const double seconds = date.secondsSince1970;
+  constexpr double kYear10000 = 253402300800.0;
+  if (!(seconds > -kYear10000 && seconds < kYear10000)) {
+    out << "date(" << seconds << ")";
+    return;
+  }
+  const auto whole = static_cast<std::time_t>(std::floor(seconds));
+  std::tm parts{};
+  gmtime_r(&whole, &parts);
+  char text[64];
+  std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S +0000", &parts);
+  out << text;
+}
+
+void describeInto(std::ostringstream& out, const DAAPValue& value, int indent) {
+  if (const PlistDate* date = value.date()) return describeDateInto(out, *date);
+  if (const DAAPArray* array = value.array()) return describeArrayInto(out, *array, indent);
+  if (const DAAPDictionary* dictionary = value.dictionary()) {
+    return describeDictionaryInto(out, *dictionary, indent);
+  }
+  if (DAAPItemRef item = value.item()) {
+    out << item->description();
+    return;
+  }
+  out << describePlistValue(value.toPlist());
+}
+
+}  // namespace
+
+DAAPValue::DAAPValue(std::uint64_t value) {
+  if (value <= static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max())) {
+    storage_ = static_cast<std::int64_t>(value);
+  } else {
+    storage_ = value;
+  }
+}
+
+DAAPValue::DAAPValue(DAAPItemRef value) {
+  if (value) storage_ = std::move(value);
+}
+
+DAAPItemRef DAAPValue::item() const {
+  const DAAPItemRef* item = std::get_if<DAAPItemRef>(&storage_);
+  return item ? *item : nullptr;
+}
+
+PlistValue DAAPValue::scalarAsPlist() const {
+  switch (type()) {
+    case Type::Boolean:
+      return std::get<bool>(storage_);
+    case Type::Integer:
+      return std::get<std::int64_t>(storage_);
+    case Type::UnsignedInteger:
+      return std::get<std::uint64_t>(storage_);
+    case Type::Real:
+      return std::get<double>(storage_);
+    case Type::String:
+      return std::get<std::string>(storage_);
+    case Type::Data:
+      return std::get<PlistData>(storage_);
+    case Type::Date:
+      return std::get<PlistDate>(storage_);
+    default:
+      return {};
+  }
+}
+
+std::int64_t DAAPValue::int64Value() const {
+  return scalarAsPlist().int64Value();
+}
+std::uint64_t DAAPValue::uint64Value() const {
+  return scalarAsPlist().uint64Value();
+}
+double DAAPValue::doubleValue() const {
+  return scalarAsPlist().doubleValue();
+}
+bool DAAPValue::boolValue() const {
+  return scalarAsPlist().boolValue();
+}
+
+const DAAPValue& DAAPValue::null() {
+  static const DAAPValue kNull;
+  return kNull;
+}
+
+const DAAPValue& DAAPValue::operator[](std::string_view key) const {
+  const DAAPDictionary* entries = dictionary();
+  return entries ? lookup(*entries, key) : null();
+}
+
+const DAAPValue& lookup(const DAAPDictionary& dictionary, std::string_view key) {
+  const auto found = dictionary.find(key);
+  return found == dictionary.end() ? DAAPValue::null() : found->second;
+}
+
+DAAPValue DAAPValue::fromPlist(const PlistValue& value) {
+  switch (value.type()) {
+    case PlistValue::Type::Null:
+    case PlistValue::Type::Uid:
+      return {};
+    case PlistValue::Type::Boolean:
+      return value.boolValue();
+    case PlistValue::Type::Integer:
+      return value.int64Value();
+    case PlistValue::Type::UnsignedInteger:
+      return value.uint64Value();
+    case PlistValue::Type::Real:
+      return value.doubleValue();
+    case PlistValue::Type::String:
+      return *value.string();
+    case PlistValue::Type::Data:
+      return *value.data();
+    case PlistValue::Type::Date:
+      return *value.date();
+    case PlistValue::Type::Dictionary:
+      return fromPlistDictionary(*value.dictionary());
+    case PlistValue::Type::Array: {
+      DAAPArray array;
+      array.reserve(value.array()->size());
+      for (const PlistValue& element : *value.array()) array.push_back(fromPlist(element));
+      return array;
+    }
+  }
+  return {};
+}
+
+PlistValue DAAPValue::toPlist() const {
+  if (const DAAPArray* elements = array()) {
+    PlistArray converted;
+    converted.reserve(elements->size());
+    for (const DAAPValue& element : *elements) converted.push_back(element.toPlist());
+    return converted;
+  }
+  if (const DAAPDictionary* entries = dictionary()) return toPlistDictionary(*entries);
+  if (DAAPItemRef record = item()) return toPlistDictionary(record->dictionaryRepresentation());
+  return scalarAsPlist();
+}
+
+PlistDictionary toPlistDictionary(const DAAPDictionary& dictionary) {
+  PlistDictionary converted;
+  for (const auto& [key, value] : dictionary) {
+    converted.emplace_hint(converted.end(), key.str(), value.toPlist());
+  }
+  return converted;
+}
+
+DAAPDictionary fromPlistDictionary(const PlistDictionary& dictionary) {
+  DAAPDictionary converted;
+  for (const auto& [key, value] : dictionary) {
+    converted.emplace_hint(converted.end(), DAAPKey(key), DAAPValue::fromPlist(value));
+  }
+  return converted;
+}
+
+std::string DAAPValue::description() const {
+  std::ostringstream out;
+  describeInto(out, *this, 0);
+  return out.str();
+}
+
+bool operator==(const DAAPValue& a, const DAAPValue& b) {
+  return a.storage_ == b.storage_;
+}
+
+}  // namespace larder

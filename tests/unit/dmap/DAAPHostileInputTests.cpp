@@ -1,0 +1,271 @@
+// Documents written to hurt: lengths that point outside their container or
+// the document, empty and enormous values, deep nesting, truncation at every
+// byte. None may crash, read outside the input (the sanitizer builds check
+// that), allocate without bound, or give anything but the documented result.
+
+#include <gtest/gtest.h>
+
+#include <random>
+
+#include "DAAPTestSupport.h"
+#include "dmap/DAAPItem.h"
+
+namespace larder {
+namespace {
+
+using namespace dmaptest;  // NOLINT(google-build-using-namespace)
+
+const std::vector<std::string> kTopLevelCodes{
+    "abro", "adbs", "aeBR", "agal", "agar", "aply", "apso", "avdb", "caci",
+    "cmbu", "cprp", "mctl", "mscr", "mupd", "cacr", "medc", "casp", "ceGI",
+    "cmcp", "cmgt", "cmst", "mccr", "merr", "mlog", "msrv", "arsv"};
+
+// A document with a bit of everything, for truncation and corruption.
+Tag richListing() {
+  return container(
+      "mupd",
+      {u32("mstt", 200), u32("mrco", 2), u32("musr", 9),
+       container("mlcl",
+                 {container("mlit", {u32("miid", 1), text("minm", "First"), u64("asai", 5),
+                                     container("aefl", {container("aeif", {u32("aefd", 1)})}),
+                                     container("mdcl", {text("mdky", "k"), text("mdvl", "v")}),
+                                     u16("cmvt", 3), u32("cval", 4),
+                                     container("cmvl", {container("mlit", {u32("miid", 3)})})}),
+                  container("mlit", {u32("miid", 2), text("asgn", "Drama")})}),
+       container("mudl", {u64("mild", 7)})});
+}
+
+TEST(DAAPHostileTest, ChildClaimingMoreThanItsContainerEndsThatWalkOnly) {
+  LogCapture log;
+  // The item claims 1000 bytes for its album while its container holds 12;
+  // the listing goes on with the next item.
+  Tag broken = container("mlit", {u32("miid", 1), text("asal", "abcd")});
+  const Tag good = container("mlit", {u32("miid", 2)});
+  PlistData data = document(container("mupd", {container("mlcl", {broken, good})}));
+  // mupd(8) mlcl(8) mlit(8) miid(12) asal header: its length field sits 4 bytes in.
+  const std::size_t albumLength = 8 + 8 + 8 + 12 + 4;
+  ASSERT_EQ(data[albumLength - 4], 'a');
+  data[albumLength + 2] = 0x03;
+  data[albumLength + 3] = 0xe8;
+  const DAAPValue header = DAAPParser::decodeData(data);
+  const DAAPArray& listing = *header["dmap.listing"].array();
+  ASSERT_EQ(listing.size(), 2u);
+  EXPECT_EQ(listing[0].item()->itemID(), 1u);
+  EXPECT_FALSE(listing[0].item()->songalbum().has_value());
+  EXPECT_TRUE(listing[0].item()->isFrozen());
+  EXPECT_EQ(listing[1].item()->itemID(), 2u);
+  EXPECT_EQ(log.countExactly("DAAPParser: tag 'asal' claims 1000 bytes, but its container has 4 "
+                             "left; rest skipped"),
+            1u);
+}
+
+TEST(DAAPHostileTest, StrayBytesTooFewForAHeaderAreSkipped) {
+  LogCapture log;
+  Tag item = container("medc", {u32("miid", 1)});
+  item.children.push_back(raw("zzzz", {}));
+  PlistData data = document(item);
+  data.resize(data.size() - 3);  // 5 bytes of a header left
+  data[7] = static_cast<std::uint8_t>(data.size() - 8);
+  const DAAPValue value = DAAPParser::decodeData(data);
+  EXPECT_EQ(value.item()->itemID(), 1u);
+  EXPECT_EQ(log.countExactly("DAAPParser: 5 stray bytes at the end of a container skipped"), 1u);
+}
+
+TEST(DAAPHostileTest, TopLevelLengthBeyondTheDocumentGivesNothing) {
+  for (const std::uint32_t declared : {13u, 0x7fffffffu, 0x80000000u, 0xffffffffu}) {
+    PlistData data = document(container("mlog", {u32("mlid", 5)}));
+    for (int index = 0; index < 4; ++index) {
+      data[4 + static_cast<std::size_t>(index)] =
+          static_cast<std::uint8_t>(declared >> (24 - 8 * index));
+    }
+    EXPECT_TRUE(DAAPParser::decodeData(data).isNull()) << declared;
+  }
+}
+
+TEST(DAAPHostileTest, EmptyDocumentsGiveTheirDocumentedResult) {
+  LogCapture log;
+  for (const std::string& code : kTopLevelCodes) {
+    const DAAPValue value = decode(container(code, {}));
+    if (code == "arsv" || code == "merr" || code == "mlog") {
+      EXPECT_TRUE(value.isNull()) << code;
+    } else if (code == "cacr" || code == "medc") {
+      ASSERT_TRUE(value.isItem()) << code;
+      EXPECT_TRUE(value.item()->isFrozen());
+      EXPECT_TRUE(value.item()->additionalInfo()->empty());
+    } else if (code == "casp" || code == "ceGI" || code == "mccr") {
+      ASSERT_TRUE(value.isArray()) << code;
+      EXPECT_TRUE(value.array()->empty()) << code;
+    } else {
+      ASSERT_TRUE(value.isDictionary()) << code;
+      EXPECT_TRUE(value.dictionary()->empty()) << code;
+    }
+  }
+  EXPECT_EQ(log.size(), 0u);
+}
+
+TEST(DAAPHostileTest, ZeroLengthValuesOfEveryKnownTagAreHarmless) {
+  // Every code any parser knows, each with an empty value, in every kind of
+  // container: nothing may be read from an empty value.
+  std::vector<Tag> empties;
+  for (const char* code :
+       {"miid", "minm", "asal", "asar", "asaa", "asai", "mcti", "mdst", "mdcl", "mpco",
+        "aeMk", "aeSI", "aeHC", "aeHV", "aeCS", "aefl", "aeMX", "pfdt", "mshc", "cmvl",
+        "cmvo", "cmvt", "cval", "ceQW", "canp", "capl", "ceQu", "ceMQ", "ceNQ", "ceQF",
+        "ceSD", "mlid", "mstt", "mcty", "msml", "msma", "mild", "mlcl", "mshl", "mudl",
+        "abal", "mrco", "mlit", "asgn", "asdp", "mper", "caia", "asyr", "aeif"}) {
+    empties.push_back(raw(code, {}));
+  }
+  for (const std::string& code : kTopLevelCodes) {
+    const DAAPValue value = decode(container(code, empties));
+    if (code == "mlog" || code == "arsv") EXPECT_TRUE(value.isNull()) << code;
+  }
+  const DAAPValue item = decode(container("medc", empties));
+  ASSERT_TRUE(item.isItem());
+  EXPECT_EQ(item.item()->itemID(), 0u);
+  EXPECT_EQ(item.item()->objectForKey("fileData"), DAAPValue(PlistData{}));
+  EXPECT_TRUE(item.item()->objectForKey("context").array()->empty());
+}
+
+TEST(DAAPHostileTest, HugeCapacityHintReservesNoMoreThanTheBytesCanHold) {
+  const DAAPValue header = decode(container(
+      "adbs", {u32("mrco", 0xffffffff), container("mlcl", {container("mlit", {u32("miid", 1)})})}));
+  EXPECT_EQ(header["dmap.returnedcount"].int64Value(), 0xffffffff);
+  const DAAPArray& listing = *header["dmap.listing"].array();
+  EXPECT_EQ(listing.size(), 1u);
+  EXPECT_LE(listing.capacity(), 20u / 8u);
+}
+
+TEST(DAAPHostileTest, DeeplyNestedListingsStopAtTheBound) {
+  LogCapture log;
+  Tag nested = container("mlit", {u32("miid", 1000)});
+  for (int level = 0; level < 200; ++level) {
+    nested = container(
+        "mlit", {u32("miid", static_cast<std::uint32_t>(level)), container("cmvl", {nested})});
+  }
+  const DAAPValue value = decode(container("ceGI", {nested}));
+  ASSERT_TRUE(value.isArray());
+  int depth = 0;
+  DAAPItemRef item = value.array()->at(0).item();
+  while (item) {
+    const DAAPValue context = item->objectForKey("context");
+    if (!context.isArray() || context.array()->empty()) break;
+    item = context.array()->at(0).item();
+    ++depth;
+  }
+  EXPECT_EQ(depth, DAAPParser::kMaxListingDepth);
+  EXPECT_EQ(log.countExactly("DAAPParser: listing nested deeper than 16 levels; 'cmvl' skipped"),
+            1u);
+}
+
+TEST(DAAPHostileTest, DeeplyNestedEmbeddedPropertyListIsRefused) {
+  LogCapture log;
+  std::string plist = "<plist version=\"1.0\">";
+  for (int level = 0; level < 5000; ++level) plist += "<array>";
+  for (int level = 0; level < 5000; ++level) plist += "</array>";
+  plist += "</plist>";
+  const DAAPValue item = decode(container("medc", {text("aeMX", plist), u32("miid", 4)}));
+  EXPECT_EQ(item.item()->itemID(), 4u);
+  EXPECT_TRUE(item.item()->objectForKey("com.orvane.sonorel.movie-info-xml").isNull());
+  EXPECT_EQ(log.countContaining("Attempting to process XML response"), 1u);
+}
+
+TEST(DAAPHostileTest, ManyNestedContainersOfEveryOtherKindDoNotRecurse) {
+  // Containers that the parsers treat as values, nested 10000 deep: the
+  // document is walked once, not descended into.
+  constexpr std::uint32_t kLevels = 10000;
+  DAAPBuffer nested;
+  for (std::uint32_t level = 0; level < kLevels; ++level) {
+    nested.appendHeader("mdcl"_dmap, 8 * (kLevels - 1 - level) + 12);
+  }
+  nested.appendUInt32(1, "mstt"_dmap);
+  const Tag deep = raw("mdcl", PlistData(nested.bytes().begin() + 8, nested.bytes().end()));
+  const DAAPValue item = decode(container("medc", {deep, u32("miid", 6)}));
+  EXPECT_EQ(item.item()->itemID(), 6u);
+  const DAAPValue codes = decode(container("mccr", {deep}));
+  EXPECT_EQ(codes.array()->size(), 1u);
+}
+
+TEST(DAAPHostileTest, TruncatedAtEveryByteGivesNothing) {
+  LogCapture log;
+  const PlistData full = document(richListing());
+  ASSERT_TRUE(DAAPParser::decodeData(full).isDictionary());
+  for (std::size_t length = 0; length < full.size(); ++length) {
+    EXPECT_TRUE(DAAPParser::decodeData(std::span(full).first(length)).isNull()) << length;
+  }
+  // Every cut from 8 bytes on is reported once; shorter ones are silent.
+  EXPECT_EQ(log.countContaining("DMAPParser parseStream: got"), full.size() - 8);
+}
+
+TEST(DAAPHostileTest, TruncatedInsideWithAMendedTopLevelSizeParsesWhatIsWhole) {
+  const PlistData full = document(richListing());
+  std::size_t itemsSeen = 0;
+  for (std::size_t length = 8; length <= full.size(); ++length) {
+    PlistData cut(full.begin(), full.begin() + static_cast<std::ptrdiff_t>(length));
+    const auto inner = static_cast<std::uint32_t>(length - 8);
+    for (int index = 0; index < 4; ++index) {
+      cut[4 + static_cast<std::size_t>(index)] =
+          static_cast<std::uint8_t>(inner >> (24 - 8 * index));
+    }
+    const DAAPValue header = DAAPParser::decodeData(cut);
+    ASSERT_TRUE(header.isDictionary()) << length;
+    if (const DAAPArray* listing = header["dmap.listing"].array()) {
+      for (const DAAPValue& item : *listing) EXPECT_TRUE(item.item()->isFrozen());
+      itemsSeen += listing->size();
+    }
+  }
+  EXPECT_GT(itemsSeen, 0u);
+  const DAAPValue whole = DAAPParser::decodeData(full);
+  EXPECT_EQ(whole["dmap.listing"].array()->size(), 2u);
+  EXPECT_EQ(whole["dmap.deletedidlisting"].array()->size(), 1u);
+}
+
+TEST(DAAPHostileTest, CorruptedBytesNeverBreakTheResultKind) {
+  const PlistData full = document(richListing());
+  std::mt19937 random(12345);
+  for (int round = 0; round < 20000; ++round) {
+    PlistData corrupted = full;
+    const int flips = 1 + static_cast<int>(random() % 4);
+    for (int flip = 0; flip < flips; ++flip) {
+      // Keep the top-level header so that the walk below it is exercised.
+      const std::size_t at = 8 + random() % (corrupted.size() - 8);
+      corrupted[at] = static_cast<std::uint8_t>(random());
+    }
+    const DAAPValue value = DAAPParser::decodeData(corrupted);
+    ASSERT_TRUE(value.isDictionary()) << round;
+  }
+}
+
+TEST(DAAPHostileTest, RandomBodiesUnderEveryTopLevelCode) {
+  std::mt19937 random(777);
+  for (const std::string& code : kTopLevelCodes) {
+    for (int round = 0; round < 500; ++round) {
+      PlistData body(random() % 200);
+      for (std::uint8_t& byte : body) byte = static_cast<std::uint8_t>(random());
+      const DAAPValue value = decode(raw(code, body));
+      if (code == "cacr" || code == "medc") EXPECT_TRUE(value.isItem());
+      if (code == "arsv") EXPECT_TRUE(value.isNull());
+      (void)value.toPlist();
+      (void)value.description();
+    }
+  }
+}
+
+TEST(DAAPHostileTest, LengthsAroundTheLimitsOfEveryWidth) {
+  // Values one byte short and one byte long of every fixed width, in every
+  // container kind, log at most and store nothing wrong.
+  LogCapture log;
+  std::vector<Tag> tags;
+  for (const char* code : {"miid", "mcti", "mlid", "mcty", "canp", "capl", "cmvo", "asai", "msma",
+                           "mstt", "mdst", "asyr", "aeSI", "aeCS"}) {
+    for (const std::size_t size : {1u, 3u, 5u, 7u, 9u, 15u, 17u, 31u, 33u}) {
+      tags.push_back(raw(code, PlistData(size, 0x7f)));
+    }
+  }
+  for (const std::string& code : kTopLevelCodes) (void)decode(container(code, tags));
+  const DAAPValue item = decode(container("medc", tags));
+  EXPECT_EQ(item.item()->itemID(), 0u);  // no size matched 4 or 8
+  EXPECT_EQ(item.item()->containerItemID(), 0x7f7f7f7fu);
+}
+
+}  // namespace
+}  // namespace larder
