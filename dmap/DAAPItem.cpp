@@ -250,7 +250,9 @@ void DAAPItem::updateItemWithDictionary(const DAAPDictionary& dictionary) {
   if (isFrozen_) return;
   if (mutableInfo_ && &dictionary == &*mutableInfo_) {
     // Writing into the dictionary being walked: walk a copy instead.
-    const DAAPDictionary snapshot = dictionary;
+    const DAAPDictionary snapshot =
+        dictionary;  // NOLINT(performance-unnecessary-copy-initialization):
+                     // the walk changes the original
     updateItemWithDictionary(snapshot);
     return;
   }

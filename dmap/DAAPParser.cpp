@@ -157,7 +157,7 @@ bool isNonEmpty(const DAAPValue& value) {
 // costing more than a few megabytes or a deep stack.
 PlistReadLimits embeddedPlistLimits() {
   PlistReadLimits limits;
-  limits.maxBytes = 16u * 1024u * 1024u;
+  limits.maxBytes = std::size_t{16} * 1024 * 1024;
   limits.maxDepth = 32;
   limits.maxObjects = 65536;
   return limits;

@@ -25,7 +25,10 @@ struct PlistNodeDeleter {
 using PlistNode = std::unique_ptr<void, PlistNodeDeleter>;
 
 struct MallocDeleter {
-  void operator()(void* memory) const { std::free(memory); }
+  void operator()(void* memory) const {
+    std::free(memory);
+  }  // NOLINT(cppcoreguidelines-no-malloc,cppcoreguidelines-owning-memory): libplist allocates with
+     // malloc
 };
 using MallocString = std::unique_ptr<char, MallocDeleter>;
 using MallocIterator = std::unique_ptr<void, MallocDeleter>;

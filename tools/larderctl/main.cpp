@@ -1,5 +1,5 @@
 // larderctl: the command-line client of larderd.
-#include <signal.h>
+#include <csignal>
 
 #include <sdbus-c++/Error.h>
 #include <CLI/CLI.hpp>
