@@ -48,7 +48,8 @@ void syncParentDirectory(const std::string& path) {
 
 std::optional<std::vector<std::uint8_t>> FileIO::read(const std::string& path, std::size_t maxBytes,
                                                       std::string* error) {
-  FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  FileDescriptor file(
+      ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));  // a FIFO never blocks
   if (!file.valid()) {
     fail(error, "open " + path);
     return std::nullopt;
