@@ -73,6 +73,11 @@ SoftwareMap::SoftwareMap(Options options)
 }
 
 SoftwareMap::~SoftwareMap() {
+  // The queries and the reload call back into the map: stop them, then
+  // drain what they enqueued before, so that nothing runs on a dead map.
+  waitUntilIdle();
+  stopMetadataQueries();
+  periodicReload_.reset();
   waitUntilIdle();
 }
 

@@ -11,7 +11,9 @@
 #include <unordered_map>
 #include <vector>
 
+#include "platform/BackgroundActivityScheduler.h"
 #include "platform/DispatchQueue.h"
+#include "platform/MetadataQuery.h"
 #include "platform/PlistValue.h"
 #include "software-map/VendSoftwareMapObserver.h"
 #include "store-runtime/LedgerSoftwareProduct.h"
@@ -29,8 +31,13 @@ class SoftwareMap {
     // Where the persisted store lives; empty means the standard place in
     // the user's caches folder.
     std::string persistedStorePath;
-    // Run the discovery of the application registry after the load.
+    // Run the discovery of the application registry after the load, and
+    // then the live queries.
     bool discoverApplications = true;
+    // Keep the map live with the metadata queries after the first discovery.
+    bool liveQueries = true;
+    // Repeat the discovery every ten hours on mains power.
+    bool periodicReload = true;
   };
 
   using ProductList = std::vector<LedgerSoftwareProductRef>;
@@ -86,6 +93,13 @@ class SoftwareMap {
   // Waits until every task enqueued on the map's queues so far has run.
   void waitUntilIdle();
 
+  // The two live queries, their strings and attributes.
+  static const std::string& metadataQueryStringQMT();
+  static const std::string& metadataQueryStringLegacy();
+  static std::vector<std::string> metadataQueryValueAttributes();
+  // Bundle identifier → {"wareID": number, "minimumVersion": string}.
+  static const PlistDictionary& legacyAppWhiteList();
+
  private:
   struct Changes {
     ProductList added;
@@ -128,10 +142,37 @@ class SoftwareMap {
       const std::string& path, const struct VendPurchaseRecord& record);
   void rebuildMapUsingDiscoveredApps(const ProductList& discovered);
   void logRebuild(double seconds);
+  void registerForPeriodicReload();
   static void updateAppWithApp(LedgerSoftwareProduct& existing, const LedgerSoftwareProduct& fresh,
                                bool* didChange);
 
   void enqueueNotifications(Changes changes);
+
+  // Live queries.
+  using MetadataItemRef = std::shared_ptr<const MetadataItem>;
+  // Records of one query event, by the item they were made from.
+  using MappedApplications = std::vector<std::pair<MetadataItemRef, LedgerSoftwareProductRef>>;
+  void initializeLantern();
+  void startMetadataQueryForQMTApps();
+  void startMetadataQueryForLegacyApps();
+  void startMetadataQuery(std::shared_ptr<MetadataQuery> SoftwareMap::*handle,
+                          const std::string& queryString, std::string_view failureText);
+  void updateApplicationWithMDItem(LedgerSoftwareProduct& product, const MetadataItemRef& item,
+                                   const MetadataQuery& query) const;
+  LedgerSoftwareProductRef applicationFromMDItem(const MetadataItemRef& item) const;
+  LedgerSoftwareProductRef legacyApplicationFromMDItem(const MetadataItemRef& item) const;
+  static bool legacyApplicationSatifiesMinimumVersionRequirement(
+      const LedgerSoftwareProduct& product);
+  void queryDidFinish(MetadataQuery& query);
+  void queryDidUpdateWithUserInfo(MetadataQuery& query, const MetadataQueryUpdate& update);
+  MappedApplications mappedApplicationsForUpdateArray(const std::vector<MetadataItemRef>& items,
+                                                      bool isLegacy) const;
+  void mdServerPortInvalid();
+  void mergeFirstResults(const MappedApplications& results, std::size_t resultCount);
+  void mergeUpdate(const MappedApplications& added, const MappedApplications& changed,
+                   const std::vector<MetadataItemRef>& removed);
+  void rememberItem(const MetadataItemRef& item, const LedgerSoftwareProductRef& product);
+  void stopMetadataQueries();
 
   Options options_;
   std::shared_ptr<DispatchQueue> dispatchQueue_;
@@ -151,6 +192,22 @@ class SoftwareMap {
   std::optional<StringMap<LedgerSoftwareProductRef>> appsByPath_;
   StringMap<ProductList> appsByBundleID_;
   std::unordered_map<std::uint64_t, ProductList> appsByItemID_;
+
+  // Items the queries reported, by identity, with their records. The item
+  // is held so that its address stays a valid key. Guarded by
+  // dispatchQueue_ (changed only in barriers and in initializeLantern).
+  struct MappedItem {
+    MetadataItemRef item;
+    LedgerSoftwareProductRef product;
+  };
+  std::unordered_map<const MetadataItem*, MappedItem> appsByMDItem_;
+
+  // Owned by metadataQueryQueue_.
+  std::shared_ptr<MetadataQuery> metadataQueryRefQMT_;
+  std::shared_ptr<MetadataQuery> metadataQueryRefLegacy_;
+  std::chrono::steady_clock::time_point metadataQueryStartDate_;
+
+  std::unique_ptr<BackgroundActivityScheduler> periodicReload_;
 
   // Guarded by observerQueue_.
   std::map<std::string, std::shared_ptr<VendSoftwareMapObserver>> observers_;

@@ -95,7 +95,32 @@ void SoftwareMap::initialDiscovery() {
                    {},
                    "SoftwareMap: Finished initial load (%ld items)",
                    {LogArgument::number(appsByPath_->size())}});
+    registerForPeriodicReload();
+    if (options_.liveQueries) dispatchQueue_->async([this] { initializeLantern(); });
   });
+}
+
+void SoftwareMap::registerForPeriodicReload() {
+  if (!options_.periodicReload) return;
+  BackgroundActivityCriteria criteria;
+  criteria.repeating = true;
+  criteria.delay = std::chrono::hours(10);
+  criteria.gracePeriod = std::chrono::hours(2);
+  criteria.priority = BackgroundActivityPriority::Maintenance;
+  criteria.allowBattery = false;
+  periodicReload_ = std::make_unique<BackgroundActivityScheduler>();
+  periodicReload_->registerActivity(
+      "com.orvane.pantryd.SoftwareMap.periodicReload", criteria,
+      [this](const BackgroundActivity&, BackgroundActivityState state) {
+        if (state != BackgroundActivityState::Run) return;
+        dispatchQueue_->async([this] {
+          TILL_LOG(1, "%@: Performing periodic reload of SoftwareMap", kSpeaker);
+          ProductList discovered = discoverAppsUsingAppRegistry();
+          dispatchQueue_->barrierAsync([this, discovered = std::move(discovered)] {
+            rebuildMapUsingDiscoveredApps(discovered);
+          });
+        });
+      });
 }
 
 void SoftwareMap::reloadFromApplicationRegistry() {

@@ -60,7 +60,7 @@ TEST_F(ServiceTest, AnswersLookupsForDiscoveredStoreSoftware) {
   installStoreApp(homeApplications(), "Bar", "com.example.bar", "1.0", 1002);
   std::string plain = platform.installBundle({applications(), "Plain", "com.example.plain"});
   auto service = startService();
-  ASSERT_TRUE(service->waitForLog("Software map rebuild took")) << service->log();
+  ASSERT_TRUE(service->waitForLog("MetadataQuery initial load took")) << service->log();
   auto client = connectClient(bus);
 
   PlistArray all = client->call("AllProducts", {});
@@ -73,7 +73,7 @@ TEST_F(ServiceTest, AnswersLookupsForDiscoveredStoreSoftware) {
   EXPECT_EQ(field(byBundle, "bundleVersion"), "2.1");
   EXPECT_EQ(field(byBundle, "itemIdentifier"), "1001");
   EXPECT_EQ(field(byBundle, "accountOpaqueID"), "account-1");
-  EXPECT_EQ(field(byBundle, "source"), "4");
+  EXPECT_EQ(field(byBundle, "source"), "2") << "the live query has taken the record over";
   EXPECT_EQ(field(byBundle, "installed"), "1");
 
   PlistDictionary byItem =
@@ -285,6 +285,109 @@ TEST_F(ServiceTest, ObserversHearChangesAndAGoneClientCostsNothing) {
           .size(),
       1u);
   EXPECT_TRUE(service->process().isRunning());
+}
+
+// Records the callbacks a client's observer object receives, with paths.
+struct ChangeRecord {
+  std::mutex mutex;
+  std::vector<std::pair<std::string, std::int64_t>> calls;  // (bundlePath, state)
+  std::size_t size() {
+    std::lock_guard lock(mutex);
+    return calls.size();
+  }
+  std::vector<std::pair<std::string, std::int64_t>> snapshot() {
+    std::lock_guard lock(mutex);
+    return calls;
+  }
+};
+
+TEST_F(ServiceTest, TheMapFollowsTheDiskAndAnnouncedUpdatesStayQuiet) {
+  std::string staged = platform.directory() + "/staging";
+  fs::create_directories(staged);
+  std::string kept = installStoreApp(applications(), "Kept", "com.example.kept", "1.0", 11);
+  auto service = startService();
+  ASSERT_TRUE(service->waitForLog("MetadataQuery initial load took")) << service->log();
+
+  auto client = connectClient(bus);
+  ChangeRecord heard;
+  client->exportSoftwareMapObserver(
+      "/test/Changes", [&](const PlistValue& product, std::int64_t state) {
+        std::lock_guard lock(heard.mutex);
+        heard.calls.emplace_back(*product["bundlePath"].string(), state);
+      });
+  client->call("AddSoftwareMapObserver", {"/test/Changes"});
+
+  // A bundle copied in: one Added.
+  std::string prepared = installStoreApp(staged, "Fresh", "com.example.fresh", "1.0", 12);
+  std::string fresh = applications() + "/Fresh.app";
+  fs::rename(prepared, fresh);
+  ASSERT_TRUE(eventually([&] { return heard.size() >= 1; })) << service->log();
+  EXPECT_EQ(heard.snapshot().at(0), std::make_pair(fresh, std::int64_t{0}));
+  EXPECT_EQ(field(dictionaryAt(client->call("ProductForItemIdentifier", {std::uint64_t{12}}), 0),
+                  "bundlePath"),
+            fresh);
+
+  // Its purchase record edited: Changed.
+  TemporaryPlatform::writePurchaseRecord(fresh, "com.example.fresh", "1.0", 12, 99);
+  ASSERT_TRUE(eventually([&] { return heard.size() >= 2; })) << service->log();
+  EXPECT_EQ(heard.snapshot().at(1), std::make_pair(fresh, std::int64_t{2}));
+
+  // An announced update that replaces the bundle: no Removed, no Added; the
+  // record keeps its identity and the report tells the change once.
+  client->call("ProductAtPathWillBeUpdatedToBundleVersionStoreVersion",
+               {kept, "2.0", std::int64_t{2}});
+  std::string replacement = installStoreApp(staged, "Kept", "com.example.kept", "2.0", 11);
+  TemporaryPlatform::writePurchaseRecord(replacement, "com.example.kept", "2.0", 11, 2);
+  fs::remove_all(kept);
+  fs::rename(replacement, kept);
+  ASSERT_TRUE(service->waitForLog("App reported as removed in MetadataQuery update, but ignoring"))
+      << service->log();
+  client->call("ProductAtPathWasUpdatedToBundleVersionStoreVersion",
+               {kept, true, "2.0", std::int64_t{2}});
+  EXPECT_EQ(field(dictionaryAt(client->call("ProductForBundleIdentifier", {"com.example.kept"}), 0),
+                  "bundlePath"),
+            kept);
+
+  // Deleted: Removed.
+  fs::remove_all(fresh);
+  ASSERT_TRUE(eventually([&] {
+    auto calls = heard.snapshot();
+    return std::find(calls.begin(), calls.end(), std::make_pair(fresh, std::int64_t{1})) !=
+           calls.end();
+  })) << service->log();
+  for (const auto& [path, state] : heard.snapshot()) {
+    EXPECT_FALSE(path == kept && (state == 0 || state == 1))
+        << "the announced update was told as " << state;
+  }
+  EXPECT_TRUE(
+      dictionaryAt(client->call("ProductForItemIdentifier", {std::uint64_t{12}}), 0).empty());
+}
+
+TEST_F(ServiceTest, OlderSoftwareOfTheMakerIsFoundFromItsMinimumVersionOn) {
+  platform.installBundle({applications(), "Snapbox", "com.orvane.Snapbox", "9.1.2"});
+  platform.installBundle({applications(), "Quire", "com.orvane.Anvil.Quire", "4.0"});
+  platform.installBundle({applications(), "Tally", "com.orvane.Anvil.Tally", "1.9"});
+  platform.installBundle({applications(), "Unlisted", "com.orvane.Unlisted", "50.0"});
+  auto service = startService();
+  ASSERT_TRUE(eventually([&] {
+    return service->logLines("MetadataQuery initial load took").size() >= 2;
+  })) << service->log();
+  auto client = connectClient(bus);
+  PlistDictionary snapbox =
+      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.orvane.Snapbox"}), 0);
+  EXPECT_EQ(field(snapbox, "itemIdentifier"), "400000101");
+  EXPECT_EQ(field(snapbox, "versionIdentifier"), "0");
+  EXPECT_EQ(field(snapbox, "isLegacyApp"), "1");
+  EXPECT_EQ(field(snapbox, "source"), "3");
+  EXPECT_FALSE(
+      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.orvane.Anvil.Quire"}), 0)
+          .empty())
+      << "exactly the minimum version is enough";
+  EXPECT_TRUE(
+      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.orvane.Anvil.Tally"}), 0)
+          .empty());
+  EXPECT_TRUE(
+      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.orvane.Unlisted"}), 0).empty());
 }
 
 TEST_F(ServiceTest, LarderctlWatchPrintsObserverCallbacks) {

@@ -85,7 +85,8 @@ class LogCapture {
   [[nodiscard]] std::string dump() const {
     std::lock_guard lock(mutex_);
     std::string text;
-    for (const Line& line : lines_) text += "[" + std::to_string(line.level) + "] " + line.text + "\n";
+    for (const Line& line : lines_)
+      text += "[" + std::to_string(line.level) + "] " + line.text + "\n";
     return text;
   }
 
@@ -106,7 +107,8 @@ class RecordingObserver final : public VendSoftwareMapObserver {
 
   void softwareProductUpdatedState(const LedgerSoftwareProductRef& product,
                                    std::int64_t state) override {
-    LedgerSoftwareProductFields fields = product ? product->snapshot() : LedgerSoftwareProductFields{};
+    LedgerSoftwareProductFields fields =
+        product ? product->snapshot() : LedgerSoftwareProductFields{};
     std::lock_guard lock(mutex_);
     calls_.push_back({product, state, std::move(fields)});
   }
@@ -247,8 +249,9 @@ class ServiceTest : public ::testing::Test {
   static std::string makeStoreBundle(const std::string& folder, const std::string& name,
                                      const std::string& identifier, const std::string& version,
                                      std::int64_t wareID, std::int64_t installerVersionID = 1) {
-    Purchase purchase{identifier, version, PlistValue(wareID), PlistValue(installerVersionID),
-                      "account-" + name, 1600000000.0};
+    Purchase purchase{identifier,         version,
+                      PlistValue(wareID), PlistValue(installerVersionID),
+                      "account-" + name,  1600000000.0};
     return makeBundle(folder, name, identifier, version, purchase);
   }
 
@@ -262,6 +265,9 @@ class ServiceTest : public ::testing::Test {
     SoftwareMap::Options result;
     result.persistedStorePath = store;
     result.discoverApplications = discover;
+    // These tests look at the scan and the update notices alone.
+    result.liveQueries = false;
+    result.periodicReload = false;
     return result;
   }
 
