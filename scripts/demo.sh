@@ -1,12 +1,11 @@
-#!/ usr / bin / env bash
-#Installs what is missing, builds, and shows the service at work : larderd
-#on a private bus over a temporary platform with sample bundles, asked by
-#larderctl.Usage : scripts / demo.sh[build - dir]
-set - euo pipefail cd "$(dirname " $0 ")/.." build = $ {
-  1 : -build
-}
-if
-  [-z "${LARDER_DEMO_ON_BUS:-}"]; then
+#!/usr/bin/env bash
+# Installs what is missing, builds, and shows the service at work: larderd
+# on a private bus over a temporary platform with sample bundles, asked by
+# larderctl. Usage: scripts/demo.sh [build-dir]
+set -euo pipefail
+cd "$(dirname "$0")/.."
+build=${1:-build}
+if [ -z "${LARDER_DEMO_ON_BUS:-}" ]; then
   ./scripts/install-deps.sh
   cmake -S . -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
   cmake --build "$build" -j"$(nproc)" --target larderd larderctl
@@ -23,7 +22,7 @@ mkdir -p "$LARDER_ROOT/Applications" "$HOME/Applications"
 plist_header='<?xml version="1.0" encoding="UTF-8"?>
 <plist version="1.0">'
 
-#bundle FOLDER NAME IDENTIFIER VERSION[ITEM - ID[VERSION - ID]]
+# bundle FOLDER NAME IDENTIFIER VERSION [ITEM-ID [VERSION-ID]]
 bundle() {
   local path="$1/$2.app"
   mkdir -p "$path/resources" "$path/bin"
@@ -41,7 +40,7 @@ PLIST
   return 0
 }
 
-#purchase BUNDLE IDENTIFIER VERSION ITEM - ID[VERSION - ID]
+# purchase BUNDLE IDENTIFIER VERSION ITEM-ID [VERSION-ID]
 purchase() {
   cat >"$1/purchase.plist" <<PLIST
 $plist_header
@@ -67,46 +66,36 @@ mkdir -p "$XDG_STATE_HOME"
 "$larderd" 2>"$XDG_STATE_HOME/larderd.log" &
 service=$!
 trap 'kill $service 2>/dev/null; rm -rf "$demo"' EXIT
-for _ in $(seq 50);
-do
-  "$larderctl" products > / dev / null 2 > &1 &&
-      break sleep 0.1 done sleep 0.5 #let the first scan and the live queries settle
+for _ in $(seq 50); do
+  "$larderctl" products >/dev/null 2>&1 && break
+  sleep 0.1
+done
+sleep 0.5  # let the first scan and the live queries settle
 
-          echo;
-echo "== larderctl products  (Terminal Helper has no purchase record: not store software)"
-     "$larderctl" products echo;
-echo "== larderctl product --bundle-id com.example.sketchpad  (1.10 is newer than 1.9)"
-     "$larderctl" product-- bundle -
-    id com.example.sketchpad echo;
-echo "== larderctl product --item-id 400100 --json"
-     "$larderctl" product-- item -
-    id 400100 --json
+echo; echo "== larderctl products  (Terminal Helper has no purchase record: not store software)"
+"$larderctl" products
+echo; echo "== larderctl product --bundle-id com.example.sketchpad  (1.10 is newer than 1.9)"
+"$larderctl" product --bundle-id com.example.sketchpad
+echo; echo "== larderctl product --item-id 400100 --json"
+"$larderctl" product --item-id 400100 --json
 
-        echo;
-echo
-    "== larderctl watch, while Ledgerly is replaced by an announced update (quiet), Newcomer is "
-    "copied in and Sketchpad's older copy deleted"
-    "$larderctl" watch& watcher = $ !sleep 0.3 ledgerly =
-        "$LARDER_ROOT/Applications/Ledgerly.app"
-        "$larderctl" call ProductAtPathWillBeUpdatedToBundleVersionStoreVersion "$ledgerly" 2.5 2
-#The install machinery replaces the whole bundle.
-            bundle
-            "$demo"
-            "Ledgerly" com.example.ledgerly 2.5 400100 2 rm -
-            rf "$ledgerly" &&
-        mv
-        "$demo/Ledgerly.app"
-        "$ledgerly" sleep 0.5 #the index sees the old bundle go and
-        the new one come : announced,
-                        so not told
-                                "$larderctl" call ProductAtPathWasUpdatedToBundleVersionStoreVersion
-                                "$ledgerly" true 2.5 2 bundle
-                                "$demo"
-                                "Newcomer" com.example.newcomer 3.0 400300 mv
-                                "$demo/Newcomer.app"
-                                "$LARDER_ROOT/Applications/" sleep 0.5 rm -
-                                rf "$LARDER_ROOT/Applications/Sketchpad.app" sleep 0.5 kill -
-                                INT $watcher wait $watcher ||
-                            true echo;
-echo "== larderctl products"
-     "$larderctl" products
+echo; echo "== larderctl watch, while Ledgerly is replaced by an announced update (quiet), Newcomer is copied in and Sketchpad's older copy deleted"
+"$larderctl" watch &
+watcher=$!
+sleep 0.3
+ledgerly="$LARDER_ROOT/Applications/Ledgerly.app"
+"$larderctl" call ProductAtPathWillBeUpdatedToBundleVersionStoreVersion "$ledgerly" 2.5 2
+# The install machinery replaces the whole bundle.
+bundle "$demo" "Ledgerly" com.example.ledgerly 2.5 400100 2
+rm -rf "$ledgerly" && mv "$demo/Ledgerly.app" "$ledgerly"
+sleep 0.5  # the index sees the old bundle go and the new one come: announced, so not told
+"$larderctl" call ProductAtPathWasUpdatedToBundleVersionStoreVersion "$ledgerly" true 2.5 2
+bundle "$demo" "Newcomer" com.example.newcomer 3.0 400300
+mv "$demo/Newcomer.app" "$LARDER_ROOT/Applications/"
+sleep 0.5
+rm -rf "$LARDER_ROOT/Applications/Sketchpad.app"
+sleep 0.5
+kill -INT $watcher
+wait $watcher || true
+echo; echo "== larderctl products"
+"$larderctl" products
