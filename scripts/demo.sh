@@ -79,7 +79,7 @@ echo; echo "== larderctl product --bundle-id com.example.sketchpad  (1.10 is new
 echo; echo "== larderctl product --item-id 400100 --json"
 "$larderctl" product --item-id 400100 --json
 
-echo; echo "== larderctl watch, while Ledgerly is replaced by an announced update (quiet), Newcomer is copied in and Sketchpad's older copy deleted"
+echo; echo "== larderctl watch, while Ledgerly is replaced by an announced update (quiet), Newcomer is copied in and its purchase record changed, and Sketchpad's older copy deleted"
 "$larderctl" watch &
 watcher=$!
 sleep 0.3
@@ -92,6 +92,8 @@ sleep 0.5  # the index sees the old bundle go and the new one come: announced, s
 "$larderctl" call ProductAtPathWasUpdatedToBundleVersionStoreVersion "$ledgerly" true 2.5 2
 bundle "$demo" "Newcomer" com.example.newcomer 3.0 400300
 mv "$demo/Newcomer.app" "$LARDER_ROOT/Applications/"
+sleep 0.5
+purchase "$LARDER_ROOT/Applications/Newcomer.app" com.example.newcomer 3.0 400300 7
 sleep 0.5
 rm -rf "$LARDER_ROOT/Applications/Sketchpad.app"
 sleep 0.5
