@@ -63,7 +63,8 @@ SoftwareMap::SoftwareMap(Options options)
       metadataQueryQueue_(
           DispatchQueue::create("SoftwareMap MetadataQuery Queue", DispatchQueue::Kind::Serial)),
       observerQueue_(
-          DispatchQueue::create("SoftwareMap Observer Queue", DispatchQueue::Kind::Serial)) {
+          DispatchQueue::create("SoftwareMap Observer Queue", DispatchQueue::Kind::Serial)),
+      storeQueue_(DispatchQueue::create("SoftwareMap Store Queue", DispatchQueue::Kind::Serial)) {
   // The load is a barrier enqueued first, so every later lookup waits for
   // the persisted records and then answers while the discovery runs.
   dispatchQueue_->barrierAsync([this] { asyncInitializeAndLoadPersistedStore(); });
@@ -89,6 +90,7 @@ void SoftwareMap::waitUntilIdle() {
     dispatchQueue_->barrierSync([] {});
     metadataQueryQueue_->sync([] {});
     observerQueue_->sync([] {});
+    storeQueue_->sync([] {});
   }
 }
 
@@ -178,19 +180,26 @@ void SoftwareMap::logAppsByPath(MapLogLine line) const {
 
 void SoftwareMap::writePersistedStoreToDisk() {
   if (!appsByPath_) return;
-  PlistDictionary records;
-  for (const auto& [path, product] : *appsByPath_) {
-    records.emplace(path, product->encodeWithCoder());
-  }
-  PlistValue root = KeyedArchive::dictionary(
-      {{std::string(kAppsByPathKey), KeyedArchive::dictionary(std::move(records))}});
-  PlistData data = KeyedArchive::archivedData(root);
-  std::string path = persistedStoreURL();
-  std::string error;
-  if (!data.empty() && !FileIO::writeAtomically(path, data, &error)) {
-    TILL_LOG(1, "%@: Exception writing persisted SoftwareMap to %@ - %@", kSpeaker, path, error);
-  }
-  TILL_LOG(2, "%@: Updated persisted SoftwareMap at %@", kSpeaker, path);
+  // The barrier takes only the membership; encoding and the disk, with its
+  // fsync, happen on the store queue in the order of the changes, so that
+  // readers never wait for the disk. A record's values are read when it is
+  // encoded, which is never older than the change that asked for the write.
+  auto members = std::make_shared<std::vector<std::pair<std::string, LedgerSoftwareProductRef>>>(
+      appsByPath_->begin(), appsByPath_->end());
+  storeQueue_->async([members, path = persistedStoreURL()] {
+    PlistDictionary records;
+    for (const auto& [memberPath, product] : *members) {
+      records.emplace(memberPath, product->encodeWithCoder());
+    }
+    PlistValue root = KeyedArchive::dictionary(
+        {{std::string(kAppsByPathKey), KeyedArchive::dictionary(std::move(records))}});
+    PlistData data = KeyedArchive::archivedData(root);
+    std::string error;
+    if (!data.empty() && !FileIO::writeAtomically(path, data, &error)) {
+      TILL_LOG(1, "%@: Exception writing persisted SoftwareMap to %@ - %@", kSpeaker, path, error);
+    }
+    TILL_LOG(2, "%@: Updated persisted SoftwareMap at %@", kSpeaker, path);
+  });
 }
 
 // MARK: secondary maps and lookups

@@ -178,6 +178,8 @@ class SoftwareMap {
   std::shared_ptr<DispatchQueue> dispatchQueue_;
   std::shared_ptr<DispatchQueue> metadataQueryQueue_;
   std::shared_ptr<DispatchQueue> observerQueue_;
+  // Writes of the persisted store, in order, outside the map's barriers.
+  std::shared_ptr<DispatchQueue> storeQueue_;
 
   struct StringHash {
     using is_transparent = void;
