@@ -93,6 +93,10 @@ class SoftwareMap {
   // Waits until every task enqueued on the map's queues so far has run.
   void waitUntilIdle();
 
+  // Makes both live queries behave as on an overflow of the kernel's event
+  // queue, for tests of the recovery.
+  void simulateMetadataQueryOverflowForTesting();
+
   // The two live queries, their strings and attributes.
   static const std::string& metadataQueryStringQMT();
   static const std::string& metadataQueryStringLegacy();

@@ -139,6 +139,14 @@ void SoftwareMap::stopMetadataQueries() {
   });
 }
 
+void SoftwareMap::simulateMetadataQueryOverflowForTesting() {
+  metadataQueryQueue_->sync([this] {
+    for (const auto& query : {metadataQueryRefQMT_, metadataQueryRefLegacy_}) {
+      if (query) query->simulateQueueOverflowForTesting();
+    }
+  });
+}
+
 void SoftwareMap::mdServerPortInvalid() {
   TILL_LOG(1, "%@: Received serverPortInvalid from MetadataQuery. Reinitializing.", kSpeaker);
   dispatchQueue_->barrierAsync([this] { initializeLantern(); });

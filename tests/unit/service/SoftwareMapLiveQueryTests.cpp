@@ -1,0 +1,48 @@
+// The live queries as the map uses them: recovery from a lost event queue.
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <thread>
+
+#include "tests/unit/service/ServiceTestSupport.h"
+
+namespace larder::testing {
+namespace {
+
+bool eventually(const std::function<bool()>& condition) {
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+  while (std::chrono::steady_clock::now() < deadline) {
+    if (condition()) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  return condition();
+}
+
+class SoftwareMapLiveQueryTest : public ServiceTest {};
+
+TEST_F(SoftwareMapLiveQueryTest, AnOverflowRestartsTheQueriesAndTheirResultsRepairTheMap) {
+  makeStoreBundle(rootApplications(), "Before", "com.example.before", "1.0", 31);
+  LogCapture log;
+  SoftwareMap::Options options = this->options(storePath("live"), true);
+  options.liveQueries = true;
+  SoftwareMap map(options);
+  ASSERT_TRUE(
+      eventually([&] { return log.countContaining("MetadataQuery initial load took") >= 2; }));
+
+  map.simulateMetadataQueryOverflowForTesting();
+  ASSERT_TRUE(eventually([&] {
+    return log.countContaining("Received serverPortInvalid from MetadataQuery. Reinitializing.") >=
+           1;
+  }));
+  // A bundle that arrives while the queries are being replaced is found by
+  // the new queries' first gathering.
+  makeStoreBundle(rootApplications(), "During", "com.example.during", "1.0", 32);
+  ASSERT_TRUE(eventually([&] { return map.productForItemIdentifier(32) != nullptr; }));
+  ASSERT_TRUE(
+      eventually([&] { return log.countContaining("MetadataQuery initial load took") >= 4; }));
+  EXPECT_NE(map.productForItemIdentifier(31), nullptr) << "the restart loses nothing";
+  EXPECT_EQ(map.allProducts().size(), 2u);
+}
+
+}  // namespace
+}  // namespace larder::testing
