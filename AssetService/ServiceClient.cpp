@@ -3,7 +3,9 @@
 #include <stdexcept>
 
 #include "AssetService/DBusValueCodec.h"
+#include "AssetService/DialogAgentRegistry.h"
 #include "AssetService/RequestTable.h"
+#include "AssetService/StoreRuntimeInterface.h"
 #include "platform/Environment.h"
 #include "store-runtime/VendStoreClient.h"
 
@@ -36,6 +38,31 @@ PlistArray ServiceClient::call(const std::string& member, const PlistArray& argu
   DBusValueCodec::writeAll(message, request->inSignature, arguments);
   sdbus::MethodReply reply = proxy_->callMethod(message, timeout_);
   return DBusValueCodec::readAll(reply, request->outSignature);
+}
+
+PlistArray ServiceClient::callDialogAgents(const std::string& member, const PlistArray& arguments,
+                                           std::uint64_t timeoutMicroseconds) {
+  const BusMethod* method = DialogAgentRegistry::findMethod(member);
+  if (!method) throw std::invalid_argument("unknown dialog agent request " + member);
+  return callMethod(DialogAgentRegistry::kInterfaceName, *method, arguments, timeoutMicroseconds);
+}
+
+PlistArray ServiceClient::callStoreRuntime(const std::string& member, const PlistArray& arguments,
+                                           std::uint64_t timeoutMicroseconds) {
+  const BusMethod* method = StoreRuntimeInterface::findMethod(member);
+  if (!method) throw std::invalid_argument("unknown store runtime request " + member);
+  return callMethod(StoreRuntimeInterface::kInterfaceName, *method, arguments, timeoutMicroseconds);
+}
+
+PlistArray ServiceClient::callMethod(std::string_view interfaceName, const BusMethod& method,
+                                     const PlistArray& arguments,
+                                     std::uint64_t timeoutMicroseconds) {
+  sdbus::MethodCall message =
+      proxy_->createMethodCall(std::string(interfaceName), std::string(method.member));
+  DBusValueCodec::writeAll(message, method.inSignature, arguments);
+  sdbus::MethodReply reply =
+      proxy_->callMethod(message, timeoutMicroseconds != 0 ? timeoutMicroseconds : timeout_);
+  return DBusValueCodec::readAll(reply, method.outSignature);
 }
 
 void ServiceClient::exportSoftwareMapObserver(

@@ -2,8 +2,10 @@
 
 #include <cstdint>
 #include <functional>
+
 #include <memory>
 #include <string>
+#include "AssetService/BusMethod.h"
 
 #include <sdbus-c++/IConnection.h>
 #include <sdbus-c++/IObject.h>
@@ -28,6 +30,13 @@ class ServiceClient {
   // Calls `member`; the reply's arguments in order. Throws sdbus::Error on
   // a D-Bus error and std::invalid_argument for an unknown request.
   PlistArray call(const std::string& member, const PlistArray& arguments);
+  // The same for the dialog agent registry (RegisterDialogAgent,
+  // UnregisterDialogAgent, DisplayDialog); a timeout of 0 is the client's.
+  PlistArray callDialogAgents(const std::string& member, const PlistArray& arguments,
+                              std::uint64_t timeoutMicroseconds = 0);
+  // The same for the store runtime (SignIn, Purchase, Downloads, ...).
+  PlistArray callStoreRuntime(const std::string& member, const PlistArray& arguments,
+                              std::uint64_t timeoutMicroseconds = 0);
 
   // Exports a software map observer at `objectPath` that hands every
   // callback to `onChange`.
@@ -37,6 +46,9 @@ class ServiceClient {
   sdbus::IConnection& connection() { return *connection_; }
 
  private:
+  PlistArray callMethod(std::string_view interfaceName, const BusMethod& method,
+                        const PlistArray& arguments, std::uint64_t timeoutMicroseconds);
+
   std::unique_ptr<sdbus::IConnection> connection_;
   std::unique_ptr<sdbus::IProxy> proxy_;
   std::unique_ptr<sdbus::IObject> observer_;

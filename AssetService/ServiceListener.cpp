@@ -4,6 +4,8 @@
 #include <sdbus-c++/IProxy.h>
 
 #include "AssetService/DBusValueCodec.h"
+#include "AssetService/DialogAgentRegistry.h"
+#include "AssetService/StoreRuntimeInterface.h"
 #include "platform/Environment.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/TillLogManager.h"
@@ -71,6 +73,15 @@ void ServiceListener::setDelegate(std::shared_ptr<AssetServiceDelegate> delegate
   delegate_ = std::move(delegate);
 }
 
+void ServiceListener::setDialogAgentRegistry(std::shared_ptr<DialogAgentRegistry> registry) {
+  dialogAgents_ = std::move(registry);
+}
+
+void ServiceListener::setStoreRuntimeInterface(
+    std::shared_ptr<StoreRuntimeInterface> storeRuntime) {
+  storeRuntime_ = std::move(storeRuntime);
+}
+
 void ServiceListener::resume() {
   connection_ = connectToBus();
   remoteObjects_ = std::make_shared<RemoteObjects>(*connection_);
@@ -81,6 +92,8 @@ void ServiceListener::resume() {
         std::string(request.inSignature), std::string(request.outSignature),
         [this, &request](sdbus::MethodCall call) { dispatch(request, std::move(call)); });
   }
+  if (dialogAgents_) dialogAgents_->exportOn(*object_, *connection_);
+  if (storeRuntime_) storeRuntime_->exportOn(*object_);
   object_->finishRegistration();
   connection_->addMatch(
       "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop.DBus',"
@@ -113,6 +126,7 @@ void ServiceListener::peerDidChangeOwner(sdbus::Message& signal) {
   std::string newOwner;
   signal >> name >> oldOwner >> newOwner;
   if (!newOwner.empty()) return;
+  if (dialogAgents_) dialogAgents_->peerDidLeave(name);
   std::lock_guard lock(peersMutex_);
   // Work the peer left queued still runs: its items hold the object.
   if (peers_.erase(name) > 0) TILL_LOG(3, "%@: connection from %@ ended", kSpeaker, name);

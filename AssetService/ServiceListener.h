@@ -15,6 +15,8 @@
 
 namespace larder {
 
+class DialogAgentRegistry;
+class StoreRuntimeInterface;
 class SoftwareMap;
 
 // The service on the bus: owns the bus name, exports the request table on
@@ -29,6 +31,11 @@ class ServiceListener {
   ServiceListener& operator=(const ServiceListener&) = delete;
 
   void setDelegate(std::shared_ptr<AssetServiceDelegate> delegate);
+  // Exported beside the request table on the service object; told of every
+  // peer that leaves the bus.
+  void setDialogAgentRegistry(std::shared_ptr<DialogAgentRegistry> registry);
+  // Exported beside the request table on the service object.
+  void setStoreRuntimeInterface(std::shared_ptr<StoreRuntimeInterface> storeRuntime);
   // Connects, exports the object, takes the name and starts delivering
   // requests on the bus thread. Throws sdbus::Error when the bus refuses.
   void resume();
@@ -45,6 +52,8 @@ class ServiceListener {
   std::string serviceName_;
   SoftwareMap& softwareMap_;
   std::shared_ptr<AssetServiceDelegate> delegate_;
+  std::shared_ptr<DialogAgentRegistry> dialogAgents_;
+  std::shared_ptr<StoreRuntimeInterface> storeRuntime_;
   std::unique_ptr<sdbus::IConnection> connection_;
   std::unique_ptr<sdbus::IObject> object_;
   std::shared_ptr<RemoteObjects> remoteObjects_;

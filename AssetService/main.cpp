@@ -6,12 +6,15 @@
 #include <string>
 
 #include "AssetService/AssetServiceDelegate.h"
+#include "AssetService/DialogAgentRegistry.h"
 #include "AssetService/ServiceListener.h"
+#include "AssetService/StoreRuntimeInterface.h"
 #include "notifications/UserNotificationCenterDelegate.h"
 #include "platform/Confinement.h"
 #include "platform/RunLoop.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/TillLogManager.h"
+#include "store-runtime/VendRuntime.h"
 
 namespace {
 
@@ -42,6 +45,11 @@ int main(int argc, const char** argv) {
   // Never released: the listener serves until the process ends.
   static ServiceListener listener(daemonMode ? kDaemonServiceName : kServiceName, softwareMap);
   listener.setDelegate(delegate);
+  // Dialogs of the runtime go to the agents that clients register.
+  auto dialogAgents = std::make_shared<DialogAgentRegistry>();
+  VendRuntime::shared()->setDialogPresenter(dialogAgents);
+  listener.setDialogAgentRegistry(dialogAgents);
+  listener.setStoreRuntimeInterface(std::make_shared<StoreRuntimeInterface>());
   try {
     listener.resume();
   } catch (const std::exception& error) {

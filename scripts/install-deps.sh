@@ -5,7 +5,7 @@ set -euo pipefail
 
 packages=(
   build-essential cmake ninja-build pkg-config git
-  libplist++-dev libplist-dev zlib1g-dev libcurl4-openssl-dev
+  libplist++-dev libplist-dev zlib1g-dev libcurl4-openssl-dev libssl-dev libarchive-dev
   libsdbus-c++-dev libsdbus-c++-bin libsystemd-dev dbus
   libcpp-httplib-dev libcli11-dev nlohmann-json3-dev uuid-dev
   libgtest-dev libgmock-dev libbenchmark-dev

@@ -2,10 +2,14 @@
 
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 
+#include "platform/ApplicationRegistry.h"
+#include "platform/Bundle.h"
 #include "platform/Environment.h"
 #include "platform/FileIO.h"
+#include "store-runtime/VendPurchaseRecord.h"
 
 namespace larder {
 
@@ -14,6 +18,69 @@ bool VendFileManager::isUpdatableAtPath(const std::string& path) {
   if (!std::filesystem::is_directory(path, code)) return false;
   std::string parent = std::filesystem::path(path).parent_path().string();
   return ::access(path.c_str(), W_OK) == 0 && ::access(parent.c_str(), W_OK) == 0;
+}
+
+namespace {
+
+constexpr std::string_view kBundleExtension = ".app";
+
+bool endsWith(std::string_view text, std::string_view suffix) {
+  return text.size() >= suffix.size() && text.substr(text.size() - suffix.size()) == suffix;
+}
+
+std::string lastPathComponent(const std::string& path) {
+  std::filesystem::path plain(path);
+  while (plain.has_parent_path() && !plain.has_filename()) plain = plain.parent_path();
+  return plain.filename().string();
+}
+
+// Below one of the application folders, and not inside another bundle
+// (a helper bundle inside an application is the application's business).
+bool isInApplicationFolder(const std::string& path) {
+  for (const std::string& folder : ApplicationRegistry::applicationFolders()) {
+    std::string prefix = folder.back() == '/' ? folder : folder + "/";
+    if (path.size() <= prefix.size() || path.compare(0, prefix.size(), prefix) != 0) continue;
+    std::filesystem::path inside = std::filesystem::path(path.substr(prefix.size())).parent_path();
+    bool nested = std::any_of(inside.begin(), inside.end(), [](const std::filesystem::path& part) {
+      return endsWith(part.string(), kBundleExtension) || part == "..";
+    });
+    if (!nested) return true;
+  }
+  return false;
+}
+
+const std::string* nonEmptyString(const PlistValue& value) {
+  const std::string* text = value.string();
+  return text && !text->empty() ? text : nullptr;
+}
+
+}  // namespace
+
+bool VendFileManager::isQuaymartAppAtPath(const std::string& path) {
+  return VendPurchaseRecord::purchaseRecordFromBundleAtPath(path).has_value();
+}
+
+bool VendFileManager::isInstallableAtPath(const std::string& givenPath) {
+  std::string path = givenPath;
+  while (path.size() > 1 && path.back() == '/') path.pop_back();
+  std::error_code code;
+  if (!endsWith(lastPathComponent(path), kBundleExtension)) return false;
+  if (std::filesystem::is_symlink(path, code)) return false;
+  if (!isInApplicationFolder(path)) return false;
+  return isUpdatableAtPath(path);
+}
+
+std::string VendFileManager::displayNameAtPath(const std::string& path) {
+  if (std::optional<Bundle> bundle = Bundle::open(path)) {
+    for (std::string_view key : {"HostBundleDisplayName", "HostBundleName"}) {
+      if (const std::string* name = nonEmptyString(bundle->infoValue(key))) return *name;
+    }
+  }
+  std::string name = lastPathComponent(path);
+  if (endsWith(name, kBundleExtension) && name.size() > kBundleExtension.size()) {
+    name.resize(name.size() - kBundleExtension.size());
+  }
+  return name;
 }
 
 std::string VendFileManager::cacheDirectoryPathWithName(std::string_view name) {

@@ -9,8 +9,11 @@
 #include "AssetService/DBusValueCodec.h"
 #include "AssetService/RequestTable.h"
 #include "AssetService/ServiceClient.h"
+#include "tools/larderctl/DialogAgentCommand.h"
+#include "tools/larderctl/DialogCommand.h"
 #include "tools/larderctl/JsonConversion.h"
 #include "tools/larderctl/ProductPrinter.h"
+#include "tools/larderctl/StoreCommands.h"
 
 namespace {
 
@@ -123,6 +126,21 @@ int runCall(const GlobalOptions& options, const std::string& member,
   return 0;
 }
 
+int runAgent(const GlobalOptions& options, const DialogAgentOptions& agentOptions) {
+  DialogAgentCommand::blockTerminationSignals();
+  ServiceClient client = connect(options);
+  return DialogAgentCommand(client, agentOptions).run();
+}
+
+int runDialog(const GlobalOptions& options, const DialogCommandOptions& dialogOptions,
+              bool timeoutGiven) {
+  ServiceClient client = connect(options);
+  const std::uint64_t timeout = timeoutGiven
+                                    ? static_cast<std::uint64_t>(options.timeoutSeconds * 1e6)
+                                    : DialogCommand::kDefaultTimeoutMicroseconds;
+  return DialogCommand(client, options.json).run(dialogOptions, timeout);
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -133,7 +151,8 @@ int main(int argc, char** argv) {
   app.add_flag("--json", options.json, "print JSON instead of tables");
   app.add_flag("--daemon", options.daemon, "talk to com.orvane.larderd.daemon");
   app.add_option("--client-type", options.clientType, "store client type to present (0-4)");
-  app.add_option("--timeout", options.timeoutSeconds, "seconds to wait for a reply");
+  auto* timeoutOption =
+      app.add_option("--timeout", options.timeoutSeconds, "seconds to wait for a reply");
 
   auto* products = app.add_subcommand("products", "list the installed store software");
   auto* product = app.add_subcommand("product", "show one product");
@@ -155,12 +174,74 @@ int main(int argc, char** argv) {
       ->required();
   call->add_option("arguments", words, "arguments; containers as JSON");
 
+  auto* agent = app.add_subcommand(
+      "agent", "answer the service's dialogs, at the terminal or with a fixed answer");
+  DialogAgentOptions agentOptions;
+  agent->add_option("--answer", agentOptions.answer, "answer every dialog so: ok, cancel or other")
+      ->check(CLI::IsMember({"ok", "cancel", "other"}));
+  auto* accountOption =
+      agent->add_option("--account", agentOptions.accountName, "account name for sign-in dialogs");
+  auto* passwordOption =
+      agent->add_option("--password", agentOptions.password, "password for sign-in dialogs");
+  accountOption->needs(passwordOption);
+  passwordOption->needs(accountOption);
+  agent->add_option("--count", agentOptions.count, "exit after this many dialogs");
+  agent->add_option("--delay", agentOptions.delaySeconds,
+                    "seconds to wait before giving a fixed answer");
+  agent->callback([&] {
+    agentOptions.json = options.json;
+    if (agentOptions.answer.empty() &&
+        (accountOption->count() > 0 || agentOptions.delaySeconds > 0)) {
+      throw CLI::ValidationError("--account, --password and --delay go with --answer");
+    }
+  });
+  auto* dialog =
+      app.add_subcommand("dialog", "show a dialog through the service and print its exit code");
+  DialogCommandOptions dialogOptions;
+  dialog->add_option("--message", dialogOptions.message, "title of the dialog")->required();
+  dialog->add_option("--explanation", dialogOptions.explanation, "body text");
+  dialog->add_option("--ok", dialogOptions.okButton, "title of the OK button (exit code 1)");
+  dialog->add_option("--cancel", dialogOptions.cancelButton,
+                     "title of the cancel button (exit code 0)");
+  dialog->add_option("--other", dialogOptions.otherButton,
+                     "title of the other button (exit code 2)");
+
+  auto* signin = app.add_subcommand("signin", "sign an account in with the store");
+  std::string accountName;
+  std::optional<std::string> password;
+  signin->add_option("account", accountName, "account name")->required();
+  signin->add_option("--password", password, "password (read from standard input when not given)");
+  auto* signout = app.add_subcommand("signout", "sign the primary account out");
+  auto* account = app.add_subcommand("account", "show the primary account");
+  auto* purchase = app.add_subcommand("purchase", "buy an item and install its download");
+  std::uint64_t purchaseItem = 0;
+  std::string buyParameters;
+  purchase->add_option("item", purchaseItem, "store item identifier")->required();
+  purchase->add_option("--buy-params", buyParameters,
+                       "the store's buy parameters (default itemId=ITEM)");
+  auto* downloads = app.add_subcommand("downloads", "list the downloads in progress");
+  std::int64_t downloadMask = 3;
+  downloads->add_option("--mask", downloadMask,
+                        "download types: 1 install, 2 stage (default both)");
+
   CLI11_PARSE(app, argc, argv);
   try {
     if (products->parsed()) return runProducts(options);
     if (product->parsed()) return runProduct(options, bundleIdentifier, itemIdentifier);
     if (watch->parsed()) return runWatch(options);
     if (call->parsed()) return runCall(options, member, words);
+    if (agent->parsed()) return runAgent(options, agentOptions);
+    if (dialog->parsed()) return runDialog(options, dialogOptions, timeoutOption->count() > 0);
+    if (signin->parsed() || signout->parsed() || account->parsed() || purchase->parsed() ||
+        downloads->parsed()) {
+      ServiceClient client = connect(options);
+      StoreCommands store(client, options.json);
+      if (signin->parsed()) return store.signIn(accountName, password);
+      if (signout->parsed()) return store.signOut();
+      if (account->parsed()) return store.account();
+      if (purchase->parsed()) return store.purchase(purchaseItem, buyParameters);
+      return store.downloads(downloadMask);
+    }
   } catch (const sdbus::Error& error) {
     std::cerr << "larderctl: " << error.getName() << ": " << error.getMessage() << std::endl;
     return 1;

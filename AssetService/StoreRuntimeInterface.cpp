@@ -1,0 +1,145 @@
+#include "AssetService/StoreRuntimeInterface.h"
+
+#include <map>
+#include <string>
+#include <vector>
+
+#include <sdbus-c++/Error.h>
+
+#include "AssetService/DBusValueCodec.h"
+#include "store-runtime/TillDownload.h"
+#include "store-runtime/TillLogManager.h"
+#include "store-runtime/TillPurchase.h"
+#include "store-runtime/VendAccountService.h"
+#include "store-runtime/VendDownloadService.h"
+#include "store-runtime/VendServiceProxy.h"
+#include "store-runtime/VendTransactionService.h"
+
+namespace larder {
+namespace {
+
+constexpr std::string_view kSpeaker = "StoreRuntimeInterface";
+
+const std::vector<BusMethod>& methodTable() {
+  static const std::vector<BusMethod> table{
+      {"SignIn", "ss", {"accountName", "password"}, "bta{sv}", {"success", "accountID", "error"}},
+      {"SignOut", "", {}, "", {}},
+      {"PrimaryAccount", "", {}, "a{sv}", {"account"}},
+      {"Purchase",
+       "ts",
+       {"itemIdentifier", "buyParameters"},
+       "ba{sv}aa{sv}",
+       {"success", "error", "downloads"}},
+      {"Downloads", "x", {"typeMask"}, "aa{sv}", {"downloads"}},
+  };
+  return table;
+}
+
+VendServiceProxy toolProxy() {
+  return VendServiceProxy(
+      VendStoreClient::initWithStoreClientType(VendStoreClient::kStoreApplication));
+}
+
+PlistDictionary errorDictionary(const OptionalError& error) {
+  return error ? error->toDictionary() : PlistDictionary{};
+}
+
+void reply(sdbus::MethodCall& call, std::string_view signature, const PlistArray& values) {
+  if (call.doesntExpectReply()) return;
+  try {
+    sdbus::MethodReply answer = call.createReply();
+    DBusValueCodec::writeAll(answer, signature, values);
+    answer.send();
+  } catch (const sdbus::Error& error) {
+    TILL_LOG(2, "%@: Answer to %@ not delivered: %@", kSpeaker, call.getSender(),
+             error.getMessage());
+  }
+}
+
+PlistArray downloadList(const std::vector<std::shared_ptr<TillDownload>>& downloads) {
+  PlistArray list;
+  for (const auto& download : downloads) list.emplace_back(download->toDictionary());
+  return list;
+}
+
+}  // namespace
+
+std::span<const BusMethod> StoreRuntimeInterface::methods() {
+  return methodTable();
+}
+
+const BusMethod* StoreRuntimeInterface::findMethod(std::string_view member) {
+  for (const BusMethod& method : methodTable()) {
+    if (method.member == member) return &method;
+  }
+  return nullptr;
+}
+
+void StoreRuntimeInterface::exportOn(sdbus::IObject& object) {
+  using Handler = void (StoreRuntimeInterface::*)(sdbus::MethodCall);
+  const std::map<std::string_view, Handler> handlers{
+      {"SignIn", &StoreRuntimeInterface::signIn},
+      {"SignOut", &StoreRuntimeInterface::signOut},
+      {"PrimaryAccount", &StoreRuntimeInterface::primaryAccount},
+      {"Purchase", &StoreRuntimeInterface::purchase},
+      {"Downloads", &StoreRuntimeInterface::downloads},
+  };
+  for (const BusMethod& method : methods()) {
+    Handler handler = handlers.at(method.member);
+    object.registerMethod(std::string(kInterfaceName), std::string(method.member),
+                          std::string(method.inSignature), method.inNames,
+                          std::string(method.outSignature), method.outNames,
+                          [self = shared_from_this(), handler = handler](sdbus::MethodCall call) {
+                            try {
+                              ((*self).*handler)(call);
+                            } catch (const sdbus::Error& error) {
+                              call.createErrorReply(error).send();
+                            }
+                          });
+  }
+}
+
+void StoreRuntimeInterface::signIn(sdbus::MethodCall call) {
+  const PlistArray arguments = DBusValueCodec::readAll(call, "ss");
+  toolProxy().accountService()->signIn(
+      *arguments[0].string(), *arguments[1].string(),
+      [call](bool success, std::uint64_t accountID, const OptionalError& error) mutable {
+        reply(call, "bta{sv}", {success, accountID, errorDictionary(error)});
+      });
+}
+
+void StoreRuntimeInterface::signOut(sdbus::MethodCall call) {
+  toolProxy().accountService()->signOut();
+  reply(call, "", {});
+}
+
+void StoreRuntimeInterface::primaryAccount(sdbus::MethodCall call) {
+  toolProxy().accountService()->primaryAccount([call](std::optional<VendAccount> account) mutable {
+    reply(call, "a{sv}", {account ? account->toDictionary() : PlistDictionary{}});
+  });
+}
+
+void StoreRuntimeInterface::purchase(sdbus::MethodCall call) {
+  const PlistArray arguments = DBusValueCodec::readAll(call, "ts");
+  TillPurchase purchase = TillPurchase::purchaseWithBuyParameters(*arguments[1].string());
+  purchase.setItemIdentifier(arguments[0].uint64Value());
+  purchase.setPurchaseType(2);  // started by the user
+  toolProxy().transactionService()->performPurchase(
+      std::move(purchase), {}, 0,
+      [call](const std::optional<TillPurchaseResponse>& response, bool success,
+             const OptionalError& error) mutable {
+        reply(call, "ba{sv}aa{sv}",
+              {success, errorDictionary(error),
+               response ? downloadList(response->downloads()) : PlistArray{}});
+      });
+}
+
+void StoreRuntimeInterface::downloads(sdbus::MethodCall call) {
+  const std::int64_t mask = DBusValueCodec::read(call, "x").int64Value();
+  toolProxy().downloadService()->downloadsWithTypeMask(
+      mask, [call](std::vector<std::shared_ptr<TillDownload>> downloads) mutable {
+        reply(call, "aa{sv}", {downloadList(downloads)});
+      });
+}
+
+}  // namespace larder

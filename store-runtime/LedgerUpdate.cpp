@@ -1,0 +1,216 @@
+#include "store-runtime/LedgerUpdate.h"
+
+#include "platform/KeyedArchive.h"
+#include "store-runtime/RecordFieldReader.h"
+
+namespace larder {
+
+namespace {
+
+constexpr std::string_view kDictionaryKey = "dictionary";
+
+enum class Kind { Identifier, String, Date, Boolean, Integer };
+
+// How a field by name maps to a key of the item. One table serves the
+// check of an item, the wire form and its reading, so the three cannot
+// drift apart.
+struct ItemField {
+  std::string_view fieldName;
+  std::string_view itemKey;
+  Kind kind;
+};
+
+constexpr ItemField kItemFields[] = {
+    {"itemIdentifier", LedgerUpdate::kWareIDKey, Kind::Identifier},
+    {"bundleID", LedgerUpdate::kBundleIDKey, Kind::String},
+    {"title", LedgerUpdate::kTitleKey, Kind::String},
+    {"version", LedgerUpdate::kVersionKey, Kind::String},
+    {"actionParams", LedgerUpdate::kActionParamsKey, Kind::String},
+    {"releaseDate", LedgerUpdate::kReleaseDateKey, Kind::Date},
+    {"isStaged", LedgerUpdate::kIsStagedKey, Kind::Boolean},
+    {"hasBeenSeenByUser", LedgerUpdate::kHasBeenSeenByUserKey, Kind::Boolean},
+    {"autoUpdateAbortCode", LedgerUpdate::kAutoUpdateAbortCodeKey, Kind::Integer},
+    {"firstAutoUpdateAttemptDate", LedgerUpdate::kFirstAutoUpdateAttemptDateKey, Kind::Date},
+    {"didFailToAutoInstall", LedgerUpdate::kDidFailToAutoInstallKey, Kind::Boolean},
+};
+
+// The value under `key` in the type its kind has on the wire; nullopt when
+// absent, and a failed reader when of the wrong type.
+std::optional<PlistValue> readKind(RecordFieldReader& reader, std::string_view key, Kind kind) {
+  auto boxed = [](const auto& value) -> std::optional<PlistValue> {
+    if (!value) return std::nullopt;
+    return PlistValue(*value);
+  };
+  switch (kind) {
+    case Kind::Identifier:
+      return boxed(reader.unsignedInteger(key));
+    case Kind::String:
+      return boxed(reader.string(key));
+    case Kind::Date:
+      return boxed(reader.date(key));
+    case Kind::Boolean:
+      return boxed(reader.boolean(key));
+    case Kind::Integer:
+      return boxed(reader.integer(key));
+  }
+  return std::nullopt;
+}
+
+// Marks that are plain values are always sent, so a client need not know
+// their defaults; the store's fields and the date are sent only when known.
+std::optional<PlistValue> defaultOnWire(Kind kind) {
+  switch (kind) {
+    case Kind::Boolean:
+      return PlistValue(false);
+    case Kind::Integer:
+      return PlistValue(std::int64_t{0});
+    default:
+      return std::nullopt;
+  }
+}
+
+}  // namespace
+
+bool LedgerUpdate::isValidItem(const PlistDictionary& item) {
+  RecordFieldReader reader(item);
+  for (const ItemField& field : kItemFields) readKind(reader, field.itemKey, field.kind);
+  return reader.ok() && reader.unsignedInteger(kWareIDKey).value_or(0) > 0;
+}
+
+std::shared_ptr<LedgerUpdate> LedgerUpdate::initWithDictionary(PlistDictionary item) {
+  if (!isValidItem(item)) return nullptr;
+  return std::make_shared<LedgerUpdate>(Validated{}, std::move(item));
+}
+
+const PlistValue& LedgerUpdate::valueForKey(std::string_view key) const {
+  const auto found = item_.find(key);
+  return found == item_.end() ? PlistValue::null() : found->second;
+}
+
+std::optional<std::string> LedgerUpdate::stringForKey(std::string_view key) const {
+  RecordFieldReader reader(item_);
+  return reader.string(key);
+}
+
+bool LedgerUpdate::boolForKey(std::string_view key) const {
+  RecordFieldReader reader(item_);
+  return reader.boolean(key).value_or(false);
+}
+
+const PlistValue& LedgerUpdate::itemIdentifier() const {
+  return valueForKey(kWareIDKey);
+}
+
+std::uint64_t LedgerUpdate::itemIdentifierValue() const {
+  return valueForKey(kWareIDKey).uint64Value();
+}
+
+std::optional<std::string> LedgerUpdate::bundleID() const {
+  return stringForKey(kBundleIDKey);
+}
+std::optional<std::string> LedgerUpdate::title() const {
+  return stringForKey(kTitleKey);
+}
+std::optional<std::string> LedgerUpdate::version() const {
+  return stringForKey(kVersionKey);
+}
+std::optional<std::string> LedgerUpdate::actionParams() const {
+  return stringForKey(kActionParamsKey);
+}
+
+std::optional<PlistDate> LedgerUpdate::releaseDate() const {
+  RecordFieldReader reader(item_);
+  return reader.date(kReleaseDateKey);
+}
+
+bool LedgerUpdate::isStaged() const {
+  return boolForKey(kIsStagedKey);
+}
+void LedgerUpdate::setIsStaged(bool staged) {
+  item_.insert_or_assign(std::string(kIsStagedKey), staged);
+}
+
+bool LedgerUpdate::hasBeenSeenByUser() const {
+  return boolForKey(kHasBeenSeenByUserKey);
+}
+void LedgerUpdate::setHasBeenSeenByUser(bool seen) {
+  item_.insert_or_assign(std::string(kHasBeenSeenByUserKey), seen);
+}
+
+std::int64_t LedgerUpdate::autoUpdateAbortCode() const {
+  RecordFieldReader reader(item_);
+  return reader.integer(kAutoUpdateAbortCodeKey).value_or(0);
+}
+void LedgerUpdate::setAutoUpdateAbortCode(std::int64_t code) {
+  item_.insert_or_assign(std::string(kAutoUpdateAbortCodeKey), code);
+}
+
+std::optional<PlistDate> LedgerUpdate::firstAutoUpdateAttemptDate() const {
+  RecordFieldReader reader(item_);
+  return reader.date(kFirstAutoUpdateAttemptDateKey);
+}
+void LedgerUpdate::setFirstAutoUpdateAttemptDate(std::optional<PlistDate> date) {
+  if (date) {
+    item_.insert_or_assign(std::string(kFirstAutoUpdateAttemptDateKey), *date);
+  } else {
+    item_.erase(std::string(kFirstAutoUpdateAttemptDateKey));
+  }
+}
+
+bool LedgerUpdate::didFailToAutoInstall() const {
+  return boolForKey(kDidFailToAutoInstallKey);
+}
+void LedgerUpdate::setDidFailToAutoInstall(bool failed) {
+  item_.insert_or_assign(std::string(kDidFailToAutoInstallKey), failed);
+}
+
+PlistDictionary LedgerUpdate::encodeWithCoder() const {
+  PlistDictionary encoded = KeyedArchive::record(kClassName);
+  encoded.emplace(kDictionaryKey, item_);
+  return encoded;
+}
+
+std::shared_ptr<LedgerUpdate> LedgerUpdate::initWithCoder(const PlistValue& encoded) {
+  if (KeyedArchive::classNameOf(encoded) != kClassName) return nullptr;
+  const PlistDictionary* item = encoded[kDictionaryKey].dictionary();
+  return item ? initWithDictionary(*item) : nullptr;
+}
+
+PlistDictionary LedgerUpdate::toDictionary() const {
+  PlistDictionary wire;
+  RecordFieldReader reader(item_);
+  for (const ItemField& field : kItemFields) {
+    std::optional<PlistValue> value = readKind(reader, field.itemKey, field.kind);
+    if (!value) value = defaultOnWire(field.kind);
+    if (value) wire.emplace(field.fieldName, std::move(*value));
+  }
+  wire.emplace(kDictionaryKey, item_);
+  return wire;
+}
+
+std::shared_ptr<LedgerUpdate> LedgerUpdate::fromDictionary(const PlistDictionary& dictionary) {
+  RecordFieldReader reader(dictionary);
+  PlistDictionary item = reader.dictionary(kDictionaryKey).value_or(PlistDictionary{});
+  if (!reader.ok()) return nullptr;
+  RecordFieldReader itemReader(item);
+  for (const ItemField& field : kItemFields) {
+    std::optional<PlistValue> sent = readKind(reader, field.fieldName, field.kind);
+    if (!sent) continue;
+    // A value that only repeats what the item already says (a default
+    // included) leaves the item as it is, so the item round-trips exactly.
+    std::optional<PlistValue> current = readKind(itemReader, field.itemKey, field.kind);
+    if (!current) current = defaultOnWire(field.kind);
+    if (sent != current) item.insert_or_assign(std::string(field.itemKey), std::move(*sent));
+  }
+  if (!reader.ok() || !itemReader.ok()) return nullptr;
+  return initWithDictionary(std::move(item));
+}
+
+std::string LedgerUpdate::description() const {
+  return "<LedgerUpdate: itemIdentifier=" + std::to_string(itemIdentifierValue()) +
+         " bundleID=" + bundleID().value_or("(null)") + " version=" + version().value_or("(null)") +
+         " title=" + title().value_or("(null)") + " isStaged=" + (isStaged() ? "1" : "0") +
+         " abortCode=" + std::to_string(autoUpdateAbortCode()) + ">";
+}
+
+}  // namespace larder

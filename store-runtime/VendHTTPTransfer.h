@@ -1,0 +1,53 @@
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <span>
+#include <string>
+
+#include "platform/PlistValue.h"
+#include "store-runtime/VendError.h"
+#include "store-runtime/VendURLRequest.h"
+#include "store-runtime/VendURLResponse.h"
+
+namespace larder {
+
+// One HTTP exchange over libcurl. Every transfer ends: the connection has
+// a time limit of its own, and a transfer that makes no progress for the
+// request's `timeoutInterval` fails, so a synchronous caller never hangs on
+// a lost reply. gzip and deflate answers are decoded on the way in.
+class VendHTTPTransfer {
+ public:
+  struct Options {
+    // Receives the body piece by piece; returning false aborts the
+    // transfer with a cancellation error. Without it the body is collected.
+    std::function<bool(std::span<const std::uint8_t>)> onData;
+    // Called with the head once it has arrived, before any body.
+    std::function<void(const VendURLResponse&)> onResponse;
+    // Bytes received so far and expected in all (0 while unknown); returning
+    // false aborts the transfer with a cancellation error.
+    std::function<bool(std::uint64_t received, std::uint64_t expected)> onProgress;
+    // Asks for the body from this offset on (HTTP range request).
+    std::uint64_t resumeFrom = 0;
+    std::chrono::milliseconds connectTimeout{10000};
+    // Largest body collected in memory when there is no `onData`.
+    std::size_t maximumBodySize = 64u << 20u;
+  };
+
+  struct Result {
+    VendURLResponse response;
+    PlistData body;  // empty when `onData` took it
+    OptionalError error;
+  };
+
+  // Errors: domain "VendHTTPErrorDomain" with curl's code for transport
+  // failures (the description is curl's text), -128 when a callback
+  // aborted. An HTTP status is not an error here; callers judge it.
+  static Result perform(const VendURLRequest& request, const Options& options);
+  static Result perform(const VendURLRequest& request);
+
+  static constexpr std::string_view kErrorDomain = "VendHTTPErrorDomain";
+};
+
+}  // namespace larder

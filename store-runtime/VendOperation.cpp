@@ -1,0 +1,128 @@
+#include "store-runtime/VendOperation.h"
+
+#include <exception>
+
+#include "store-runtime/TillLogManager.h"
+#include "store-runtime/VendAccountStore.h"
+#include "store-runtime/VendRuntime.h"
+#include "store-runtime/VendServiceProxy.h"
+#include "store-runtime/VendURLBag.h"
+
+namespace larder {
+namespace {
+constexpr std::string_view kSpeaker = "VendOperation";
+}
+
+VendOperation::VendOperation(VendStoreClient storeClient) : storeClient_(std::move(storeClient)) {}
+
+void VendOperation::setSuccess(bool success) {
+  std::lock_guard lock(mutex_);
+  success_ = success;
+}
+
+bool VendOperation::success() const {
+  std::lock_guard lock(mutex_);
+  return success_;
+}
+
+void VendOperation::setError(OptionalError error) {
+  std::lock_guard lock(mutex_);
+  error_ = std::move(error);
+}
+
+OptionalError VendOperation::error() const {
+  std::lock_guard lock(mutex_);
+  return error_;
+}
+
+void VendOperation::setCompletionHandler(CompletionHandler handler) {
+  std::lock_guard lock(mutex_);
+  completionHandler_ = std::move(handler);
+}
+
+void VendOperation::setDelegate(std::shared_ptr<VendOperationDelegate> delegate) {
+  std::lock_guard lock(mutex_);
+  delegate_ = std::move(delegate);
+}
+
+std::shared_ptr<VendOperationDelegate> VendOperation::delegate() const {
+  std::lock_guard lock(mutex_);
+  return delegate_;
+}
+
+bool VendOperation::isCancelled() const {
+  if (cancelled_) return true;
+  const VendOperation* parent = parent_.load();
+  return parent != nullptr && parent->isCancelled();
+}
+
+std::shared_ptr<VendServiceProxy> VendOperation::serviceProxy() {
+  std::lock_guard lock(mutex_);
+  if (!serviceProxy_) serviceProxy_ = std::make_shared<VendServiceProxy>(storeClient_);
+  return serviceProxy_;
+}
+
+std::optional<VendAccount> VendOperation::storeAccount() {
+  return serviceProxy()->runtime()->accountStore().primaryAccount();
+}
+
+PlistValue VendOperation::valueForURLBagKey(std::string_view key) {
+  return serviceProxy()->runtime()->urlBag().valueForKey(requiredBagType(), key);
+}
+
+void VendOperation::reportProgress(double fraction) {
+  if (auto observer = delegate()) observer->operationUpdatedProgress(*this, fraction);
+}
+
+bool VendOperation::runSubOperation(VendOperation& subOperation, OptionalError* error) {
+  subOperation.parent_ = this;
+  subOperation.start();
+  subOperation.parent_ = nullptr;
+  if (error) *error = subOperation.error();
+  return subOperation.success();
+}
+
+bool VendOperation::runSyncReturningError(OptionalError* error) {
+  start();
+  if (error) *error = this->error();
+  return success();
+}
+
+void VendOperation::start() {
+  if (started_.exchange(true)) return;
+  runOnce();
+  finish();
+}
+
+void VendOperation::runOnce() {
+  try {
+    run();
+  } catch (const std::exception& exception) {
+    TILL_LOG(1, "%@: Exception running %@ - %@", kSpeaker, storeClient_.identifier(),
+             exception.what());
+    setSuccess(false);
+  } catch (...) {
+    TILL_LOG(1, "%@: Unknown exception running %@", kSpeaker, storeClient_.identifier());
+    setSuccess(false);
+  }
+}
+
+void VendOperation::finish() {
+  CompletionHandler handler;
+  bool succeeded = false;
+  OptionalError failure;
+  {
+    std::lock_guard lock(mutex_);
+    handler = std::move(completionHandler_);
+    completionHandler_ = nullptr;
+    succeeded = success_;
+    failure = error_;
+  }
+  if (auto observer = delegate()) {
+    if (!succeeded && failure) observer->operationFailedWithError(*this, *failure);
+    observer->operationFinished(*this);
+  }
+  if (handler) handler(*this, succeeded, failure);
+}
+
+}  // namespace larder

@@ -1,0 +1,86 @@
+#include "store-runtime/VendRuntime.h"
+
+#include <cstdlib>
+
+#include "platform/DispatchQueue.h"
+#include "platform/Environment.h"
+#include "store-runtime/VendAccountStore.h"
+#include "store-runtime/VendCancellingDialogPresenter.h"
+#include "store-runtime/VendDownloadManager.h"
+#include "store-runtime/VendURLBag.h"
+
+namespace larder {
+namespace {
+
+std::mutex& sharedRuntimeMutex() {
+  static std::mutex mutex;
+  return mutex;
+}
+
+std::shared_ptr<VendRuntime>& sharedRuntimeSlot() {
+  static std::shared_ptr<VendRuntime> runtime;
+  return runtime;
+}
+
+}  // namespace
+
+VendRuntimeConfiguration VendRuntimeConfiguration::fromEnvironment() {
+  VendRuntimeConfiguration configuration;
+  configuration.bagURL = Environment::variable("LARDER_STORE_URL");
+  configuration.stateDirectory = Environment::stateDirectory();
+  configuration.downloadsDirectory = Environment::cacheHome() + "/com.orvane.larderd/Downloads";
+  const std::string timeout = Environment::variable("LARDER_STORE_TIMEOUT");
+  if (!timeout.empty()) {
+    const double seconds = std::strtod(timeout.c_str(), nullptr);
+    if (seconds > 0) configuration.requestTimeout = seconds;
+  }
+  return configuration;
+}
+
+VendRuntime::VendRuntime(VendRuntimeConfiguration configuration)
+    : configuration_(std::move(configuration)),
+      urlBag_(std::make_unique<VendURLBag>(configuration_)),
+      accountStore_(std::make_unique<VendAccountStore>(configuration_)),
+      downloadManager_(std::make_unique<VendDownloadManager>(configuration_)),
+      serviceQueue_(DispatchQueue::create(
+          "com.orvane.larderd.VendServices", DispatchQueue::Kind::Concurrent,
+          {.concurrentWorkers = 16, .idleTimeout = std::chrono::seconds(10)})) {}
+
+VendRuntime::~VendRuntime() = default;
+
+std::shared_ptr<VendRuntime> VendRuntime::shared() {
+  std::lock_guard lock(sharedRuntimeMutex());
+  auto& runtime = sharedRuntimeSlot();
+  if (!runtime)
+    runtime = std::make_shared<VendRuntime>(VendRuntimeConfiguration::fromEnvironment());
+  return runtime;
+}
+
+void VendRuntime::setShared(std::shared_ptr<VendRuntime> runtime) {
+  std::lock_guard lock(sharedRuntimeMutex());
+  sharedRuntimeSlot() = std::move(runtime);
+}
+
+void VendRuntime::setDialogPresenter(std::shared_ptr<VendDialogPresenter> presenter) {
+  std::lock_guard lock(hooksMutex_);
+  dialogPresenter_ = std::move(presenter);
+}
+
+std::shared_ptr<VendDialogPresenter> VendRuntime::dialogPresenter() const {
+  std::lock_guard lock(hooksMutex_);
+  if (dialogPresenter_) return dialogPresenter_;
+  static const auto cancelling = std::make_shared<VendCancellingDialogPresenter>();
+  return cancelling;
+}
+
+void VendRuntime::setAssetService(std::shared_ptr<VendAssetService> service) {
+  std::lock_guard lock(hooksMutex_);
+  assetService_ = std::move(service);
+}
+
+std::shared_ptr<VendAssetService> VendRuntime::assetService() const {
+  std::lock_guard lock(hooksMutex_);
+  return assetService_;
+}
+
+}  // namespace larder

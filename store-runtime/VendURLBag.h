@@ -1,0 +1,78 @@
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/PlistValue.h"
+#include "store-runtime/VendError.h"
+#include "store-runtime/VendRuntime.h"
+
+namespace larder {
+
+// Told after every load of a bag, whatever its type.
+class VendURLBagObserver {
+ public:
+  virtual ~VendURLBagObserver() = default;
+  virtual void urlBagDidUpdateWithSuccess(bool success, const OptionalError& error) = 0;
+};
+
+// The store's URL bag: a dictionary of request URLs and settings, fetched
+// from the bag URL and kept per bag type. A bag is fetched on first use
+// and again when it has expired (after its "ttl" seconds, default one
+// hour); one fetch per type runs at a time and callers that arrive during
+// it share its result.
+class VendURLBag {
+ public:
+  struct LoadResult {
+    bool success = false;
+    // A fetch took place (rather than the cached bag being used).
+    bool loaded = false;
+    OptionalError error;
+  };
+
+  explicit VendURLBag(const VendRuntimeConfiguration& configuration);
+
+  LoadResult load(std::int64_t bagType, bool force = false);
+  // Null when the bag cannot be had or lacks the key.
+  PlistValue valueForKey(std::int64_t bagType, std::string_view key);
+  // The absolute URL under the key, or an error (code 30 when the key is
+  // missing).
+  std::optional<std::string> urlForKey(std::int64_t bagType, std::string_view key,
+                                       OptionalError* error);
+  bool isValid(std::int64_t bagType);
+  // The regular expression under the key matches the whole text.
+  bool regexWithKeyMatchesString(std::int64_t bagType, std::string_view key, std::string_view text);
+
+  void addObserver(const std::shared_ptr<VendURLBagObserver>& observer);
+  void removeObserver(const std::shared_ptr<VendURLBagObserver>& observer);
+
+  // The URL the bag of a type is fetched from.
+  [[nodiscard]] std::string bagURLForType(std::int64_t bagType) const;
+
+ private:
+  struct Entry {
+    std::mutex fetchMutex;  // one fetch at a time for this type
+    std::optional<PlistDictionary> bag;
+    std::chrono::steady_clock::time_point expiry;
+  };
+
+  Entry& entryForType(std::int64_t bagType);
+  LoadResult fetch(std::int64_t bagType, Entry& entry);
+  std::optional<PlistDictionary> cachedBag(std::int64_t bagType, bool loadIfNeeded);
+  void notifyObservers(const LoadResult& result);
+
+  VendRuntimeConfiguration configuration_;
+  std::mutex mutex_;  // entries_ and the cached bags
+  std::map<std::int64_t, std::unique_ptr<Entry>> entries_;
+  std::mutex observersMutex_;
+  std::vector<std::shared_ptr<VendURLBagObserver>> observers_;
+};
+
+}  // namespace larder

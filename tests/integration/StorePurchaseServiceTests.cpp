@@ -1,0 +1,106 @@
+// Purchases through the running service, the way a person at a terminal
+// makes them: larder-store, larderd on a private bus, larderctl.
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <memory>
+
+#include "tests/integration/LarderctlProcess.h"
+#include "tests/integration/ServiceHarness.h"
+#include "tests/integration/StoreCatalogueBuilder.h"
+#include "tests/integration/StoreServerProcess.h"
+
+namespace larder::testing {
+namespace {
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+
+constexpr char kAccountName[] = "shopper@example.org";
+constexpr char kPassword[] = "open sesame";
+
+class StorePurchaseServiceTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    catalogue_.addAccount({.accountID = 8123, .orvaneID = kAccountName, .password = kPassword});
+    catalogue_.addItem(
+        {.wareID = 901, .bundleID = "com.example.Atlas", .title = "Atlas", .version = "3.1"});
+    store_ = std::make_unique<StoreServerProcess>(catalogue_.directory());
+    fs::create_directories(platform_.root() + "/Applications");
+    service_ = std::make_unique<ServiceProcess>(
+        platform_, bus_, std::vector<std::string>{},
+        std::map<std::string, std::string>{{"LARDER_STORE_URL", store_->bagURL()},
+                                           {"LARDER_STORE_TIMEOUT", "5"}});
+    ASSERT_TRUE(service_->waitUntilServing()) << service_->log();
+  }
+
+  // Runs larderctl to its end; its exit status.
+  int run(const std::vector<std::string>& arguments, std::string* output = nullptr,
+          std::string* errors = nullptr) {
+    Larderctl larderctl(platform_, bus_, arguments, "larderctl-" + std::to_string(++runs_));
+    if (!larderctl.waitForExit(60s)) return -1;
+    const int status = larderctl.process().wait();
+    if (output) *output = larderctl.output();
+    if (errors) *errors = larderctl.errors();
+    return status;
+  }
+
+  [[nodiscard]] std::string bundlePath() const {
+    return platform_.root() + "/Applications/Atlas.app";
+  }
+
+  StoreCatalogueBuilder catalogue_;
+  std::unique_ptr<StoreServerProcess> store_;
+  TemporaryPlatform platform_;
+  PrivateBus bus_;
+  std::unique_ptr<ServiceProcess> service_;
+  int runs_ = 0;
+};
+
+TEST_F(StorePurchaseServiceTest, SignedInPurchaseInstallsTheBundleAndTheMapSeesIt) {
+  std::string output;
+  std::string errors;
+  ASSERT_EQ(run({"signin", kAccountName, "--password", kPassword}, &output, &errors), 0)
+      << errors << service_->log();
+  EXPECT_NE(output.find("account 8123"), std::string::npos) << output;
+  ASSERT_EQ(run({"account"}, &output), 0);
+  EXPECT_NE(output.find(kAccountName), std::string::npos);
+
+  ASSERT_EQ(run({"purchase", "901"}, &output, &errors), 0) << errors << service_->log();
+  EXPECT_NE(output.find("com.example.Atlas"), std::string::npos) << output;
+  ASSERT_TRUE(eventually([&] { return fs::exists(bundlePath() + "/purchase.plist"); }, 20s))
+      << service_->log();
+  EXPECT_TRUE(eventually(
+      [&] {
+        return run({"product", "--bundle-id", "com.example.Atlas"}, &output) == 0;
+      },
+      20s))
+      << service_->log();
+  EXPECT_NE(output.find("3.1"), std::string::npos) << output;
+}
+
+TEST_F(StorePurchaseServiceTest, ADialogAgentSignsTheAccountInWhenAPurchaseNeedsIt) {
+  Larderctl agent(platform_, bus_,
+                  {"agent", "--answer", "ok", "--account", kAccountName, "--password", kPassword},
+                  "agent");
+  ASSERT_TRUE(agent.waitForError("registered")) << agent.errors();
+  std::string errors;
+  ASSERT_EQ(run({"purchase", "901"}, nullptr, &errors), 0) << errors << service_->log();
+  std::string output;
+  ASSERT_EQ(run({"--json", "account"}, &output), 0);
+  EXPECT_NE(output.find("8123"), std::string::npos) << output;
+  EXPECT_TRUE(eventually([&] { return fs::exists(bundlePath() + "/bundle.plist"); }, 20s));
+}
+
+TEST_F(StorePurchaseServiceTest, WithoutAgentOrAccountThePurchaseFailsAsCancelled) {
+  std::string errors;
+  EXPECT_EQ(run({"purchase", "901"}, nullptr, &errors), 1);
+  EXPECT_NE(errors.find("code -128"), std::string::npos) << errors;
+  EXPECT_EQ(store_->requestCount("buy-product"), 0U);
+  EXPECT_FALSE(fs::exists(bundlePath()));
+  EXPECT_EQ(run({"signin", kAccountName, "--password", "wrong"}, nullptr, &errors), 1);
+  EXPECT_NE(errors.find("code 401"), std::string::npos) << errors;
+}
+
+}  // namespace
+}  // namespace larder::testing

@@ -1,0 +1,451 @@
+// The store runtime against the reference store on loopback, in process:
+// purchases, downloads and installs, sign-in, and every way a store can
+// fail.
+#include <gtest/gtest.h>
+
+#include <sys/stat.h>
+
+#include <chrono>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <memory>
+#include <optional>
+#include <thread>
+
+#include "ServiceHarness.h"
+#include "StoreCatalogueBuilder.h"
+#include "StoreServerProcess.h"
+#include "platform/DispatchSemaphore.h"
+#include "store-runtime/TillDownload.h"
+#include "store-runtime/TillPurchase.h"
+#include "store-runtime/VendAccountService.h"
+#include "store-runtime/VendAccountStore.h"
+#include "store-runtime/VendDialogPresenter.h"
+#include "store-runtime/VendDownloadService.h"
+#include "store-runtime/VendRequestSigner.h"
+#include "store-runtime/VendRuntime.h"
+#include "store-runtime/VendServiceProxy.h"
+#include "store-runtime/VendTransactionService.h"
+#include "store-runtime/VendURLBag.h"
+
+namespace larder::testing {
+namespace {
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+
+constexpr std::uint64_t kAccountID = 7001;
+constexpr std::uint64_t kNotesItem = 501;
+constexpr char kAccountName[] = "reader@example.org";
+constexpr char kPassword[] = "correct horse";
+
+// Answers every sign-in dialog with what it was given, and counts them.
+class ScriptedPresenter : public VendDialogPresenter {
+ public:
+  ScriptedPresenter(std::int64_t exitCode, PlistDictionary values)
+      : exitCode_(exitCode), values_(std::move(values)) {}
+  void present(const VendDialog& dialog, Reply reply) override {
+    ++shown;
+    lastKind = dialog.kind();
+    reply({exitCode_, values_});
+  }
+  void dismiss(std::string_view, std::int64_t) override {}
+  std::atomic<int> shown{0};
+  std::atomic<std::int64_t> lastKind{-1};
+
+ private:
+  std::int64_t exitCode_;
+  PlistDictionary values_;
+};
+
+// Points LARDER_ROOT at a private root for the span of a test.
+class RootOverride {
+ public:
+  explicit RootOverride(const std::string& root) {
+    if (const char* value = std::getenv("LARDER_ROOT")) saved_ = value;
+    ::setenv("LARDER_ROOT", root.c_str(), 1);
+  }
+  ~RootOverride() {
+    if (saved_) {
+      ::setenv("LARDER_ROOT", saved_->c_str(), 1);
+    } else {
+      ::unsetenv("LARDER_ROOT");
+    }
+  }
+  RootOverride(const RootOverride&) = delete;
+  RootOverride& operator=(const RootOverride&) = delete;
+
+ private:
+  std::optional<std::string> saved_;
+};
+
+class StoreRuntimeTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    catalogue_.addAccount(
+        {.accountID = kAccountID, .orvaneID = kAccountName, .password = kPassword});
+    catalogue_.addItem({.wareID = kNotesItem,
+                        .bundleID = "com.example.Notes",
+                        .title = "Notes",
+                        .version = "2.0",
+                        .payloadBytes = 3 * 1024 * 1024});
+    // Small chunks, so that the package has several digests to check.
+    catalogue_.setStoreSettings({}, 256 * 1024);
+    fs::create_directories(platform_.root() + "/Applications");
+    root_ = std::make_unique<RootOverride>(platform_.root());
+  }
+
+  void TearDown() override {
+    VendRuntime::setShared(nullptr);
+    root_.reset();
+  }
+
+  // Starts the store with these faults and a runtime that talks to it.
+  void startStore(const std::vector<std::string>& faults = {}, double timeout = 10) {
+    store_ = std::make_unique<StoreServerProcess>(catalogue_.directory(), faults);
+    VendRuntimeConfiguration configuration;
+    configuration.bagURL = store_->bagURL();
+    configuration.stateDirectory = platform_.stateHome() + "/larder";
+    configuration.downloadsDirectory = platform_.cacheHome() + "/com.orvane.larderd/Downloads";
+    configuration.connectTimeout = 2s;
+    configuration.requestTimeout = timeout;
+    runtime_ = std::make_shared<VendRuntime>(configuration);
+    VendRuntime::setShared(runtime_);
+    proxy_ =
+        std::make_unique<VendServiceProxy>(VendStoreClient::initWithStoreClientType(0), runtime_);
+  }
+
+  void signIn() {
+    bool signedIn = false;
+    proxy_->accountServiceSynchronousBlock(
+        [&](VendAccountService& service, DispatchSemaphore& done) {
+          service.signIn(kAccountName, kPassword,
+                         [&](bool success, std::uint64_t, const OptionalError&) {
+                           signedIn = success;
+                           done.signal();
+                         });
+        });
+    ASSERT_TRUE(signedIn);
+  }
+
+  struct PurchaseResult {
+    std::optional<TillPurchaseResponse> response;
+    bool success = false;
+    OptionalError error;
+  };
+  PurchaseResult purchase(std::uint64_t item, std::int64_t options) {
+    PurchaseResult result;
+    auto purchase =
+        TillPurchase::purchaseWithBuyParameters("itemId=" + std::to_string(item) + "&price=0");
+    purchase.setItemIdentifier(item);
+    proxy_->transactionServiceSynchronousBlock(
+        [&](VendTransactionService& service, DispatchSemaphore& done) {
+          service.performPurchase(purchase, {}, options,
+                                  [&](const std::optional<TillPurchaseResponse>& response,
+                                      bool success, const OptionalError& error) {
+                                    result = {response, success, error};
+                                    done.signal();
+                                  });
+        });
+    return result;
+  }
+
+  struct DownloadResult {
+    std::int64_t result = -1;
+    OptionalError error;
+  };
+  DownloadResult install(const std::shared_ptr<TillDownload>& download) {
+    DownloadResult outcome;
+    proxy_->downloadServiceSynchronousBlock(
+        [&](VendDownloadService& service, DispatchSemaphore& done) {
+          service.performDownload(download, 0, [&](std::int64_t result, OptionalError error) {
+            outcome = {result, std::move(error)};
+            done.signal();
+          });
+        });
+    return outcome;
+  }
+
+  // The purchase's one download, to be installed by the test.
+  std::shared_ptr<TillDownload> purchasedDownload() {
+    auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
+    EXPECT_TRUE(result.success) << (result.error ? result.error->descriptionText() : "");
+    if (!result.response || result.response->downloads().size() != 1) return nullptr;
+    auto download = result.response->downloads().front();
+    download->setDownloadType(TillDownload::kInstall);
+    return download;
+  }
+
+  [[nodiscard]] std::string installedBundle() const {
+    return platform_.root() + "/Applications/Notes.app";
+  }
+
+  // Nothing of the bundle under Applications, nothing left among downloads.
+  void expectNothingInstalledOrHalfWritten() const {
+    EXPECT_FALSE(fs::exists(installedBundle()));
+    std::size_t applications = 0;
+    for ([[maybe_unused]] const auto& entry :
+         fs::directory_iterator(platform_.root() + "/Applications")) {
+      ++applications;
+    }
+    EXPECT_EQ(applications, 0U) << "staging left beside the applications";
+    const std::string downloads = runtime_->configuration().downloadsDirectory;
+    if (!fs::exists(downloads)) return;
+    for (const auto& entry : fs::recursive_directory_iterator(downloads)) {
+      EXPECT_FALSE(entry.is_regular_file()) << "left behind: " << entry.path();
+    }
+  }
+
+  StoreCatalogueBuilder catalogue_;
+  TemporaryPlatform platform_;
+  std::unique_ptr<RootOverride> root_;
+  std::unique_ptr<StoreServerProcess> store_;
+  std::shared_ptr<VendRuntime> runtime_;
+  std::unique_ptr<VendServiceProxy> proxy_;
+};
+
+TEST_F(StoreRuntimeTest, PurchaseDownloadsChecksAndInstallsTheBundle) {
+  startStore();
+  signIn();
+  auto download = purchasedDownload();
+  ASSERT_TRUE(download);
+  EXPECT_EQ(download->metadata().bundleIdentifier(), "com.example.Notes");
+  auto outcome = install(download);
+  ASSERT_EQ(outcome.result, 1) << (outcome.error ? outcome.error->descriptionText() : "");
+  EXPECT_TRUE(fs::exists(installedBundle() + "/bundle.plist"));
+  EXPECT_TRUE(fs::exists(installedBundle() + "/purchase.plist"));
+  EXPECT_EQ(store_->requestCount("buy-product"), 1U);
+}
+
+TEST_F(StoreRuntimeTest, PurchaseWithoutOptionsStartsTheInstallItself) {
+  startStore();
+  signIn();
+  auto result = purchase(kNotesItem, 0);
+  ASSERT_TRUE(result.success) << (result.error ? result.error->descriptionText() : "");
+  const auto deadline = std::chrono::steady_clock::now() + 20s;
+  while (!fs::exists(installedBundle() + "/bundle.plist") &&
+         std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(20ms);
+  }
+  EXPECT_TRUE(fs::exists(installedBundle() + "/bundle.plist"));
+}
+
+TEST_F(StoreRuntimeTest, BrokenTransfersEndInClearErrorsWithNothingInstalled) {
+  for (const std::string fault : {"assets=corrupt", "assets=truncate", "assets=500"}) {
+    SCOPED_TRACE(fault);
+    startStore({fault});
+    signIn();
+    auto download = purchasedDownload();
+    ASSERT_TRUE(download);
+    auto outcome = install(download);
+    EXPECT_EQ(outcome.result, 0);
+    ASSERT_TRUE(outcome.error);
+    EXPECT_FALSE(outcome.error->description.empty());
+    expectNothingInstalledOrHalfWritten();
+  }
+}
+
+TEST_F(StoreRuntimeTest, AStoreThatDoesNotAnswerEndsInAnErrorWithinTheTimeLimit) {
+  startStore({"assets=stall", "buy-product=stall"}, 2);
+  signIn();
+  const auto started = std::chrono::steady_clock::now();
+  auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
+  EXPECT_FALSE(result.success);
+  ASSERT_TRUE(result.error);
+  EXPECT_LT(std::chrono::steady_clock::now() - started, 15s);
+  expectNothingInstalledOrHalfWritten();
+}
+
+TEST_F(StoreRuntimeTest, StalledAssetTransferFailsAndLeavesNothing) {
+  startStore({"assets=stall"}, 2);
+  signIn();
+  auto download = purchasedDownload();
+  ASSERT_TRUE(download);
+  const auto started = std::chrono::steady_clock::now();
+  auto outcome = install(download);
+  EXPECT_EQ(outcome.result, 0);
+  EXPECT_TRUE(outcome.error);
+  EXPECT_LT(std::chrono::steady_clock::now() - started, 15s);
+  expectNothingInstalledOrHalfWritten();
+}
+
+TEST_F(StoreRuntimeTest, AnswersThatAreNotPropertyListsOrOfTheWrongShapeGiveErrors) {
+  for (const std::string fault :
+       {"buy-product=not-plist", "buy-product=wrong-shape", "buy-product=500"}) {
+    SCOPED_TRACE(fault);
+    startStore({fault});
+    signIn();
+    auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
+    EXPECT_FALSE(result.success);
+    EXPECT_FALSE(result.response);
+    ASSERT_TRUE(result.error);
+    EXPECT_FALSE(result.error->description.empty());
+  }
+}
+
+TEST_F(StoreRuntimeTest, ABagThatIsNotAPropertyListFailsEveryRequestCleanly) {
+  for (const std::string fault : {"bag=not-plist", "bag=wrong-shape", "bag=500"}) {
+    SCOPED_TRACE(fault);
+    startStore({fault});
+    auto load = runtime_->urlBag().load(0);
+    EXPECT_FALSE(load.success);
+    ASSERT_TRUE(load.error);
+    EXPECT_FALSE(load.error->description.empty());
+    OptionalError error;
+    EXPECT_FALSE(runtime_->urlBag().urlForKey(0, "buy-product", &error));
+    EXPECT_TRUE(error);
+    auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
+    EXPECT_FALSE(result.success);
+    EXPECT_TRUE(result.error);
+    EXPECT_EQ(store_->requestCount("buy-product"), 0U);
+  }
+}
+
+TEST_F(StoreRuntimeTest, ConcurrentCallersShareOneBagFetchAndObserversHearOfIt) {
+  startStore();
+  class CountingObserver : public VendURLBagObserver {
+   public:
+    void urlBagDidUpdateWithSuccess(bool success, const OptionalError&) override {
+      if (success) ++loads;
+    }
+    std::atomic<int> loads{0};
+  };
+  auto observer = std::make_shared<CountingObserver>();
+  runtime_->urlBag().addObserver(observer);
+  std::vector<std::thread> callers;
+  for (int i = 0; i < 10; ++i) {
+    callers.emplace_back(
+        [&] { EXPECT_TRUE(runtime_->urlBag().valueForKey(0, "buy-product").isString()); });
+  }
+  for (auto& caller : callers) caller.join();
+  EXPECT_EQ(store_->requestCount("bag"), 1U);
+  EXPECT_EQ(observer->loads, 1);
+  EXPECT_TRUE(runtime_->urlBag().load(0, true).loaded);
+  EXPECT_EQ(store_->requestCount("bag"), 2U);
+  EXPECT_EQ(observer->loads, 2);
+}
+
+TEST_F(StoreRuntimeTest, AMissingBagKeyIsCode30) {
+  startStore();
+  OptionalError error;
+  EXPECT_FALSE(runtime_->urlBag().urlForKey(0, "no-such-request", &error));
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, 30);
+  EXPECT_TRUE(runtime_->urlBag().urlForKey(0, "buy-product", &error).has_value());
+}
+
+TEST_F(StoreRuntimeTest, APurchaseWithoutAccountAsksTheUserAndRemembersTheAccount) {
+  startStore();
+  auto presenter = std::make_shared<ScriptedPresenter>(
+      VendDialogButton::kOK,
+      PlistDictionary{{"accountName", kAccountName}, {"password", kPassword}});
+  runtime_->setDialogPresenter(presenter);
+  auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
+  ASSERT_TRUE(result.success) << (result.error ? result.error->descriptionText() : "");
+  EXPECT_EQ(presenter->shown, 1);
+  EXPECT_EQ(presenter->lastKind, VendDialog::kSignIn);
+  auto primary = runtime_->accountStore().primaryAccount();
+  ASSERT_TRUE(primary);
+  EXPECT_EQ(primary->accountID, kAccountID);
+  // The account and its key survive in a file only the user can read.
+  struct stat info {};
+  ASSERT_EQ(::stat(runtime_->accountStore().path().c_str(), &info), 0);
+  EXPECT_EQ(info.st_mode & 077, 0U);
+  VendAccountStore reloaded(runtime_->configuration());
+  ASSERT_TRUE(reloaded.primaryAccount());
+  EXPECT_EQ(reloaded.primaryAccount()->signingKey, primary->signingKey);
+  // The next purchase asks nobody.
+  EXPECT_TRUE(purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller).success);
+  EXPECT_EQ(presenter->shown, 1);
+}
+
+TEST_F(StoreRuntimeTest, CancelledOrWrongSignInFailsThePurchase) {
+  startStore();
+  runtime_->setDialogPresenter(
+      std::make_shared<ScriptedPresenter>(VendDialogButton::kCancel, PlistDictionary{}));
+  auto cancelled = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
+  ASSERT_TRUE(cancelled.error);
+  EXPECT_EQ(cancelled.error->code, VendError::kCancelledCode);
+  EXPECT_EQ(store_->requestCount("buy-product"), 0U);
+
+  runtime_->setDialogPresenter(std::make_shared<ScriptedPresenter>(
+      VendDialogButton::kOK,
+      PlistDictionary{{"accountName", kAccountName}, {"password", "wrong"}}));
+  auto refused = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
+  ASSERT_TRUE(refused.error);
+  EXPECT_EQ(refused.error->code, 401);
+  EXPECT_FALSE(runtime_->accountStore().primaryAccount());
+}
+
+TEST_F(StoreRuntimeTest, NoDialogAgentMeansTheSignInCountsAsCancelled) {
+  startStore();
+  auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
+  ASSERT_TRUE(result.error);
+  EXPECT_EQ(result.error->code, VendError::kCancelledCode);
+}
+
+TEST_F(StoreRuntimeTest, SignaturesRoundTripAndAForgedAnswerIsRefused) {
+  startStore();
+  signIn();
+  std::optional<VendURLRequest> signedRequest;
+  proxy_->transactionServiceSynchronousBlock([&](VendTransactionService& service,
+                                                 DispatchSemaphore& done) {
+    service.signURLRequest(VendURLRequest(store_->baseURL() + "/x"), "daap", std::nullopt,
+                           [&](const std::optional<VendURLRequest>& request, const OptionalError&) {
+                             signedRequest = request;
+                             done.signal();
+                           });
+  });
+  ASSERT_TRUE(signedRequest);
+  EXPECT_TRUE(signedRequest->valueForHeaderField("X-Larder-Signature").has_value());
+
+  const auto account = runtime_->accountStore().primaryAccount();
+  ASSERT_TRUE(account);
+  const PlistData body{'o', 'k'};
+  VendURLResponse response;
+  response.statusCode = 200;
+  response.headers.emplace_back("x-larder-signature",
+                                VendRequestSigner(account->signingKey).answerSignature(200, body));
+  auto verify = [&](const VendURLResponse& answer) {
+    std::optional<PlistData> verified;
+    proxy_->transactionServiceSynchronousBlock(
+        [&](VendTransactionService& service, DispatchSemaphore& done) {
+          service.signedBodyWithURLResponse(
+              answer, "daap", body, std::nullopt,
+              [&](const std::optional<PlistData>& result, const OptionalError&) {
+                verified = result;
+                done.signal();
+              });
+        });
+    return verified;
+  };
+  EXPECT_EQ(verify(response), body);
+  response.statusCode = 201;  // the status is signed too
+  EXPECT_FALSE(verify(response));
+}
+
+TEST_F(StoreRuntimeTest, ItemLookupFindsTheItemByIdentifierAndByBundle) {
+  startStore();
+  auto lookup = [&](PlistDictionary request) {
+    PlistDictionary answer;
+    proxy_->transactionServiceSynchronousBlock(
+        [&](VendTransactionService& service, DispatchSemaphore& done) {
+          service.itemLookup(std::move(request),
+                             [&](bool, const PlistDictionary& result, const OptionalError&) {
+                               answer = result;
+                               done.signal();
+                             });
+        });
+    return PlistValue(answer);
+  };
+  auto byID = lookup(
+      {{"id", std::to_string(kNotesItem)}, {"caller", "com.orvane.larderd"}, {"p", "lockup"}});
+  EXPECT_EQ(*byID["results"][std::to_string(kNotesItem)]["bundleId"].string(), "com.example.Notes");
+  auto byBundle = lookup({{"bundleId", "com.example.Notes"}, {"p", "lockup"}});
+  ASSERT_TRUE(byBundle["results"].dictionary());
+  EXPECT_EQ(byBundle["results"].dictionary()->size(), 1U);
+}
+
+}  // namespace
+}  // namespace larder::testing

@@ -1,0 +1,274 @@
+// The download records: the store's download dictionary read and written
+// back, the archive form, and the malformed dictionaries that must be
+// refused as a whole.
+#include <gtest/gtest.h>
+
+#include <functional>
+#include <string>
+#include <vector>
+
+#include "platform/KeyedArchive.h"
+#include "store-runtime/TillDownload.h"
+#include "store-runtime/TillPurchaseResponse.h"
+
+namespace larder {
+namespace {
+
+const std::string kDigestA(64, 'a');
+const std::string kDigestB = "0123456789abcdef0123456789ABCDEF0123456789abcdef0123456789abcdef";
+
+PlistDictionary storeAsset() {
+  return PlistDictionary{{"type", 10},
+                         {"URL", "http://store.test/assets/42/Thing.tar"},
+                         {"fileSize", 1500},
+                         {"numberOfBytesToHash", 1000},
+                         {"hashes", PlistArray{kDigestA, kDigestB}}};
+}
+
+PlistDictionary storeMetadata() {
+  return PlistDictionary{{"itemIdentifier", 42},
+                         {"bundleIdentifier", "com.example.thing"},
+                         {"bundleVersion", "2.1"},
+                         {"title", "Thing"},
+                         {"thumbnailImageURL", "http://store.test/icons/42.png"},
+                         {"preflightPackageURL", "http://store.test/preflight/42"}};
+}
+
+// A download exactly as the store's purchase answer holds it.
+PlistDictionary storeDownload() {
+  return PlistDictionary{{"metadata", storeMetadata()}, {"assets", PlistArray{storeAsset()}}};
+}
+
+TEST(TillDownloadRecord, ReadsTheStoresDownloadAndWritesItBackWithTheLocalFields) {
+  std::shared_ptr<TillDownload> download = TillDownload::fromDictionary(storeDownload());
+  ASSERT_NE(download, nullptr);
+  const TillDownloadMetadata metadata = download->metadata();
+  EXPECT_EQ(metadata.itemIdentifier(), 42u);
+  EXPECT_EQ(metadata.bundleIdentifier(), "com.example.thing");
+  EXPECT_EQ(metadata.bundleVersion(), "2.1");
+  EXPECT_EQ(metadata.preflightPackageURL(), "http://store.test/preflight/42");
+  EXPECT_FALSE(metadata.isMDMProvided());
+  ASSERT_EQ(download->assets().size(), 1u);
+  const TillDownloadAsset asset = download->assets().front();
+  EXPECT_EQ(asset.URLRequest().url(), "http://store.test/assets/42/Thing.tar");
+  EXPECT_EQ(asset.fileSize(), 1500);
+  EXPECT_EQ(asset.numberOfBytesToHash(), 1000);
+  EXPECT_EQ(asset.hashes(), (std::vector<std::string>{kDigestA, kDigestB}));
+  EXPECT_EQ(download->downloadType(), TillDownload::kInstall);
+
+  const PlistDictionary written = download->toDictionary();
+  // Every key the store sent comes back with its value...
+  PlistDictionary expectedMetadata = storeMetadata();
+  expectedMetadata.emplace("isMDMProvided", false);
+  EXPECT_EQ(PlistValue(written.at("metadata")), PlistValue(expectedMetadata));
+  PlistDictionary expectedAsset = storeAsset();
+  expectedAsset.emplace("external", false);
+  EXPECT_EQ(written.at("assets"), PlistValue(PlistArray{expectedAsset}));
+  // ...and the local fields are added.
+  EXPECT_EQ(written.at("downloadType"), PlistValue(1));
+  EXPECT_EQ(written.at("skipAssetDownloadIfNotAlreadyOnDisk"), PlistValue(false));
+  EXPECT_EQ(written.at("status"),
+            PlistValue(PlistDictionary{{"isPaused", false}, {"isFailed", false}}));
+  EXPECT_FALSE(written.contains("relaunchAppWithBundleURL"));
+
+  // The written form reads back to the same record.
+  std::shared_ptr<TillDownload> again = TillDownload::fromDictionary(written);
+  ASSERT_NE(again, nullptr);
+  EXPECT_EQ(again->snapshot(), download->snapshot());
+}
+
+TillDownloadFields everyFieldSet() {
+  TillDownloadMetadata metadata;
+  metadata.setItemIdentifier(0xFFFFFFFFFFFFFFF0ull);
+  metadata.setBundleIdentifier("com.example.managed");
+  metadata.setBundleVersion("7");
+  metadata.setTitle("Managed");
+  metadata.setThumbnailImageURL("http://store.test/t.png");
+  metadata.setAuxInfo(PlistDictionary{{"SystemVersion", "12.4"}, {"nested", PlistArray{1, "two"}}});
+  metadata.setIsMDMProvided(true);
+  TillDownloadAsset asset;
+  VendURLRequest request("http://store.test/a.tar");
+  request.setValue("secret", "X-Token");
+  request.setTimeoutInterval(5);
+  asset.setURLRequest(request);
+  asset.setFileSize(3);
+  asset.setNumberOfBytesToHash(2);
+  asset.setHashes({kDigestA, kDigestB});
+  TillDownloadFields fields;
+  fields.metadata = metadata;
+  fields.assets = {asset, asset};
+  fields.downloadType = TillDownload::kStageOnly;
+  fields.relaunchAppWithBundleURL = "/Applications/Managed.app";
+  fields.skipAssetDownloadIfNotAlreadyOnDisk = true;
+  fields.status = {true, true};
+  fields.progress = 0.25;
+  return fields;
+}
+
+TEST(TillDownloadRecord, EveryFieldSurvivesTheArchiveAndTheWire) {
+  const TillDownload original(everyFieldSet());
+
+  const PlistData archived = KeyedArchive::archivedData(original.encodeWithCoder());
+  std::string error;
+  std::optional<PlistValue> root = KeyedArchive::unarchivedRoot(archived, {"TillDownload"}, &error);
+  ASSERT_TRUE(root) << error;
+  std::shared_ptr<TillDownload> fromArchive = TillDownload::initWithCoder(*root);
+  ASSERT_NE(fromArchive, nullptr);
+  EXPECT_EQ(fromArchive->snapshot(), everyFieldSet());
+
+  std::shared_ptr<TillDownload> fromWire = TillDownload::fromDictionary(original.toDictionary());
+  ASSERT_NE(fromWire, nullptr);
+  EXPECT_EQ(fromWire->snapshot(), everyFieldSet());
+  // The request that is more than a plain fetch keeps its header and limit.
+  EXPECT_EQ(fromWire->assets()[0].URLRequest().valueForHeaderField("x-token"), "secret");
+  EXPECT_EQ(fromWire->assets()[0].URLRequest().timeoutInterval(), 5);
+}
+
+TEST(TillDownloadRecord, ArchiveRefusesNestedRecordsOfTheWrongClass) {
+  PlistDictionary encoded = TillDownload(everyFieldSet()).encodeWithCoder();
+  ASSERT_NE(TillDownload::initWithCoder(encoded), nullptr);
+
+  PlistDictionary swapped = encoded;
+  swapped["metadata"] = PlistValue(everyFieldSet().assets[0].encodeWithCoder());
+  EXPECT_EQ(TillDownload::initWithCoder(swapped), nullptr);
+
+  PlistDictionary plainAssets = encoded;
+  plainAssets["assets"] = PlistArray{PlistValue(everyFieldSet().assets[0].toDictionary())};
+  EXPECT_EQ(TillDownload::initWithCoder(plainAssets), nullptr);
+
+  PlistDictionary otherClass = encoded;
+  otherClass["$class"] = "LedgerSoftwareProduct";
+  EXPECT_EQ(TillDownload::initWithCoder(otherClass), nullptr);
+}
+
+struct Malformation {
+  std::string name;
+  std::function<void(PlistDictionary&)> apply;
+};
+
+PlistDictionary& metadataOf(PlistDictionary& download) {
+  return *download["metadata"].dictionary();
+}
+PlistDictionary& firstAsset(PlistDictionary& download) {
+  return *(*download["assets"].array())[0].dictionary();
+}
+
+TEST(TillDownloadRecord, MalformedDownloadsAreRefusedAsAWhole) {
+  const std::vector<Malformation> malformations = {
+      {"no metadata", [](PlistDictionary& d) { d.erase("metadata"); }},
+      {"metadata is a string", [](PlistDictionary& d) { d["metadata"] = "thing"; }},
+      {"item identifier is text",
+       [](PlistDictionary& d) { metadataOf(d)["itemIdentifier"] = "42"; }},
+      {"item identifier is negative",
+       [](PlistDictionary& d) { metadataOf(d)["itemIdentifier"] = -1; }},
+      {"title is a number", [](PlistDictionary& d) { metadataOf(d)["title"] = 5; }},
+      {"auxInfo is an array", [](PlistDictionary& d) { metadataOf(d)["auxInfo"] = PlistArray{}; }},
+      {"no assets", [](PlistDictionary& d) { d.erase("assets"); }},
+      {"empty assets", [](PlistDictionary& d) { d["assets"] = PlistArray{}; }},
+      {"assets is a dictionary", [](PlistDictionary& d) { d["assets"] = storeAsset(); }},
+      {"an asset is a string",
+       [](PlistDictionary& d) {
+         d["assets"] = PlistArray{storeAsset(), "x"};
+       }},
+      {"no URL", [](PlistDictionary& d) { firstAsset(d).erase("URL"); }},
+      {"URL is a number", [](PlistDictionary& d) { firstAsset(d)["URL"] = 3; }},
+      {"file size is text", [](PlistDictionary& d) { firstAsset(d)["fileSize"] = "1500"; }},
+      {"file size is zero", [](PlistDictionary& d) { firstAsset(d)["fileSize"] = 0; }},
+      {"file size is negative", [](PlistDictionary& d) { firstAsset(d)["fileSize"] = -1500; }},
+      {"chunk size is zero", [](PlistDictionary& d) { firstAsset(d)["numberOfBytesToHash"] = 0; }},
+      {"chunk size is a real",
+       [](PlistDictionary& d) { firstAsset(d)["numberOfBytesToHash"] = 1000.0; }},
+      {"one digest short",
+       [](PlistDictionary& d) { firstAsset(d)["hashes"] = PlistArray{kDigestA}; }},
+      {"one digest too many",
+       [](PlistDictionary& d) {
+         firstAsset(d)["hashes"] = PlistArray{kDigestA, kDigestB, kDigestA};
+       }},
+      {"digest is not hex",
+       [](PlistDictionary& d) {
+         firstAsset(d)["hashes"] = PlistArray{kDigestA, std::string(64, 'g')};
+       }},
+      {"digest of odd length",
+       [](PlistDictionary& d) {
+         firstAsset(d)["hashes"] = PlistArray{kDigestA, std::string(63, 'a')};
+       }},
+      {"digests of two lengths",
+       [](PlistDictionary& d) {
+         firstAsset(d)["hashes"] = PlistArray{kDigestA, std::string(32, 'a')};
+       }},
+      {"digest is a number",
+       [](PlistDictionary& d) {
+         firstAsset(d)["hashes"] = PlistArray{kDigestA, 7};
+       }},
+      {"type is not a package", [](PlistDictionary& d) { firstAsset(d)["type"] = 11; }},
+      {"download type is text", [](PlistDictionary& d) { d["downloadType"] = "1"; }},
+      {"status is a bool", [](PlistDictionary& d) { d["status"] = true; }},
+      {"isPaused is text",
+       [](PlistDictionary& d) {
+         d["status"] = PlistDictionary{{"isPaused", "yes"}};
+       }},
+      {"progress beyond 1", [](PlistDictionary& d) { d["progress"] = 1.5; }},
+  };
+  for (const Malformation& malformation : malformations) {
+    PlistDictionary download = storeDownload();
+    malformation.apply(download);
+    EXPECT_EQ(TillDownload::fromDictionary(download), nullptr) << malformation.name;
+  }
+  // The unchanged dictionary, and one with MD5 digests, are accepted: the
+  // refusals above are the malformations' doing.
+  EXPECT_NE(TillDownload::fromDictionary(storeDownload()), nullptr);
+  PlistDictionary md5 = storeDownload();
+  firstAsset(md5)["hashes"] = PlistArray{std::string(32, 'a'), std::string(32, 'b')};
+  EXPECT_NE(TillDownload::fromDictionary(md5), nullptr);
+}
+
+TEST(TillPurchaseResponseRecord, KeepsTheWellFormedDownloadsOfAnAnswer) {
+  PlistDictionary second = storeDownload();
+  metadataOf(second)["itemIdentifier"] = 43;
+  PlistDictionary broken = storeDownload();
+  firstAsset(broken)["fileSize"] = "big";
+  const PlistDictionary answer{
+      {"downloads", PlistArray{storeDownload(), broken, "not a download", second}}};
+
+  std::size_t dropped = 0;
+  std::optional<TillPurchaseResponse> response =
+      TillPurchaseResponse::fromDictionary(answer, &dropped);
+  ASSERT_TRUE(response);
+  EXPECT_EQ(dropped, 2u);
+  ASSERT_EQ(response->downloads().size(), 2u);
+  EXPECT_EQ(response->downloads()[0]->metadata().itemIdentifier(), 42u);
+  EXPECT_EQ(response->downloads()[1]->metadata().itemIdentifier(), 43u);
+
+  EXPECT_FALSE(TillPurchaseResponse::fromDictionary(PlistDictionary{{"failureType", "x"}}));
+  EXPECT_FALSE(
+      TillPurchaseResponse::fromDictionary(PlistDictionary{{"downloads", storeDownload()}}));
+  std::optional<TillPurchaseResponse> none =
+      TillPurchaseResponse::fromDictionary(PlistDictionary{{"downloads", PlistArray{}}});
+  ASSERT_TRUE(none);
+  EXPECT_TRUE(none->downloads().empty());
+}
+
+TEST(TillPurchaseResponseRecord, ArchiveAndWireKeepEveryDownload) {
+  std::optional<TillPurchaseResponse> response = TillPurchaseResponse::fromDictionary(
+      PlistDictionary{{"downloads", PlistArray{storeDownload(), storeDownload()}}});
+  ASSERT_TRUE(response);
+  response->downloads()[1]->setDownloadType(TillDownload::kStageOnly);
+
+  const PlistData archived = KeyedArchive::archivedData(response->encodeWithCoder());
+  std::optional<PlistValue> root = KeyedArchive::unarchivedRoot(archived, {"TillPurchaseResponse"});
+  ASSERT_TRUE(root);
+  std::optional<TillPurchaseResponse> decoded = TillPurchaseResponse::initWithCoder(*root);
+  ASSERT_TRUE(decoded);
+  ASSERT_EQ(decoded->downloads().size(), 2u);
+  EXPECT_EQ(decoded->downloads()[0]->snapshot(), response->downloads()[0]->snapshot());
+  EXPECT_EQ(decoded->downloads()[1]->downloadType(), TillDownload::kStageOnly);
+
+  std::optional<TillPurchaseResponse> overTheWire =
+      TillPurchaseResponse::fromDictionary(response->toDictionary());
+  ASSERT_TRUE(overTheWire);
+  ASSERT_EQ(overTheWire->downloads().size(), 2u);
+  EXPECT_EQ(overTheWire->downloads()[1]->snapshot(), response->downloads()[1]->snapshot());
+}
+
+}  // namespace
+}  // namespace larder

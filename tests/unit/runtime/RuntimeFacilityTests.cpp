@@ -1,0 +1,911 @@
+// The runtime's helper facilities: gzip, errors, restrictions, the
+// simulated platform agents, message traces, localised text, string and
+// file helpers. Each test runs against its own platform root, home and XDG
+// folders below a fresh temporary folder.
+
+#include <gtest/gtest.h>
+#include <pwd.h>
+#include <sys/stat.h>
+#include <sys/utsname.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <nlohmann/json.hpp>
+#include <optional>
+#include <random>
+#include <set>
+#include <sstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/FileIO.h"
+#include "platform/PropertyListSerialization.h"
+#include "store-runtime/LedgerDockMessaging.h"
+#include "store-runtime/LedgerLocalizedString.h"
+#include "store-runtime/LedgerQuaymartLauncher.h"
+#include "store-runtime/LedgerRootHelper.h"
+#include "store-runtime/LedgerSystemState.h"
+#include "store-runtime/LedgerTraceMessage.h"
+#include "store-runtime/LedgerTwilightAgent.h"
+#include "store-runtime/LocalizedStringBundle.h"
+#include "store-runtime/PlatformStateFile.h"
+#include "store-runtime/VendDevice.h"
+#include "store-runtime/VendError.h"
+#include "store-runtime/VendFileManager.h"
+#include "store-runtime/VendGzip.h"
+#include "store-runtime/VendManagedRestrictions.h"
+#include "store-runtime/VendStoreClient.h"
+#include "store-runtime/VendStringHelpers.h"
+
+namespace larder {
+namespace {
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+
+void writeText(const std::string& path, std::string_view text) {
+  fs::create_directories(fs::path(path).parent_path());
+  std::ofstream file(path, std::ios::binary | std::ios::trunc);
+  file.write(text.data(), static_cast<std::streamsize>(text.size()));
+  file.close();
+  ASSERT_TRUE(file) << "cannot write " << path;
+}
+
+void writePlist(const std::string& path, const PlistValue& value) {
+  writeText(path, PropertyListSerialization::writeXml(value));
+}
+
+std::string readText(const std::string& path) {
+  std::ifstream file(path, std::ios::binary);
+  std::stringstream contents;
+  contents << file.rdbuf();
+  return contents.str();
+}
+
+PlistValue readPlist(const std::string& path) {
+  std::optional<PlistData> bytes = FileIO::read(path);
+  if (!bytes) return {};
+  std::optional<PlistValue> value = PropertyListSerialization::read(*bytes);
+  return value ? *value : PlistValue();
+}
+
+double secondsNow() {
+  return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
+}
+
+std::string realHomeOfCurrentUser() {
+  const passwd* entry = ::getpwuid(::getuid());
+  return entry && entry->pw_dir ? std::string(entry->pw_dir) : std::string();
+}
+
+class RuntimeFacilityTest : public ::testing::Test {
+ protected:
+  static constexpr const char* kVariables[] = {"LARDER_ROOT",
+                                               "HOME",
+                                               "XDG_CACHE_HOME",
+                                               "XDG_STATE_HOME",
+                                               "XDG_CONFIG_HOME",
+                                               "LARDER_STORE_APP",
+                                               "__OSINSTALL_ENVIRONMENT"};
+
+  void SetUp() override {
+    for (const char* name : kVariables) {
+      const char* value = std::getenv(name);
+      saved_.emplace_back(name, value ? std::optional<std::string>(value) : std::nullopt);
+    }
+    std::string pattern = (fs::temp_directory_path() / "larder-facilities-XXXXXX").string();
+    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
+    temporary_ = pattern;
+    root_ = temporary_ + "/root";
+    home_ = temporary_ + "/home";
+    fs::create_directories(root_);
+    fs::create_directories(home_);
+    ::setenv("LARDER_ROOT", root_.c_str(), 1);
+    ::setenv("HOME", home_.c_str(), 1);
+    ::setenv("XDG_CACHE_HOME", (temporary_ + "/cache").c_str(), 1);
+    ::setenv("XDG_STATE_HOME", (temporary_ + "/state").c_str(), 1);
+    ::setenv("XDG_CONFIG_HOME", (temporary_ + "/config").c_str(), 1);
+    ::unsetenv("LARDER_STORE_APP");
+    ::unsetenv("__OSINSTALL_ENVIRONMENT");
+  }
+
+  void TearDown() override {
+    LedgerTraceMessageWaitUntilWritten();
+    for (const std::string& folder : lockedFolders_) ::chmod(folder.c_str(), 0755);
+    std::error_code code;
+    fs::remove_all(temporary_, code);
+    for (const auto& [name, value] : saved_) {
+      if (value) {
+        ::setenv(name.c_str(), value->c_str(), 1);
+      } else {
+        ::unsetenv(name.c_str());
+      }
+    }
+  }
+
+  std::string rooted(std::string_view path) const { return root_ + std::string(path); }
+  std::string platformState(std::string_view name) const {
+    return rooted("/var/lib/larder-platform/") + std::string(name);
+  }
+
+  // A bundle with the given information dictionary and, if given, purchase
+  // record text.
+  std::string makeBundle(const std::string& path, const PlistDictionary& info,
+                         std::optional<std::string> purchaseText = std::nullopt) {
+    fs::create_directories(path);
+    writePlist(path + "/bundle.plist", PlistValue(info));
+    if (purchaseText) writeText(path + "/purchase.plist", *purchaseText);
+    return path;
+  }
+
+  static std::string purchaseRecordText(std::string_view bundleIdentifier) {
+    PlistDictionary record{{"bundleIdentifier", PlistValue(bundleIdentifier)},
+                           {"bundleVersion", "1.0"},
+                           {"wareID", PlistValue(std::int64_t{4242})}};
+    return PropertyListSerialization::writeXml(PlistValue(record));
+  }
+
+  std::string temporary_;
+  std::string root_;
+  std::string home_;
+  std::vector<std::string> lockedFolders_;
+  std::vector<std::pair<std::string, std::optional<std::string>>> saved_;
+};
+
+// ---------------------------------------------------------------- gzip
+
+PlistData pseudoRandomBytes(std::size_t count, std::uint32_t seed) {
+  std::mt19937 generator(seed);
+  PlistData bytes(count);
+  for (auto& byte : bytes) byte = static_cast<std::uint8_t>(generator());
+  return bytes;
+}
+
+TEST_F(RuntimeFacilityTest, GzipRoundTripsEmptySmallRandomAndLargeInputs) {
+  std::string text = "<plist><dict><key>bundle-id</key><string>com.example.app</string></dict>";
+  std::vector<PlistData> inputs = {
+      {},
+      PlistData(text.begin(), text.end()),
+      pseudoRandomBytes(300000, 7),              // incompressible, several output chunks
+      PlistData(10u << 20u, std::uint8_t{'a'}),  // compresses a thousandfold
+  };
+  for (const PlistData& input : inputs) {
+    std::optional<PlistData> zipped = VendCopyGzippedDataForData(input);
+    ASSERT_TRUE(zipped.has_value()) << input.size();
+    ASSERT_GE(zipped->size(), 18u);
+    EXPECT_EQ((*zipped)[0], 0x1f);
+    EXPECT_EQ((*zipped)[1], 0x8b);
+    std::optional<PlistData> unzipped = VendCopyGunzippedDataForData(*zipped, 16u << 20u);
+    ASSERT_TRUE(unzipped.has_value()) << input.size();
+    EXPECT_EQ(*unzipped, input);
+  }
+  EXPECT_LT(VendCopyGzippedDataForData(inputs[3])->size(), 100000u);
+}
+
+TEST_F(RuntimeFacilityTest, GzipOutputIsReadByTheSystemGzipTool) {
+  if (std::system("command -v gzip >/dev/null 2>&1") != 0) GTEST_SKIP() << "no gzip tool";
+  PlistData input = pseudoRandomBytes(5000, 3);
+  std::string zippedPath = temporary_ + "/body.gz";
+  std::optional<PlistData> zipped = VendCopyGzippedDataForData(input);
+  ASSERT_TRUE(zipped);
+  ASSERT_TRUE(FileIO::writeAtomically(zippedPath, *zipped));
+  std::string command = "gzip -dc '" + zippedPath + "' > '" + temporary_ + "/body'";
+  ASSERT_EQ(std::system(command.c_str()), 0);
+  EXPECT_EQ(FileIO::read(temporary_ + "/body"), input);
+}
+
+TEST_F(RuntimeFacilityTest, GunzipRefusesDamagedTruncatedPaddedAndOversizedStreams) {
+  PlistData input = pseudoRandomBytes(20000, 11);
+  PlistData zipped = *VendCopyGzippedDataForData(input);
+
+  PlistData flipped = zipped;
+  flipped[flipped.size() / 2] ^= 0x55;
+  EXPECT_FALSE(VendCopyGunzippedDataForData(flipped));
+
+  PlistData badChecksum = zipped;
+  badChecksum[badChecksum.size() - 6] ^= 0x01;  // inside the CRC-32 of the trailer
+  EXPECT_FALSE(VendCopyGunzippedDataForData(badChecksum));
+
+  PlistData truncated(zipped.begin(), zipped.end() - 5);
+  EXPECT_FALSE(VendCopyGunzippedDataForData(truncated));
+
+  PlistData padded = zipped;
+  padded.push_back(0);
+  EXPECT_FALSE(VendCopyGunzippedDataForData(padded));
+
+  std::string plain = "not compressed at all";
+  EXPECT_FALSE(VendCopyGunzippedDataForData(PlistData(plain.begin(), plain.end())));
+  EXPECT_FALSE(VendCopyGunzippedDataForData(PlistData{}));
+
+  // A small body that expands beyond the limit is refused, at the limit it is fine.
+  PlistData zeros(4u << 20u, 0);
+  PlistData bomb = *VendCopyGzippedDataForData(zeros);
+  EXPECT_FALSE(VendCopyGunzippedDataForData(bomb, zeros.size() - 1));
+  std::optional<PlistData> exact = VendCopyGunzippedDataForData(bomb, zeros.size());
+  ASSERT_TRUE(exact);
+  EXPECT_EQ(exact->size(), zeros.size());
+}
+
+// ---------------------------------------------------------------- errors
+
+TEST_F(RuntimeFacilityTest, NamedErrorsCarryTheirCodesAndTexts) {
+  struct Expected {
+    VendError error;
+    std::int64_t code;
+    std::optional<std::string> title;
+    std::optional<std::string> message;
+    std::string description;
+  };
+  const std::vector<Expected> table = {
+      {VendError::cancelledByUser(), -128, "AC check failed",
+       "Can't start because the user canceled the dialog.",
+       "Can't start because the user canceled the dialog."},
+      {VendError::notAuthorized(), 4, "Authorization failed",
+       "Not authorized to proceed with updates.", "Not authorized to proceed with updates."},
+      {VendError::alreadyInstalled(), 7, std::nullopt, "Skipping download", "Skipping download"},
+      {VendError::notEnoughDiskSpace(), 11, "Disk check failed",
+       "Can't start because there is not enough disk space.",
+       "Can't start because there is not enough disk space."},
+      {VendError::noUniqueTaggedUpdate(), 27, std::nullopt, std::nullopt, ""},
+      {VendError::urlBagKeyMissing(), 30, "DAAP Key not in Bag", std::nullopt,
+       "DAAP Key not in Bag"},
+  };
+  for (const Expected& expected : table) {
+    SCOPED_TRACE(expected.code);
+    EXPECT_EQ(expected.error.domain, VendErrorDomain);
+    EXPECT_EQ(expected.error.code, expected.code);
+    EXPECT_EQ(expected.error.title(), expected.title);
+    EXPECT_EQ(expected.error.message(), expected.message);
+    EXPECT_EQ(expected.error.description, expected.description);
+    // Title and message survive the wire form.
+    std::optional<VendError> back = VendError::fromDictionary(expected.error.toDictionary());
+    ASSERT_TRUE(back);
+    EXPECT_EQ(*back, expected.error);
+    EXPECT_EQ(back->title(), expected.title);
+  }
+  EXPECT_TRUE(VendError::cancelledByUser().isCancellation());
+  EXPECT_FALSE(VendError::notAuthorized().isCancellation());
+}
+
+TEST_F(RuntimeFacilityTest, ErrorConstructorsPreferTheMessageAndTakeAnyDomain) {
+  VendError both = VendError::make(99, "Title", "Message");
+  EXPECT_EQ(both.description, "Message");
+  VendError titleOnly = VendError::make(99, "Title", std::nullopt);
+  EXPECT_EQ(titleOnly.description, "Title");
+  EXPECT_EQ(titleOnly.message(), std::nullopt);
+  VendError neither = VendError::make(99);
+  EXPECT_EQ(neither.description, "");
+  EXPECT_TRUE(neither.userInfo.empty());
+
+  VendError foreign = VendError::withDomain("NSURLErrorDomain", -1001, "timed out");
+  EXPECT_EQ(foreign.domain, "NSURLErrorDomain");
+  EXPECT_EQ(foreign.code, -1001);
+  EXPECT_EQ(foreign.description, "timed out");
+  EXPECT_EQ(foreign.title(), std::nullopt);
+  EXPECT_EQ(VendError::withDomain("D", 1).description, "");
+}
+
+// ---------------------------------------------------------------- restrictions
+
+TEST_F(RuntimeFacilityTest, RestrictionsFollowTheFileAtEveryCall) {
+  const std::string path = rooted("/etc/larder/restrictions.plist");
+  EXPECT_EQ(VendManagedRestrictions::restrictionsFilePath(), path);
+  EXPECT_FALSE(VendManagedRestrictions::isRestrictedTo(
+      LedgerRestrictStoreToDisableSoftwareUpdateNotifications));
+
+  writePlist(path, PlistValue(PlistDictionary{
+                       {std::string(LedgerRestrictStoreToDisableSoftwareUpdateNotifications), true},
+                       {std::string(LedgerRestrictStoreToRequireAdminForSoftwareInstall), false}}));
+  EXPECT_TRUE(VendManagedRestrictions::isRestrictedTo(
+      LedgerRestrictStoreToDisableSoftwareUpdateNotifications));
+  EXPECT_FALSE(
+      VendManagedRestrictions::isRestrictedTo(LedgerRestrictStoreToRequireAdminForSoftwareInstall));
+  EXPECT_FALSE(VendManagedRestrictions::isRestrictedTo("SomethingElse"));
+
+  // A change applies at once, numbers count, other types do not.
+  writePlist(path,
+             PlistValue(PlistDictionary{
+                 {std::string(LedgerRestrictStoreToRequireAdminForSoftwareInstall),
+                  PlistValue(std::int64_t{1})},
+                 {std::string(LedgerRestrictStoreToDisableSoftwareUpdateNotifications), "YES"}}));
+  EXPECT_TRUE(
+      VendManagedRestrictions::isRestrictedTo(LedgerRestrictStoreToRequireAdminForSoftwareInstall));
+  EXPECT_FALSE(VendManagedRestrictions::isRestrictedTo(
+      LedgerRestrictStoreToDisableSoftwareUpdateNotifications));
+}
+
+TEST_F(RuntimeFacilityTest, DamagedOrMisshapenRestrictionsRestrictNothing) {
+  const std::string path = rooted("/etc/larder/restrictions.plist");
+  writeText(path, "<?xml version=\"1.0\"?><plist><dict><key>RequireAdmin");
+  EXPECT_FALSE(
+      VendManagedRestrictions::isRestrictedTo(LedgerRestrictStoreToRequireAdminForSoftwareInstall));
+  writePlist(path, PlistValue(PlistArray{
+                       PlistValue(std::string(LedgerRestrictStoreToRequireAdminForSoftwareInstall)),
+                       true}));
+  EXPECT_FALSE(
+      VendManagedRestrictions::isRestrictedTo(LedgerRestrictStoreToRequireAdminForSoftwareInstall));
+  fs::remove(path);
+  fs::create_directories(path);  // a folder where the file should be
+  EXPECT_FALSE(
+      VendManagedRestrictions::isRestrictedTo(LedgerRestrictStoreToRequireAdminForSoftwareInstall));
+}
+
+// ---------------------------------------------------------------- deferred-install agent
+
+TEST_F(RuntimeFacilityTest, TwilightArmingIsPersistedAndUndone) {
+  EXPECT_FALSE(LedgerTwilightAgent::isArmedForInstallLater());
+  EXPECT_FALSE(LedgerTwilightAgent::armedMode());
+
+  double before = secondsNow();
+  LedgerTwilightAgent::armObserverWithMode(2);
+  EXPECT_TRUE(LedgerTwilightAgent::isArmedForInstallLater());
+  EXPECT_EQ(LedgerTwilightAgent::armedMode(), 2);
+  PlistValue stored = readPlist(platformState("twilight.plist"));
+  EXPECT_TRUE(stored["armed"].boolValue());
+  EXPECT_EQ(stored["armedMode"].int64Value(), 2);
+  ASSERT_TRUE(stored["armedDate"].isDate());
+  EXPECT_NEAR(stored["armedDate"].date()->secondsSince1970, before, 5);
+
+  LedgerTwilightAgent::armObserverWithMode(1);
+  EXPECT_EQ(LedgerTwilightAgent::armedMode(), 1);
+
+  LedgerTwilightAgent::disarmObserver();
+  EXPECT_FALSE(LedgerTwilightAgent::isArmedForInstallLater());
+  EXPECT_FALSE(LedgerTwilightAgent::armedMode());
+  stored = readPlist(platformState("twilight.plist"));
+  EXPECT_FALSE(stored["armed"].boolValue());
+  EXPECT_TRUE(stored["armedMode"].isNull());
+}
+
+TEST_F(RuntimeFacilityTest, RestartCountdownTakesAPresetAnswerOrRunsOut) {
+  PlatformStateFile state(platformState("twilight.plist"));
+  state.updateDictionary([](PlistDictionary& s) { s["countdownAnswer"] = std::int64_t{4}; });
+  EXPECT_EQ(LedgerTwilightAgent::showRestartCountdownNotification(), 4);
+  PlistValue stored = readPlist(state.path());
+  EXPECT_TRUE(stored["countdownAnswer"].isNull()) << "an answer is used once";
+  EXPECT_FALSE(stored["restartCountdownShown"].boolValue());
+  EXPECT_EQ(stored["lastCountdownResult"].int64Value(), 4);
+
+  // No answer: the countdown runs out, which means restart.
+  EXPECT_EQ(LedgerTwilightAgent::showRestartCountdownNotification(),
+            LedgerTwilightAgent::kCountdownRanOut);
+  stored = readPlist(state.path());
+  EXPECT_EQ(stored["countdownCount"].int64Value(), 2);
+  EXPECT_EQ(stored["lastCountdownResult"].int64Value(), 1);
+}
+
+TEST_F(RuntimeFacilityTest, RestartCountdownIsShownUntilTheUserAnswers) {
+  PlatformStateFile state(platformState("twilight.plist"));
+  state.updateDictionary([](PlistDictionary& s) { s["countdownSeconds"] = 30.0; });
+  std::atomic<bool> sawShown{false};
+  std::thread user([&] {
+    auto deadline = std::chrono::steady_clock::now() + 10s;
+    while (!LedgerTwilightAgent::isRestartCountdownShown() &&
+           std::chrono::steady_clock::now() < deadline) {
+      std::this_thread::sleep_for(10ms);
+    }
+    sawShown = LedgerTwilightAgent::isRestartCountdownShown();
+    state.updateDictionary([](PlistDictionary& s) { s["countdownAnswer"] = std::int64_t{3}; });
+  });
+  auto start = std::chrono::steady_clock::now();
+  std::int64_t result = LedgerTwilightAgent::showRestartCountdownNotification();
+  auto took = std::chrono::steady_clock::now() - start;
+  user.join();
+  EXPECT_TRUE(sawShown);
+  EXPECT_EQ(result, 3);
+  EXPECT_LT(took, 20s) << "an answer ends the countdown early";
+  EXPECT_FALSE(LedgerTwilightAgent::isRestartCountdownShown());
+}
+
+// ---------------------------------------------------------------- message trace
+
+TEST_F(RuntimeFacilityTest, TraceMessagesFromManyThreadsAreWholeLines) {
+  constexpr int kThreads = 8;
+  constexpr int kPerThread = 150;
+  // Longer than a pipe buffer, so a line written in pieces would show.
+  const std::string padding(6000, 'x');
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&, t] {
+      for (int i = 0; i < kPerThread; ++i) {
+        LedgerTraceMessage("com.orvane.Quaymart.test",
+                           PlistDictionary{{"thread", PlistValue(std::int64_t{t})},
+                                           {"index", PlistValue(std::int64_t{i})},
+                                           {"padding", PlistValue(padding)},
+                                           {"bundle_id", "Third Party App"}});
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  LedgerTraceMessageWaitUntilWritten();
+
+  const std::string path = temporary_ + "/state/larder/messagetrace.log";
+  EXPECT_EQ(LedgerTraceMessageLogPath(), path);
+  std::ifstream log(path);
+  std::set<std::pair<int, int>> seen;
+  std::string line;
+  int lines = 0;
+  while (std::getline(log, line)) {
+    ++lines;
+    nlohmann::json record = nlohmann::json::parse(line, nullptr, false);
+    ASSERT_FALSE(record.is_discarded()) << "torn line " << lines;
+    EXPECT_EQ(record["domain"], "com.orvane.Quaymart.test");
+    EXPECT_EQ(record["message"]["padding"], padding);
+    EXPECT_EQ(record["message"]["bundle_id"], "Third Party App");
+    seen.emplace(record["message"]["thread"].get<int>(), record["message"]["index"].get<int>());
+  }
+  EXPECT_EQ(lines, kThreads * kPerThread);
+  EXPECT_EQ(seen.size(), static_cast<std::size_t>(kThreads * kPerThread));
+}
+
+TEST_F(RuntimeFacilityTest, TraceLinesKeepEveryValueKind) {
+  PlistDictionary message{{"success", true},
+                          {"count", PlistValue(std::int64_t{-3})},
+                          {"ratio", 0.5},
+                          {"data", PlistValue(PlistData{'h', 'i', '!'})},
+                          {"when", PlistValue(PlistDate{0})},
+                          {"list", PlistValue(PlistArray{"a", PlistValue(std::int64_t{1})})},
+                          {"odd", PlistValue(std::string("bad \xff byte"))}};
+  nlohmann::json record = nlohmann::json::parse(
+      LedgerTraceMessageLine("com.orvane.Quaymart.kinds", message, PlistDate{86400}));
+  EXPECT_EQ(record["date"], "1970-01-02T00:00:00Z");
+  EXPECT_EQ(record["message"]["success"], true);
+  EXPECT_EQ(record["message"]["count"], -3);
+  EXPECT_EQ(record["message"]["ratio"], 0.5);
+  EXPECT_EQ(record["message"]["data"], "aGkh");
+  EXPECT_EQ(record["message"]["when"], "1970-01-01T00:00:00Z");
+  EXPECT_EQ(record["message"]["list"], nlohmann::json::array({"a", 1}));
+  EXPECT_TRUE(record["message"]["odd"].is_string());
+}
+
+// ---------------------------------------------------------------- localised text
+
+TEST_F(RuntimeFacilityTest, LocalizedLookupFallsBackToDefaultThenKey) {
+  VendStoreClient store =
+      VendStoreClient::initWithStoreClientType(VendStoreClient::kStoreApplication);
+  LocalizedStringBundle framework = LocalizedStringBundle::tradelineFramework();
+  EXPECT_EQ(LedgerLocalizedStringFromTableInBundle("UPDATE_NOTIFICATION_LATER_BUTTON", std::nullopt,
+                                                   framework, "", &store),
+            "Later");
+  EXPECT_EQ(LedgerLocalizedString("SOFTWARE_LICENSE_AGREEMENT_TITLE", nullptr),
+            "Software License Agreement");
+  EXPECT_EQ(LedgerLocalizedStringFromTableInBundle("NO_SUCH_KEY", std::nullopt, framework,
+                                                   "Fallback", &store),
+            "Fallback");
+  EXPECT_EQ(
+      LedgerLocalizedStringFromTableInBundle("NO_SUCH_KEY", std::nullopt, framework, "", &store),
+      "NO_SUCH_KEY");
+  // The runtime's own bundle answers the texts of its dialogs.
+  LocalizedStringBundle dialogBundle = LocalizedStringBundle::forVendDialog();
+  EXPECT_EQ(dialogBundle.localizedStringForKey("AUTOUPDATE_OPTIN_OK", "", std::nullopt), "Turn On");
+  EXPECT_EQ(dialogBundle.localizedStringForKey("NOPE", "", std::nullopt), "NOPE");
+  EXPECT_EQ(dialogBundle.localizedStringForKey("NOPE", "given", std::nullopt), "given");
+}
+
+TEST_F(RuntimeFacilityTest, BookClientHasWordingOfItsOwn) {
+  VendStoreClient store =
+      VendStoreClient::initWithStoreClientType(VendStoreClient::kStoreApplication);
+  VendStoreClient books =
+      VendStoreClient::initWithStoreClientType(VendStoreClient::kBookApplication);
+  std::string storeTitle = LedgerLocalizedString("UPDATES_AVAILABLE_NOTIFICATION_TITLE", &store);
+  std::string bookTitle = LedgerLocalizedString("UPDATES_AVAILABLE_NOTIFICATION_TITLE", &books);
+  EXPECT_EQ(storeTitle, "Updates Available");
+  EXPECT_EQ(bookTitle, "Book Updates Available");
+  // Texts the book client does not override are the common ones.
+  EXPECT_EQ(LedgerLocalizedString("UPDATE_NOTIFICATION_DETAILS_BUTTON", &books),
+            LedgerLocalizedString("UPDATE_NOTIFICATION_DETAILS_BUTTON", &store));
+  // The client-free lookup of the bundle ignores the overrides.
+  EXPECT_EQ(LocalizedStringBundle::tradelineFramework().localizedStringForKey(
+                "UPDATES_AVAILABLE_NOTIFICATION_TITLE", "", std::nullopt),
+            storeTitle);
+}
+
+TEST_F(RuntimeFacilityTest, EveryTextKeyTheServiceUsesHasEnglishText) {
+  // Each key must give text of its own, not the key back.
+  const std::vector<std::string_view> keys = {
+      "AC_POWER_MESSAGE",
+      "CANCEL",
+      "CANNOT_UPDATE_BODY",
+      "CONFIRM_RESTART_TITLE_DOWNLOAD",
+      "CRITICAL_UPDATES_INSTALL_NOW_RESTART_TEXT",
+      "DOITLATER_HELPER_POWER_TEXT",
+      "INSTALL_QUIT_APP_MULTIPLE_MESSAGE_FORMAT",
+      "OVP_INVITE_NOTIFICATION_TITLE_FORMAT",
+      "UPDATES_AVAILABLE_HEARTHANVIL_NOTIFICATION_TEXT_AND_OTHERS_FORMAT",
+      "UPDATE_NOTIFICATION_LATER_OPTION_AUTOUPDATE_RESTART_REQUIRED_OPTIN",
+      "UPDATEFAILED_DIALOG_AVAILABLE_UPDATES_SHOW_DETAILS_BUTTON"};
+  for (std::string_view key : keys) {
+    std::string text = LedgerLocalizedString(key, nullptr);
+    EXPECT_NE(text, key);
+    EXPECT_FALSE(text.empty()) << key;
+  }
+  EXPECT_NE(LedgerLocalizedString("CANNOT_UPDATE_BODY", nullptr).find("%@"), std::string::npos);
+}
+
+TEST_F(RuntimeFacilityTest, BundleOnDiskAnswersFromItsOwnTables) {
+  std::string bundle = temporary_ + "/Update.bundle";
+  writePlist(bundle + "/resources/Localizable.strings",
+             PlistValue(PlistDictionary{{"MajorOS.Title", "A New System"}}));
+  writePlist(bundle + "/resources/Other.strings",
+             PlistValue(PlistDictionary{{"MajorOS.Title", "Other Table"}}));
+  LocalizedStringBundle onDisk = LocalizedStringBundle::atPath(bundle);
+  EXPECT_EQ(onDisk.localizedStringForKey("MajorOS.Title", "", std::nullopt), "A New System");
+  EXPECT_EQ(onDisk.localizedStringForKey("MajorOS.Title", "", "Other"), "Other Table");
+  EXPECT_EQ(onDisk.localizedStringForKey("MajorOS.Badge", "", std::nullopt), "MajorOS.Badge");
+  // Table names cannot leave the bundle, and framework keys are not mixed in.
+  EXPECT_EQ(onDisk.localizedStringForKey("MajorOS.Title", "", "../resources/Other"),
+            "MajorOS.Title");
+  EXPECT_EQ(onDisk.localizedStringForKey("CANCEL", "", std::nullopt), "CANCEL");
+}
+
+// ---------------------------------------------------------------- string helpers
+
+TEST_F(RuntimeFacilityTest, TildeExpandsAgainstTheRealHomeNotHOME) {
+  std::string realHome = realHomeOfCurrentUser();
+  ASSERT_FALSE(realHome.empty());
+  ASSERT_NE(realHome, home_);  // the fixture points HOME elsewhere
+  std::string expected = realHome == "/" ? "" : realHome;
+  EXPECT_EQ(
+      stringByExpandingTildeInPathOutsideOfSandbox("~/Library/Application Support/Bindery/Books"),
+      expected + "/Library/Application Support/Bindery/Books");
+  EXPECT_EQ(stringByExpandingTildeInPathOutsideOfSandbox("~"), realHome);
+  const passwd* rootEntry = ::getpwnam("root");
+  ASSERT_NE(rootEntry, nullptr);
+  EXPECT_EQ(stringByExpandingTildeInPathOutsideOfSandbox("~root/notes"),
+            std::string(rootEntry->pw_dir) + "/notes");
+  EXPECT_EQ(stringByExpandingTildeInPathOutsideOfSandbox("~no-such-user-x9/a"),
+            "~no-such-user-x9/a");
+  EXPECT_EQ(stringByExpandingTildeInPathOutsideOfSandbox("/srv/~/x"), "/srv/~/x");
+  EXPECT_EQ(stringByExpandingTildeInPathOutsideOfSandbox("relative/~"), "relative/~");
+  EXPECT_EQ(stringByExpandingTildeInPathOutsideOfSandbox(""), "");
+}
+
+TEST_F(RuntimeFacilityTest, QueryStringHelperPlacesSeparatorsAndKeepsTheFragment) {
+  struct Case {
+    std::string_view url;
+    std::string_view text;
+    std::string_view expected;
+  };
+  const Case cases[] = {
+      {"quaymart://showUpdatesPage", "source=notification",
+       "quaymart://showUpdatesPage?source=notification"},
+      {"https://h/p?a=1", "b=2", "https://h/p?a=1&b=2"},
+      {"https://h/p?", "b=2", "https://h/p?b=2"},
+      {"https://h/p?a=1&", "b=2", "https://h/p?a=1&b=2"},
+      {"https://h/p#top", "b=2", "https://h/p?b=2#top"},
+      {"https://h/p?a=1#x?y", "b=2", "https://h/p?a=1&b=2#x?y"},
+      {"https://h/p?a=1", "&b=2", "https://h/p?a=1&b=2"},
+      {"https://h/p", "?b=2", "https://h/p?b=2"},
+      {"https://h/p?a=1", "", "https://h/p?a=1"},
+      {"", "b=2", "?b=2"},
+  };
+  for (const Case& c : cases) {
+    EXPECT_EQ(urlByAddingStringToQueryString(c.url, c.text), c.expected)
+        << c.url << " + " << c.text;
+  }
+}
+
+// ---------------------------------------------------------------- system state
+
+TEST_F(RuntimeFacilityTest, LockedApplicationsMayNotLaunch) {
+  const std::string path = platformState("locked-applications.plist");
+  EXPECT_EQ(LedgerLockedApplicationsFilePath(), path);
+  EXPECT_TRUE(LedgerIsClientAppAllowedToLaunch("com.orvane.Quaymart"));
+
+  writePlist(path, PlistValue(PlistArray{"com.example.Other", "com.orvane.Quaymart"}));
+  EXPECT_FALSE(LedgerIsClientAppAllowedToLaunch("com.orvane.Quaymart"));
+  EXPECT_TRUE(LedgerIsClientAppAllowedToLaunch("com.orvane.Quaymart.helper"));
+  EXPECT_TRUE(LedgerIsClientAppAllowedToLaunch("com.orvane.quaymart"));
+
+  writePlist(path, PlistValue(PlistArray{}));
+  EXPECT_TRUE(LedgerIsClientAppAllowedToLaunch("com.orvane.Quaymart"));
+  writePlist(path, PlistValue(PlistDictionary{{"com.orvane.Quaymart", true}}));
+  EXPECT_TRUE(LedgerIsClientAppAllowedToLaunch("com.orvane.Quaymart"));
+  writeText(path, "garbage");
+  EXPECT_TRUE(LedgerIsClientAppAllowedToLaunch("com.orvane.Quaymart"));
+}
+
+TEST_F(RuntimeFacilityTest, DimWakeGuestAndRecoveryComeFromTheirSources) {
+  EXPECT_FALSE(LedgerIsDimWake());
+  EXPECT_FALSE(LedgerOnRecoveryPartition());
+  const std::string state = platformState("system-state.plist");
+  writePlist(state, PlistValue(PlistDictionary{{"dimWake", true}, {"guestUser", true}}));
+  EXPECT_TRUE(LedgerIsDimWake());
+  EXPECT_TRUE(LedgerCurrentUserIsGuestUser());
+  writePlist(state, PlistValue(PlistDictionary{{"guestUser", false}}));
+  EXPECT_FALSE(LedgerIsDimWake());
+  EXPECT_FALSE(LedgerCurrentUserIsGuestUser());
+
+  EXPECT_TRUE(LedgerIsGuestUserName("guest"));
+  EXPECT_TRUE(LedgerIsGuestUserName("guest-a1b2c3"));
+  EXPECT_FALSE(LedgerIsGuestUserName("guest-"));
+  EXPECT_FALSE(LedgerIsGuestUserName("guesthouse"));
+  EXPECT_FALSE(LedgerIsGuestUserName("root"));
+  EXPECT_FALSE(LedgerIsGuestUserName(""));
+
+  ::setenv("__OSINSTALL_ENVIRONMENT", "1", 1);
+  EXPECT_TRUE(LedgerOnRecoveryPartition());
+  ::setenv("__OSINSTALL_ENVIRONMENT", "", 1);
+  EXPECT_FALSE(LedgerOnRecoveryPartition());
+}
+
+TEST_F(RuntimeFacilityTest, CriticalUpdateTimeStampIsKeptPerUser) {
+  EXPECT_FALSE(LedgerCriticalUpdateTimeStamp());
+  double before = secondsNow();
+  LedgerCreateCriticalUpdateTimeStamp();
+  std::optional<PlistDate> stamp = LedgerCriticalUpdateTimeStamp();
+  ASSERT_TRUE(stamp);
+  EXPECT_GE(stamp->secondsSince1970, before - 1);
+  EXPECT_LE(stamp->secondsSince1970, secondsNow() + 1);
+  EXPECT_TRUE(fs::exists(temporary_ + "/config/larder/CriticalUpdate.plist"));
+  // Another user's configuration folder has none.
+  ::setenv("XDG_CONFIG_HOME", (temporary_ + "/other-config").c_str(), 1);
+  EXPECT_FALSE(LedgerCriticalUpdateTimeStamp());
+}
+
+// ---------------------------------------------------------------- device
+
+TEST_F(RuntimeFacilityTest, OSMajorVersionComesFromOSReleaseElseTheKernel) {
+  writeText(rooted("/etc/os-release"),
+            "NAME=\"Debian GNU/Linux\"\nVERSION_ID=\"13.2\"\nID=debian\n");
+  EXPECT_EQ(VendDevice::osMajorVersionString(), "13");
+  writeText(rooted("/etc/os-release"), "NAME=Ubuntu\n  VERSION_ID=22.04  \n");
+  EXPECT_EQ(VendDevice::osMajorVersionString(), "22");
+
+  // No version in /etc: the second place, then the kernel.
+  writeText(rooted("/etc/os-release"), "NAME=rolling\n");
+  writeText(rooted("/usr/lib/os-release"), "VERSION_ID='7'\n");
+  EXPECT_EQ(VendDevice::osMajorVersionString(), "7");
+  fs::remove(rooted("/usr/lib/os-release"));
+  utsname name{};
+  ASSERT_EQ(::uname(&name), 0);
+  std::string release = name.release;
+  std::string kernelMajor = release.substr(0, release.find_first_not_of("0123456789"));
+  EXPECT_EQ(VendDevice::osMajorVersionString(), kernelMajor);
+
+  EXPECT_EQ(VendDevice::majorVersionOf("\"12\""), "12");
+  EXPECT_EQ(VendDevice::majorVersionOf("bookworm"), "");
+}
+
+TEST_F(RuntimeFacilityTest, GuidPrefersMachineIdAndOtherwiseKeepsOneItMade) {
+  const std::string machineId = "0123456789abcdef0123456789ABCDEF";
+  writeText(rooted("/etc/machine-id"), machineId + "\n");
+  EXPECT_EQ(VendDevice::guid(), machineId);
+
+  writeText(rooted("/etc/machine-id"), "not-an-id\n");
+  std::string made = VendDevice::guid();
+  EXPECT_EQ(made.size(), 32u);
+  EXPECT_NE(made, machineId);
+  EXPECT_EQ(VendDevice::guid(), made) << "the identifier stays the same";
+  EXPECT_EQ(readText(platformState("machine-guid")), made + "\n");
+
+  fs::remove(rooted("/etc/machine-id"));
+  EXPECT_EQ(VendDevice::guid(), made);
+}
+
+TEST_F(RuntimeFacilityTest, AvailableDiskSpaceIsThatOfThePlatformRoot) {
+  std::uint64_t space = VendDevice::availableDiskSpace();
+  std::error_code code;
+  fs::space_info info = fs::space(root_, code);
+  ASSERT_FALSE(code);
+  // Other processes write meanwhile; the two readings are close, not equal.
+  double difference = static_cast<double>(space) - static_cast<double>(info.available);
+  EXPECT_LT(std::abs(difference), 256.0 * 1024 * 1024);
+  EXPECT_GT(space, 0u);
+  ::setenv("LARDER_ROOT", (temporary_ + "/missing-root").c_str(), 1);
+  EXPECT_EQ(VendDevice::availableDiskSpace(), 0u);
+}
+
+// ---------------------------------------------------------------- privileged helper
+
+TEST_F(RuntimeFacilityTest, RootHelperWritesSystemPreferencesWithTheOSVersion) {
+  writeText(rooted("/etc/os-release"), "VERSION_ID=\"13.1\"\n");
+  const std::string path = rooted("/etc/larder/com.orvane.larderd.plist");
+  EXPECT_EQ(LedgerRootHelper::systemPreferencesPath(), path);
+  writePlist(path, PlistValue(PlistDictionary{{"OVPInviteURL", "https://example.test/invite"},
+                                              {"OVPInviteOrgName", "Example"},
+                                              {"Unrelated", "kept"}}));
+
+  LedgerRootHelper::Proxy& proxy = LedgerRootHelper::sharedInstance().proxy();
+  proxy.setAutoUpdateEnabledPreference(false);
+  proxy.setAutoUpdateRestartRequiredEnabledPreference(true);
+  proxy.setLastDoItLaterLogoutFailed(true);
+  PlistValue stored = readPlist(path);
+  ASSERT_TRUE(stored["AutoUpdate"].isBoolean());
+  EXPECT_FALSE(stored["AutoUpdate"].boolValue());
+  EXPECT_EQ(stored["AutoUpdateMajorOSVersion"], PlistValue("13"));
+  EXPECT_TRUE(stored["AutoUpdateRestartRequired"].boolValue());
+  EXPECT_EQ(stored["AutoUpdateRestartRequiredMajorOSVersion"], PlistValue("13"));
+  EXPECT_TRUE(stored["LastDoItLaterLogoutFailed"].boolValue());
+
+  proxy.deleteOVPInviteFromPreferences();
+  stored = readPlist(path);
+  EXPECT_TRUE(stored["OVPInviteURL"].isNull());
+  EXPECT_TRUE(stored["OVPInviteOrgName"].isNull());
+  EXPECT_EQ(stored["Unrelated"], PlistValue("kept"));
+  EXPECT_FALSE(stored["AutoUpdate"].boolValue());
+}
+
+TEST_F(RuntimeFacilityTest, RootHelperKeepsTheLockedPathsAsASet) {
+  LedgerRootHelper::Proxy& proxy = LedgerRootHelper::sharedInstance().proxy();
+  proxy.updateLockedFilePaths({"/Applications/A.app", "/Applications/B.app"}, true);
+  proxy.updateLockedFilePaths({"/Applications/A.app"}, true);
+  EXPECT_EQ(readPlist(platformState("locked-file-paths.plist")),
+            PlistValue(PlistArray{"/Applications/A.app", "/Applications/B.app"}));
+  proxy.updateLockedFilePaths({"/Applications/A.app", "/Applications/Never.app"}, false);
+  EXPECT_EQ(readPlist(LedgerRootHelper::lockedFilePathsPath()),
+            PlistValue(PlistArray{"/Applications/B.app"}));
+}
+
+TEST_F(RuntimeFacilityTest, StateFileChangesFromManyThreadsAreNotLost) {
+  PlatformStateFile file(platformState("counter.plist"));
+  constexpr int kThreads = 6;
+  constexpr int kIncrements = 40;
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&] {
+      for (int i = 0; i < kIncrements; ++i) {
+        file.updateDictionary([](PlistDictionary& state) {
+          state["count"] = PlistValue(state)["count"].int64Value() + 1;
+        });
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  EXPECT_EQ(PlistValue(file.readDictionary())["count"].int64Value(), kThreads * kIncrements);
+}
+
+// ---------------------------------------------------------------- launcher bar and store app
+
+TEST_F(RuntimeFacilityTest, DockRecordsIconsPlaceholdersAndMessages) {
+  VendStoreClient store =
+      VendStoreClient::initWithStoreClientType(VendStoreClient::kStoreApplication);
+  const std::string iconSource = temporary_ + "/icon.png";
+  writeText(iconSource, "PNGDATA");
+  LedgerDockMessaging& dock = LedgerDockMessaging::sharedInstance();
+  dock.loadIconForIdentifier("061-12345", "file://" + iconSource, store);
+  dock.loadIconForProductID(400100, "https://store.test/icon.png", store);
+  dock.loadIconForIdentifier("../../escape", iconSource, store);
+
+  std::string location = LedgerIconLocationForIdentifier(store.identifier(), "061-12345");
+  EXPECT_EQ(readText(location), "PNGDATA");
+  EXPECT_FALSE(fs::exists(LedgerIconLocationForIdentifier(store.identifier(), "400100")))
+      << "remote icons are recorded, not fetched";
+  std::string escaped = LedgerIconLocationForIdentifier(store.identifier(), "../../escape");
+  EXPECT_EQ(fs::path(escaped).parent_path(), fs::path(location).parent_path());
+  EXPECT_EQ(readText(escaped), "PNGDATA");
+
+  LedgerRootHelper::sharedInstance().proxy().createPlaceholderWithName("Big Update", 0,
+                                                                       PlistData{1, 2, 3});
+  dock.createPlaceholderWithName("Other", 0, PlistData{});
+  dock.removePlaceholderWithName("Other");
+  dock.sendMessageForUpdate(
+      PlistDictionary{{"productKey", "061-12345"}, {"title", "Big Update"}},
+      PlistDictionary{{"state", PlistValue(std::int64_t{2})}, {"percentComplete", 40.0}});
+
+  PlistValue state = readPlist(LedgerDockMessaging::stateFilePath());
+  const std::string iconKey = store.identifier() + "/061-12345";
+  EXPECT_EQ(state["icons"][iconKey]["url"], PlistValue("file://" + iconSource));
+  EXPECT_EQ(state["icons"][iconKey]["location"], PlistValue(location));
+  EXPECT_EQ(state["icons"][store.identifier() + "/400100"]["url"],
+            PlistValue("https://store.test/icon.png"));
+  EXPECT_EQ(state["placeholders"]["Big Update"]["iconData"], PlistValue(PlistData{1, 2, 3}));
+  EXPECT_TRUE(state["placeholders"]["Other"].isNull());
+  EXPECT_EQ(state["messages"]["061-12345"]["status"]["percentComplete"], PlistValue(40.0));
+
+  LedgerRootHelper::sharedInstance().proxy().removePlaceholderWithName("Big Update");
+  EXPECT_TRUE(
+      readPlist(LedgerDockMessaging::stateFilePath())["placeholders"]["Big Update"].isNull());
+}
+
+TEST_F(RuntimeFacilityTest, StoreApplicationLaunchIsRecordedAndStarted) {
+  const std::string url = "quaymart://showUpdatesPage?source=installer";
+  EXPECT_TRUE(LedgerQuaymartLauncher::sharedInstance().launchQuaymartWithURL(url));
+  PlistValue state = readPlist(LedgerQuaymartLauncher::stateFilePath());
+  ASSERT_TRUE(state["launches"].isArray());
+  ASSERT_EQ(state["launches"].array()->size(), 1u);
+  EXPECT_EQ(state["launches"].array()->at(0)["url"], PlistValue(url));
+  EXPECT_FALSE(state["launches"].array()->at(0)["launched"].boolValue());
+
+  const std::string script = temporary_ + "/store-app.sh";
+  const std::string output = temporary_ + "/store-app.out";
+  writeText(script, "#!/bin/sh\nprintf '%s' \"$1\" > '" + output + ".tmp' && mv '" + output +
+                        ".tmp' '" + output + "'\n");
+  ASSERT_EQ(::chmod(script.c_str(), 0755), 0);
+  ::setenv("LARDER_STORE_APP", script.c_str(), 1);
+  EXPECT_TRUE(LedgerQuaymartLauncher::sharedInstance().launchQuaymartWithURL(url));
+  auto deadline = std::chrono::steady_clock::now() + 10s;
+  while (!fs::exists(output) && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(20ms);
+  }
+  EXPECT_EQ(readText(output), url);
+  state = readPlist(LedgerQuaymartLauncher::stateFilePath());
+  ASSERT_EQ(state["launches"].array()->size(), 2u);
+  EXPECT_TRUE(state["launches"].array()->at(1)["launched"].boolValue());
+
+  ::setenv("LARDER_STORE_APP", (temporary_ + "/no-such-program").c_str(), 1);
+  EXPECT_FALSE(LedgerQuaymartLauncher::sharedInstance().launchQuaymartWithURL(url));
+}
+
+// ---------------------------------------------------------------- file manager
+
+TEST_F(RuntimeFacilityTest, StoreSoftwareIsTheBundleWithAPurchaseRecord) {
+  std::string store =
+      makeBundle(rooted("/Applications/Store.app"), {{"HostBundleIdentifier", "com.example.store"}},
+                 purchaseRecordText("com.example.store"));
+  std::string plain = makeBundle(rooted("/Applications/Plain.app"),
+                                 {{"HostBundleIdentifier", "com.example.plain"}});
+  std::string damaged = makeBundle(rooted("/Applications/Damaged.app"),
+                                   {{"HostBundleIdentifier", "com.example.damaged"}},
+                                   std::string("<plist><dict><key>wareID"));
+  std::string notDictionary =
+      makeBundle(rooted("/Applications/Array.app"), {},
+                 PropertyListSerialization::writeXml(PlistValue(PlistArray{"a"})));
+  EXPECT_TRUE(VendFileManager::isQuaymartAppAtPath(store));
+  EXPECT_FALSE(VendFileManager::isQuaymartAppAtPath(plain));
+  EXPECT_FALSE(VendFileManager::isQuaymartAppAtPath(damaged));
+  EXPECT_FALSE(VendFileManager::isQuaymartAppAtPath(notDictionary));
+  EXPECT_FALSE(VendFileManager::isQuaymartAppAtPath(rooted("/Applications/Missing.app")));
+  EXPECT_FALSE(VendFileManager::isQuaymartAppAtPath(store + "/purchase.plist"));
+}
+
+TEST_F(RuntimeFacilityTest, InstallableMeansAReplaceableBundleInAnApplicationFolder) {
+  PlistDictionary info{{"HostBundleIdentifier", "com.example.app"}};
+  std::string top = makeBundle(rooted("/Applications/App.app"), info);
+  std::string sub = makeBundle(rooted("/Applications/Utilities/Tool.app"), info);
+  std::string inHome = makeBundle(home_ + "/Applications/Mine.app", info);
+  std::string onVolume = makeBundle(rooted("/Volumes/Disk/Applications/There.app"), info);
+  std::string outside = makeBundle(rooted("/opt/Elsewhere.app"), info);
+  std::string nested = makeBundle(top + "/helpers/Helper.app", info);
+  std::string notBundle = rooted("/Applications/Folder");
+  fs::create_directories(notBundle);
+  std::string link = rooted("/Applications/Link.app");
+  fs::create_directory_symlink(top, link);
+
+  EXPECT_TRUE(VendFileManager::isInstallableAtPath(top));
+  EXPECT_TRUE(VendFileManager::isInstallableAtPath(top + "/"));
+  EXPECT_TRUE(VendFileManager::isInstallableAtPath(sub));
+  EXPECT_TRUE(VendFileManager::isInstallableAtPath(inHome));
+  EXPECT_TRUE(VendFileManager::isInstallableAtPath(onVolume));
+  EXPECT_FALSE(VendFileManager::isInstallableAtPath(outside));
+  EXPECT_FALSE(VendFileManager::isInstallableAtPath(nested));
+  EXPECT_FALSE(VendFileManager::isInstallableAtPath(notBundle));
+  EXPECT_FALSE(VendFileManager::isInstallableAtPath(link));
+  EXPECT_FALSE(VendFileManager::isInstallableAtPath(rooted("/Applications/Missing.app")));
+  EXPECT_FALSE(VendFileManager::isInstallableAtPath(rooted("/Applications/../opt/Elsewhere.app")));
+}
+
+TEST_F(RuntimeFacilityTest, BundleInAFolderWeCannotWriteIsNotInstallable) {
+  if (::geteuid() == 0) GTEST_SKIP() << "permissions do not bind the superuser";
+  std::string locked = rooted("/Applications/Locked");
+  std::string lockedBundle =
+      makeBundle(locked + "/Held.app", {{"HostBundleIdentifier", "com.example.app"}});
+  ASSERT_TRUE(VendFileManager::isInstallableAtPath(lockedBundle));
+  ASSERT_EQ(::chmod(locked.c_str(), 0555), 0);
+  lockedFolders_.push_back(locked);
+  EXPECT_FALSE(VendFileManager::isInstallableAtPath(lockedBundle));
+}
+
+TEST_F(RuntimeFacilityTest, DisplayNamePrefersTheBundlesOwnNames) {
+  std::string both =
+      makeBundle(rooted("/Applications/Both.app"),
+                 {{"HostBundleDisplayName", "Shown Name"}, {"HostBundleName", "Name"}});
+  std::string nameOnly =
+      makeBundle(rooted("/Applications/NameOnly.app"),
+                 {{"HostBundleDisplayName", ""}, {"HostBundleName", "Plain Name"}});
+  std::string bare = makeBundle(rooted("/Applications/Bare Folder.app"), {});
+  EXPECT_EQ(VendFileManager::displayNameAtPath(both), "Shown Name");
+  EXPECT_EQ(VendFileManager::displayNameAtPath(nameOnly), "Plain Name");
+  EXPECT_EQ(VendFileManager::displayNameAtPath(bare), "Bare Folder");
+  EXPECT_EQ(VendFileManager::displayNameAtPath(bare + "/"), "Bare Folder");
+  EXPECT_EQ(VendFileManager::displayNameAtPath(rooted("/Applications/Gone.app")), "Gone");
+}
+
+}  // namespace
+}  // namespace larder

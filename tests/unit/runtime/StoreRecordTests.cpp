@@ -1,0 +1,788 @@
+// The shared store records: their archive and wire forms, what they refuse,
+// and the behaviour the update queue, the book library and the purchase
+// paths rely on.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <cmath>
+#include <cstdint>
+#include <functional>
+#include <limits>
+#include <set>
+#include <string>
+#include <vector>
+
+#include "platform/KeyedArchive.h"
+#include "store-runtime/LedgerBook.h"
+#include "store-runtime/LedgerDAAPPurchasedItem.h"
+#include "store-runtime/LedgerSoftwareUpdateStatus.h"
+#include "store-runtime/LedgerUpdate.h"
+#include "store-runtime/SysupQuaymartUpdate.h"
+#include "store-runtime/TillPurchase.h"
+
+namespace larder {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::UnorderedElementsAreArray;
+
+constexpr std::uint64_t kHugeIdentifier = std::numeric_limits<std::uint64_t>::max();
+const std::set<std::string, std::less<>> kRecordClasses{"dictionary",
+                                                        "array",
+                                                        "LedgerUpdate",
+                                                        "SysupQuaymartUpdate",
+                                                        "LedgerBook",
+                                                        "TillPurchase",
+                                                        "LedgerDAAPPurchasedItem",
+                                                        "LedgerSoftwareUpdateStatus"};
+
+// Through a real archive: binary property list out and back in.
+PlistValue throughArchive(const PlistValue& root) {
+  std::string error;
+  std::optional<PlistValue> decoded =
+      KeyedArchive::unarchivedRoot(KeyedArchive::archivedData(root), kRecordClasses, &error);
+  EXPECT_TRUE(decoded) << error;
+  return decoded.value_or(PlistValue());
+}
+
+std::vector<std::string> keysOf(const PlistDictionary& dictionary) {
+  std::vector<std::string> keys;
+  for (const auto& [key, value] : dictionary) keys.push_back(key);
+  return keys;
+}
+
+// Values of every type, and the awkward ones of each, that a file or a
+// client could put under any key.
+std::vector<PlistValue> hostileValues() {
+  return {PlistValue("text"),
+          PlistValue(""),
+          PlistValue(std::int64_t{-1}),
+          PlistValue(std::numeric_limits<std::int64_t>::min()),
+          PlistValue(kHugeIdentifier),
+          PlistValue(std::nan("")),
+          PlistValue(std::numeric_limits<double>::infinity()),
+          PlistValue(2.5),
+          PlistValue(true),
+          PlistValue(PlistData{0xff, 0x00}),
+          PlistValue(PlistDate{std::nan("")}),
+          PlistValue(PlistArray{1, "two"}),
+          PlistValue(PlistDictionary{{"$class", "LedgerBook"}}),
+          PlistValue(PlistUid{3})};
+}
+
+// Replaces each key of a valid dictionary in turn by each hostile value.
+// Whatever the decoder makes of it must be either a refusal or a record
+// whose own encoding decodes to the same encoding again: no crash, and no
+// record that cannot survive its next save. Encodings are compared as
+// archived bytes, so that a NaN kept verbatim compares equal to itself.
+template <typename Decode, typename Encode>
+void expectRefusedOrStable(const PlistDictionary& valid, Decode decode, Encode encode) {
+  for (const auto& [key, original] : valid) {
+    for (const PlistValue& hostile : hostileValues()) {
+      PlistDictionary damaged = valid;
+      damaged[key] = hostile;
+      auto record = decode(damaged);
+      if (!record) continue;
+      PlistDictionary encoded = encode(*record);
+      auto again = decode(encoded);
+      ASSERT_TRUE(again) << "re-decoding failed after replacing " << key;
+      EXPECT_EQ(KeyedArchive::archivedData(encode(*again)), KeyedArchive::archivedData(encoded))
+          << "unstable after replacing " << key;
+    }
+  }
+}
+
+// ---------------------------------------------------------------- LedgerUpdate
+
+PlistDictionary storeItem(std::uint64_t wareID = 409183694) {
+  return PlistDictionary{
+      {"ware-id", PlistValue(wareID)},
+      {"bundle-id", "com.example.Keynote"},
+      {"title", "Keynote"},
+      {"version", "13.1"},
+      {"action-params", "productType=C&itemId=409183694&price=0"},
+      {"release-date", PlistDate{1700000000}},
+      // Keys the service does not know are the store's business and stay.
+      {"size", std::int64_t{123456789}},
+      {"whats-new", PlistDictionary{{"text", "Bug fixes"}, {"links", PlistArray{"a", "b"}}}},
+  };
+}
+
+TEST(StoreRecordLedgerUpdate, ReadsTheStoreItemThroughItsAccessors) {
+  LedgerUpdateRef update = LedgerUpdate::initWithDictionary(storeItem(kHugeIdentifier));
+  ASSERT_TRUE(update);
+  EXPECT_EQ(update->itemIdentifierValue(), kHugeIdentifier);
+  EXPECT_EQ(update->itemIdentifier(), PlistValue(kHugeIdentifier));
+  EXPECT_EQ(update->bundleID(), "com.example.Keynote");
+  EXPECT_EQ(update->title(), "Keynote");
+  EXPECT_EQ(update->version(), "13.1");
+  EXPECT_EQ(update->actionParams(), "productType=C&itemId=409183694&price=0");
+  EXPECT_EQ(update->releaseDate(), PlistDate{1700000000});
+  // A fresh item has no marks, and its dictionary is the item unchanged.
+  EXPECT_FALSE(update->isStaged());
+  EXPECT_FALSE(update->hasBeenSeenByUser());
+  EXPECT_EQ(update->autoUpdateAbortCode(), 0);
+  EXPECT_FALSE(update->firstAutoUpdateAttemptDate());
+  EXPECT_FALSE(update->didFailToAutoInstall());
+  EXPECT_EQ(update->dictionary(), storeItem(kHugeIdentifier));
+
+  // Only the identifier is required.
+  LedgerUpdateRef bare = LedgerUpdate::initWithDictionary({{"ware-id", 7}});
+  ASSERT_TRUE(bare);
+  EXPECT_EQ(bare->itemIdentifierValue(), 7u);
+  EXPECT_FALSE(bare->bundleID());
+  EXPECT_FALSE(bare->releaseDate());
+}
+
+TEST(StoreRecordLedgerUpdate, LocalMarksLiveInTheDictionaryAndSurviveMergeAndArchive) {
+  LedgerUpdateRef cached = LedgerUpdate::initWithDictionary(storeItem());
+  ASSERT_TRUE(cached);
+  cached->setIsStaged(true);
+  cached->setHasBeenSeenByUser(true);
+  cached->setAutoUpdateAbortCode(3);
+  cached->setFirstAutoUpdateAttemptDate(PlistDate{1700000500.25});
+  cached->setDidFailToAutoInstall(true);
+
+  const PlistDictionary& persisted = cached->dictionary();
+  EXPECT_EQ(persisted.at(std::string(LedgerUpdate::kIsStagedKey)), PlistValue(true));
+  EXPECT_EQ(persisted.at(std::string(LedgerUpdate::kAutoUpdateAbortCodeKey)),
+            PlistValue(std::int64_t{3}));
+  EXPECT_EQ(persisted.at("size"), PlistValue(std::int64_t{123456789}));
+
+  // The update queue's merge: start from the cached dictionary and let every
+  // key the store sends win. The store's new values arrive, the marks stay.
+  PlistDictionary fromStore = storeItem();
+  fromStore["version"] = "13.2";
+  fromStore["title"] = "Keynote Pro";
+  fromStore["new-key"] = "new";
+  PlistDictionary merged = cached->dictionary();
+  for (const auto& [key, value] : fromStore) merged.insert_or_assign(key, value);
+  LedgerUpdateRef renewed = LedgerUpdate::initWithDictionary(merged);
+  ASSERT_TRUE(renewed);
+  EXPECT_EQ(renewed->version(), "13.2");
+  EXPECT_EQ(renewed->title(), "Keynote Pro");
+  EXPECT_TRUE(renewed->isStaged());
+  EXPECT_TRUE(renewed->hasBeenSeenByUser());
+  EXPECT_EQ(renewed->autoUpdateAbortCode(), 3);
+  EXPECT_EQ(renewed->firstAutoUpdateAttemptDate(), PlistDate{1700000500.25});
+  EXPECT_TRUE(renewed->didFailToAutoInstall());
+  EXPECT_EQ(renewed->dictionary().at("new-key"), PlistValue("new"));
+
+  // The archive keeps the whole item, unknown keys and marks included.
+  LedgerUpdateRef unarchived =
+      LedgerUpdate::initWithCoder(throughArchive(renewed->encodeWithCoder()));
+  ASSERT_TRUE(unarchived);
+  EXPECT_EQ(unarchived->dictionary(), renewed->dictionary());
+
+  // Clearing the date removes its key; the other marks keep explicit values.
+  renewed->setFirstAutoUpdateAttemptDate(std::nullopt);
+  renewed->setIsStaged(false);
+  EXPECT_FALSE(renewed->dictionary().contains(LedgerUpdate::kFirstAutoUpdateAttemptDateKey));
+  EXPECT_FALSE(renewed->isStaged());
+  EXPECT_EQ(renewed->dictionary().at(std::string(LedgerUpdate::kIsStagedKey)), PlistValue(false));
+}
+
+TEST(StoreRecordLedgerUpdate, MalformedItemsAreRefusedSoThatTheGoodOnesCanBeKept) {
+  auto with = [](std::string_view key, PlistValue value) {
+    PlistDictionary item = storeItem();
+    item.insert_or_assign(std::string(key), std::move(value));
+    return item;
+  };
+  PlistDictionary withoutWareID = storeItem();
+  withoutWareID.erase("ware-id");
+  const std::vector<std::pair<std::string, PlistDictionary>> malformed = {
+      {"no ware-id", withoutWareID},
+      {"ware-id as text", with("ware-id", "409183694")},
+      {"negative ware-id", with("ware-id", std::int64_t{-5})},
+      {"zero ware-id", with("ware-id", 0)},
+      {"ware-id as real", with("ware-id", 5.5)},
+      {"ware-id as bool", with("ware-id", true)},
+      {"bundle-id as number", with("bundle-id", 12)},
+      {"title as array", with("title", PlistArray{"Keynote"})},
+      {"version as number", with("version", 13.1)},
+      {"action-params as data", with("action-params", PlistData{1, 2})},
+      {"release-date as text", with("release-date", "2023-11-14")},
+      {"release-date not finite", with("release-date", PlistDate{std::nan("")})},
+      {"staged mark as text", with(LedgerUpdate::kIsStagedKey, "YES")},
+      {"abort code as real", with(LedgerUpdate::kAutoUpdateAbortCodeKey, 3.5)},
+      {"attempt date as dictionary",
+       with(LedgerUpdate::kFirstAutoUpdateAttemptDateKey, PlistDictionary{})},
+  };
+  std::vector<PlistDictionary> answer{storeItem(1)};
+  for (const auto& [why, item] : malformed) {
+    EXPECT_FALSE(LedgerUpdate::isValidItem(item)) << why;
+    EXPECT_FALSE(LedgerUpdate::initWithDictionary(item)) << why;
+    answer.push_back(item);
+  }
+  answer.push_back(storeItem(2));
+
+  std::vector<std::uint64_t> kept;
+  for (const PlistDictionary& item : answer) {
+    if (LedgerUpdateRef update = LedgerUpdate::initWithDictionary(item)) {
+      kept.push_back(update->itemIdentifierValue());
+    }
+  }
+  EXPECT_THAT(kept, ElementsAre(1u, 2u));
+
+  // Archives that are not a record of ours give nothing.
+  EXPECT_FALSE(LedgerUpdate::initWithCoder(PlistValue(42)));
+  EXPECT_FALSE(LedgerUpdate::initWithCoder(KeyedArchive::record("LedgerBook")));
+  EXPECT_FALSE(LedgerUpdate::initWithCoder(KeyedArchive::record(LedgerUpdate::kClassName)));
+  PlistDictionary notAnItem = KeyedArchive::record(LedgerUpdate::kClassName);
+  notAnItem.emplace("dictionary", PlistArray{storeItem()});
+  EXPECT_FALSE(LedgerUpdate::initWithCoder(notAnItem));
+
+  expectRefusedOrStable(
+      storeItem(),
+      [](const PlistDictionary& item) { return LedgerUpdate::initWithDictionary(item); },
+      [](const LedgerUpdate& update) { return update.dictionary(); });
+}
+
+TEST(StoreRecordLedgerUpdate, WireFormUsesFieldNamesAndCarriesTheWholeItem) {
+  LedgerUpdateRef update = LedgerUpdate::initWithDictionary(storeItem(kHugeIdentifier));
+  ASSERT_TRUE(update);
+  update->setAutoUpdateAbortCode(-7);
+
+  PlistDictionary wire = update->toDictionary();
+  EXPECT_THAT(keysOf(wire), UnorderedElementsAreArray<std::string>(
+                                {"itemIdentifier", "bundleID", "title", "version", "actionParams",
+                                 "releaseDate", "isStaged", "hasBeenSeenByUser",
+                                 "autoUpdateAbortCode", "didFailToAutoInstall", "dictionary"}));
+  EXPECT_EQ(wire.at("itemIdentifier").type(), PlistValue::Type::UnsignedInteger);
+  EXPECT_EQ(wire.at("itemIdentifier").uint64Value(), kHugeIdentifier);
+  EXPECT_EQ(wire.at("actionParams"), PlistValue("productType=C&itemId=409183694&price=0"));
+  EXPECT_EQ(wire.at("isStaged"), PlistValue(false));
+  EXPECT_EQ(wire.at("autoUpdateAbortCode"), PlistValue(std::int64_t{-7}));
+  EXPECT_EQ(wire.at("dictionary"), PlistValue(update->dictionary()));
+
+  LedgerUpdateRef back = LedgerUpdate::fromDictionary(wire);
+  ASSERT_TRUE(back);
+  EXPECT_EQ(back->dictionary(), update->dictionary());
+
+  // A client may send only field names, with the date as seconds, the way
+  // the bus carries dates.
+  LedgerUpdateRef sent = LedgerUpdate::fromDictionary({{"itemIdentifier", std::uint64_t{55}},
+                                                       {"bundleID", "com.example.App"},
+                                                       {"releaseDate", 1600000000.5},
+                                                       {"isStaged", true}});
+  ASSERT_TRUE(sent);
+  EXPECT_EQ(sent->itemIdentifierValue(), 55u);
+  EXPECT_EQ(sent->bundleID(), "com.example.App");
+  EXPECT_EQ(sent->releaseDate(), PlistDate{1600000000.5});
+  EXPECT_EQ(*sent->dictionary().at("release-date").date(), PlistDate{1600000000.5});
+  EXPECT_TRUE(sent->isStaged());
+
+  // A field given by name wins over the same value inside "dictionary".
+  wire["title"] = "Renamed";
+  LedgerUpdateRef renamed = LedgerUpdate::fromDictionary(wire);
+  ASSERT_TRUE(renamed);
+  EXPECT_EQ(renamed->title(), "Renamed");
+  EXPECT_EQ(renamed->dictionary().at("size"), PlistValue(std::int64_t{123456789}));
+
+  // Wrong types by name, a "dictionary" that is none, or no identifier at all.
+  EXPECT_FALSE(LedgerUpdate::fromDictionary({{"itemIdentifier", "55"}}));
+  EXPECT_FALSE(LedgerUpdate::fromDictionary({{"itemIdentifier", 55}, {"isStaged", "yes"}}));
+  EXPECT_FALSE(LedgerUpdate::fromDictionary({{"itemIdentifier", 55}, {"dictionary", 1}}));
+  EXPECT_FALSE(LedgerUpdate::fromDictionary({{"bundleID", "com.example.App"}}));
+  EXPECT_FALSE(LedgerUpdate::fromDictionary({}));
+}
+
+// -------------------------------------------------------- SysupQuaymartUpdate
+
+SysupQuaymartUpdateFields osUpdateFields() {
+  SysupQuaymartUpdateFields fields;
+  fields.productKey = "041-12345";
+  fields.tags = {"SysupBUNDLE:com.example.SetupHerald", "major"};
+  fields.title = "System Update";
+  fields.versionString = "14.2";
+  fields.longDescription = "Fixes.";
+  fields.action = 2;
+  fields.isCritical = true;
+  fields.isRecommended = true;
+  fields.firmwareWarning = "Keep the machine plugged in.";
+  fields.licenseAgreement = "Terms.";
+  fields.applicationIdentifiersToClose = {"com.example.Mail", "com.example.Notes"};
+  fields.allowedToUseInstallLater = true;
+  fields.downloadMetadata = {{"thumbnailImageURL", "https://store.example/icon.png"},
+                             {"itemIdentifier", std::uint64_t{9}}};
+  return fields;
+}
+
+TEST(StoreRecordSysupQuaymartUpdate, RoundTripsThroughArchiveAndWire) {
+  SysupQuaymartUpdate update(osUpdateFields());
+  EXPECT_EQ(update.thumbnailImageURL(), "https://store.example/icon.png");
+
+  std::optional<SysupQuaymartUpdate> unarchived =
+      SysupQuaymartUpdate::initWithCoder(throughArchive(update.encodeWithCoder()));
+  ASSERT_TRUE(unarchived);
+  EXPECT_EQ(*unarchived, update);
+
+  PlistDictionary wire = update.toDictionary();
+  EXPECT_EQ(wire.at("tags"),
+            PlistValue(PlistArray{"SysupBUNDLE:com.example.SetupHerald", "major"}));
+  EXPECT_EQ(wire.at("action"), PlistValue(std::int64_t{2}));
+  std::optional<SysupQuaymartUpdate> back = SysupQuaymartUpdate::fromDictionary(wire);
+  ASSERT_TRUE(back);
+  EXPECT_EQ(*back, update);
+
+  // Absent texts and metadata are left out, not sent empty.
+  SysupQuaymartUpdateFields plain;
+  plain.productKey = "041-0";
+  PlistDictionary plainWire = SysupQuaymartUpdate(plain).toDictionary();
+  for (const char* key : {"title", "firmwareWarning", "licenseAgreement", "downloadMetadata"}) {
+    EXPECT_FALSE(plainWire.contains(key)) << key;
+  }
+  std::optional<SysupQuaymartUpdate> plainBack = SysupQuaymartUpdate::fromDictionary(plainWire);
+  ASSERT_TRUE(plainBack);
+  EXPECT_FALSE(plainBack->thumbnailImageURL());
+  EXPECT_FALSE(plainBack->firmwareWarning());
+}
+
+TEST(StoreRecordSysupQuaymartUpdate, RefusesMissingKeyAndWrongTypes) {
+  const PlistDictionary valid = SysupQuaymartUpdate(osUpdateFields()).toDictionary();
+  auto with = [&](const char* key, PlistValue value) {
+    PlistDictionary wire = valid;
+    wire[key] = std::move(value);
+    return wire;
+  };
+  PlistDictionary withoutKey = valid;
+  withoutKey.erase("productKey");
+  EXPECT_FALSE(SysupQuaymartUpdate::fromDictionary(withoutKey));
+  EXPECT_FALSE(SysupQuaymartUpdate::fromDictionary(with("productKey", "")));
+  EXPECT_FALSE(SysupQuaymartUpdate::fromDictionary(with("tags", PlistArray{"ok", 3})));
+  EXPECT_FALSE(SysupQuaymartUpdate::fromDictionary(with("tags", "SysupBUNDLE:x")));
+  EXPECT_FALSE(SysupQuaymartUpdate::fromDictionary(with("action", "2")));
+  EXPECT_FALSE(SysupQuaymartUpdate::fromDictionary(with("isCritical", "true")));
+  EXPECT_FALSE(SysupQuaymartUpdate::fromDictionary(with("downloadMetadata", PlistArray{})));
+  EXPECT_FALSE(SysupQuaymartUpdate::initWithCoder(PlistValue("041-12345")));
+  EXPECT_FALSE(SysupQuaymartUpdate::initWithCoder(valid));  // no "$class"
+
+  expectRefusedOrStable(
+      valid, [](const PlistDictionary& wire) { return SysupQuaymartUpdate::fromDictionary(wire); },
+      [](const SysupQuaymartUpdate& update) { return update.toDictionary(); });
+}
+
+// ------------------------------------------------- LedgerSoftwareUpdateStatus
+
+TEST(StoreRecordSoftwareUpdateStatus, PhaseAndProgressFollowWhatTheFrameworkSays) {
+  using Status = LedgerSoftwareUpdateStatus;
+  EXPECT_EQ(
+      Status::initWithProgress(40, PlistDictionary{{"currentState", "downloading"}}, true).state(),
+      Status::kStateDownloading);
+  EXPECT_EQ(
+      Status::initWithProgress(40, PlistDictionary{{"currentState", "installing"}}, true).state(),
+      Status::kStateInstalling);
+  // A numeric state wins over the word, and is kept even if unknown to us.
+  EXPECT_EQ(Status::initWithProgress(
+                10, PlistDictionary{{"state", 6}, {"currentState", "downloading"}}, true)
+                .state(),
+            6);
+  EXPECT_EQ(Status::initWithProgress(10, PlistDictionary{{"state", 9}}, true).state(), 9);
+  // Without a say from the framework: finished only at 100 percent.
+  EXPECT_EQ(Status::initWithProgress(100, std::nullopt, false).state(), Status::kStateFinished);
+  EXPECT_TRUE(Status::initWithProgress(100, std::nullopt, false).hasEnded());
+  EXPECT_EQ(Status::initWithProgress(99.9, std::nullopt, true).state(), Status::kStateInstalling);
+  EXPECT_EQ(Status::initWithProgress(50, PlistDictionary{{"currentState", 7}}, true).state(),
+            Status::kStateInstalling);
+
+  EXPECT_EQ(Status::initWithProgress(-5, std::nullopt, true).percentComplete(), 0);
+  EXPECT_EQ(Status::initWithProgress(250, std::nullopt, true).percentComplete(), 100);
+  EXPECT_EQ(Status::initWithProgress(std::nan(""), std::nullopt, true).percentComplete(), 0);
+  EXPECT_EQ(Status::initWithProgress(42.5, std::nullopt, true).percentComplete(), 42.5);
+
+  VendError failure{.code = 4, .description = "Authorization failed"};
+  Status failed = Status::initWithError(failure);
+  EXPECT_EQ(failed.state(), Status::kStateFailed);
+  EXPECT_TRUE(failed.hasEnded());
+  EXPECT_FALSE(failed.canCancel());
+  ASSERT_TRUE(failed.error());
+  EXPECT_EQ(*failed.error(), failure);
+}
+
+TEST(StoreRecordSoftwareUpdateStatus, RoundTripsAndRefusesWrongTypes) {
+  using Status = LedgerSoftwareUpdateStatus;
+  const Status progress =
+      Status::initWithProgress(37.5, PlistDictionary{{"currentState", "downloading"}}, true);
+  const Status failed = Status::initWithError(
+      VendError{.code = -128, .description = "Cancelled", .userInfo = {{"extra", "x"}}});
+  for (const Status& status : {progress, failed}) {
+    std::optional<Status> unarchived =
+        Status::initWithCoder(throughArchive(status.encodeWithCoder()));
+    ASSERT_TRUE(unarchived) << status.description();
+    EXPECT_EQ(*unarchived, status);
+    std::optional<Status> back = Status::fromDictionary(status.toDictionary());
+    ASSERT_TRUE(back) << status.description();
+    EXPECT_EQ(*back, status);
+  }
+  EXPECT_FALSE(progress.toDictionary().contains("error"));
+  EXPECT_FALSE(failed.toDictionary().contains("statusInfo"));
+
+  EXPECT_FALSE(Status::fromDictionary({{"percentComplete", "37"}}));
+  EXPECT_FALSE(Status::fromDictionary({{"state", 4.0}}));
+  EXPECT_FALSE(Status::fromDictionary({{"error", "failed"}}));
+  EXPECT_FALSE(Status::fromDictionary({{"statusInfo", PlistArray{}}}));
+  EXPECT_FALSE(Status::initWithCoder(progress.toDictionary()));  // no "$class"
+  // Out-of-range progress from outside is clamped like local progress.
+  std::optional<Status> clamped = Status::fromDictionary({{"percentComplete", 1e9}});
+  ASSERT_TRUE(clamped);
+  EXPECT_EQ(clamped->percentComplete(), 100);
+
+  expectRefusedOrStable(
+      failed.toDictionary(),
+      [](const PlistDictionary& wire) { return Status::fromDictionary(wire); },
+      [](const Status& status) { return status.toDictionary(); });
+}
+
+// ------------------------------------------------------ LedgerBook and items
+
+LedgerCloudItemFields cloudFields() {
+  LedgerCloudItemFields fields;
+  fields.itemIdentifier = kHugeIdentifier;
+  fields.title = "The Book";
+  fields.uniqueIdentifier = std::to_string(kHugeIdentifier);
+  fields.publicationVersion = 3;
+  fields.publicationDisplayVersion = "1.2";
+  fields.author = "A. Writer";
+  fields.category = "Fiction";
+  fields.sortName = "Book, The";
+  fields.coverImageURL = "https://store.example/cover.jpg";
+  fields.purchaseDate = PlistDate{1500000000};
+  fields.daapDictionary = PlistDictionary{{"dmap.itemid", 77}, {"daap.songgenre", "Fiction"}};
+  fields.daapItemIdentifier = 77;
+  fields.daapPurchasedToken = 4294967295u;
+  fields.oaxenItemIdentifier = 88;
+  fields.expectedReleaseDate = PlistDate{1800000000};
+  fields.downloadAssetSize = 5'000'000'000ull;
+  fields.redownloadBuyParams = "itemId=1234&pricingParameters=RDWN";
+  fields.updateBuyParams = "itemId=1234&pricingParameters=UPDT";
+  return fields;
+}
+
+LedgerBook localBook() {
+  LedgerBookFields fields;
+  static_cast<LedgerCloudItemFields&>(fields) = cloudFields();
+  fields.isLocal = true;
+  fields.path = "/home/u/Books/book.epub";
+  fields.bookInfo = PlistDictionary{{"publication-version", 3}};
+  fields.sonorelMetaData =
+      PlistDictionary{{"itemId", 1234}, {"book-info", PlistDictionary{{"publication-version", 3}}}};
+  return LedgerBook(std::move(fields));
+}
+
+TEST(StoreRecordLedgerBook, EqualityCoversEveryFieldAndCopiesAreIndependent) {
+  const LedgerBook original = localBook();
+  EXPECT_TRUE(original.isEqualToBook(localBook()));
+  EXPECT_TRUE(LedgerBook().isEqualToBook(LedgerBook()));
+
+  const std::vector<std::pair<std::string, std::function<void(LedgerBookFields&)>>> changes = {
+      {"isLocal", [](auto& f) { f.isLocal = false; }},
+      {"path", [](auto& f) { f.path = "/elsewhere.epub"; }},
+      {"bookInfo", [](auto& f) { (*f.bookInfo)["publication-version"] = 4; }},
+      {"sonorelMetaData", [](auto& f) { f.sonorelMetaData.reset(); }},
+      {"itemIdentifier", [](auto& f) { f.itemIdentifier = 1; }},
+      {"title", [](auto& f) { f.title = "Other"; }},
+      {"publicationVersion", [](auto& f) { f.publicationVersion = 4; }},
+      {"purchaseDate", [](auto& f) { f.purchaseDate = PlistDate{1500000000.5}; }},
+      {"daapDictionary", [](auto& f) { (*f.daapDictionary)["dmap.itemid"] = 78; }},
+      {"daapPurchasedToken", [](auto& f) { f.daapPurchasedToken.reset(); }},
+      {"updateBuyParams", [](auto& f) { f.updateBuyParams = ""; }},
+  };
+  for (const auto& [field, change] : changes) {
+    LedgerBook changed = localBook();
+    change(changed.fields());
+    EXPECT_FALSE(original.isEqualToBook(changed)) << field;
+    EXPECT_FALSE(changed.isEqualToBook(original)) << field;
+
+    // What the library's merge does: the record it holds takes the rebuilt
+    // values and stays the same object, which observers already hold.
+    LedgerBookRef held = localBook().copy();
+    const LedgerBook* identity = held.get();
+    held->copyLibraryPropertiesFromBook(changed);
+    EXPECT_EQ(held.get(), identity);
+    EXPECT_TRUE(held->isEqualToBook(changed)) << field;
+  }
+
+  // A copy is a new record: changing it leaves the original alone.
+  LedgerBookRef copy = original.copy();
+  ASSERT_TRUE(copy);
+  EXPECT_NE(copy.get(), &original);
+  EXPECT_TRUE(copy->isEqualToBook(original));
+  copy->fields().title = "Changed";
+  (*copy->fields().bookInfo)["publication-version"] = 9;
+  EXPECT_EQ(original.title(), "The Book");
+  EXPECT_EQ(original.fields().bookInfo->at("publication-version"), PlistValue(3));
+}
+
+TEST(StoreRecordLedgerBook, RoundTripsThroughArchiveAndWireWithAbsentFieldsLeftOut) {
+  const LedgerBook book = localBook();
+  LedgerBookRef unarchived = LedgerBook::initWithCoder(throughArchive(book.encodeWithCoder()));
+  ASSERT_TRUE(unarchived);
+  EXPECT_TRUE(unarchived->isEqualToBook(book));
+
+  PlistDictionary wire = book.toDictionary();
+  EXPECT_EQ(book.dictionaryRepresentation(), wire);
+  EXPECT_EQ(wire.at("itemIdentifier").uint64Value(), kHugeIdentifier);
+  EXPECT_EQ(wire.at("downloadAssetSize"), PlistValue(std::uint64_t{5'000'000'000ull}));
+  LedgerBookRef back = LedgerBook::fromDictionary(wire);
+  ASSERT_TRUE(back);
+  EXPECT_TRUE(back->isEqualToBook(book));
+
+  // A book made with nothing says only that it is not local.
+  EXPECT_THAT(keysOf(LedgerBook().toDictionary()), ElementsAre("isLocal"));
+  LedgerBookRef empty = LedgerBook::fromDictionary({});
+  ASSERT_TRUE(empty);
+  EXPECT_TRUE(empty->isEqualToBook(LedgerBook()));
+  // Dates arrive from the bus as seconds.
+  LedgerBookRef dated = LedgerBook::fromDictionary({{"purchaseDate", 1500000000.0}});
+  ASSERT_TRUE(dated);
+  EXPECT_EQ(dated->fields().purchaseDate, PlistDate{1500000000});
+
+  // The library's own file: a dictionary of records of both kinds.
+  LedgerDAAPPurchasedItem item(cloudFields());
+  PlistValue decoded = throughArchive(KeyedArchive::dictionary(
+      {{"localBooksByPath",
+        KeyedArchive::dictionary({{"/home/u/Books/book.epub", book.encodeWithCoder()}})},
+       {"purchasedBooksByItemID", KeyedArchive::dictionary({{"88", item.encodeWithCoder()}})}}));
+  LedgerBookRef fromFile =
+      LedgerBook::initWithCoder(decoded["localBooksByPath"]["/home/u/Books/book.epub"]);
+  ASSERT_TRUE(fromFile);
+  EXPECT_TRUE(fromFile->isEqualToBook(book));
+  LedgerDAAPPurchasedItemRef itemFromFile =
+      LedgerDAAPPurchasedItem::initWithCoder(decoded["purchasedBooksByItemID"]["88"]);
+  ASSERT_TRUE(itemFromFile);
+  EXPECT_TRUE(itemFromFile->isEqualToBook(item));
+  // Each kind refuses the other's archive.
+  EXPECT_FALSE(LedgerBook::initWithCoder(decoded["purchasedBooksByItemID"]["88"]));
+  EXPECT_FALSE(LedgerDAAPPurchasedItem::initWithCoder(book.encodeWithCoder()));
+}
+
+TEST(StoreRecordLedgerBook, WrongTypesAreRefused) {
+  const PlistDictionary valid = localBook().toDictionary();
+  for (const char* key : {"itemIdentifier", "publicationVersion", "daapItemIdentifier",
+                          "daapPurchasedToken", "oaxenItemIdentifier", "downloadAssetSize"}) {
+    PlistDictionary negative = valid;
+    negative[key] = std::int64_t{-1};
+    EXPECT_FALSE(LedgerBook::fromDictionary(negative)) << key << " negative";
+    PlistDictionary text = valid;
+    text[key] = "12";
+    EXPECT_FALSE(LedgerBook::fromDictionary(text)) << key << " as text";
+  }
+  for (const char* key : {"title", "path", "author", "coverImageURL", "redownloadBuyParams"}) {
+    PlistDictionary number = valid;
+    number[key] = 5;
+    EXPECT_FALSE(LedgerBook::fromDictionary(number)) << key;
+  }
+  for (const char* key : {"bookInfo", "sonorelMetaData", "daapDictionary"}) {
+    PlistDictionary array = valid;
+    array[key] = PlistArray{PlistDictionary{}};
+    EXPECT_FALSE(LedgerBook::fromDictionary(array)) << key;
+  }
+  PlistDictionary badDate = valid;
+  badDate["expectedReleaseDate"] = PlistDate{std::numeric_limits<double>::infinity()};
+  EXPECT_FALSE(LedgerBook::fromDictionary(badDate));
+  PlistDictionary badFlag = valid;
+  badFlag["isLocal"] = "YES";
+  EXPECT_FALSE(LedgerBook::fromDictionary(badFlag));
+  EXPECT_FALSE(LedgerBook::initWithCoder(PlistValue(PlistArray{})));
+  EXPECT_FALSE(LedgerBook::initWithCoder(valid));  // no "$class"
+
+  expectRefusedOrStable(
+      valid, [](const PlistDictionary& wire) { return LedgerBook::fromDictionary(wire); },
+      [](const LedgerBook& book) { return book.toDictionary(); });
+}
+
+TEST(StoreRecordLedgerBook, RedownloadPurchaseNeedsParametersAndIsARedownload) {
+  LedgerBook book = localBook();
+  std::optional<TillPurchase> purchase = book.redownloadPurchase();
+  ASSERT_TRUE(purchase);
+  EXPECT_EQ(purchase->buyParameters(), "itemId=1234&pricingParameters=RDWN");
+  // The record's own identifier wins over the one in the parameters.
+  EXPECT_EQ(purchase->itemIdentifier(), kHugeIdentifier);
+  EXPECT_TRUE(purchase->isRedownload());
+  EXPECT_FALSE(purchase->isUpdate());
+
+  book.fields().itemIdentifier.reset();
+  ASSERT_TRUE(book.redownloadPurchase());
+  EXPECT_EQ(book.redownloadPurchase()->itemIdentifier(), 1234u);
+
+  book.fields().redownloadBuyParams = "";
+  EXPECT_FALSE(book.redownloadPurchase());
+  book.fields().redownloadBuyParams.reset();
+  EXPECT_FALSE(book.redownloadPurchase());
+  EXPECT_FALSE(LedgerBook().redownloadPurchase());
+}
+
+TEST(StoreRecordDAAPPurchasedItem, HasExactlyTheCloudFieldsOfABook) {
+  LedgerDAAPPurchasedItem item(cloudFields());
+  EXPECT_FALSE(item.isLocal());
+  EXPECT_EQ(item.path(), "daap:88");
+  EXPECT_FALSE(LedgerDAAPPurchasedItem().path());
+
+  // Same keys as a book, less the ones only a local file gives.
+  std::vector<std::string> bookKeys = keysOf(localBook().toDictionary());
+  std::erase_if(bookKeys, [](const std::string& key) {
+    return key == "isLocal" || key == "path" || key == "bookInfo" || key == "sonorelMetaData";
+  });
+  EXPECT_EQ(keysOf(item.toDictionary()), bookKeys);
+  // And the same values under them.
+  PlistDictionary bookWire = localBook().toDictionary();
+  for (const auto& [key, value] : item.toDictionary()) EXPECT_EQ(bookWire.at(key), value) << key;
+
+  LedgerDAAPPurchasedItemRef unarchived =
+      LedgerDAAPPurchasedItem::initWithCoder(throughArchive(item.encodeWithCoder()));
+  ASSERT_TRUE(unarchived);
+  EXPECT_TRUE(unarchived->isEqualToBook(item));
+  LedgerDAAPPurchasedItemRef back = LedgerDAAPPurchasedItem::fromDictionary(item.toDictionary());
+  ASSERT_TRUE(back);
+  EXPECT_TRUE(back->isEqualToBook(item));
+  EXPECT_EQ(item.dictionaryRepresentation(), item.toDictionary());
+
+  LedgerDAAPPurchasedItemRef copy = item.copy();
+  copy->fields().daapDictionary->insert_or_assign("dmap.itemid", 1);
+  EXPECT_FALSE(copy->isEqualToBook(item));
+  copy->copyLibraryPropertiesFromBook(item);
+  EXPECT_TRUE(copy->isEqualToBook(item));
+
+  std::optional<TillPurchase> purchase = item.redownloadPurchase();
+  ASSERT_TRUE(purchase);
+  EXPECT_TRUE(purchase->isRedownload());
+  EXPECT_EQ(purchase->itemIdentifier(), kHugeIdentifier);
+
+  EXPECT_FALSE(LedgerDAAPPurchasedItem::fromDictionary({{"oaxenItemIdentifier", -88}}));
+  expectRefusedOrStable(
+      item.toDictionary(),
+      [](const PlistDictionary& wire) { return LedgerDAAPPurchasedItem::fromDictionary(wire); },
+      [](const LedgerDAAPPurchasedItem& record) { return record.toDictionary(); });
+}
+
+// -------------------------------------------------------------- TillPurchase
+
+TEST(StoreRecordTillPurchase, ItemIdentifierComesFromTheBuyParameters) {
+  using P = TillPurchase;
+  EXPECT_EQ(P::itemIdentifierFromBuyParameters("itemId=123"), 123u);
+  EXPECT_EQ(P::itemIdentifierFromBuyParameters("productType=C&itemId=5&price=0"), 5u);
+  EXPECT_EQ(P::itemIdentifierFromBuyParameters("?itemId=9"), 9u);
+  EXPECT_EQ(P::itemIdentifierFromBuyParameters("itemId=18446744073709551615"), kHugeIdentifier);
+  EXPECT_EQ(P::itemIdentifierFromBuyParameters("salableWareId=5&appExtVrsId=7"), 5u);
+  // "itemId" is preferred wherever it stands, and a broken one falls back.
+  EXPECT_EQ(P::itemIdentifierFromBuyParameters("salableWareId=5&itemId=6"), 6u);
+  EXPECT_EQ(P::itemIdentifierFromBuyParameters("itemId=&salableWareId=3"), 3u);
+  // The first of two wins.
+  EXPECT_EQ(P::itemIdentifierFromBuyParameters("itemId=1&itemId=2"), 1u);
+
+  for (const char* broken : {"", "itemId", "itemId=", "itemId=12abc", "itemId=-1", "itemId=+4",
+                             "itemId= 4", "itemId=18446744073709551616", "xitemId=4", "ItemId=4",
+                             "bids=com.example.App", "itemId=0x10", "&&&", "=4"}) {
+    EXPECT_FALSE(P::itemIdentifierFromBuyParameters(broken)) << broken;
+  }
+
+  TillPurchase purchase = P::purchaseWithBuyParameters("productType=C&itemId=42");
+  EXPECT_EQ(purchase.buyParameters(), "productType=C&itemId=42");
+  EXPECT_EQ(purchase.itemIdentifier(), 42u);
+  EXPECT_EQ(P::purchaseWithBuyParameters("bids=com.example.App").itemIdentifier(), 0u);
+}
+
+TEST(StoreRecordTillPurchase, PreflightCheckFollowsTheAccountLessOptions) {
+  TillPurchase purchase;
+  EXPECT_FALSE(purchase.checkPreflightAterPurchase());
+
+  PlistDictionary options{{std::string(TillPurchaseAccountLessOptionPerformPreflightCheck), true},
+                          {std::string(TillPurchaseAccountLessOptionAllowRedownload), false}};
+  purchase.setAccountLessOptions(options);
+  EXPECT_TRUE(purchase.checkPreflightAterPurchase());
+  EXPECT_EQ(purchase.accountLessOptions(), options);
+  EXPECT_FALSE(TillPurchase::accountLessOption(purchase.accountLessOptions(),
+                                               TillPurchaseAccountLessOptionAllowRedownload));
+
+  // An explicit setting after the options wins.
+  purchase.setCheckPreflightAterPurchase(false);
+  EXPECT_FALSE(purchase.checkPreflightAterPurchase());
+
+  // Integers count as C counts them; text and other types do not count.
+  purchase.setAccountLessOptions(
+      PlistDictionary{{std::string(TillPurchaseAccountLessOptionPerformPreflightCheck), 1}});
+  EXPECT_TRUE(purchase.checkPreflightAterPurchase());
+  purchase.setAccountLessOptions(
+      PlistDictionary{{std::string(TillPurchaseAccountLessOptionPerformPreflightCheck), "YES"}});
+  EXPECT_FALSE(purchase.checkPreflightAterPurchase());
+  purchase.setAccountLessOptions(
+      PlistDictionary{{std::string(TillPurchaseAccountLessOptionPerformPreflightCheck), true}});
+  purchase.setAccountLessOptions(std::nullopt);
+  EXPECT_FALSE(purchase.checkPreflightAterPurchase());
+  EXPECT_FALSE(purchase.accountLessOptions());
+
+  // The wire form: a missing flag is implied by the options, a present one
+  // is taken as sent.
+  PlistDictionary wire{
+      {"buyParams", "salableWareId=5"},
+      {"accountLessOptions",
+       PlistDictionary{{std::string(TillPurchaseAccountLessOptionPerformPreflightCheck), true}}}};
+  std::optional<TillPurchase> implied = TillPurchase::fromDictionary(wire);
+  ASSERT_TRUE(implied);
+  EXPECT_TRUE(implied->checkPreflightAterPurchase());
+  wire["checkPreflightAterPurchase"] = false;
+  std::optional<TillPurchase> overridden = TillPurchase::fromDictionary(wire);
+  ASSERT_TRUE(overridden);
+  EXPECT_FALSE(overridden->checkPreflightAterPurchase());
+}
+
+TEST(StoreRecordTillPurchase, WireDictionaryIsTheBuyRequestAndRoundTrips) {
+  TillPurchase purchase = TillPurchase::purchaseWithBuyParameters("itemId=7&appExtVrsId=3");
+  purchase.setItemIdentifier(kHugeIdentifier);
+  purchase.setPurchaseType(TillPurchase::kPurchaseTypeBackground);
+  purchase.setParentalControls(PlistDictionary{{"rating", 300}});
+  purchase.setIsUpdate(true);
+  purchase.setIsOVP(true);
+  purchase.setIsAccountLessPurchase(true);
+  purchase.setAccountLessOptions(
+      PlistDictionary{{std::string(TillPurchaseAccountLessOptionAllowRedownload), true}});
+  purchase.setOrvaneID("someone@example.org");
+  purchase.setAccountIdentifier(99);
+
+  PlistDictionary wire = purchase.toDictionary();
+  EXPECT_THAT(keysOf(wire),
+              UnorderedElementsAreArray<std::string>(
+                  {"buyParams", "itemIdentifier", "purchaseType", "parentalControls", "isUpdate",
+                   "isRedownload", "isOVP", "isAccountLessPurchase", "accountLessOptions",
+                   "checkPreflightAterPurchase", "orvaneID", "accountIdentifier"}));
+  EXPECT_EQ(wire.at("buyParams"), PlistValue("itemId=7&appExtVrsId=3"));
+  EXPECT_EQ(wire.at("itemIdentifier").uint64Value(), kHugeIdentifier);
+  EXPECT_EQ(wire.at("purchaseType"), PlistValue(std::int64_t{3}));
+  EXPECT_EQ(wire.at("isUpdate"), PlistValue(true));
+  EXPECT_EQ(wire.at("isRedownload"), PlistValue(false));
+
+  std::optional<TillPurchase> back = TillPurchase::fromDictionary(wire);
+  ASSERT_TRUE(back);
+  EXPECT_EQ(*back, purchase);
+  std::optional<TillPurchase> unarchived =
+      TillPurchase::initWithCoder(throughArchive(purchase.encodeWithCoder()));
+  ASSERT_TRUE(unarchived);
+  EXPECT_EQ(*unarchived, purchase);
+
+  // Absent optionals are left out; what remains still round-trips.
+  PlistDictionary plain = TillPurchase().toDictionary();
+  for (const char* key : {"parentalControls", "accountLessOptions", "orvaneID"}) {
+    EXPECT_FALSE(plain.contains(key)) << key;
+  }
+  EXPECT_EQ(plain.at("accountIdentifier"), PlistValue(std::int64_t{0}));
+  std::optional<TillPurchase> plainBack = TillPurchase::fromDictionary(plain);
+  ASSERT_TRUE(plainBack);
+  EXPECT_EQ(*plainBack, TillPurchase());
+
+  EXPECT_FALSE(TillPurchase::fromDictionary({{"itemIdentifier", std::int64_t{-1}}}));
+  EXPECT_FALSE(TillPurchase::fromDictionary({{"itemIdentifier", "7"}}));
+  EXPECT_FALSE(TillPurchase::fromDictionary({{"buyParams", 7}}));
+  EXPECT_FALSE(TillPurchase::fromDictionary({{"isUpdate", "true"}}));
+  EXPECT_FALSE(TillPurchase::fromDictionary({{"accountLessOptions", PlistArray{}}}));
+  EXPECT_FALSE(TillPurchase::fromDictionary({{"orvaneID", 1}}));
+  EXPECT_FALSE(TillPurchase::fromDictionary({{"purchaseType", 2.5}}));
+  EXPECT_FALSE(TillPurchase::initWithCoder(wire));  // no "$class"
+  EXPECT_FALSE(TillPurchase::initWithCoder(KeyedArchive::record("LedgerBook")));
+
+  expectRefusedOrStable(
+      wire, [](const PlistDictionary& sent) { return TillPurchase::fromDictionary(sent); },
+      [](const TillPurchase& record) { return record.toDictionary(); });
+}
+
+}  // namespace
+}  // namespace larder

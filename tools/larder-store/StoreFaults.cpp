@@ -1,0 +1,63 @@
+#include "larder-store/StoreFaults.h"
+
+#include <array>
+#include <utility>
+
+namespace larder {
+namespace {
+
+constexpr std::array<std::pair<StoreFaults::Kind, std::string_view>, 6> kKindNames{{
+    {StoreFaults::Kind::ServerError, "500"},
+    {StoreFaults::Kind::Stall, "stall"},
+    {StoreFaults::Kind::NotPlist, "not-plist"},
+    {StoreFaults::Kind::WrongShape, "wrong-shape"},
+    {StoreFaults::Kind::Truncate, "truncate"},
+    {StoreFaults::Kind::Corrupt, "corrupt"},
+}};
+
+}  // namespace
+
+std::string_view StoreFaults::kindName(Kind kind) {
+  for (const auto& [candidate, name] : kKindNames) {
+    if (candidate == kind) return name;
+  }
+  return "unknown";
+}
+
+std::optional<StoreFaults::Kind> StoreFaults::kindNamed(std::string_view name) {
+  for (const auto& [kind, candidate] : kKindNames) {
+    if (candidate == name) return kind;
+  }
+  return std::nullopt;
+}
+
+std::optional<StoreFaults> StoreFaults::parse(const std::vector<std::string>& faultTexts,
+                                              std::string* error) {
+  StoreFaults faults;
+  for (const std::string& faultText : faultTexts) {
+    const auto equals = faultText.find('=');
+    const auto route = storeRouteNamed(std::string_view(faultText).substr(0, equals));
+    const auto kind = equals == std::string::npos
+                          ? std::nullopt
+                          : kindNamed(std::string_view(faultText).substr(equals + 1));
+    if (!route || !kind) {
+      if (error)
+        *error = "fault \"" + faultText + "\" is not ROUTE=KIND with a known route and kind";
+      return std::nullopt;
+    }
+    if (appliesOnlyToAssets(*kind) && *route != StoreRoute::Assets) {
+      if (error) *error = "fault \"" + faultText + "\" applies only to the assets route";
+      return std::nullopt;
+    }
+    faults.faults_[*route] = *kind;
+  }
+  return faults;
+}
+
+std::optional<StoreFaults::Kind> StoreFaults::faultFor(StoreRoute route) const {
+  const auto found = faults_.find(route);
+  if (found == faults_.end()) return std::nullopt;
+  return found->second;
+}
+
+}  // namespace larder

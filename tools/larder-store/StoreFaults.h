@@ -1,0 +1,45 @@
+#pragma once
+
+#include <map>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "larder-store/StoreRoute.h"
+
+namespace larder {
+
+// Faults that the store injects on a route, so that tests can see how a
+// client copes with a store that misbehaves. Given as "ROUTE=KIND".
+class StoreFaults {
+ public:
+  enum class Kind {
+    ServerError,  // "500": status 500 with a failure dictionary
+    Stall,        // "stall": no answer until the server stops
+    NotPlist,     // "not-plist": 200 with bytes that are no property list
+    WrongShape,   // "wrong-shape": 200 with a property list of the wrong shape
+    Truncate,     // "truncate" (assets): full Content-Length, half the bytes
+    Corrupt,      // "corrupt" (assets): bytes flipped in the middle
+  };
+
+  // Parses every "ROUTE=KIND" text; on the first bad one returns nullopt and
+  // says why in *error.
+  static std::optional<StoreFaults> parse(const std::vector<std::string>& faultTexts,
+                                          std::string* error);
+
+  [[nodiscard]] std::optional<Kind> faultFor(StoreRoute route) const;
+  [[nodiscard]] bool empty() const { return faults_.empty(); }
+
+  static std::string_view kindName(Kind kind);
+
+ private:
+  static std::optional<Kind> kindNamed(std::string_view name);
+  static bool appliesOnlyToAssets(Kind kind) {
+    return kind == Kind::Truncate || kind == Kind::Corrupt;
+  }
+
+  std::map<StoreRoute, Kind> faults_;
+};
+
+}  // namespace larder

@@ -1,0 +1,51 @@
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+
+#include "larder-store/PackageDigest.h"
+#include "platform/PlistValue.h"
+
+namespace larder {
+
+// One item of the catalogue: "items/<ware-id>/item.plist" and the package
+// beside it.
+struct StoreItem {
+  struct Preflight {
+    bool allowed = true;
+    std::string minimumSystemVersion = "0";
+  };
+
+  std::uint64_t wareID = 0;
+  std::string bundleID;
+  std::string title;
+  std::string version;
+  std::string actionParams;
+  PlistDate releaseDate;
+  std::string folder;       // absolute path of the item's folder
+  std::string packageName;  // file name inside `folder`
+  std::optional<std::string> thumbnailName;
+  // Present when the item asks for a preflight check before its download.
+  std::optional<Preflight> preflight;
+  bool accountLess = false;
+  PackageDigest digest;  // filled by the catalogue
+
+  [[nodiscard]] std::string packagePath() const { return folder + "/" + packageName; }
+  // The file a request for `name` in the item's assets means, if any.
+  [[nodiscard]] std::optional<std::string> assetPath(std::string_view name) const;
+  // What the preflight route answers for this item.
+  [[nodiscard]] Preflight preflightAnswer() const { return preflight.value_or(Preflight{}); }
+
+  // Reads an item.plist found in `folder`; the folder's name must be the
+  // ware id when the dictionary gives one, and is the ware id when it does
+  // not. nullopt with *error when the entry is malformed.
+  static std::optional<StoreItem> fromDictionary(const PlistValue& dictionary,
+                                                 const std::string& folder, std::string* error);
+
+  // "itemId=<ware-id>&..." for an item whose catalogue entry names no buy
+  // parameters.
+  static std::string defaultActionParams(std::uint64_t wareID);
+};
+
+}  // namespace larder

@@ -1,0 +1,111 @@
+#include "larder-store/StorePurchases.h"
+
+#include <charconv>
+#include <span>
+
+#include "larder-store/StoreAnswers.h"
+#include "platform/PropertyListSerialization.h"
+#include "store-runtime/TillLogManager.h"
+#include "store-runtime/VendRequestSigner.h"
+
+namespace larder {
+namespace {
+
+std::optional<std::uint64_t> positiveNumber(std::string_view text) {
+  std::uint64_t value = 0;
+  const auto* end = text.data() + text.size();
+  const auto [stop, code] = std::from_chars(text.data(), end, value);
+  if (code != std::errc() || stop != end || value == 0) return std::nullopt;
+  return value;
+}
+
+std::span<const std::uint8_t> bytesOf(std::string_view text) {
+  return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
+}
+
+StoreReply failure(int status, std::string_view type, std::string_view message) {
+  return {status, StoreAnswers::failure(type, message), std::nullopt};
+}
+
+}  // namespace
+
+std::optional<std::string_view> StorePurchases::queryValue(std::string_view query,
+                                                           std::string_view key) {
+  while (!query.empty()) {
+    const auto ampersand = query.find('&');
+    const std::string_view pair = query.substr(0, ampersand);
+    const auto equals = pair.find('=');
+    if (pair.substr(0, equals) == key) {
+      return equals == std::string_view::npos ? std::string_view() : pair.substr(equals + 1);
+    }
+    if (ampersand == std::string_view::npos) break;
+    query.remove_prefix(ampersand + 1);
+  }
+  return std::nullopt;
+}
+
+std::optional<std::uint64_t> StorePurchases::itemIdentifierOf(const PlistValue& purchase) {
+  const PlistValue& identifier = purchase["itemIdentifier"];
+  if ((identifier.isInteger() || identifier.isString()) && identifier.uint64Value() > 0) {
+    return identifier.uint64Value();
+  }
+  const std::string* buyParams = purchase["buyParams"].string();
+  if (!buyParams) return std::nullopt;
+  for (std::string_view key : {"itemId", "salableWareId"}) {
+    const auto value = queryValue(*buyParams, key);
+    if (const auto number = value ? positiveNumber(*value) : std::nullopt) return number;
+  }
+  return std::nullopt;
+}
+
+StorePurchases::Signature StorePurchases::checkSignature(const httplib::Request& request,
+                                                         const StoreAccount** signer) const {
+  const std::string accountHeader(VendRequestSigner::kAccountHeader);
+  const std::string signatureHeader(VendRequestSigner::kSignatureHeader);
+  if (!request.has_header(accountHeader) && !request.has_header(signatureHeader)) {
+    return Signature::Absent;
+  }
+  const auto accountID = positiveNumber(request.get_header_value(accountHeader));
+  const StoreAccount* account =
+      accountID ? catalogue_.accounts().accountWithID(*accountID) : nullptr;
+  if (!account) return Signature::Invalid;
+  const VendRequestSigner verifier(account->signingKey);
+  const std::string expected =
+      verifier.requestSignature(request.method, request.target, bytesOf(request.body));
+  if (!VendRequestSigner::signaturesMatch(request.get_header_value(signatureHeader), expected)) {
+    return Signature::Invalid;
+  }
+  *signer = account;
+  return Signature::Valid;
+}
+
+StoreReply StorePurchases::buy(const httplib::Request& request, std::string_view baseURL) const {
+  const StoreAccount* signer = nullptr;
+  const Signature signature = checkSignature(request, &signer);
+  if (signature == Signature::Invalid) {
+    TILL_LOG(2, "%@: refusing a purchase with a bad signature", "StorePurchases");
+    return failure(401, "invalid-signature", "The request's signature is not valid.");
+  }
+  StoreReply reply = [&] {
+    const auto purchase = PropertyListSerialization::read(request.body);
+    const auto identifier =
+        purchase && purchase->isDictionary() ? itemIdentifierOf(*purchase) : std::nullopt;
+    if (!identifier) {
+      return failure(400, "invalid-request", "The purchase names no item.");
+    }
+    const StoreItem* item = catalogue_.itemWithID(*identifier);
+    if (!item) return failure(404, "unknown-item", "This item is not in the store.");
+    if (!signer && !item->accountLess) {
+      return failure(401, "invalid-signature", "Sign in to buy this item.");
+    }
+    TILL_LOG(2, "%@: purchase of %llu (%@)", "StorePurchases",
+             static_cast<unsigned long long>(item->wareID), item->bundleID);
+    return StoreReply{
+        200, PlistDictionary{{"downloads", PlistArray{StoreAnswers::download(*item, baseURL)}}},
+        std::nullopt};
+  }();
+  if (signer) reply.signingKey = signer->signingKey;
+  return reply;
+}
+
+}  // namespace larder

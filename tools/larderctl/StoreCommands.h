@@ -1,0 +1,35 @@
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+
+#include "AssetService/ServiceClient.h"
+
+namespace larder {
+
+// `larderctl signin|signout|account|purchase|downloads`: the store
+// runtime of the service, for people and scripts. Each prints a line of
+// text, or JSON with --json, and returns the process's exit status.
+class StoreCommands {
+ public:
+  // A purchase waits for the store and, with a sign-in dialog, for a person.
+  static constexpr std::uint64_t kPurchaseTimeoutMicroseconds = 600'000'000ULL;
+
+  StoreCommands(ServiceClient& client, bool json) : client_(client), json_(json) {}
+
+  // Without a password, reads it from the first line of standard input.
+  int signIn(const std::string& accountName, std::optional<std::string> password);
+  int signOut();
+  int account();
+  int purchase(std::uint64_t itemIdentifier, const std::string& buyParameters);
+  int downloads(std::int64_t typeMask);
+
+ private:
+  int reportFailure(const PlistValue& error) const;
+
+  ServiceClient& client_;
+  bool json_;
+};
+
+}  // namespace larder
