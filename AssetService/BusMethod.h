@@ -1,8 +1,15 @@
 #pragma once
 
+#include <map>
+#include <memory>
+#include <span>
 #include <string>
 #include <string_view>
 #include <vector>
+
+#include <sdbus-c++/Error.h>
+#include <sdbus-c++/IObject.h>
+#include <sdbus-c++/Message.h>
 
 namespace larder {
 
@@ -17,5 +24,36 @@ struct BusMethod {
   // Sent without waiting for an answer.
   bool noReply = false;
 };
+
+// The method of `methods` named `member`, or null.
+inline const BusMethod* findBusMethod(std::span<const BusMethod> methods, std::string_view member) {
+  for (const BusMethod& method : methods) {
+    if (method.member == member) return &method;
+  }
+  return nullptr;
+}
+
+// Adds `methods` of `interfaceName` to the object, each handled by the
+// target's member function of the same name. A D-Bus error thrown by a
+// handler becomes the call's error reply.
+template <typename Target>
+void exportBusMethods(
+    sdbus::IObject& object, std::string_view interfaceName, std::span<const BusMethod> methods,
+    const std::map<std::string_view, void (Target::*)(sdbus::MethodCall)>& handlers,
+    const std::shared_ptr<Target>& target) {
+  for (const BusMethod& method : methods) {
+    auto handler = handlers.at(method.member);
+    object.registerMethod(std::string(interfaceName), std::string(method.member),
+                          std::string(method.inSignature), method.inNames,
+                          std::string(method.outSignature), method.outNames,
+                          [target, handler](sdbus::MethodCall call) {
+                            try {
+                              ((*target).*handler)(call);
+                            } catch (const sdbus::Error& error) {
+                              call.createErrorReply(error).send();
+                            }
+                          });
+  }
+}
 
 }  // namespace larder

@@ -69,10 +69,7 @@ std::span<const BusMethod> DialogAgentRegistry::agentMethods() {
 }
 
 const BusMethod* DialogAgentRegistry::findMethod(std::string_view member) {
-  for (const BusMethod& method : registryMethodTable()) {
-    if (method.member == member) return &method;
-  }
-  return nullptr;
+  return findBusMethod(registryMethodTable(), member);
 }
 
 DialogAgentRegistry::DialogAgentRegistry()
@@ -87,25 +84,12 @@ void DialogAgentRegistry::exportOn(sdbus::IObject& object, sdbus::IConnection& c
     std::lock_guard lock(mutex_);
     connection_ = &connection;
   }
-  using Handler = void (DialogAgentRegistry::*)(sdbus::MethodCall);
-  const std::map<std::string_view, Handler> handlers{
-      {"RegisterDialogAgent", &DialogAgentRegistry::registerAgent},
-      {"UnregisterDialogAgent", &DialogAgentRegistry::unregisterAgent},
-      {"DisplayDialog", &DialogAgentRegistry::displayDialog},
-  };
-  for (const BusMethod& method : methods()) {
-    Handler handler = handlers.at(method.member);
-    object.registerMethod(std::string(kInterfaceName), std::string(method.member),
-                          std::string(method.inSignature), method.inNames,
-                          std::string(method.outSignature), method.outNames,
-                          [self = shared_from_this(), handler](sdbus::MethodCall call) {
-                            try {
-                              ((*self).*handler)(call);
-                            } catch (const sdbus::Error& error) {
-                              call.createErrorReply(error).send();
-                            }
-                          });
-  }
+  exportBusMethods<DialogAgentRegistry>(
+      object, kInterfaceName, methods(),
+      {{"RegisterDialogAgent", &DialogAgentRegistry::registerAgent},
+       {"UnregisterDialogAgent", &DialogAgentRegistry::unregisterAgent},
+       {"DisplayDialog", &DialogAgentRegistry::displayDialog}},
+      shared_from_this());
 }
 
 void DialogAgentRegistry::registerAgent(sdbus::MethodCall call) {

@@ -69,34 +69,18 @@ std::span<const BusMethod> StoreRuntimeInterface::methods() {
 }
 
 const BusMethod* StoreRuntimeInterface::findMethod(std::string_view member) {
-  for (const BusMethod& method : methodTable()) {
-    if (method.member == member) return &method;
-  }
-  return nullptr;
+  return findBusMethod(methodTable(), member);
 }
 
 void StoreRuntimeInterface::exportOn(sdbus::IObject& object) {
-  using Handler = void (StoreRuntimeInterface::*)(sdbus::MethodCall);
-  const std::map<std::string_view, Handler> handlers{
-      {"SignIn", &StoreRuntimeInterface::signIn},
-      {"SignOut", &StoreRuntimeInterface::signOut},
-      {"PrimaryAccount", &StoreRuntimeInterface::primaryAccount},
-      {"Purchase", &StoreRuntimeInterface::purchase},
-      {"Downloads", &StoreRuntimeInterface::downloads},
-  };
-  for (const BusMethod& method : methods()) {
-    Handler handler = handlers.at(method.member);
-    object.registerMethod(std::string(kInterfaceName), std::string(method.member),
-                          std::string(method.inSignature), method.inNames,
-                          std::string(method.outSignature), method.outNames,
-                          [self = shared_from_this(), handler = handler](sdbus::MethodCall call) {
-                            try {
-                              ((*self).*handler)(call);
-                            } catch (const sdbus::Error& error) {
-                              call.createErrorReply(error).send();
-                            }
-                          });
-  }
+  exportBusMethods<StoreRuntimeInterface>(
+      object, kInterfaceName, methods(),
+      {{"SignIn", &StoreRuntimeInterface::signIn},
+       {"SignOut", &StoreRuntimeInterface::signOut},
+       {"PrimaryAccount", &StoreRuntimeInterface::primaryAccount},
+       {"Purchase", &StoreRuntimeInterface::purchase},
+       {"Downloads", &StoreRuntimeInterface::downloads}},
+      shared_from_this());
 }
 
 void StoreRuntimeInterface::signIn(sdbus::MethodCall call) {

@@ -8,12 +8,13 @@ build=${1:-build}
 if [ -z "${LARDER_DEMO_ON_BUS:-}" ]; then
   ./scripts/install-deps.sh
   cmake -S . -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo >/dev/null
-  cmake --build "$build" -j"$(nproc)" --target larderd larderctl
+  cmake --build "$build" -j"$(nproc)" --target larderd larderctl larder-store
   exec env LARDER_DEMO_ON_BUS=1 dbus-run-session -- "$0" "$build"
 fi
 
 larderd="$PWD/$build/larderd"
 larderctl="$PWD/$build/larderctl"
+larder_store="$PWD/$build/larder-store"
 demo=$(mktemp -d /tmp/larder-demo-XXXXXX)
 export LARDER_ROOT="$demo/root" HOME="$demo/home"
 export XDG_CACHE_HOME="$HOME/.cache" XDG_STATE_HOME="$HOME/.local/state"
@@ -61,11 +62,48 @@ bundle "$LARDER_ROOT/Applications" "Sketchpad" com.example.sketchpad 1.9 400200
 bundle "$HOME/Applications" "Sketchpad" com.example.sketchpad 1.10 400200
 bundle "$LARDER_ROOT/Applications" "Terminal Helper" com.example.helper 1.0
 
-echo "== starting larderd (log: $XDG_STATE_HOME/larderd.log)"
+# A store with one account and one app, Atlas, packed from a bundle.
+catalogue="$demo/catalogue"
+mkdir -p "$catalogue/items/400400"
+cat >"$catalogue/accounts.plist" <<PLIST
+$plist_header
+<array><dict>
+  <key>accountID</key><integer>5150</integer>
+  <key>orvaneID</key><string>demo@example.org</string>
+  <key>password</key><string>demo</string>
+</dict></array>
+</plist>
+PLIST
+bundle "$demo/packaging" "Atlas" com.example.atlas 1.0 400400
+"$larder_store" pack "$demo/packaging/Atlas.app" "$catalogue/items/400400/Atlas.tar"
+cat >"$catalogue/items/400400/item.plist" <<PLIST
+$plist_header
+<dict>
+  <key>ware-id</key><integer>400400</integer>
+  <key>bundle-id</key><string>com.example.atlas</string>
+  <key>title</key><string>Atlas</string>
+  <key>version</key><string>1.0</string>
+  <key>action-params</key><string>itemId=400400&amp;price=0</string>
+  <key>release-date</key><date>2026-10-01T09:00:00Z</date>
+  <key>package</key><string>Atlas.tar</string>
+</dict>
+</plist>
+PLIST
+
 mkdir -p "$XDG_STATE_HOME"
+echo "== starting larder-store (log: $XDG_STATE_HOME/larder-store.log)"
+"$larder_store" --catalogue "$catalogue" --port 0 >"$demo/store.out" 2>"$XDG_STATE_HOME/larder-store.log" &
+store=$!
+for _ in $(seq 50); do
+  grep -q listening "$demo/store.out" 2>/dev/null && break
+  sleep 0.1
+done
+export LARDER_STORE_URL="$(sed -n 's/.*listening on //p' "$demo/store.out")/bag.plist"
+
+echo "== starting larderd (log: $XDG_STATE_HOME/larderd.log)"
 "$larderd" 2>"$XDG_STATE_HOME/larderd.log" &
 service=$!
-trap 'kill $service 2>/dev/null; rm -rf "$demo"' EXIT
+trap 'kill $service $store 2>/dev/null; rm -rf "$demo"' EXIT
 for _ in $(seq 50); do
   "$larderctl" products >/dev/null 2>&1 && break
   sleep 0.1
@@ -101,3 +139,20 @@ kill -INT $watcher
 wait $watcher || true
 echo; echo "== larderctl products"
 "$larderctl" products
+
+echo; echo "== larderctl dialog  (no dialog agent is registered: the dialog counts as cancelled, 0)"
+"$larderctl" dialog --message "Install updates now?" --ok Install --cancel Later
+echo; echo "== larderctl purchase 400400, while larderctl agent answers the sign-in dialog"
+"$larderctl" agent --answer ok --account demo@example.org --password demo --count 1 &
+agent=$!
+sleep 0.3
+"$larderctl" purchase 400400
+wait $agent || true
+"$larderctl" account
+for _ in $(seq 50); do
+  [ -e "$LARDER_ROOT/Applications/Atlas.app/purchase.plist" ] && break
+  sleep 0.1
+done
+sleep 0.5  # the live query sees the new bundle
+echo; echo "== larderctl product --bundle-id com.example.atlas  (downloaded, digests checked, installed)"
+"$larderctl" product --bundle-id com.example.atlas

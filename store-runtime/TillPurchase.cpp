@@ -5,6 +5,7 @@
 #include "platform/KeyedArchive.h"
 #include "store-runtime/RecordFieldReader.h"
 #include "store-runtime/RecordFieldWriter.h"
+#include "store-runtime/VendStringHelpers.h"
 
 namespace larder {
 
@@ -28,14 +29,6 @@ constexpr std::string_view kAccountIdentifierKey = "accountIdentifier";
 constexpr std::string_view kItemIdParameter = "itemId";
 constexpr std::string_view kSalableWareIdParameter = "salableWareId";
 
-std::optional<std::uint64_t> decimal(std::string_view text) {
-  if (text.empty()) return std::nullopt;
-  std::uint64_t value = 0;
-  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), value);
-  if (error != std::errc{} || end != text.data() + text.size()) return std::nullopt;
-  return value;
-}
-
 // The value of the first parameter named `name` in query text; no
 // percent-decoding, since the values we look for are plain numbers.
 std::optional<std::string_view> queryValue(std::string_view query, std::string_view name) {
@@ -55,7 +48,7 @@ std::optional<std::string_view> queryValue(std::string_view query, std::string_v
 
 std::optional<std::uint64_t> numericParameter(std::string_view query, std::string_view name) {
   const std::optional<std::string_view> text = queryValue(query, name);
-  return text ? decimal(*text) : std::nullopt;
+  return text ? unsignedDecimalNumber(*text) : std::nullopt;
 }
 
 void putFields(PlistDictionary& target, const TillPurchase& purchase) {

@@ -9,6 +9,7 @@
 #include <filesystem>
 
 #include "platform/DispatchQueue.h"
+#include "platform/Environment.h"
 #include "store-runtime/TillLogManager.h"
 #include "store-runtime/VendAssetFetcher.h"
 #include "store-runtime/VendDownloadError.h"
@@ -122,6 +123,15 @@ bool hasVerifiedPackage(const TillDownloadAsset& asset, const std::string& path)
   return true;
 }
 
+// A configuration made by hand may leave the folder out; downloads then go
+// where the service keeps them, never to a path relative to "/".
+VendRuntimeConfiguration withDownloadsDirectory(VendRuntimeConfiguration configuration) {
+  if (configuration.downloadsDirectory.empty()) {
+    configuration.downloadsDirectory = Environment::cacheHome() + "/com.orvane.larderd/Downloads";
+  }
+  return configuration;
+}
+
 }  // namespace
 
 struct VendDownloadManager::Job {
@@ -150,7 +160,7 @@ VendDownloadManager::VendDownloadManager(const VendRuntimeConfiguration& configu
 
 VendDownloadManager::VendDownloadManager(const VendRuntimeConfiguration& configuration,
                                          Limits limits)
-    : configuration_(configuration),
+    : configuration_(withDownloadsDirectory(configuration)),
       limits_(limits),
       replyQueue_(
           DispatchQueue::create("VendDownloadManager replies", DispatchQueue::Kind::Concurrent,

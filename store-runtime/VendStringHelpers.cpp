@@ -1,5 +1,7 @@
 #include "store-runtime/VendStringHelpers.h"
 
+#include <charconv>
+
 #include <pwd.h>
 #include <unistd.h>
 
@@ -72,6 +74,15 @@ std::string urlByAddingStringToQueryString(std::string_view url, std::string_vie
   result += text;
   result += fragment;
   return result;
+}
+
+std::optional<std::uint64_t> unsignedDecimalNumber(std::string_view text) {
+  if (text.empty()) return std::nullopt;
+  std::uint64_t value = 0;
+  const char* end = text.data() + text.size();
+  const auto [stop, code] = std::from_chars(text.data(), end, value);
+  if (code != std::errc() || stop != end) return std::nullopt;
+  return value;
 }
 
 }  // namespace larder

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <cstdint>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -16,5 +18,9 @@ std::string stringByExpandingTildeInPathOutsideOfSandbox(std::string_view path);
 // front of a "#fragment", which stays last. A leading "?" or "&" of `text`
 // is dropped; empty text leaves the URL as it is.
 std::string urlByAddingStringToQueryString(std::string_view url, std::string_view text);
+
+// The whole text as an unsigned decimal number: no sign, no spaces, no
+// trailing characters, no overflow; nullopt otherwise.
+std::optional<std::uint64_t> unsignedDecimalNumber(std::string_view text);
 
 }  // namespace larder

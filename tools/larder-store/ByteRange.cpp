@@ -1,4 +1,5 @@
 #include "larder-store/ByteRange.h"
+#include "store-runtime/VendStringHelpers.h"
 
 #include <algorithm>
 #include <charconv>
@@ -11,14 +12,6 @@ std::string_view trimmed(std::string_view text) {
   while (!text.empty() && (text.front() == ' ' || text.front() == '\t')) text.remove_prefix(1);
   while (!text.empty() && (text.back() == ' ' || text.back() == '\t')) text.remove_suffix(1);
   return text;
-}
-
-std::optional<std::uint64_t> number(std::string_view text) {
-  std::uint64_t value = 0;
-  const auto* end = text.data() + text.size();
-  const auto [stop, code] = std::from_chars(text.data(), end, value);
-  if (text.empty() || code != std::errc() || stop != end) return std::nullopt;
-  return value;
 }
 
 ByteRange whole(std::uint64_t size) {
@@ -35,7 +28,7 @@ ByteRange partial(std::uint64_t first, std::uint64_t last) {
 
 // "-n": the last n bytes.
 ByteRange suffix(std::string_view count, std::uint64_t size) {
-  const auto bytes = number(count);
+  const auto bytes = unsignedDecimalNumber(count);
   if (!bytes) return whole(size);
   if (*bytes == 0 || size == 0) return unsatisfiable();
   return partial(size - std::min(*bytes, size), size - 1);
@@ -53,9 +46,10 @@ ByteRange ByteRange::select(std::string_view header, std::uint64_t size) {
     return whole(size);
   }
   if (dash == 0) return suffix(ranges.substr(1), size);
-  const auto first = number(ranges.substr(0, dash));
+  const auto first = unsignedDecimalNumber(ranges.substr(0, dash));
   const std::string_view lastText = ranges.substr(dash + 1);
-  const auto last = lastText.empty() ? std::optional<std::uint64_t>(UINT64_MAX) : number(lastText);
+  const auto last =
+      lastText.empty() ? std::optional<std::uint64_t>(UINT64_MAX) : unsignedDecimalNumber(lastText);
   if (!first || !last || *last < *first) return whole(size);
   if (*first >= size) return unsatisfiable();
   return partial(*first, std::min(*last, size - 1));

@@ -1,4 +1,5 @@
 #include "larder-store/StoreItem.h"
+#include "store-runtime/VendStringHelpers.h"
 
 #include <sys/stat.h>
 
@@ -20,14 +21,6 @@ bool isRegularFile(const std::string& path) {
   return fs::is_regular_file(path, code);
 }
 
-std::optional<std::uint64_t> decimalNumber(std::string_view text) {
-  std::uint64_t value = 0;
-  const auto* end = text.data() + text.size();
-  const auto [stop, code] = std::from_chars(text.data(), end, value);
-  if (code != std::errc() || stop != end || text.empty()) return std::nullopt;
-  return value;
-}
-
 const std::string* nonEmptyString(const PlistValue& value) {
   const std::string* text = value.string();
   return text && !text->empty() ? text : nullptr;
@@ -46,7 +39,7 @@ bool fail(std::string* error, std::string why) {
 
 bool readWareID(const PlistValue& entry, const std::string& folder, StoreItem& item,
                 std::string* error) {
-  const auto fromFolder = decimalNumber(fs::path(folder).filename().string());
+  const auto fromFolder = unsignedDecimalNumber(fs::path(folder).filename().string());
   const PlistValue& given = entry["ware-id"];
   if (given.isNull()) {
     if (!fromFolder || *fromFolder == 0)

@@ -7,15 +7,14 @@
 #include "platform/PropertyListSerialization.h"
 #include "store-runtime/TillLogManager.h"
 #include "store-runtime/VendRequestSigner.h"
+#include "store-runtime/VendStringHelpers.h"
 
 namespace larder {
 namespace {
 
 std::optional<std::uint64_t> positiveNumber(std::string_view text) {
-  std::uint64_t value = 0;
-  const auto* end = text.data() + text.size();
-  const auto [stop, code] = std::from_chars(text.data(), end, value);
-  if (code != std::errc() || stop != end || value == 0) return std::nullopt;
+  auto value = unsignedDecimalNumber(text);
+  if (value == 0U) return std::nullopt;
   return value;
 }
 

@@ -10,6 +10,7 @@
 #include "platform/PropertyListSerialization.h"
 #include "store-runtime/TillLogManager.h"
 #include "store-runtime/VendRequestSigner.h"
+#include "store-runtime/VendStringHelpers.h"
 
 namespace larder {
 namespace {
@@ -20,14 +21,6 @@ constexpr time_t kKeepAliveSeconds = 2;
 
 std::span<const std::uint8_t> bytesOf(std::string_view text) {
   return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
-}
-
-std::optional<std::uint64_t> decimalNumber(std::string_view text) {
-  std::uint64_t value = 0;
-  const auto* end = text.data() + text.size();
-  const auto [stop, code] = std::from_chars(text.data(), end, value);
-  if (code != std::errc() || stop != end || text.empty()) return std::nullopt;
-  return value;
 }
 
 // "a,b,c" as its non-empty parts.
@@ -233,7 +226,7 @@ void StoreServer::answerItemLookup(const httplib::Request& request,
   const std::string ids = request.get_param_value("id");
   const std::string bundleIDs = request.get_param_value("bundleId");
   for (std::string_view id : commaSeparated(ids)) {
-    const auto wareID = decimalNumber(id);
+    const auto wareID = unsignedDecimalNumber(id);
     add(wareID ? catalogue_.itemWithID(*wareID) : nullptr);
   }
   for (std::string_view bundleID : commaSeparated(bundleIDs)) {
@@ -243,7 +236,7 @@ void StoreServer::answerItemLookup(const httplib::Request& request,
 }
 
 const StoreItem* StoreServer::itemInPath(const httplib::Request& request) const {
-  const auto wareID = decimalNumber(request.matches[1].str());
+  const auto wareID = unsignedDecimalNumber(request.matches[1].str());
   return wareID ? catalogue_.itemWithID(*wareID) : nullptr;
 }
 

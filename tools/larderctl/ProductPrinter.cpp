@@ -5,7 +5,7 @@
 #include <vector>
 
 #include "AssetService/DBusValueCodec.h"
-#include "tools/larderctl/JsonConversion.h"
+#include "store-runtime/JsonConversion.h"
 
 namespace larder {
 

@@ -2,7 +2,7 @@
 
 #include <iostream>
 
-#include "tools/larderctl/JsonConversion.h"
+#include "store-runtime/JsonConversion.h"
 
 namespace larder {
 namespace {

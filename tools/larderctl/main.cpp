@@ -11,7 +11,7 @@
 #include "AssetService/ServiceClient.h"
 #include "tools/larderctl/DialogAgentCommand.h"
 #include "tools/larderctl/DialogCommand.h"
-#include "tools/larderctl/JsonConversion.h"
+#include "store-runtime/JsonConversion.h"
 #include "tools/larderctl/ProductPrinter.h"
 #include "tools/larderctl/StoreCommands.h"
 

@@ -276,9 +276,9 @@ class PackageServer {
       serve(request, response);
     });
     port_ = server_.bind_to_any_port("127.0.0.1");
-    // The socket listens once bound; connections made before the accept
-    // loop runs wait in its backlog.
     thread_ = std::thread([this] { server_.listen_after_bind(); });
+    // `stop` is lost on a server whose accept loop has not begun yet.
+    while (!server_.is_running()) std::this_thread::sleep_for(std::chrono::milliseconds(1));
   }
   ~PackageServer() {
     {

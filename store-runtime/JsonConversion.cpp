@@ -1,6 +1,8 @@
-#include "tools/larderctl/JsonConversion.h"
+#include "store-runtime/JsonConversion.h"
 
 #include <array>
+#include <cmath>
+#include <ctime>
 
 namespace larder {
 
@@ -25,7 +27,16 @@ std::string base64(const PlistData& data) {
 
 }  // namespace
 
-nlohmann::json JsonConversion::toJson(const PlistValue& value) {
+std::string JsonConversion::isoDate(PlistDate date) {
+  const auto seconds = static_cast<std::time_t>(std::floor(date.secondsSince1970));
+  std::tm utc{};
+  if (::gmtime_r(&seconds, &utc) == nullptr) return {};
+  std::array<char, 32> text{};
+  const std::size_t length = std::strftime(text.data(), text.size(), "%Y-%m-%dT%H:%M:%SZ", &utc);
+  return std::string(text.data(), length);
+}
+
+nlohmann::json JsonConversion::toJson(const PlistValue& value, DateStyle dates) {
   switch (value.type()) {
     case PlistValue::Type::Null:
       return nullptr;
@@ -42,17 +53,18 @@ nlohmann::json JsonConversion::toJson(const PlistValue& value) {
     case PlistValue::Type::Data:
       return base64(*value.data());
     case PlistValue::Type::Date:
-      return value.date()->secondsSince1970;
+      return dates == DateStyle::ISO8601 ? nlohmann::json(isoDate(*value.date()))
+                                         : nlohmann::json(value.date()->secondsSince1970);
     case PlistValue::Type::Uid:
       return value.uid()->value;
     case PlistValue::Type::Array: {
       nlohmann::json array = nlohmann::json::array();
-      for (const PlistValue& element : *value.array()) array.push_back(toJson(element));
+      for (const PlistValue& element : *value.array()) array.push_back(toJson(element, dates));
       return array;
     }
     case PlistValue::Type::Dictionary: {
       nlohmann::json object = nlohmann::json::object();
-      for (const auto& [key, element] : *value.dictionary()) object[key] = toJson(element);
+      for (const auto& [key, element] : *value.dictionary()) object[key] = toJson(element, dates);
       return object;
     }
   }
