@@ -121,7 +121,7 @@ void StoreRuntimeInterface::purchase(sdbus::MethodCall call) {
 void StoreRuntimeInterface::downloads(sdbus::MethodCall call) {
   const std::int64_t mask = DBusValueCodec::read(call, "x").int64Value();
   toolProxy().downloadService()->downloadsWithTypeMask(
-      mask, [call](std::vector<std::shared_ptr<TillDownload>> downloads) mutable {
+      mask, [call](const std::vector<std::shared_ptr<TillDownload>>& downloads) mutable {
         reply(call, "aa{sv}", {downloadList(downloads)});
       });
 }

@@ -121,7 +121,10 @@ std::unique_ptr<curl_slist, ListDeleter> headerList(const VendURLRequest& reques
   // curl would otherwise send "Expect: 100-continue" and wait for it.
   list = curl_slist_append(list, "Expect:");
   for (const auto& [name, value] : request.headers()) {
-    list = curl_slist_append(list, (name + ": " + value).c_str());
+    std::string line = name;
+    line += ": ";
+    line += value;
+    list = curl_slist_append(list, line.c_str());
   }
   if (request.cachePolicy() == VendURLRequest::kReloadIgnoringLocalCacheData) {
     list = curl_slist_append(list, "Cache-Control: no-cache");

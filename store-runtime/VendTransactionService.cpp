@@ -75,8 +75,8 @@ void VendTransactionService::async(std::function<void()> work) const {
 }
 
 void VendTransactionService::performPurchase(TillPurchase purchase,
-                                             LegacyApps /*legacyAppsToGrant*/, std::int64_t options,
-                                             PurchaseReply reply) {
+                                             const LegacyApps& /*legacyAppsToGrant*/,
+                                             std::int64_t options, PurchaseReply reply) {
   async([self = *this, purchase = std::move(purchase), options, reply = std::move(reply)] {
     auto outcome = self.purchase(purchase, options);
     reply(outcome.response, outcome.response.has_value(), outcome.error);
@@ -84,7 +84,7 @@ void VendTransactionService::performPurchase(TillPurchase purchase,
 }
 
 void VendTransactionService::performPurchases(std::vector<TillPurchase> purchases,
-                                              LegacyApps /*legacyAppsToGrant*/,
+                                              const LegacyApps& /*legacyAppsToGrant*/,
                                               std::int64_t options, BulkPurchaseReply reply) {
   async([self = *this, purchases = std::move(purchases), options, reply = std::move(reply)] {
     PurchaseResponses responses;
@@ -190,8 +190,8 @@ void VendTransactionService::itemLookup(
 }
 
 void VendTransactionService::signURLRequest(
-    VendURLRequest request, std::string /*service*/,
-    std::optional<std::string> /*signingSessionID*/,
+    VendURLRequest request, const std::string& /*service*/,
+    const std::optional<std::string>& /*signingSessionID*/,
     std::function<void(const std::optional<VendURLRequest>&, const OptionalError&)> reply) {
   async([runtime = runtime_, request = std::move(request), reply = std::move(reply)]() mutable {
     auto account = runtime->accountStore().primaryAccount();
@@ -205,8 +205,8 @@ void VendTransactionService::signURLRequest(
 }
 
 void VendTransactionService::signedBodyWithURLResponse(
-    VendURLResponse response, std::string /*service*/, PlistData data,
-    std::optional<std::string> /*sessionID*/,
+    VendURLResponse response, const std::string& /*service*/, PlistData data,
+    const std::optional<std::string>& /*sessionID*/,
     std::function<void(const std::optional<PlistData>&, const OptionalError&)> reply) {
   async([runtime = runtime_, response = std::move(response), data = std::move(data),
          reply = std::move(reply)] {

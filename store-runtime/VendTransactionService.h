@@ -38,11 +38,11 @@ class VendTransactionService {
 
   VendTransactionService(VendStoreClient storeClient, std::shared_ptr<VendRuntime> runtime);
 
-  void performPurchase(TillPurchase purchase, LegacyApps legacyAppsToGrant, std::int64_t options,
-                       PurchaseReply reply);
+  void performPurchase(TillPurchase purchase, const LegacyApps& legacyAppsToGrant,
+                       std::int64_t options, PurchaseReply reply);
   // Purchases one after the other. Success only when every one succeeded;
   // the responses hold those that did, and the error is the first failure.
-  void performPurchases(std::vector<TillPurchase> purchases, LegacyApps legacyAppsToGrant,
+  void performPurchases(std::vector<TillPurchase> purchases, const LegacyApps& legacyAppsToGrant,
                         std::int64_t options, BulkPurchaseReply reply);
   // Looks items up by the request's "id" or "bundleId" (and passes its other
   // entries along). The reply has the store's answer dictionary.
@@ -53,12 +53,13 @@ class VendTransactionService {
 
   // Signs the request for the primary account.
   void signURLRequest(
-      VendURLRequest request, std::string service, std::optional<std::string> signingSessionID,
+      VendURLRequest request, const std::string& service,
+      const std::optional<std::string>& signingSessionID,
       std::function<void(const std::optional<VendURLRequest>&, const OptionalError&)> reply);
   // The body, when the answer carries the primary account's signature.
   void signedBodyWithURLResponse(
-      VendURLResponse response, std::string service, PlistData data,
-      std::optional<std::string> signingSessionID,
+      VendURLResponse response, const std::string& service, PlistData data,
+      const std::optional<std::string>& signingSessionID,
       std::function<void(const std::optional<PlistData>&, const OptionalError&)> reply);
 
  private:

@@ -24,8 +24,8 @@ std::chrono::seconds lifetimeOf(const PlistDictionary& bag) {
 
 }  // namespace
 
-VendURLBag::VendURLBag(const VendRuntimeConfiguration& configuration)
-    : configuration_(configuration) {}
+VendURLBag::VendURLBag(VendRuntimeConfiguration configuration)
+    : configuration_(std::move(configuration)) {}
 
 std::string VendURLBag::bagURLForType(std::int64_t bagType) const {
   if (bagType == 0 || configuration_.bagURL.empty()) return configuration_.bagURL;

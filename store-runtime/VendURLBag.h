@@ -37,7 +37,7 @@ class VendURLBag {
     OptionalError error;
   };
 
-  explicit VendURLBag(const VendRuntimeConfiguration& configuration);
+  explicit VendURLBag(VendRuntimeConfiguration configuration);
 
   LoadResult load(std::int64_t bagType, bool force = false);
   // Null when the bag cannot be had or lacks the key.
