@@ -14,7 +14,7 @@ if setarch "$(uname -m)" -R true 2>/dev/null; then
   norandom=(setarch "$(uname -m)" -R)
 fi
 
-export TSAN_OPTIONS="halt_on_error=1 second_deadlock_stack=1 ${TSAN_OPTIONS:-}"
+export TSAN_OPTIONS="halt_on_error=1 second_deadlock_stack=1 suppressions=$root/scripts/tsan-suppressions.txt ${TSAN_OPTIONS:-}"
 
 # Debug keeps the debug-only checks (assertions, re-entrancy aborts) in the build under test.
 cmake -S "$root" -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=Debug -DCMAKE_CXX_COMPILER=g++ \

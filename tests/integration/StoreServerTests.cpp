@@ -460,7 +460,7 @@ TEST_F(StoreServerTest, StalledRouteTimesOutWithoutBlockingOtherRoutesOrShutdown
   // A stalled request that outlives the test's patience: it must not keep
   // the store from stopping.
   std::atomic<bool> longOneEnded{false};
-  std::thread longOne([&] {
+  std::jthread longOne([&] {
     get(store->baseURL() + "/lookup?id=1001", 60);
     longOneEnded = true;
   });
