@@ -8,7 +8,7 @@ build=${2:-build-fuzz}
 ./scripts/install-deps.sh
 cmake -S . -B "$build" -G Ninja -DCMAKE_CXX_COMPILER=clang++ -DCMAKE_BUILD_TYPE=RelWithDebInfo \
   -DLARDER_FUZZ=ON -DLARDER_SANITIZE=address -DLARDER_TESTS=OFF -DLARDER_BENCH=OFF
-cmake --build "$build" -j"$(nproc)"
+cmake --build "$build" -j"$(nproc)" --target larder_fuzzers
 for target in "$build"/fuzz/fuzz_*; do
   [ -x "$target" ] || continue
   name=$(basename "$target")

@@ -60,6 +60,28 @@ class SoftwareMap {
   ProductList allProducts();
   std::optional<PlistData> iconDataForApplicationWithBundleID(std::string_view bundleIdentifier);
 
+  // The body of an update check: a dictionary with the installed software
+  // ("local-software") and/or the software that came with the machine
+  // ("bundled-software"), as an XML property list, gzip-compressed when
+  // asked and possible. `compressed` tells whether it was; `hadBundledApps`
+  // is written only when the bundled list was made. Items whose item
+  // identifier (in decimal) or bundle identifier is on `skipList` are left
+  // out. nullopt would mean no body; the writer always gives one.
+  std::optional<PlistData> updateRequestBodyData(bool* compressed, bool includeInstalledApps,
+                                                 bool includeBundledApps, bool conditionally,
+                                                 bool* hadBundledApps, bool shouldCompress,
+                                                 const std::vector<std::string>& skipList = {});
+  // The path that an incoming `versionNumber` of the application should
+  // replace; nullopt when there is none that may be replaced.
+  std::optional<std::string> productPathToUpgradeForBundleIdentifier(
+      std::string_view bundleIdentifier, std::string_view versionNumber);
+  // Whether a pushed install of that version may go ahead: yes when it has
+  // a store copy to replace or when the application is not here at all.
+  bool shouldAllowAutoPushForBundleID(std::string_view bundleID, std::string_view bundleVersion);
+  // The manifest of bundled software is read once per process; tests that
+  // change the platform root between cases forget it.
+  static void resetBundledManifestForTesting();
+
   // Observers are kept by token; a null observer still gets a token.
   std::string addObserver(std::shared_ptr<VendSoftwareMapObserver> observer);
   void removeObserverWithToken(const std::string& token);
@@ -151,6 +173,13 @@ class SoftwareMap {
                                bool* didChange);
 
   void enqueueNotifications(Changes changes);
+
+  // Update request body.
+  struct SoftwareEntry;
+  using SoftwareEntries = std::vector<SoftwareEntry>;
+  SoftwareEntries copyApplicationDictionariesForUpdateSkipping(
+      const std::vector<std::string>& skipList);
+  static SoftwareEntries bundledApplicationsListConditional(bool conditionally);
 
   // Live queries.
   using MetadataItemRef = std::shared_ptr<const MetadataItem>;

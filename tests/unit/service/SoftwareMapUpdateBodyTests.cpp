@@ -1,0 +1,700 @@
+// The update request body that the software map makes for the store, and
+// the map's answers about which bundle an incoming version replaces and
+// whether a pushed install may go ahead.
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <cstdint>
+#include <filesystem>
+#include <limits>
+#include <map>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "ServiceTestSupport.h"
+#include "platform/Environment.h"
+#include "platform/FileIO.h"
+#include "platform/PropertyListSerialization.h"
+#include "software-map/SoftwareMap.h"
+#include "store-runtime/VendGzip.h"
+
+namespace larder::testing {
+namespace {
+
+// What a call gave, with its out arguments. The out bools start as the
+// opposite of what a correct call leaves, unless the call must not touch
+// them, so that a forgotten write shows.
+struct Body {
+  std::optional<PlistData> data;
+  bool compressed = true;
+  bool hadBundledApps = true;
+};
+
+struct BodyRequest {
+  bool installed = false;
+  bool bundled = false;
+  bool conditionally = false;
+  bool compress = false;
+  std::vector<std::string> skipList;
+};
+
+std::string textOf(const PlistData& bytes) {
+  return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
+}
+
+class SoftwareMapUpdateBodyTest : public ServiceTest {
+ protected:
+  void SetUp() override {
+    ServiceTest::SetUp();
+    // The manifest is held for the life of the process; every case starts
+    // as a fresh process would.
+    SoftwareMap::resetBundledManifestForTesting();
+  }
+  void TearDown() override {
+    SoftwareMap::resetBundledManifestForTesting();
+    ServiceTest::TearDown();
+  }
+
+  static std::string manifestPath() { return Environment::rootedPath("/var/db/.QMTManifest"); }
+
+  static void writeManifest(const PlistValue& rows) { writePlist(manifestPath(), rows); }
+
+  static Body requestBody(SoftwareMap& map, const BodyRequest& request) {
+    Body body;
+    body.data = map.updateRequestBodyData(&body.compressed, request.installed, request.bundled,
+                                          request.conditionally, &body.hadBundledApps,
+                                          request.compress, request.skipList);
+    return body;
+  }
+
+  // The uncompressed body read back: the writer's output must be a
+  // property list that the platform reads, byte for byte what the general
+  // writer makes of the same dictionary.
+  static PlistDictionary parsedBody(const Body& body) {
+    EXPECT_TRUE(body.data.has_value());
+    if (!body.data) return {};
+    EXPECT_FALSE(body.compressed);
+    std::string error;
+    std::optional<PlistValue> parsed = PropertyListSerialization::read(*body.data, &error);
+    EXPECT_TRUE(parsed.has_value()) << error << "\n" << textOf(*body.data);
+    if (!parsed || !parsed->isDictionary()) {
+      ADD_FAILURE() << "the body is not a dictionary:\n" << textOf(*body.data);
+      return {};
+    }
+    EXPECT_EQ(textOf(*body.data), PropertyListSerialization::writeXml(*parsed));
+    return *parsed->dictionary();
+  }
+
+  // The entries of one list by their "ware-id" as text (installed
+  // software sends it as text); every ware id appears once.
+  static std::map<std::string, PlistValue> entriesByWareID(const PlistValue& list) {
+    std::map<std::string, PlistValue> entries;
+    EXPECT_TRUE(list.isArray()) << describePlistValue(list);
+    if (!list.isArray()) return entries;
+    for (const PlistValue& entry : *list.array()) {
+      const std::string* text = entry["ware-id"].string();
+      EXPECT_NE(text, nullptr) << describePlistValue(entry);
+      std::string key = text ? *text : describePlistValue(entry);
+      EXPECT_TRUE(entries.emplace(key, entry).second) << "ware id twice: " << key;
+    }
+    return entries;
+  }
+
+  static LedgerSoftwareProductFields storedRecord(const std::string& path) {
+    LedgerSoftwareProductFields fields;
+    fields.bundlePath = path;
+    fields.installed = true;
+    fields.source = LedgerSoftwareProduct::kSourceRegistryOrPurchaseRecord;
+    return fields;
+  }
+
+  // A map that holds exactly `records`, from its persisted store, and
+  // never looks at the application folders.
+  std::unique_ptr<SoftwareMap> mapWithRecords(
+      const std::vector<LedgerSoftwareProductFields>& records) {
+    std::string path = storePath("records");
+    writeBytes(path, archivedStore(records));
+    auto map = std::make_unique<SoftwareMap>(options(path, false));
+    map->waitUntilIdle();
+    EXPECT_EQ(map->allProducts().size(), records.size());
+    return map;
+  }
+
+  std::unique_ptr<SoftwareMap> emptyMap() { return mapWithRecords({}); }
+
+  // Four rows as a machine's manifest has them, and the entries they give.
+  static PlistArray manifestRows() {
+    return {PlistDictionary{{"bundleID", "com.example.bundled.pages"},
+                            {"version", "7.1"},
+                            {"wareID", "409201541"},
+                            {"installerVersionID", "824364771"}},
+            PlistDictionary{{"bundleID", "com.example.bundled.keynote"},
+                            {"version", "12.0"},
+                            {"wareID", std::int64_t{409183694}},
+                            {"installerVersionID", std::int64_t{5}}},
+            PlistDictionary{{"bundleID", "com.example.bundled.numbers"}},
+            PlistDictionary{{"wareID", PlistValue(std::numeric_limits<std::uint64_t>::max())},
+                            {"version", "1.0"}}};
+  }
+  static PlistArray manifestEntries() {
+    return {PlistDictionary{{"HostBundleIdentifier", "com.example.bundled.pages"},
+                            {"HostBundleShortVersionString", "7.1"},
+                            {"ware-id", "409201541"},
+                            {"installed-version-identifier", std::int64_t{824364771}}},
+            PlistDictionary{{"HostBundleIdentifier", "com.example.bundled.keynote"},
+                            {"HostBundleShortVersionString", "12.0"},
+                            {"ware-id", std::int64_t{409183694}},
+                            {"installed-version-identifier", std::int64_t{5}}},
+            PlistDictionary{{"HostBundleIdentifier", "com.example.bundled.numbers"}},
+            PlistDictionary{{"ware-id", PlistValue(std::numeric_limits<std::uint64_t>::max())},
+                            {"HostBundleShortVersionString", "1.0"}}};
+  }
+};
+
+// MARK: installed software
+
+TEST_F(SoftwareMapUpdateBodyTest, InstalledEntriesCarryTheRecordsValuesAndLeaveOutAbsentOnes) {
+  LedgerSoftwareProductFields full = storedRecord(rootApplications() + "/Full.app");
+  full.bundleIdentifier = "com.example.full";
+  full.bundleVersion = "2.4.1";
+  full.itemIdentifier = 7001;
+  full.versionIdentifier = 101;
+  full.accountOpaqueID = "not sent";
+  LedgerSoftwareProductFields sparse = storedRecord(rootApplications() + "/Sparse.app");
+  sparse.bundleIdentifier = "com.example.sparse";
+  sparse.itemIdentifier = 7002;
+  LedgerSoftwareProductFields nameless = storedRecord(homeApplications() + "/Nameless.app");
+  nameless.itemIdentifier = std::numeric_limits<std::uint64_t>::max();
+  nameless.versionIdentifier = -5;
+  nameless.bundleVersion = "0";
+  // The OS installer has no item identifier and is not sent.
+  LedgerSoftwareProductFields installer = storedRecord(rootApplications() + "/Setup.app");
+  installer.bundleIdentifier = "com.example.setup";
+  installer.bundleVersion = "5.0";
+  auto map = mapWithRecords({full, sparse, nameless, installer});
+
+  LogCapture log;
+  Body body = requestBody(*map, {.installed = true});
+  PlistDictionary parsed = parsedBody(body);
+  EXPECT_FALSE(body.compressed);
+  EXPECT_TRUE(body.hadBundledApps) << "written only when the bundled list is made";
+  ASSERT_EQ(parsed.size(), 1U) << describePlistValue(parsed);
+  std::map<std::string, PlistValue> entries = entriesByWareID(parsed["local-software"]);
+  std::map<std::string, PlistValue> expected{
+      {"7001", PlistDictionary{{"ware-id", "7001"},
+                               {"installed-version-identifier", std::int64_t{101}},
+                               {"HostBundleIdentifier", "com.example.full"},
+                               {"HostBundleShortVersionString", "2.4.1"}}},
+      {"7002",
+       PlistDictionary{{"ware-id", "7002"}, {"HostBundleIdentifier", "com.example.sparse"}}},
+      {"18446744073709551615", PlistDictionary{{"ware-id", "18446744073709551615"},
+                                               {"installed-version-identifier", std::int64_t{-5}},
+                                               {"HostBundleShortVersionString", "0"}}},
+  };
+  EXPECT_EQ(entries, expected);
+
+  EXPECT_EQ(log.countExactly("SoftwareMap: installed: 1; bundled: 0; conditional: 0", 2), 1U)
+      << log.dump();
+  // The same dictionary goes to the side file at level 3.
+  std::optional<PlistData> side = FileIO::read(stateFolder() + "/UpdateQueueRequstBody.plist");
+  ASSERT_TRUE(side.has_value());
+  EXPECT_EQ(PropertyListSerialization::read(*side), PlistValue(parsed));
+}
+
+TEST_F(SoftwareMapUpdateBodyTest, AnEmptyMapGivesAnEmptyListAndNothingAskedGivesAnEmptyDictionary) {
+  auto map = emptyMap();
+  Body installed = requestBody(*map, {.installed = true});
+  EXPECT_EQ(parsedBody(installed), (PlistDictionary{{"local-software", PlistArray{}}}));
+
+  Body nothing = requestBody(*map, {});
+  ASSERT_TRUE(nothing.data.has_value());
+  EXPECT_EQ(textOf(*nothing.data), PropertyListSerialization::writeXml(PlistDictionary{}));
+  EXPECT_FALSE(nothing.compressed);
+  EXPECT_TRUE(nothing.hadBundledApps) << "no bundled list was made";
+}
+
+TEST_F(SoftwareMapUpdateBodyTest, OnlyThePreferredCopyOfAnApplicationIsSent) {
+  // Equal versions: the copy in /Applications wins. Different versions:
+  // the newer one wins wherever it is. The installer version tells the
+  // copies apart.
+  makeStoreBundle(rootApplications(), "Twin", "com.example.twin", "3.0", 9001, 11);
+  makeStoreBundle(homeApplications(), "Twin", "com.example.twin", "3.0", 9001, 22);
+  makeStoreBundle(rootApplications(), "Older", "com.example.older", "3.0", 9002, 33);
+  std::string newer =
+      makeStoreBundle(homeApplications(), "Older", "com.example.older", "3.1", 9002, 44);
+  SoftwareMap map(options(storePath(), true));
+  map.waitUntilIdle();
+  ASSERT_EQ(map.allProducts().size(), 4U);
+
+  std::map<std::string, PlistValue> entries =
+      entriesByWareID(parsedBody(requestBody(map, {.installed = true}))["local-software"]);
+  ASSERT_EQ(entries.size(), 2U);
+  EXPECT_EQ(entries["9001"]["installed-version-identifier"], PlistValue(std::int64_t{11}));
+  EXPECT_EQ(entries["9002"]["installed-version-identifier"], PlistValue(std::int64_t{44})) << newer;
+  EXPECT_EQ(entries["9002"]["HostBundleShortVersionString"], PlistValue("3.1"));
+}
+
+TEST_F(SoftwareMapUpdateBodyTest, TheSkipListKeepsItemsOutByItemOrBundleIdentifier) {
+  std::vector<LedgerSoftwareProductFields> records;
+  for (int i = 0; i < 4; ++i) {
+    LedgerSoftwareProductFields fields =
+        storedRecord(rootApplications() + "/S" + std::to_string(i) + ".app");
+    fields.bundleIdentifier = "com.example.s" + std::to_string(i);
+    fields.itemIdentifier = static_cast<std::uint64_t>(7000 + i);
+    records.push_back(fields);
+  }
+  auto map = mapWithRecords(records);
+  auto sentWareIDs = [&](std::vector<std::string> skipList) {
+    std::vector<std::string> sent;
+    PlistDictionary body = parsedBody(requestBody(*map, {.installed = true, .skipList = skipList}));
+    for (const auto& [wareID, entry] : entriesByWareID(body["local-software"])) {
+      sent.push_back(wareID);
+    }
+    return sent;
+  };
+
+  EXPECT_EQ(sentWareIDs({}), (std::vector<std::string>{"7000", "7001", "7002", "7003"}));
+  EXPECT_EQ(sentWareIDs({"com.example.s1", "7003"}), (std::vector<std::string>{"7000", "7002"}));
+  // Whole values only: parts, other spellings and other cases match nothing.
+  EXPECT_EQ(sentWareIDs({"700", "07000", "7000 ", "com.example.s", "COM.EXAMPLE.S2", ""}),
+            (std::vector<std::string>{"7000", "7001", "7002", "7003"}));
+}
+
+TEST_F(SoftwareMapUpdateBodyTest, TextThatLooksLikeMarkupSurvivesTheTrip) {
+  LedgerSoftwareProductFields hostile = storedRecord(rootApplications() + "/Hostile.app");
+  hostile.bundleIdentifier = "com.example.<dict>&amp;</string>]]>\"'";
+  hostile.bundleVersion = "ü€😀 \t1.0\n ";
+  hostile.itemIdentifier = 1;
+  LedgerSoftwareProductFields empty = storedRecord(rootApplications() + "/Empty.app");
+  empty.bundleIdentifier = "";
+  empty.bundleVersion = "";
+  empty.itemIdentifier = 2;
+  empty.versionIdentifier = 0;
+  auto map = mapWithRecords({hostile, empty});
+
+  std::map<std::string, PlistValue> entries =
+      entriesByWareID(parsedBody(requestBody(*map, {.installed = true}))["local-software"]);
+  EXPECT_EQ(entries["1"]["HostBundleIdentifier"], PlistValue(*hostile.bundleIdentifier));
+  EXPECT_EQ(entries["1"]["HostBundleShortVersionString"], PlistValue(*hostile.bundleVersion));
+  // An empty value is a value: it is sent.
+  EXPECT_EQ(entries["2"], PlistValue(PlistDictionary{{"ware-id", "2"},
+                                                     {"installed-version-identifier", 0},
+                                                     {"HostBundleIdentifier", ""},
+                                                     {"HostBundleShortVersionString", ""}}));
+}
+
+// MARK: bundled software
+
+TEST_F(SoftwareMapUpdateBodyTest, BundledEntriesFollowTheManifestInItsOrder) {
+  PlistArray rows = manifestRows();
+  // Rows that are not dictionaries are skipped; values of types the store
+  // would not understand are left out.
+  rows.insert(rows.begin() + 1, PlistValue("not a row"));
+  rows.push_back(PlistDictionary{{"bundleID", std::int64_t{5}},
+                                 {"version", PlistArray{}},
+                                 {"wareID", PlistDictionary{}},
+                                 {"installerVersionID", PlistData{1, 2}}});
+  writeManifest(rows);
+  auto map = emptyMap();
+
+  LogCapture log;
+  Body body = requestBody(*map, {.bundled = true});
+  PlistArray expected = manifestEntries();
+  expected.emplace_back(PlistDictionary{});
+  EXPECT_EQ(parsedBody(body), (PlistDictionary{{"bundled-software", expected}}));
+  EXPECT_TRUE(body.hadBundledApps);
+  EXPECT_EQ(log.countExactly("SoftwareMap: Bundled applications manifest row 1 is not a "
+                             "dictionary, skipping it",
+                             1),
+            1U)
+      << log.dump();
+  EXPECT_EQ(log.countExactly("SoftwareMap: installed: 0; bundled: 1; conditional: 0", 2), 1U);
+}
+
+TEST_F(SoftwareMapUpdateBodyTest, TheManifestIsReadOnceForTheWholeProcess) {
+  writeManifest(manifestRows());
+  auto map = emptyMap();
+  LogCapture log;
+  PlistDictionary first = parsedBody(requestBody(*map, {.bundled = true}));
+  ASSERT_EQ(first, (PlistDictionary{{"bundled-software", manifestEntries()}}));
+
+  // Neither a changed file, nor a removed one, nor another map instance
+  // sees anything but the list read first.
+  writeManifest(PlistArray{PlistDictionary{{"bundleID", "com.example.changed"}}});
+  EXPECT_EQ(parsedBody(requestBody(*map, {.bundled = true})), first);
+  std::filesystem::remove(manifestPath());
+  auto other = emptyMap();
+  Body fromOther = requestBody(*other, {.bundled = true});
+  EXPECT_EQ(parsedBody(fromOther), first);
+  EXPECT_TRUE(fromOther.hadBundledApps);
+  EXPECT_EQ(log.countContaining("bundled applications from " + manifestPath(), 2), 1U)
+      << log.dump();
+
+  // A manifest that was read empty is held as well.
+  SoftwareMap::resetBundledManifestForTesting();
+  writeManifest(PlistArray{});
+  Body empty = requestBody(*map, {.bundled = true});
+  EXPECT_FALSE(empty.hadBundledApps);
+  writeManifest(manifestRows());
+  Body stillEmpty = requestBody(*map, {.bundled = true});
+  EXPECT_EQ(parsedBody(stillEmpty), (PlistDictionary{{"bundled-software", PlistArray{}}}));
+  EXPECT_FALSE(stillEmpty.hadBundledApps);
+}
+
+TEST_F(SoftwareMapUpdateBodyTest, AMissingOrUnusableManifestGivesAnEmptyListAndIsTriedAgain) {
+  auto map = emptyMap();
+  struct Case {
+    std::string what;
+    std::optional<std::string> contents;  // nullopt: no file
+    std::string expectedLine;
+    int level;
+  };
+  const std::string path = manifestPath();
+  const std::vector<Case> cases{
+      {"missing", std::nullopt, "SoftwareMap: No bundled applications manifest at " + path, 3},
+      {"not a property list", "<plist><array><dict>",
+       "SoftwareMap: Could not read the bundled applications manifest at " + path, 1},
+      {"empty file", "", "SoftwareMap: Could not read the bundled applications manifest at " + path,
+       1},
+      {"a dictionary",
+       PropertyListSerialization::writeXml(PlistDictionary{{"bundleID", "com.example.x"}}),
+       "SoftwareMap: Bundled applications manifest at " + path + " is not a list, ignoring it", 1},
+      {"a folder", std::nullopt, "SoftwareMap: No bundled applications manifest at " + path, 3},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.what);
+    std::filesystem::remove_all(path);
+    if (c.contents) writeText(path, *c.contents);
+    if (c.what == "a folder") std::filesystem::create_directories(path);
+    LogCapture log;
+    Body body = requestBody(*map, {.bundled = true});
+    EXPECT_EQ(parsedBody(body), (PlistDictionary{{"bundled-software", PlistArray{}}}));
+    EXPECT_FALSE(body.hadBundledApps);
+    EXPECT_EQ(log.countContaining(c.expectedLine, c.level), 1U) << log.dump();
+    EXPECT_EQ(log.countContaining("bundled applications from"), 0U) << log.dump();
+  }
+
+  // The next request after any of them reads the file that is there now.
+  std::filesystem::remove_all(path);
+  writeManifest(manifestRows());
+  Body repaired = requestBody(*map, {.bundled = true});
+  EXPECT_EQ(parsedBody(repaired), (PlistDictionary{{"bundled-software", manifestEntries()}}));
+  EXPECT_TRUE(repaired.hadBundledApps);
+}
+
+TEST_F(SoftwareMapUpdateBodyTest, ThreadsThatMeetAtTheFirstReadAllSeeTheWholeList) {
+  PlistArray rows;
+  PlistArray expected;
+  for (int i = 0; i < 3000; ++i) {
+    rows.emplace_back(PlistDictionary{{"bundleID", "com.example.b" + std::to_string(i)},
+                                      {"wareID", std::int64_t{i}}});
+    expected.emplace_back(
+        PlistDictionary{{"HostBundleIdentifier", "com.example.b" + std::to_string(i)},
+                        {"ware-id", std::int64_t{i}}});
+  }
+  writeManifest(rows);
+  auto map = emptyMap();
+  const PlistDictionary wanted{{"bundled-software", expected}};
+
+  LogCapture log;
+  constexpr int kThreads = 6;
+  std::atomic<int> ready{0};
+  std::vector<Body> bodies(kThreads);
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&, t] {
+      ready.fetch_add(1);
+      while (ready.load() < kThreads) std::this_thread::yield();
+      bodies[t] = requestBody(*map, {.bundled = true});
+    });
+  }
+  for (std::thread& thread : threads) thread.join();
+  for (const Body& body : bodies) {
+    EXPECT_EQ(parsedBody(body), wanted);
+    EXPECT_TRUE(body.hadBundledApps);
+  }
+  EXPECT_EQ(log.countContaining("Read 3000 bundled applications", 2), 1U) << log.dump();
+}
+
+// MARK: conditions
+
+TEST_F(SoftwareMapUpdateBodyTest, TheConditionAloneAlsoBringsTheBundledList) {
+  writeManifest(manifestRows());
+  LedgerSoftwareProductFields record = storedRecord(rootApplications() + "/Only.app");
+  record.bundleIdentifier = "com.example.only";
+  record.itemIdentifier = 42;
+  auto map = mapWithRecords({record});
+  const PlistArray local{
+      PlistDictionary{{"ware-id", "42"}, {"HostBundleIdentifier", "com.example.only"}}};
+  const PlistArray bundled = manifestEntries();
+
+  struct Case {
+    BodyRequest request;
+    PlistDictionary expected;
+    bool touchesHadBundledApps;
+    std::string logLine;
+  };
+  const std::vector<Case> cases{
+      {{.conditionally = true},
+       {{"bundled-software", bundled}},
+       true,
+       "installed: 0; bundled: 0; conditional: 1"},
+      {{.installed = true, .conditionally = true},
+       {{"local-software", local}, {"bundled-software", bundled}},
+       true,
+       "installed: 1; bundled: 0; conditional: 1"},
+      {{.installed = true, .bundled = true, .conditionally = true},
+       {{"local-software", local}, {"bundled-software", bundled}},
+       true,
+       "installed: 1; bundled: 1; conditional: 1"},
+      {{.installed = true, .bundled = true},
+       {{"local-software", local}, {"bundled-software", bundled}},
+       true,
+       "installed: 1; bundled: 1; conditional: 0"},
+      {{.installed = true},
+       {{"local-software", local}},
+       false,
+       "installed: 1; bundled: 0; conditional: 0"},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.logLine);
+    LogCapture log;
+    Body body;
+    body.hadBundledApps = false;
+    body.data =
+        map->updateRequestBodyData(&body.compressed, c.request.installed, c.request.bundled,
+                                   c.request.conditionally, &body.hadBundledApps, false, {});
+    EXPECT_EQ(parsedBody(body), c.expected);
+    EXPECT_EQ(body.hadBundledApps, c.touchesHadBundledApps)
+        << "set to true when the list is made, and only then";
+    EXPECT_EQ(log.countExactly("SoftwareMap: " + c.logLine, 2), 1U) << log.dump();
+  }
+}
+
+TEST_F(SoftwareMapUpdateBodyTest, ACompressedBodyIsTheGzipOfTheSameXml) {
+  writeManifest(manifestRows());
+  std::vector<LedgerSoftwareProductFields> records;
+  for (int i = 0; i < 300; ++i) {
+    LedgerSoftwareProductFields fields =
+        storedRecord(rootApplications() + "/Z" + std::to_string(i) + ".app");
+    fields.bundleIdentifier = "com.example.z" + std::to_string(i);
+    fields.bundleVersion = "1." + std::to_string(i);
+    fields.itemIdentifier = static_cast<std::uint64_t>(100000 + i);
+    fields.versionIdentifier = 9 * i;
+    records.push_back(fields);
+  }
+  auto map = mapWithRecords(records);
+
+  LogCapture log;
+  Body plain = requestBody(*map, {.installed = true, .bundled = true, .skipList = {"100007"}});
+  Body zipped = requestBody(
+      *map, {.installed = true, .bundled = true, .compress = true, .skipList = {"100007"}});
+  PlistDictionary parsed = parsedBody(plain);
+  EXPECT_EQ(entriesByWareID(parsed["local-software"]).size(), 299U);
+  ASSERT_TRUE(zipped.data.has_value());
+  EXPECT_TRUE(zipped.compressed);
+  EXPECT_TRUE(zipped.hadBundledApps);
+  ASSERT_GE(zipped.data->size(), 2U);
+  EXPECT_EQ((*zipped.data)[0], 0x1f);
+  EXPECT_EQ((*zipped.data)[1], 0x8b);
+  EXPECT_LT(zipped.data->size(), plain.data->size() / 4);
+  std::optional<PlistData> unzipped = VendCopyGunzippedDataForData(*zipped.data);
+  ASSERT_TRUE(unzipped.has_value());
+  EXPECT_EQ(*unzipped, *plain.data);
+  EXPECT_EQ(log.countExactly("SoftwareMap: Compressed the request body", 2), 1U) << log.dump();
+  EXPECT_EQ(log.countContaining("Could not zip"), 0U);
+
+  // Out arguments may be absent.
+  std::optional<PlistData> anonymous =
+      map->updateRequestBodyData(nullptr, true, true, false, nullptr, true, {"100007"});
+  ASSERT_TRUE(anonymous.has_value());
+  EXPECT_EQ(VendCopyGunzippedDataForData(*anonymous), plain.data);
+}
+
+// MARK: path to upgrade
+
+class SoftwareMapUpgradePathTest : public SoftwareMapUpdateBodyTest {
+ protected:
+  std::optional<std::string> upgradePath(SoftwareMap& map, const std::string& identifier,
+                                         const std::string& version) {
+    return map.productPathToUpgradeForBundleIdentifier(identifier, version);
+  }
+};
+
+TEST_F(SoftwareMapUpgradePathTest, AMappedCopyIsTheAnswerWhateverTheVersion) {
+  std::string mapped =
+      makeStoreBundle(rootApplications(), "Mapped", "com.example.mapped", "5.0", 1);
+  LedgerSoftwareProductFields record = storedRecord(mapped);
+  record.bundleIdentifier = "com.example.mapped";
+  record.bundleVersion = "5.0";
+  record.itemIdentifier = 1;
+  auto map = mapWithRecords({record});
+
+  for (const std::string version : {"0.1", "5.0", "6.0", ""}) {
+    SCOPED_TRACE(version);
+    LogCapture log;
+    EXPECT_EQ(upgradePath(*map, "com.example.mapped", version), mapped);
+    EXPECT_EQ(log.countExactly("SoftwareMap: Found app at " + mapped +
+                                   " using SoftwareMap to upgrade to " + version,
+                               1),
+              1U)
+        << log.dump();
+  }
+}
+
+TEST_F(SoftwareMapUpgradePathTest, AMappedCopyThatCannotBeReplacedEndsTheSearch) {
+  // The map remembers a bundle that is gone; a replaceable copy on disk
+  // with the same identifier is not looked for.
+  std::string gone = rootApplications() + "/Gone.app";
+  std::string onDisk = makeStoreBundle(homeApplications(), "Gone", "com.example.gone", "1.0", 2);
+  LedgerSoftwareProductFields record = storedRecord(gone);
+  record.bundleIdentifier = "com.example.gone";
+  record.bundleVersion = "1.0";
+  auto map = mapWithRecords({record});
+
+  LogCapture log;
+  EXPECT_EQ(upgradePath(*map, "com.example.gone", "2.0"), std::nullopt) << onDisk;
+  EXPECT_EQ(log.countExactly("SoftwareMap: Found app at " + gone +
+                                 " using SoftwareMap but it is not upgradable, "
+                                 "productPathToUpgradeForBundleIdentifier:versionNumber will "
+                                 "return nil",
+                             1),
+            1U)
+      << log.dump();
+  EXPECT_EQ(log.countContaining("AppRegistry"), 0U);
+  EXPECT_EQ(log.countContaining("No app was found"), 0U);
+}
+
+TEST_F(SoftwareMapUpgradePathTest, AnUnmappedStoreCopyIsTheAnswerOnlyForANewerVersion) {
+  std::string loose = makeStoreBundle(rootApplications(), "Loose", "com.example.loose", "1.9", 3);
+  auto map = emptyMap();
+  struct Case {
+    std::string requested;
+    bool replaces;
+  };
+  for (const Case& c :
+       {Case{"1.10", true}, Case{"2", true}, Case{"1.9.1", true}, Case{"1.9", false},
+        Case{"01.9", false}, Case{"1.8", false}, Case{"1.09", false}, Case{"", false}}) {
+    SCOPED_TRACE(c.requested);
+    LogCapture log;
+    std::optional<std::string> path = upgradePath(*map, "com.example.loose", c.requested);
+    if (c.replaces) {
+      EXPECT_EQ(path, loose);
+      EXPECT_EQ(log.countExactly("SoftwareMap: Found app at " + loose +
+                                     " with bundle ID com.example.loose using AppRegistry to "
+                                     "upgrade to " +
+                                     c.requested,
+                                 1),
+                1U)
+          << log.dump();
+    } else {
+      EXPECT_EQ(path, std::nullopt);
+      EXPECT_EQ(log.countExactly("SoftwareMap: No app was found with bundle ID com.example.loose "
+                                 "to upgrade to " +
+                                     c.requested,
+                                 1),
+                1U)
+          << log.dump();
+    }
+  }
+}
+
+TEST_F(SoftwareMapUpgradePathTest,
+       UnmappedBundlesThatAreNotStoreSoftwareOrHaveNoVersionAreNotTaken) {
+  std::string plain =
+      makeBundle(rootApplications(), "Plain", "com.example.plain", "1.0", std::nullopt);
+  std::string unversioned =
+      makeStoreBundle(rootApplications(), "Unversioned", "com.example.unversioned", "", 4);
+  auto map = emptyMap();
+
+  LogCapture log;
+  EXPECT_EQ(upgradePath(*map, "com.example.plain", "2.0"), std::nullopt);
+  EXPECT_EQ(
+      log.countExactly(
+          "SoftwareMap: isQuaymartAppAtPath or isUpdatableAtPath failed for app at " + plain, 3),
+      1U)
+      << log.dump();
+  EXPECT_EQ(
+      log.countExactly(
+          "SoftwareMap: No app was found with bundle ID com.example.plain to upgrade to 2.0", 1),
+      1U);
+
+  log.clear();
+  EXPECT_EQ(upgradePath(*map, "com.example.unversioned", "2.0"), std::nullopt) << unversioned;
+  EXPECT_EQ(log.countContaining("isQuaymartAppAtPath or isUpdatableAtPath failed"), 0U);
+  EXPECT_EQ(log.countExactly("SoftwareMap: No app was found with bundle ID "
+                             "com.example.unversioned to upgrade to 2.0",
+                             1),
+            1U);
+
+  log.clear();
+  EXPECT_EQ(upgradePath(*map, "com.example.nowhere", "1.0"), std::nullopt);
+  EXPECT_EQ(
+      log.countExactly(
+          "SoftwareMap: No app was found with bundle ID com.example.nowhere to upgrade to 1.0", 1),
+      1U)
+      << log.dump();
+}
+
+// MARK: pushed installs
+
+TEST_F(SoftwareMapUpgradePathTest, APushIsAllowedWhereItReplacesAStoreCopyOrFindsNothing) {
+  // In the map, a store copy in an application folder.
+  std::string mapped =
+      makeStoreBundle(rootApplications(), "Mapped", "com.example.mapped", "5.0", 1);
+  LedgerSoftwareProductFields mappedRecord = storedRecord(mapped);
+  mappedRecord.bundleIdentifier = "com.example.mapped";
+  mappedRecord.bundleVersion = "5.0";
+  mappedRecord.itemIdentifier = 1;
+  // In the map, a store copy outside the application folders: the path to
+  // replace is found but may not be installed over, and no other copy
+  // stands in the way.
+  std::string aside =
+      makeStoreBundle(temporary() + "/root/Elsewhere", "Aside", "com.example.aside", "1.0", 5);
+  LedgerSoftwareProductFields asideRecord = storedRecord(aside);
+  asideRecord.bundleIdentifier = "com.example.aside";
+  asideRecord.bundleVersion = "1.0";
+  // In the map, a bundle that is gone.
+  LedgerSoftwareProductFields goneRecord = storedRecord(rootApplications() + "/Gone.app");
+  goneRecord.bundleIdentifier = "com.example.gone";
+  auto map = mapWithRecords({mappedRecord, asideRecord, goneRecord});
+  // Not in the map: a store copy that only a newer version replaces.
+  makeStoreBundle(homeApplications(), "Loose", "com.example.loose", "3.0", 6);
+
+  EXPECT_TRUE(map->shouldAllowAutoPushForBundleID("com.example.mapped", "1.0"));
+  EXPECT_TRUE(map->shouldAllowAutoPushForBundleID("com.example.nowhere", "1.0"))
+      << "nothing on the machine";
+  EXPECT_TRUE(map->shouldAllowAutoPushForBundleID("com.example.aside", "2.0"));
+  EXPECT_TRUE(map->shouldAllowAutoPushForBundleID("com.example.gone", "2.0"));
+  EXPECT_TRUE(map->shouldAllowAutoPushForBundleID("com.example.loose", "4.0"));
+  // The copy would not be replaced, but the map does not know it, so
+  // nothing is found in the way.
+  EXPECT_TRUE(map->shouldAllowAutoPushForBundleID("com.example.loose", "2.0"));
+}
+
+TEST_F(SoftwareMapUpgradePathTest, AStoreCopyThatThePushCannotReplaceRefusesIt) {
+  // The preferred copy (newer) is not store software, so it is no place to
+  // install; the store copy beside it would be, and stands in the way.
+  std::string plain =
+      makeBundle(rootApplications(), "Dual", "com.example.dual", "2.0", std::nullopt);
+  std::string store = makeStoreBundle(homeApplications(), "Dual", "com.example.dual", "1.0", 7);
+  LedgerSoftwareProductFields plainRecord = storedRecord(plain);
+  plainRecord.bundleIdentifier = "com.example.dual";
+  plainRecord.bundleVersion = "2.0";
+  LedgerSoftwareProductFields storeRecord = storedRecord(store);
+  storeRecord.bundleIdentifier = "com.example.dual";
+  storeRecord.bundleVersion = "1.0";
+  storeRecord.itemIdentifier = 7;
+  auto map = mapWithRecords({plainRecord, storeRecord});
+
+  ASSERT_EQ(upgradePath(*map, "com.example.dual", "3.0"), plain);
+  EXPECT_FALSE(map->shouldAllowAutoPushForBundleID("com.example.dual", "3.0"));
+
+  // Without the store copy the same push goes ahead.
+  std::filesystem::remove(store + "/purchase.plist");
+  EXPECT_TRUE(map->shouldAllowAutoPushForBundleID("com.example.dual", "3.0"));
+}
+
+}  // namespace
+}  // namespace larder::testing
