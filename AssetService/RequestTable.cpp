@@ -69,7 +69,10 @@ constexpr std::array kRequests = std::to_array<RequestDescriptor>({
    }},
   {"productPathToUpgradeForBundleIdentifier:versionNumberString:replyBlock:",
    "ProductPathToUpgradeForBundleIdentifierVersionNumberString", "ss", "s",
-   "bundleIdentifier,versionNumberString", "path", false, nullptr, kEmpty},
+   "bundleIdentifier,versionNumberString", "path", false,
+   [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {
+     answer(r, {i.softwareMap().productPathToUpgradeForBundleIdentifier(text(a, 0), text(a, 1)).value_or("")});
+   }},
   {"bundleInfoFromBundleAtPath:replyBlock:", "BundleInfoFromBundleAtPath", "s", "a{sv}", "path",
    "info", false,
    [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {
@@ -82,8 +85,14 @@ constexpr std::array kRequests = std::to_array<RequestDescriptor>({
    }},
   {"httpPostBodyWithInstalledApps:bundledApps:conditionally:replyBlock:",
    "HttpPostBodyWithInstalledAppsBundledAppsConditionally", "bbb", "aybb",
-   "installedApps,bundledApps,conditionally", "body,compressed,hadBundledApps", false, nullptr,
-   kEmpty},
+   "installedApps,bundledApps,conditionally", "body,compressed,hadBundledApps", false,
+   [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {
+     bool compressed = false;
+     bool hadBundledApps = false;
+     auto body = i.softwareMap().updateRequestBodyData(&compressed, a.at(0).boolValue(), a.at(1).boolValue(),
+                                                       a.at(2).boolValue(), &hadBundledApps, true);
+     answer(r, {body.value_or(PlistData{}), compressed, hadBundledApps});
+   }},
   {"productAtPath:wasUpdated:toBundleVersion:storeVersion:",
    "ProductAtPathWasUpdatedToBundleVersionStoreVersion", "sbsx", "",
    "path,wasUpdated,bundleVersion,storeVersion", "", false,
@@ -108,7 +117,10 @@ constexpr std::array kRequests = std::to_array<RequestDescriptor>({
    }},
   {"shouldAllowAutoPushForBundleID:bundleVersion:replyBlock:",
    "ShouldAllowAutoPushForBundleIDBundleVersion", "ss", "b", "bundleIdentifier,bundleVersion",
-   "allow", false, nullptr, kEmpty},
+   "allow", false,
+   [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {
+     answer(r, {i.softwareMap().shouldAllowAutoPushForBundleID(text(a, 0), text(a, 1))});
+   }},
   {"lookupOrvaneIDForApp:replyBlock:", "LookupOrvaneIDForApp", "a{sv}", "s", "product",
    "orvaneID", false, nullptr, kEmpty},
 

@@ -12,6 +12,8 @@
 #include "AssetService/RequestTable.h"
 #include "platform/FileIO.h"
 #include "platform/KeyedArchive.h"
+#include "platform/PropertyListSerialization.h"
+#include "store-runtime/VendGzip.h"
 #include "tests/integration/ServiceHarness.h"
 
 namespace larder::testing {
@@ -203,13 +205,41 @@ TEST_F(ServiceTest, RequestsWithoutTargetAnswerEmptyOrNotAtAll) {
   client->presentStoreClient(0);
   PlistArray badge = client->call("AvailableUpdatesBadgeCount", {});
   EXPECT_EQ(badge.at(0).uint64Value(), 0u);
-  PlistArray body =
-      client->call("HttpPostBodyWithInstalledAppsBundledAppsConditionally", {true, true, false});
-  ASSERT_EQ(body.size(), 3u);
+  PlistArray incompatible = client->call("IncompatibleUpdates", {});
+  ASSERT_EQ(incompatible.size(), 1u);
+  EXPECT_TRUE(incompatible.at(0).array() && incompatible.at(0).array()->empty());
   auto quick = std::make_unique<ServiceClient>(bus.connect(), "com.orvane.larderd", 300'000);
   EXPECT_THROW(quick->call("UnhideAllOSUpdates", {}), sdbus::Error)
       << "its reply belongs to a controller";
   EXPECT_TRUE(service->process().isRunning());
+}
+
+TEST_F(ServiceTest, TheUpdateRequestBodyListsTheInstalledStoreSoftware) {
+  const std::string ledger =
+      installStoreApp(applications(), "Ledger", "com.example.ledger", "1.4", 4242);
+  auto service = startService();
+  auto client = connectClient(bus);
+  client->presentStoreClient(0);
+  ASSERT_TRUE(eventually([&] {
+    const PlistArray found =
+        client->call("ProductForBundleIdentifier", {std::string("com.example.ledger")});
+    return found.at(0).dictionary() && !found.at(0).dictionary()->empty();
+  }));
+  PlistArray reply =
+      client->call("HttpPostBodyWithInstalledAppsBundledAppsConditionally", {true, false, false});
+  ASSERT_EQ(reply.size(), 3u);
+  ASSERT_TRUE(reply.at(0).data());
+  EXPECT_TRUE(reply.at(1).boolValue()) << "the body is asked for compressed";
+  EXPECT_FALSE(reply.at(2).boolValue()) << "no bundled software was asked for";
+  auto xml = VendCopyGunzippedDataForData(*reply.at(0).data());
+  ASSERT_TRUE(xml);
+  auto body = PropertyListSerialization::read(*xml);
+  ASSERT_TRUE(body);
+  const PlistArray* local = (*body)["local-software"].array();
+  ASSERT_TRUE(local);
+  ASSERT_EQ(local->size(), 1u);
+  EXPECT_EQ(*(*local)[0]["ware-id"].string(), "4242");
+  EXPECT_FALSE((*body)["bundled-software"].array());
 }
 
 TEST_F(ServiceTest, ModeFollowsTheArguments) {
