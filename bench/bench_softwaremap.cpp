@@ -5,6 +5,7 @@
 #include <memory>
 #include <random>
 
+#include "LoadedSoftwareMap.h"
 #include "ProductStoreFixture.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/TillLogManager.h"
@@ -16,18 +17,12 @@ using larder::bench::ProductStoreFixture;
 
 constexpr std::size_t kProducts = 10'000;
 
-struct Shared {
-  Shared() : fixture(kProducts) {
-    larder::TillLogManager::sharedManager().setLevel(0);
-    map = std::make_unique<SoftwareMap>(
-        SoftwareMap::Options{fixture.storePath(), /*discoverApplications=*/false});
-    map->waitUntilIdle();
+struct Shared : larder::bench::LoadedSoftwareMap {
+  Shared() : LoadedSoftwareMap(kProducts) {
     for (std::size_t i = 0; i < kProducts; ++i) {
       identifiers.push_back(ProductStoreFixture::bundleIdentifier(i));
     }
   }
-  ProductStoreFixture fixture;
-  std::unique_ptr<SoftwareMap> map;
   std::vector<std::string> identifiers;
 };
 

@@ -5,7 +5,7 @@
 #include <memory>
 #include <string>
 
-#include "ProductStoreFixture.h"
+#include "LoadedSoftwareMap.h"
 #include "platform/PropertyListSerialization.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/TillLogManager.h"
@@ -16,19 +16,11 @@ namespace {
 using larder::PlistArray;
 using larder::PlistDictionary;
 using larder::SoftwareMap;
-using larder::bench::ProductStoreFixture;
 
 constexpr std::size_t kProducts = 10'000;
 
-struct Shared {
-  Shared() : fixture(kProducts) {
-    larder::TillLogManager::sharedManager().setLevel(0);
-    map = std::make_unique<SoftwareMap>(
-        SoftwareMap::Options{fixture.storePath(), /*discoverApplications=*/false});
-    map->waitUntilIdle();
-  }
-  ProductStoreFixture fixture;
-  std::unique_ptr<SoftwareMap> map;
+struct Shared : larder::bench::LoadedSoftwareMap {
+  Shared() : LoadedSoftwareMap(kProducts) {}
 };
 
 Shared& shared() {

@@ -9,9 +9,9 @@
 #include "AssetService/DBusValueCodec.h"
 #include "AssetService/RequestTable.h"
 #include "AssetService/ServiceClient.h"
+#include "store-runtime/JsonConversion.h"
 #include "tools/larderctl/DialogAgentCommand.h"
 #include "tools/larderctl/DialogCommand.h"
-#include "store-runtime/JsonConversion.h"
 #include "tools/larderctl/ProductPrinter.h"
 #include "tools/larderctl/StoreCommands.h"
 

@@ -30,7 +30,9 @@ struct PlistNodeDeleter {
 };
 using PlistNode = std::unique_ptr<void, PlistNodeDeleter>;
 
-PlistData bytesOf(std::string_view text) { return PlistData(text.begin(), text.end()); }
+PlistData bytesOf(std::string_view text) {
+  return PlistData(text.begin(), text.end());
+}
 
 std::optional<PlistValue> readBytes(const PlistData& bytes, std::string* error = nullptr,
                                     const PlistReadLimits& limits = {}) {
@@ -53,10 +55,9 @@ bool sameValue(const PlistValue& a, const PlistValue& b) {
   if (const PlistDictionary* left = a.dictionary()) {
     const PlistDictionary& right = *b.dictionary();
     return left->size() == right.size() &&
-           std::equal(left->begin(), left->end(), right.begin(),
-                      [](const auto& x, const auto& y) {
-                        return x.first == y.first && sameValue(x.second, y.second);
-                      });
+           std::equal(left->begin(), left->end(), right.begin(), [](const auto& x, const auto& y) {
+             return x.first == y.first && sameValue(x.second, y.second);
+           });
   }
   return a == b;
 }
@@ -70,8 +71,8 @@ std::string firstDifference(const PlistValue& a, const PlistValue& b,
     const PlistArray& right = *b.array();
     if (left->size() != right.size()) return here + " (size)";
     for (std::size_t index = 0; index < left->size(); ++index) {
-      std::string found = firstDifference((*left)[index], right[index],
-                                          path + "/" + std::to_string(index));
+      std::string found =
+          firstDifference((*left)[index], right[index], path + "/" + std::to_string(index));
       if (!found.empty()) return found;
     }
     return "";
@@ -228,11 +229,15 @@ PlistValue productCatalogue(int count) {
 // Builds libplist's own tree, independently of the code under test.
 PlistNode toLibplist(const PlistValue& value) {
   switch (value.type()) {
-    case Type::Boolean: return PlistNode(plist_new_bool(value.boolValue()));
+    case Type::Boolean:
+      return PlistNode(plist_new_bool(value.boolValue()));
     case Type::Integer:
-    case Type::UnsignedInteger: return PlistNode(plist_new_uint(value.uint64Value()));
-    case Type::Real: return PlistNode(plist_new_real(value.doubleValue()));
-    case Type::String: return PlistNode(plist_new_string(value.string()->c_str()));
+    case Type::UnsignedInteger:
+      return PlistNode(plist_new_uint(value.uint64Value()));
+    case Type::Real:
+      return PlistNode(plist_new_real(value.doubleValue()));
+    case Type::String:
+      return PlistNode(plist_new_string(value.string()->c_str()));
     case Type::Data:
       return PlistNode(plist_new_data(reinterpret_cast<const char*>(value.data()->data()),
                                       value.data()->size()));
@@ -242,7 +247,8 @@ PlistNode toLibplist(const PlistValue& value) {
       return PlistNode(plist_new_date(static_cast<std::int32_t>(seconds),
                                       static_cast<std::int32_t>((since2001 - seconds) * 1e6)));
     }
-    case Type::Uid: return PlistNode(plist_new_uid(value.uid()->value));
+    case Type::Uid:
+      return PlistNode(plist_new_uid(value.uid()->value));
     case Type::Array: {
       PlistNode array(plist_new_array());
       for (const PlistValue& element : *value.array()) {
@@ -257,7 +263,8 @@ PlistNode toLibplist(const PlistValue& value) {
       }
       return dictionary;
     }
-    case Type::Null: break;
+    case Type::Null:
+      break;
   }
   return PlistNode(plist_new_dict());
 }
@@ -342,7 +349,8 @@ void expectMatchesLibplist(plist_t node, const PlistValue& expected, const std::
       }
       break;
     }
-    case Type::Null: FAIL() << "null has no counterpart";
+    case Type::Null:
+      FAIL() << "null has no counterpart";
   }
 }
 
@@ -476,9 +484,9 @@ TEST(BinaryPlistWriterTest, WritesSmallestFittingIntegers) {
   EXPECT_EQ(soleObjectBytes(std::int64_t{5'000'000'000}),
             sequence({0x13, 0x00, 0x00, 0x00, 0x01, 0x2A, 0x05, 0xF2, 0x00}));
   EXPECT_EQ(soleObjectBytes(-2), sequence({0x13, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFE}));
-  EXPECT_EQ(soleObjectBytes(std::numeric_limits<std::uint64_t>::max()),
-            sequence({0x14, 0, 0, 0, 0, 0, 0, 0, 0, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF,
-                      0xFF}));
+  EXPECT_EQ(
+      soleObjectBytes(std::numeric_limits<std::uint64_t>::max()),
+      sequence({0x14, 0, 0, 0, 0, 0, 0, 0, 0, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF}));
 }
 
 TEST(BinaryPlistWriterTest, WritesScalarMarkers) {
@@ -510,9 +518,9 @@ TEST(BinaryPlistWriterTest, WritesLongLengthsAfterTheMarker) {
 
 TEST(BinaryPlistWriterTest, WritesHeaderTrailerAndOffsetTable) {
   const PlistData file = PropertyListSerialization::writeBinary(5);
-  const PlistData expected = sequence({'b', 'p', 'l', 'i', 's', 't', '0', '0', 0x10, 0x05, 0x08,
-                                       0, 0, 0, 0, 0, 0, 1, 1, 0, 0, 0, 0, 0, 0, 0, 1,
-                                       0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 10});
+  const PlistData expected = sequence(
+      {'b', 'p', 'l', 'i', 's', 't', '0', '0', 0x10, 0x05, 0x08, 0, 0, 0, 0, 0, 0, 1, 1, 0, 0, 0,
+       0,   0,   0,   0,   1,   0,   0,   0,   0,    0,    0,    0, 0, 0, 0, 0, 0, 0, 0, 0, 10});
   EXPECT_EQ(file, expected);
 }
 
@@ -528,8 +536,8 @@ TEST(BinaryPlistWriterTest, WritesDictionaryKeysThenValues) {
 TEST(BinaryPlistWriterTest, StoresEqualStringsOnce) {
   PlistArray records;
   for (int index = 0; index < 1000; ++index) {
-    records.emplace_back(PlistDictionary{{"bundleIdentifier", "com.example.shared"},
-                                         {"index", index}});
+    records.emplace_back(
+        PlistDictionary{{"bundleIdentifier", "com.example.shared"}, {"index", index}});
   }
   const PlistData file = PropertyListSerialization::writeBinary(records);
   const std::string text(file.begin(), file.end());
@@ -570,9 +578,11 @@ TEST(BinaryPlistWriterTest, SkipsNullsAndWritesNullRootAsEmptyDictionary) {
 }
 
 TEST(BinaryPlistWriterTest, ReplacesMalformedUtf8) {
-  const PlistValue broken = std::string("a\xFF" "b\xC3");
-  EXPECT_EQ(readBytes(PropertyListSerialization::writeBinary(broken)),
-            PlistValue("a\xEF\xBF\xBD" "b\xEF\xBF\xBD"));
+  const PlistValue broken = std::string(
+      "a\xFF"
+      "b\xC3");
+  EXPECT_EQ(readBytes(PropertyListSerialization::writeBinary(broken)), PlistValue("a\xEF\xBF\xBD"
+                                                                                  "b\xEF\xBF\xBD"));
   // Encoded surrogates are not UTF-8 either.
   const PlistValue surrogate = std::string("\xED\xA0\x80");
   const std::optional<PlistValue> back =
@@ -825,13 +835,13 @@ TEST(BinaryPlistReaderTest, RefusesContainersThatContainThemselves) {
   expectReadFails(assembleBinary({sequence({0xA1, 0x00})}), "contains itself");
   expectReadFails(assembleBinary({sequence({0xA1, 0x01}), sequence({0xA1, 0x00})}),
                   "contains itself");
-  expectReadFails(
-      assembleBinary({sequence({0xD1, 0x01, 0x00}), sequence({0x51, 'k'})}), "contains itself");
+  expectReadFails(assembleBinary({sequence({0xD1, 0x01, 0x00}), sequence({0x51, 'k'})}),
+                  "contains itself");
 }
 
 TEST(BinaryPlistReaderTest, CopiesSharedObjects) {
-  const PlistData file = assembleBinary({sequence({0xA3, 0x01, 0x01, 0x02}),
-                                         sequence({0x51, 'x'}), sequence({0xA2, 0x01, 0x01})});
+  const PlistData file = assembleBinary(
+      {sequence({0xA3, 0x01, 0x01, 0x02}), sequence({0x51, 'x'}), sequence({0xA2, 0x01, 0x01})});
   std::string error;
   const std::optional<PlistValue> value = readBytes(file, &error);
   ASSERT_TRUE(value) << error;
@@ -944,9 +954,9 @@ TEST(BinaryPlistReaderTest, RefusesUnsupportedAndMalformedObjects) {
   expectReadFails(assembleBinary({sequence({0x21, 0, 0})}), "real");
   expectReadFails(assembleBinary({sequence({0x32, 0, 0, 0, 0})}), "date");
   expectReadFails(assembleBinary({sequence({0x13, 0, 0})}), "integer out of range");
-  expectReadFails(assembleBinary({sequence({0x14, 0, 0, 0, 0, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0,
-                                            0})}),
-                  "64 bits");
+  expectReadFails(
+      assembleBinary({sequence({0x14, 0, 0, 0, 0, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0, 0})}),
+      "64 bits");
   expectReadFails(
       assembleBinary({sequence({0xD1, 0x01, 0x02}), sequence({0x10, 0x01}), sequence({0x09})}),
       "key is not a string");
@@ -954,8 +964,7 @@ TEST(BinaryPlistReaderTest, RefusesUnsupportedAndMalformedObjects) {
 
 TEST(BinaryPlistReaderTest, AcceptsOtherWritersEncodings) {
   // 4-byte reals, sign-extended 16-byte integers, unsorted keys.
-  EXPECT_EQ(readBytes(assembleBinary({sequence({0x22, 0x3F, 0xC0, 0x00, 0x00})})),
-            PlistValue(1.5));
+  EXPECT_EQ(readBytes(assembleBinary({sequence({0x22, 0x3F, 0xC0, 0x00, 0x00})})), PlistValue(1.5));
   PlistData negative = sequence({0x14});
   negative.insert(negative.end(), 15, 0xFF);
   negative.push_back(0xFE);
@@ -980,7 +989,8 @@ TEST(BinaryPlistReaderTest, ReplacesUnpairedSurrogates) {
   EXPECT_EQ(utf16({0xD83D}), replacement);
   EXPECT_EQ(utf16({0xDE00}), replacement);
   EXPECT_EQ(utf16({0xDE00, 0xD83D}), PlistValue("\xEF\xBF\xBD\xEF\xBF\xBD"));
-  EXPECT_EQ(utf16({0xD83D, 0x0041}), PlistValue("\xEF\xBF\xBD" "A"));
+  EXPECT_EQ(utf16({0xD83D, 0x0041}), PlistValue("\xEF\xBF\xBD"
+                                                "A"));
   EXPECT_EQ(utf16({0x00E9, 0x0000, 0x4E2D}), PlistValue(std::string("\xC3\xA9\0\xE4\xB8\xAD", 6)));
 }
 
@@ -1037,15 +1047,15 @@ TEST(XmlPlistReaderTest, ReadsADocument) {
   std::string error;
   const std::optional<PlistValue> value = PropertyListSerialization::read(xml, &error);
   ASSERT_TRUE(value) << error;
-  const PlistValue expected = PlistDictionary{
-      {"name", "caf\xC3\xA9 & more"},
-      {"count", -12},
-      {"big", std::numeric_limits<std::uint64_t>::max()},
-      {"ratio", 0.5},
-      {"when", PlistDate{kEpochOffset2001 + 100}},
-      {"blob", PlistData{0, 1, 2}},
-      {"on", true},
-      {"list", PlistArray{"<raw>", PlistArray{}, PlistDictionary{}}}};
+  const PlistValue expected =
+      PlistDictionary{{"name", "caf\xC3\xA9 & more"},
+                      {"count", -12},
+                      {"big", std::numeric_limits<std::uint64_t>::max()},
+                      {"ratio", 0.5},
+                      {"when", PlistDate{kEpochOffset2001 + 100}},
+                      {"blob", PlistData{0, 1, 2}},
+                      {"on", true},
+                      {"list", PlistArray{"<raw>", PlistArray{}, PlistDictionary{}}}};
   EXPECT_EQ(*value, expected);
 }
 
@@ -1065,7 +1075,8 @@ TEST(XmlPlistReaderTest, ReplacesEncodedSurrogates) {
   const std::optional<PlistValue> value =
       PropertyListSerialization::read("<plist><string>a&#xD800;b</string></plist>");
   ASSERT_TRUE(value);
-  EXPECT_EQ(*value, PlistValue("a\xEF\xBF\xBD\xEF\xBF\xBD\xEF\xBF\xBD" "b"));
+  EXPECT_EQ(*value, PlistValue("a\xEF\xBF\xBD\xEF\xBF\xBD\xEF\xBF\xBD"
+                               "b"));
 }
 
 // Deep documents must be refused before libplist builds (and recursively
