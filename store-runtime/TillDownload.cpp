@@ -113,73 +113,59 @@ void TillDownload::update(const std::function<void(TillDownloadFields&)>& change
 }
 
 TillDownloadMetadata TillDownload::metadata() const {
-  std::lock_guard lock(mutex_);
-  return fields_.metadata;
+  return field(&TillDownloadFields::metadata);
 }
 
 void TillDownload::setMetadata(TillDownloadMetadata metadata) {
-  std::lock_guard lock(mutex_);
-  fields_.metadata = std::move(metadata);
+  setField(&TillDownloadFields::metadata, std::move(metadata));
 }
 
 std::vector<TillDownloadAsset> TillDownload::assets() const {
-  std::lock_guard lock(mutex_);
-  return fields_.assets;
+  return field(&TillDownloadFields::assets);
 }
 
 void TillDownload::setAssets(std::vector<TillDownloadAsset> assets) {
-  std::lock_guard lock(mutex_);
-  fields_.assets = std::move(assets);
+  setField(&TillDownloadFields::assets, std::move(assets));
 }
 
 std::int64_t TillDownload::downloadType() const {
-  std::lock_guard lock(mutex_);
-  return fields_.downloadType;
+  return field(&TillDownloadFields::downloadType);
 }
 
 void TillDownload::setDownloadType(std::int64_t type) {
-  std::lock_guard lock(mutex_);
-  fields_.downloadType = type;
+  setField(&TillDownloadFields::downloadType, type);
 }
 
 std::optional<std::string> TillDownload::relaunchAppWithBundleURL() const {
-  std::lock_guard lock(mutex_);
-  return fields_.relaunchAppWithBundleURL;
+  return field(&TillDownloadFields::relaunchAppWithBundleURL);
 }
 
 void TillDownload::setRelaunchAppWithBundleURL(std::optional<std::string> url) {
-  std::lock_guard lock(mutex_);
-  fields_.relaunchAppWithBundleURL = std::move(url);
+  setField(&TillDownloadFields::relaunchAppWithBundleURL, std::move(url));
 }
 
 bool TillDownload::skipAssetDownloadIfNotAlreadyOnDisk() const {
-  std::lock_guard lock(mutex_);
-  return fields_.skipAssetDownloadIfNotAlreadyOnDisk;
+  return field(&TillDownloadFields::skipAssetDownloadIfNotAlreadyOnDisk);
 }
 
 void TillDownload::setSkipAssetDownloadIfNotAlreadyOnDisk(bool value) {
-  std::lock_guard lock(mutex_);
-  fields_.skipAssetDownloadIfNotAlreadyOnDisk = value;
+  setField(&TillDownloadFields::skipAssetDownloadIfNotAlreadyOnDisk, value);
 }
 
 TillDownloadStatus TillDownload::status() const {
-  std::lock_guard lock(mutex_);
-  return fields_.status;
+  return field(&TillDownloadFields::status);
 }
 
 void TillDownload::setStatus(TillDownloadStatus status) {
-  std::lock_guard lock(mutex_);
-  fields_.status = status;
+  setField(&TillDownloadFields::status, status);
 }
 
 double TillDownload::progress() const {
-  std::lock_guard lock(mutex_);
-  return fields_.progress;
+  return field(&TillDownloadFields::progress);
 }
 
 void TillDownload::setProgress(double fraction) {
-  std::lock_guard lock(mutex_);
-  fields_.progress = fraction;
+  setField(&TillDownloadFields::progress, fraction);
 }
 
 PlistDictionary TillDownload::encodeWithCoder() const {

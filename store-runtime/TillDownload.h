@@ -91,6 +91,18 @@ class TillDownload {
   [[nodiscard]] std::string description() const;
 
  private:
+  // One field read or written under the record's lock.
+  template <typename Value>
+  Value field(Value TillDownloadFields::*member) const {
+    std::lock_guard lock(mutex_);
+    return fields_.*member;
+  }
+  template <typename Value, typename Given>
+  void setField(Value TillDownloadFields::*member, Given&& value) {
+    std::lock_guard lock(mutex_);
+    fields_.*member = std::forward<Given>(value);
+  }
+
   mutable std::mutex mutex_;
   TillDownloadFields fields_;
 };
