@@ -2,6 +2,7 @@
 
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/TillLogManager.h"
+#include "update-queue/UpdateQueue.h"
 
 namespace larder {
 
@@ -9,6 +10,13 @@ namespace {
 
 PlistDictionary wireForm(const LedgerSoftwareProductRef& product) {
   return product ? product->toDictionary() : PlistDictionary{};
+}
+
+PlistArray wireForm(const UpdateQueue::UpdateList& updates) {
+  PlistArray wire;
+  wire.reserve(updates.size());
+  for (const LedgerUpdateRef& update : updates) wire.emplace_back(update->toDictionary());
+  return wire;
 }
 
 }  // namespace
@@ -81,6 +89,77 @@ std::string AssetServiceInterface::addSoftwareMapObserver(const std::string& obj
 
 void AssetServiceInterface::removeSoftwareMapObserver(const std::string& token) {
   softwareMap_.removeObserverWithToken(token);
+}
+
+std::optional<std::string> AssetServiceInterface::lookupOrvaneIDForApp(
+    const PlistValue& product) const {
+  const PlistDictionary* fields = product.dictionary();
+  std::optional<LedgerSoftwareProduct> record;
+  if (fields && !fields->empty()) {
+    record.emplace(LedgerSoftwareProduct::fieldsFromDictionary(*fields));
+  }
+  // The lookup works without a store client too, as every request about
+  // installed software does; it then speaks for the store application.
+  const VendStoreClient client = storeClient().value_or(
+      VendStoreClient::initWithStoreClientType(VendStoreClient::kStoreApplication));
+  return SoftwareMap::lookupOrvaneIDForApp(record ? &*record : nullptr, client);
+}
+
+// --- Available updates ---
+
+std::shared_ptr<UpdateQueue> AssetServiceInterface::updateQueue() const {
+  std::optional<VendStoreClient> client = storeClient();
+  return UpdateQueue::updateQueueForStoreClient(client ? &*client : nullptr);
+}
+
+bool AssetServiceInterface::isBookClient() const {
+  std::optional<VendStoreClient> client = storeClient();
+  return client && client->clientType() == VendStoreClient::kBookApplication;
+}
+
+PlistArray AssetServiceInterface::availableUpdates() const {
+  // Book updates come with the book library; until then a book client has
+  // none to list.
+  if (isBookClient()) return {};
+  auto queue = updateQueue();
+  return queue ? wireForm(*queue->availableUpdates()) : PlistArray{};
+}
+
+PlistDictionary AssetServiceInterface::availableUpdateWithItemIdentifier(
+    std::uint64_t itemIdentifier) const {
+  auto queue = updateQueue();
+  auto update = queue ? queue->availableUpdateWithItemIdentifier(itemIdentifier) : nullptr;
+  return update ? update->toDictionary() : PlistDictionary{};
+}
+
+PlistArray AssetServiceInterface::incompatibleUpdates() const {
+  auto queue = updateQueue();
+  auto list = queue ? queue->incompatibleUpdates() : nullptr;
+  return list ? wireForm(*list) : PlistArray{};
+}
+
+void AssetServiceInterface::checkForUpdatesWithUserHasSeenUpdates(
+    bool userHasSeenUpdates, std::function<void(PlistArray)> reply) const {
+  // Book clients check for book updates, which come with the book library:
+  // until then their check finds nothing.
+  if (isBookClient()) {
+    if (reply) reply({false, PlistArray{}, PlistDictionary{}});
+    return;
+  }
+  auto queue = updateQueue();
+  // Without a queue the reply belonged to it: it is never sent.
+  if (!queue) return;
+  queue->checkForUpdatesWithCompletionHandler(
+      [queue, userHasSeenUpdates, reply = std::move(reply)](
+          bool success, const UpdateQueue::UpdateList& available,
+          const std::optional<UpdateQueue::UpdateList>& incompatible, const OptionalError& error) {
+        if (userHasSeenUpdates) {
+          queue->setUserHasSeenAllUpdates(available,
+                                          incompatible.value_or(UpdateQueue::UpdateList{}));
+        }
+        if (!reply) return;
+        reply({success, wireForm(available), error ? error->toDictionary() : PlistDictionary{}});
+      });
 }
 
 }  // namespace larder

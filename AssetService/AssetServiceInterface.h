@@ -15,6 +15,7 @@
 namespace larder {
 
 class SoftwareMap;
+class UpdateQueue;
 
 // One client connection: the client's store client and the queue its
 // requests run on. It holds nothing else; every request resolves the
@@ -44,7 +45,25 @@ class AssetServiceInterface {
   [[nodiscard]] std::string addSoftwareMapObserver(const std::string& objectPath);
   void removeSoftwareMapObserver(const std::string& token);
 
+  // The account that owns the product the client sent (an empty record is
+  // no product); asks the store and blocks until it has answered.
+  [[nodiscard]] std::optional<std::string> lookupOrvaneIDForApp(const PlistValue& product) const;
+
   [[nodiscard]] SoftwareMap& softwareMap() const { return softwareMap_; }
+  // The update queue of the connection's store client; nullptr without one.
+  [[nodiscard]] std::shared_ptr<UpdateQueue> updateQueue() const;
+  // Book clients ask for book updates where others ask for app updates.
+  [[nodiscard]] bool isBookClient() const;
+
+  // Available updates and installs. The reply carries the records' wire
+  // forms; without a queue the requests answer as their table row says.
+  [[nodiscard]] PlistArray availableUpdates() const;
+  [[nodiscard]] PlistDictionary availableUpdateWithItemIdentifier(
+      std::uint64_t itemIdentifier) const;
+  [[nodiscard]] PlistArray incompatibleUpdates() const;
+  // Replies (success, updates, error) when the check ends.
+  void checkForUpdatesWithUserHasSeenUpdates(bool userHasSeenUpdates,
+                                             std::function<void(PlistArray)> reply) const;
 
  private:
   std::string peer_;

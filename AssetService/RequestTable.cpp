@@ -6,6 +6,7 @@
 #include "AssetService/AssetServiceInterface.h"
 #include "AssetService/DBusValueCodec.h"
 #include "software-map/SoftwareMap.h"
+#include "update-queue/UpdateQueue.h"
 #include "store-runtime/TillLogManager.h"
 
 namespace larder {
@@ -122,17 +123,28 @@ constexpr std::array kRequests = std::to_array<RequestDescriptor>({
      answer(r, {i.softwareMap().shouldAllowAutoPushForBundleID(text(a, 0), text(a, 1))});
    }},
   {"lookupOrvaneIDForApp:replyBlock:", "LookupOrvaneIDForApp", "a{sv}", "s", "product",
-   "orvaneID", false, nullptr, kEmpty},
+   "orvaneID", false,
+   [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {
+     answer(r, {i.lookupOrvaneIDForApp(a.at(0)).value_or("")});
+   }},
 
   // Available updates and installs.
   {"availableUpdatesBadgeCountWithReplyBlock:", "AvailableUpdatesBadgeCount", "", "t", "",
    "badgeCount", false, nullptr, kEmpty},
   {"availableUpdatesWithReplyBlock:", "AvailableUpdates", "", "aa{sv}", "", "updates", false,
-   nullptr, kEmpty},
+   [](AssetServiceInterface& i, const Arguments&, const ReplyHandler& r) {
+     answer(r, {i.availableUpdates()});
+   }},
   {"availableUpdateWithItemIdentifier:replyBlock:", "AvailableUpdateWithItemIdentifier", "t",
-   "a{sv}", "itemIdentifier", "update", false, nullptr, kEmpty},
+   "a{sv}", "itemIdentifier", "update", false,
+   [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {
+     answer(r, {i.availableUpdateWithItemIdentifier(a.at(0).uint64Value())});
+   }},
   {"incompatibleUpdatesWithReplyBlock:", "IncompatibleUpdates", "", "aa{sv}", "", "updates",
-   false, nullptr, kEmpty},
+   false,
+   [](AssetServiceInterface& i, const Arguments&, const ReplyHandler& r) {
+     answer(r, {i.incompatibleUpdates()});
+   }},
   {"addAvailableUpdatesObserver:", "AddAvailableUpdatesObserver", "o", "", "observer", "", false,
    nullptr, kNothing},
   {"removeAvailableUpdatesObserver:", "RemoveAvailableUpdatesObserver", "o", "", "observer", "",
@@ -144,12 +156,26 @@ constexpr std::array kRequests = std::to_array<RequestDescriptor>({
    "asa{sv}", "bsa{sv}a{sv}", "tags,fallbackPurchase", "success,path,response,error", false,
    nullptr, kNoReply},
   {"checkForUpdatesWithUserHasSeenUpdates:replyBlock:", "CheckForUpdatesWithUserHasSeenUpdates",
-   "b", "baa{sv}a{sv}", "userHasSeenUpdates", "success,updates,error", false, nullptr, kNoReply},
+   "b", "baa{sv}a{sv}", "userHasSeenUpdates", "success,updates,error", false,
+   [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {
+     i.checkForUpdatesWithUserHasSeenUpdates(a.at(0).boolValue(), r);
+   }},
   {"willStartDownloadForUpdateWithIdentifier:", "WillStartDownloadForUpdateWithIdentifier", "t",
-   "", "itemIdentifier", "", false, nullptr, kNothing},
+   "", "itemIdentifier", "", false,
+   [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler&) {
+     if (auto queue = i.updateQueue()) {
+       queue->willStartDownloadForUpdateWithIdentifier(a.at(0).uint64Value());
+     }
+   }},
   {"didFinishDownloadForUpdateWithItemIdentifier:didInstall:",
    "DidFinishDownloadForUpdateWithItemIdentifierDidInstall", "tb", "",
-   "itemIdentifier,didInstall", "", false, nullptr, kNothing},
+   "itemIdentifier,didInstall", "", false,
+   [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler&) {
+     if (auto queue = i.updateQueue()) {
+       queue->didFinishDownloadForUpdateWithItemIdentifier(a.at(0).uint64Value(),
+                                                           a.at(1).boolValue());
+     }
+   }},
   {"updatesForTags:replyBlock:", "UpdatesForTags", "as", "aa{sv}", "tags", "updates", false,
    nullptr, kNoReply},
   {"willInteractivelyPurchaseItemIdentifier:replyBlock:", "WillInteractivelyPurchaseItemIdentifier",

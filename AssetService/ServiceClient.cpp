@@ -30,13 +30,15 @@ void ServiceClient::presentStoreClient(std::int64_t clientType) {
   call("StartService", {});
 }
 
-PlistArray ServiceClient::call(const std::string& member, const PlistArray& arguments) {
+PlistArray ServiceClient::call(const std::string& member, const PlistArray& arguments,
+                               std::uint64_t timeoutMicroseconds) {
   const RequestDescriptor* request = RequestTable::find(member);
   if (!request) throw std::invalid_argument("unknown request " + member);
   sdbus::MethodCall message =
       proxy_->createMethodCall(std::string(RequestTable::kInterfaceName), member);
   DBusValueCodec::writeAll(message, request->inSignature, arguments);
-  sdbus::MethodReply reply = proxy_->callMethod(message, timeout_);
+  sdbus::MethodReply reply =
+      proxy_->callMethod(message, timeoutMicroseconds != 0 ? timeoutMicroseconds : timeout_);
   return DBusValueCodec::readAll(reply, request->outSignature);
 }
 

@@ -29,7 +29,9 @@ class ServiceClient {
 
   // Calls `member`; the reply's arguments in order. Throws sdbus::Error on
   // a D-Bus error and std::invalid_argument for an unknown request.
-  PlistArray call(const std::string& member, const PlistArray& arguments);
+  // A timeout of 0 is the client's.
+  PlistArray call(const std::string& member, const PlistArray& arguments,
+                  std::uint64_t timeoutMicroseconds = 0);
   // The same for the dialog agent registry (RegisterDialogAgent,
   // UnregisterDialogAgent, DisplayDialog); a timeout of 0 is the client's.
   PlistArray callDialogAgents(const std::string& member, const PlistArray& arguments,

@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <span>
 #include <string_view>
+#include <utility>
 
 #include "platform/PlistValue.h"
 
@@ -32,8 +33,17 @@ class DAAPBuffer {
   // False, and nothing written, when the offset is not inside the buffer.
   bool mendSize(std::size_t sizeOffset, std::uint32_t size);
 
+  // Room for `bytes` more bytes, so that a body of known size grows once.
+  void reserve(std::size_t bytes) { data_.reserve(data_.size() + bytes); }
+
   // A copy of the bytes written so far.
   [[nodiscard]] PlistData data() const { return data_; }
+  // The bytes written so far, without a copy; the buffer is empty after.
+  [[nodiscard]] PlistData takeData() {
+    PlistData taken = std::move(data_);
+    data_.clear();
+    return taken;
+  }
   [[nodiscard]] std::span<const std::uint8_t> bytes() const { return data_; }
   [[nodiscard]] std::size_t length() const { return data_.size(); }
 

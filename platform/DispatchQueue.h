@@ -39,6 +39,11 @@ class DispatchQueue {
   // Dropping the last reference while items are still queued is fine: they still run.
   static std::shared_ptr<DispatchQueue> create(std::string label, Kind kind);
   static std::shared_ptr<DispatchQueue> create(std::string label, Kind kind, Limits limits);
+  // The process's shared concurrent queue of default priority, for work
+  // that must run outside whatever queue or lock its submitter holds:
+  // completion handlers and delegate calls. Made on first use, never torn
+  // down.
+  static DispatchQueue& globalQueue();
   virtual ~DispatchQueue() = default;
 
   DispatchQueue(const DispatchQueue&) = delete;

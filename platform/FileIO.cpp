@@ -111,6 +111,18 @@ bool FileIO::writeAtomically(const std::string& path, std::span<const std::uint8
   return true;
 }
 
+bool FileIO::writeInPlace(const std::string& path, std::span<const std::uint8_t> bytes,
+                          std::string* error) {
+  std::string parent = std::filesystem::path(path).parent_path().string();
+  if (!parent.empty() && !createDirectories(parent, error)) return false;
+  FileDescriptor file(
+      ::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, S_IRUSR | S_IWUSR));
+  if (!file.valid()) return fail(error, "open " + path);
+  if (!writeAll(file.get(), bytes)) return fail(error, "write " + path);
+  if (::close(file.release()) != 0) return fail(error, "close " + path);
+  return true;
+}
+
 bool FileIO::writeAtomically(const std::string& path, std::string_view text, std::string* error) {
   return writeAtomically(
       path, std::span(reinterpret_cast<const std::uint8_t*>(text.data()), text.size()), error);

@@ -26,6 +26,12 @@ class FileIO {
   static bool writeAtomically(const std::string& path, std::string_view text,
                               std::string* error = nullptr);
 
+  // Truncates and rewrites `path` itself, for files whose readers are
+  // built to survive a torn write (they start empty on a file that does
+  // not parse). Creates missing parent folders; the file is 0600.
+  static bool writeInPlace(const std::string& path, std::span<const std::uint8_t> bytes,
+                           std::string* error = nullptr);
+
   static bool createDirectories(const std::string& path, std::string* error = nullptr);
 };
 

@@ -62,9 +62,11 @@ bundle "$LARDER_ROOT/Applications" "Sketchpad" com.example.sketchpad 1.9 400200
 bundle "$HOME/Applications" "Sketchpad" com.example.sketchpad 1.10 400200
 bundle "$LARDER_ROOT/Applications" "Terminal Helper" com.example.helper 1.0
 
-# A store with one account and one app, Atlas, packed from a bundle.
+# A store with one account and three apps, each packed from a bundle: Atlas
+# to buy, and updates for Ledgerly and (one this machine cannot take) for
+# Sketchpad.
 catalogue="$demo/catalogue"
-mkdir -p "$catalogue/items/400400"
+mkdir -p "$catalogue"
 cat >"$catalogue/accounts.plist" <<PLIST
 $plist_header
 <array><dict>
@@ -74,21 +76,31 @@ $plist_header
 </dict></array>
 </plist>
 PLIST
-bundle "$demo/packaging" "Atlas" com.example.atlas 1.0 400400
-"$larder_store" pack "$demo/packaging/Atlas.app" "$catalogue/items/400400/Atlas.tar"
-cat >"$catalogue/items/400400/item.plist" <<PLIST
+
+# store_item ITEM-ID NAME IDENTIFIER VERSION [EXTRA-PLIST-ENTRIES]
+store_item() {
+  local folder="$catalogue/items/$1"
+  mkdir -p "$folder"
+  bundle "$demo/packaging" "$2" "$3" "$4" "$1"
+  "$larder_store" pack "$demo/packaging/$2.app" "$folder/$2.tar"
+  cat >"$folder/item.plist" <<PLIST
 $plist_header
 <dict>
-  <key>ware-id</key><integer>400400</integer>
-  <key>bundle-id</key><string>com.example.atlas</string>
-  <key>title</key><string>Atlas</string>
-  <key>version</key><string>1.0</string>
-  <key>action-params</key><string>itemId=400400&amp;price=0</string>
+  <key>ware-id</key><integer>$1</integer>
+  <key>bundle-id</key><string>$3</string>
+  <key>title</key><string>$2</string>
+  <key>version</key><string>$4</string>
+  <key>action-params</key><string>itemId=$1&amp;price=0</string>
   <key>release-date</key><date>2026-10-01T09:00:00Z</date>
-  <key>package</key><string>Atlas.tar</string>
+  <key>package</key><string>$2.tar</string>
+  ${5:-}
 </dict>
 </plist>
 PLIST
+}
+store_item 400400 Atlas com.example.atlas 1.0
+store_item 400100 Ledgerly com.example.ledgerly 2.6
+store_item 400200 Sketchpad com.example.sketchpad 2.0 "<key>incompatible</key><true/>"
 
 mkdir -p "$XDG_STATE_HOME"
 echo "== starting larder-store (log: $XDG_STATE_HOME/larder-store.log)"
@@ -156,3 +168,8 @@ done
 sleep 0.5  # the live query sees the new bundle
 echo; echo "== larderctl product --bundle-id com.example.atlas  (downloaded, digests checked, installed)"
 "$larderctl" product --bundle-id com.example.atlas
+
+echo; echo "== larderctl updates --check  (Ledgerly 2.5 installed, 2.6 in the store; Sketchpad 2.0 needs another machine)"
+"$larderctl" updates --check
+echo; echo "== larderctl updates  (the same list, from the service's cache; no store request)"
+"$larderctl" updates

@@ -21,6 +21,8 @@
 
 namespace larder {
 
+class VendStoreClient;
+
 // The process's one index of the store software installed on the machine.
 // All maps are guarded by `dispatchQueue`: readers enter it synchronously,
 // every change is a barrier. Records are shared between the maps, so a
@@ -78,6 +80,11 @@ class SoftwareMap {
   // Whether a pushed install of that version may go ahead: yes when it has
   // a store copy to replace or when the application is not here at all.
   bool shouldAllowAutoPushForBundleID(std::string_view bundleID, std::string_view bundleVersion);
+  // The name of the account that owns `product`, asked of the store with
+  // the purchase record of its bundle. Blocks until the store has
+  // answered; nullopt without product, purchase record or answer.
+  static std::optional<std::string> lookupOrvaneIDForApp(const LedgerSoftwareProduct* product,
+                                                         const VendStoreClient& storeClient);
   // The manifest of bundled software is read once per process; tests that
   // change the platform root between cases forget it.
   static void resetBundledManifestForTesting();

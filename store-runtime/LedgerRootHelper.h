@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "platform/PlistValue.h"
+#include "store-runtime/DaemonDefaults.h"
 
 namespace larder {
 
@@ -22,7 +23,7 @@ namespace larder {
 // land in the launcher bar's state (LedgerDockMessaging).
 class LedgerRootHelper {
  public:
-  static constexpr std::string_view kSystemPreferencesDomain = "com.orvane.larderd";
+  static constexpr std::string_view kSystemPreferencesDomain = kDaemonDefaultsID;
 
   // Keys the helper writes in that domain.
   static constexpr std::string_view kAutoUpdateEnabledKey = "AutoUpdate";

@@ -82,32 +82,42 @@ std::shared_ptr<LedgerUpdate> LedgerUpdate::initWithDictionary(PlistDictionary i
   return std::make_shared<LedgerUpdate>(Validated{}, std::move(item));
 }
 
-const PlistValue& LedgerUpdate::valueForKey(std::string_view key) const {
-  const auto found = item_.find(key);
-  return found == item_.end() ? PlistValue::null() : found->second;
+LedgerUpdate::LedgerUpdate(Validated, PlistDictionary item)
+    : item_(std::move(item)),
+      itemIdentifierValue_(RecordFieldReader(item_).unsignedInteger(kWareIDKey).value_or(0)),
+      bundleID_(RecordFieldReader(item_).string(kBundleIDKey)) {}
+
+PlistDictionary LedgerUpdate::dictionary() const {
+  std::lock_guard lock(mutex_);
+  return item_;
 }
 
 std::optional<std::string> LedgerUpdate::stringForKey(std::string_view key) const {
-  RecordFieldReader reader(item_);
-  return reader.string(key);
+  std::lock_guard lock(mutex_);
+  return RecordFieldReader(item_).string(key);
 }
 
 bool LedgerUpdate::boolForKey(std::string_view key) const {
-  RecordFieldReader reader(item_);
-  return reader.boolean(key).value_or(false);
+  std::lock_guard lock(mutex_);
+  return RecordFieldReader(item_).boolean(key).value_or(false);
 }
 
-const PlistValue& LedgerUpdate::itemIdentifier() const {
-  return valueForKey(kWareIDKey);
+std::optional<PlistDate> LedgerUpdate::dateForKey(std::string_view key) const {
+  std::lock_guard lock(mutex_);
+  return RecordFieldReader(item_).date(key);
 }
 
-std::uint64_t LedgerUpdate::itemIdentifierValue() const {
-  return valueForKey(kWareIDKey).uint64Value();
+void LedgerUpdate::setValueForKey(std::string_view key, PlistValue value) {
+  std::lock_guard lock(mutex_);
+  item_.insert_or_assign(std::string(key), std::move(value));
 }
 
-std::optional<std::string> LedgerUpdate::bundleID() const {
-  return stringForKey(kBundleIDKey);
+PlistValue LedgerUpdate::itemIdentifier() const {
+  std::lock_guard lock(mutex_);
+  const auto found = item_.find(kWareIDKey);
+  return found == item_.end() ? PlistValue() : found->second;
 }
+
 std::optional<std::string> LedgerUpdate::title() const {
   return stringForKey(kTitleKey);
 }
@@ -119,54 +129,53 @@ std::optional<std::string> LedgerUpdate::actionParams() const {
 }
 
 std::optional<PlistDate> LedgerUpdate::releaseDate() const {
-  RecordFieldReader reader(item_);
-  return reader.date(kReleaseDateKey);
+  return dateForKey(kReleaseDateKey);
 }
 
 bool LedgerUpdate::isStaged() const {
   return boolForKey(kIsStagedKey);
 }
 void LedgerUpdate::setIsStaged(bool staged) {
-  item_.insert_or_assign(std::string(kIsStagedKey), staged);
+  setValueForKey(kIsStagedKey, staged);
 }
 
 bool LedgerUpdate::hasBeenSeenByUser() const {
   return boolForKey(kHasBeenSeenByUserKey);
 }
 void LedgerUpdate::setHasBeenSeenByUser(bool seen) {
-  item_.insert_or_assign(std::string(kHasBeenSeenByUserKey), seen);
+  setValueForKey(kHasBeenSeenByUserKey, seen);
 }
 
 std::int64_t LedgerUpdate::autoUpdateAbortCode() const {
-  RecordFieldReader reader(item_);
-  return reader.integer(kAutoUpdateAbortCodeKey).value_or(0);
+  std::lock_guard lock(mutex_);
+  return RecordFieldReader(item_).integer(kAutoUpdateAbortCodeKey).value_or(0);
 }
 void LedgerUpdate::setAutoUpdateAbortCode(std::int64_t code) {
-  item_.insert_or_assign(std::string(kAutoUpdateAbortCodeKey), code);
+  setValueForKey(kAutoUpdateAbortCodeKey, code);
 }
 
 std::optional<PlistDate> LedgerUpdate::firstAutoUpdateAttemptDate() const {
-  RecordFieldReader reader(item_);
-  return reader.date(kFirstAutoUpdateAttemptDateKey);
+  return dateForKey(kFirstAutoUpdateAttemptDateKey);
 }
 void LedgerUpdate::setFirstAutoUpdateAttemptDate(std::optional<PlistDate> date) {
   if (date) {
-    item_.insert_or_assign(std::string(kFirstAutoUpdateAttemptDateKey), *date);
-  } else {
-    item_.erase(std::string(kFirstAutoUpdateAttemptDateKey));
+    setValueForKey(kFirstAutoUpdateAttemptDateKey, *date);
+    return;
   }
+  std::lock_guard lock(mutex_);
+  item_.erase(std::string(kFirstAutoUpdateAttemptDateKey));
 }
 
 bool LedgerUpdate::didFailToAutoInstall() const {
   return boolForKey(kDidFailToAutoInstallKey);
 }
 void LedgerUpdate::setDidFailToAutoInstall(bool failed) {
-  item_.insert_or_assign(std::string(kDidFailToAutoInstallKey), failed);
+  setValueForKey(kDidFailToAutoInstallKey, failed);
 }
 
 PlistDictionary LedgerUpdate::encodeWithCoder() const {
   PlistDictionary encoded = KeyedArchive::record(kClassName);
-  encoded.emplace(kDictionaryKey, item_);
+  encoded.emplace(kDictionaryKey, dictionary());
   return encoded;
 }
 
@@ -177,14 +186,15 @@ std::shared_ptr<LedgerUpdate> LedgerUpdate::initWithCoder(const PlistValue& enco
 }
 
 PlistDictionary LedgerUpdate::toDictionary() const {
+  PlistDictionary item = dictionary();
   PlistDictionary wire;
-  RecordFieldReader reader(item_);
+  RecordFieldReader reader(item);
   for (const ItemField& field : kItemFields) {
     std::optional<PlistValue> value = readKind(reader, field.itemKey, field.kind);
     if (!value) value = defaultOnWire(field.kind);
     if (value) wire.emplace(field.fieldName, std::move(*value));
   }
-  wire.emplace(kDictionaryKey, item_);
+  wire.emplace(kDictionaryKey, std::move(item));
   return wire;
 }
 

@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -15,8 +16,10 @@ namespace larder {
 // item is the record: `dictionary()` is what the update queue persists and
 // merges, so the local marks live in it under keys of their own.
 //
-// Records are shared through std::shared_ptr and changed in place by their
-// owner, which guards the writes; the record has no lock.
+// Records are shared through std::shared_ptr: the update queue hands its
+// own records to clients and keeps marking them, so every access takes the
+// record's lock. The store's keys never change after the record is made;
+// only the local marks do.
 class LedgerUpdate {
   struct Validated {
     explicit Validated() = default;
@@ -49,15 +52,15 @@ class LedgerUpdate {
   static std::shared_ptr<LedgerUpdate> initWithDictionary(PlistDictionary item);
   static bool isValidItem(const PlistDictionary& item);
 
-  LedgerUpdate(Validated, PlistDictionary item) : item_(std::move(item)) {}
+  LedgerUpdate(Validated, PlistDictionary item);
 
-  // The item with the local marks.
-  [[nodiscard]] const PlistDictionary& dictionary() const { return item_; }
+  // A copy of the item with the local marks.
+  [[nodiscard]] PlistDictionary dictionary() const;
 
   // The number as the store sent it, and its value.
-  [[nodiscard]] const PlistValue& itemIdentifier() const;
-  [[nodiscard]] std::uint64_t itemIdentifierValue() const;
-  [[nodiscard]] std::optional<std::string> bundleID() const;
+  [[nodiscard]] PlistValue itemIdentifier() const;
+  [[nodiscard]] std::uint64_t itemIdentifierValue() const { return itemIdentifierValue_; }
+  [[nodiscard]] const std::optional<std::string>& bundleID() const { return bundleID_; }
   [[nodiscard]] std::optional<std::string> title() const;
   // The version the update brings.
   [[nodiscard]] std::optional<std::string> version() const;
@@ -92,11 +95,17 @@ class LedgerUpdate {
   [[nodiscard]] std::string description() const;
 
  private:
-  [[nodiscard]] const PlistValue& valueForKey(std::string_view key) const;
   [[nodiscard]] std::optional<std::string> stringForKey(std::string_view key) const;
   [[nodiscard]] bool boolForKey(std::string_view key) const;
+  [[nodiscard]] std::optional<PlistDate> dateForKey(std::string_view key) const;
+  void setValueForKey(std::string_view key, PlistValue value);
 
+  mutable std::mutex mutex_;
   PlistDictionary item_;
+  // Store keys never change, so the ones that lists are searched by are
+  // read once.
+  std::uint64_t itemIdentifierValue_;
+  std::optional<std::string> bundleID_;
 };
 
 using LedgerUpdateRef = std::shared_ptr<LedgerUpdate>;

@@ -19,11 +19,19 @@ class StoreClientRegistry {
  public:
   // nullptr for a client without identifier.
   std::shared_ptr<Object> objectForStoreClient(const VendStoreClient* storeClient) {
+    return objectForStoreClient(storeClient, [](const VendStoreClient& client) {
+      return std::make_shared<Object>(client);
+    });
+  }
+
+  // The same, for objects that need more than the client to be made.
+  template <typename Factory>
+  std::shared_ptr<Object> objectForStoreClient(const VendStoreClient* storeClient, Factory&& make) {
     if (!storeClient || storeClient->identifier().empty()) return nullptr;
     std::lock_guard lock(mutex_);
     auto found = objects_.find(storeClient->identifier());
     if (found != objects_.end()) return found->second;
-    auto object = std::make_shared<Object>(*storeClient);
+    std::shared_ptr<Object> object = make(*storeClient);
     objects_.emplace(storeClient->identifier(), object);
     return object;
   }

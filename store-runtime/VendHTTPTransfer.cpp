@@ -129,6 +129,11 @@ std::unique_ptr<curl_slist, ListDeleter> headerList(const VendURLRequest& reques
   if (request.cachePolicy() == VendURLRequest::kReloadIgnoringLocalCacheData) {
     list = curl_slist_append(list, "Cache-Control: no-cache");
   }
+  // A body is sent with the type its request names, or with none: curl
+  // would call it a form.
+  if (!request.valueForHeaderField("Content-Type")) {
+    list = curl_slist_append(list, "Content-Type:");
+  }
   return std::unique_ptr<curl_slist, ListDeleter>(list);
 }
 

@@ -1,5 +1,6 @@
 #include "store-runtime/VendStringHelpers.h"
 
+#include <cctype>
 #include <charconv>
 
 #include <pwd.h>
@@ -74,6 +75,22 @@ std::string urlByAddingStringToQueryString(std::string_view url, std::string_vie
   result += text;
   result += fragment;
   return result;
+}
+
+std::string percentEncodedQueryComponent(std::string_view text) {
+  static constexpr char kDigits[] = "0123456789ABCDEF";
+  std::string encoded;
+  encoded.reserve(text.size());
+  for (const unsigned char byte : text) {
+    if (std::isalnum(byte) != 0 || byte == '-' || byte == '_' || byte == '.' || byte == '~') {
+      encoded.push_back(static_cast<char>(byte));
+    } else {
+      encoded.push_back('%');
+      encoded.push_back(kDigits[byte >> 4U]);
+      encoded.push_back(kDigits[byte & 0xFU]);
+    }
+  }
+  return encoded;
 }
 
 std::optional<std::uint64_t> unsignedDecimalNumber(std::string_view text) {

@@ -19,6 +19,10 @@ std::string stringByExpandingTildeInPathOutsideOfSandbox(std::string_view path);
 // is dropped; empty text leaves the URL as it is.
 std::string urlByAddingStringToQueryString(std::string_view url, std::string_view text);
 
+// `text` as one name or value of a URL query: every byte but letters,
+// digits and "-._~" percent-encoded.
+std::string percentEncodedQueryComponent(std::string_view text);
+
 // The whole text as an unsigned decimal number: no sign, no spaces, no
 // trailing characters, no overflow; nullopt otherwise.
 std::optional<std::uint64_t> unsignedDecimalNumber(std::string_view text);

@@ -1,7 +1,5 @@
 #include "store-runtime/VendTransactionService.h"
 
-#include <cctype>
-
 #include "platform/DispatchQueue.h"
 #include "platform/PropertyListSerialization.h"
 #include "store-runtime/TillDownload.h"
@@ -22,21 +20,6 @@ constexpr std::string_view kSpeaker = "VendTransactionService";
 constexpr std::string_view kBuyBagKey = "buy-product";
 constexpr std::string_view kLookupBagKey = "item-lookup";
 
-std::string percentEncoded(std::string_view text) {
-  std::string encoded;
-  for (unsigned char c : text) {
-    if (std::isalnum(c) != 0 || c == '-' || c == '_' || c == '.' || c == '~') {
-      encoded.push_back(static_cast<char>(c));
-    } else {
-      static constexpr char kDigits[] = "0123456789ABCDEF";
-      encoded += '%';
-      encoded.push_back(kDigits[c >> 4U]);
-      encoded.push_back(kDigits[c & 0xFU]);
-    }
-  }
-  return encoded;
-}
-
 // "a=1&b=x" from the string and number entries of the request.
 std::string queryText(const PlistDictionary& request) {
   std::string query;
@@ -50,7 +33,7 @@ std::string queryText(const PlistDictionary& request) {
       continue;
     }
     if (!query.empty()) query += '&';
-    query += percentEncoded(key) + "=" + percentEncoded(text);
+    query += percentEncodedQueryComponent(key) + "=" + percentEncodedQueryComponent(text);
   }
   return query;
 }

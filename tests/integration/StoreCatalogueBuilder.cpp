@@ -51,6 +51,7 @@ void StoreCatalogueBuilder::addAccount(const Account& account) {
                         {"password", account.password},
                         {"storeFrontID", account.storeFrontID}};
   if (account.signingKey) entry.emplace("signingKey", *account.signingKey);
+  if (account.opaqueID) entry.emplace("opaqueID", *account.opaqueID);
   accounts_.emplace_back(std::move(entry));
   writePlist("accounts.plist", accounts_);
 }
@@ -59,6 +60,10 @@ void StoreCatalogueBuilder::setStoreSettings(const PlistDictionary& bagExtras,
                                              std::optional<std::uint64_t> chunkSize) {
   PlistDictionary settings{{"bag", bagExtras}};
   if (chunkSize) settings.emplace("chunkSize", *chunkSize);
+  writeStoreSettings(settings);
+}
+
+void StoreCatalogueBuilder::writeStoreSettings(const PlistDictionary& settings) const {
   writePlist("store.plist", settings);
 }
 

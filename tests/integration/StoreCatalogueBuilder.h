@@ -20,6 +20,7 @@ class StoreCatalogueBuilder {
     std::string password;
     std::string storeFrontID = "143441";
     std::optional<PlistData> signingKey;  // absent: the store derives one
+    std::optional<std::string> opaqueID;  // absent: the store uses the account id
   };
 
   struct Item {
@@ -51,6 +52,9 @@ class StoreCatalogueBuilder {
   // store.plist: extra bag entries and the hash chunk size.
   void setStoreSettings(const PlistDictionary& bagExtras,
                         std::optional<std::uint64_t> chunkSize = std::nullopt);
+  // store.plist exactly as given, for settings beyond those two
+  // ("extraUpdateItems", ...) and for malformed ones.
+  void writeStoreSettings(const PlistDictionary& settings) const;
   // Any file below the catalogue, for entries a test wants malformed.
   void writeFile(const std::string& relativePath, std::string_view contents) const;
 

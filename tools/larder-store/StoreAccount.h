@@ -14,6 +14,8 @@ struct StoreAccount {
   std::string password;
   std::string storeFrontID;
   PlistData signingKey;
+  // How purchase records name the account ("opaqueAccountIDString").
+  std::string opaqueID;
 
   // The answer to a successful sign-in.
   [[nodiscard]] PlistDictionary toAuthenticationDictionary() const;

@@ -75,9 +75,18 @@ std::optional<StoreAccount> StoreAccounts::accountFromEntry(const PlistValue& en
   } else {
     account.signingKey = derivedSigningKey(account.accountID, account.orvaneID, account.password);
   }
+  const PlistValue& opaqueID = entry["opaqueID"];
+  if (opaqueID.isNull()) {
+    account.opaqueID = std::to_string(account.accountID);
+  } else if (opaqueID.string() && !opaqueID.string()->empty()) {
+    account.opaqueID = *opaqueID.string();
+  } else {
+    return skip("opaqueID is not a non-empty string");
+  }
   if (accountWithID(account.accountID)) return skip("its accountID is taken");
   for (const StoreAccount& other : accounts_) {
     if (other.orvaneID == account.orvaneID) return skip("its orvaneID is taken");
+    if (other.opaqueID == account.opaqueID) return skip("its opaqueID is taken");
   }
   return account;
 }
@@ -93,6 +102,13 @@ const StoreAccount* StoreAccounts::authenticate(std::string_view name,
 const StoreAccount* StoreAccounts::accountWithID(std::uint64_t accountID) const {
   for (const StoreAccount& account : accounts_) {
     if (account.accountID == accountID) return &account;
+  }
+  return nullptr;
+}
+
+const StoreAccount* StoreAccounts::accountWithOpaqueID(std::string_view opaqueID) const {
+  for (const StoreAccount& account : accounts_) {
+    if (account.opaqueID == opaqueID) return &account;
   }
   return nullptr;
 }

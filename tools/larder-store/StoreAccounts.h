@@ -11,7 +11,7 @@
 namespace larder {
 
 // The accounts of "accounts.plist": an array of { accountID, orvaneID,
-// password, storeFrontID?, signingKey? }. An entry that is not one is
+// password, storeFrontID?, signingKey?, opaqueID? }. An entry that is not one is
 // skipped with a line on standard error.
 class StoreAccounts {
  public:
@@ -23,6 +23,7 @@ class StoreAccounts {
   [[nodiscard]] const StoreAccount* authenticate(std::string_view name,
                                                  std::string_view password) const;
   [[nodiscard]] const StoreAccount* accountWithID(std::uint64_t accountID) const;
+  [[nodiscard]] const StoreAccount* accountWithOpaqueID(std::string_view opaqueID) const;
   [[nodiscard]] std::size_t size() const { return accounts_.size(); }
 
   // The key of an account that names none: the same for the same account

@@ -29,6 +29,10 @@ PlistDictionary StoreAnswers::bag(std::string_view baseURL, const PlistDictionar
       {"item-lookup", joined(baseURL, kItemLookupPath)},
       {"ovp-licensing-invitation-url-pattern",
        "^" + regexEscaped(joined(baseURL, kInvitationsPrefix)) + ".+$"},
+      {"available-software-updates-extended", joined(baseURL, kUpdateCheckPath)},
+      {"available-software-updates-compress-request", true},
+      {"da-do-not-update-list", PlistArray{}},
+      {"orvane-id-lookup", joined(baseURL, kOrvaneIDLookupPath)},
   };
   for (const auto& [key, value] : extras) {
     const std::string* text = value.string();

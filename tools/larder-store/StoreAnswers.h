@@ -19,6 +19,8 @@ class StoreAnswers {
   static constexpr std::string_view kItemLookupPath = "/lookup";
   static constexpr std::string_view kAssetsPrefix = "/assets/";
   static constexpr std::string_view kPreflightPrefix = "/preflight/";
+  static constexpr std::string_view kUpdateCheckPath = "/available-software-updates";
+  static constexpr std::string_view kOrvaneIDLookupPath = "/orvane-id-lookup";
   static constexpr std::string_view kInvitationsPrefix = "/invitations/";
   static constexpr std::string_view kRequestsPath = "/_larder/requests";
 

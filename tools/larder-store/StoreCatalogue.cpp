@@ -37,6 +37,7 @@ std::optional<StoreCatalogue> StoreCatalogue::load(const std::string& directory,
   StoreCatalogue catalogue;
   catalogue.loadSettings(directory + "/store.plist");
   catalogue.accounts_ = StoreAccounts::load(directory + "/accounts.plist");
+  catalogue.cloudLibrary_ = std::make_shared<StoreCloudLibrary>(directory + "/library.plist");
   catalogue.loadItems(directory + "/items");
   TILL_LOG(2, "%@: %lu items and %lu accounts from %@", "StoreCatalogue",
            static_cast<unsigned long>(catalogue.items_.size()),
@@ -63,6 +64,12 @@ void StoreCatalogue::loadSettings(const std::string& path) {
     chunkSize_ = chunkSize.uint64Value();
   } else if (!chunkSize.isNull()) {
     TILL_LOG(1, "%@: ignoring \"chunkSize\" of %@: not a positive integer", "StoreCatalogue", path);
+  }
+  const PlistValue& extraUpdateItems = (*settings)["extraUpdateItems"];
+  if (const PlistArray* items = extraUpdateItems.array()) {
+    extraUpdateItems_ = *items;
+  } else if (!extraUpdateItems.isNull()) {
+    TILL_LOG(1, "%@: ignoring \"extraUpdateItems\" of %@: not an array", "StoreCatalogue", path);
   }
 }
 

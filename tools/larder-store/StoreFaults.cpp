@@ -6,9 +6,10 @@
 namespace larder {
 namespace {
 
-constexpr std::array<std::pair<StoreFaults::Kind, std::string_view>, 6> kKindNames{{
+constexpr std::array<std::pair<StoreFaults::Kind, std::string_view>, 7> kKindNames{{
     {StoreFaults::Kind::ServerError, "500"},
     {StoreFaults::Kind::Stall, "stall"},
+    {StoreFaults::Kind::Slow, "slow"},
     {StoreFaults::Kind::NotPlist, "not-plist"},
     {StoreFaults::Kind::WrongShape, "wrong-shape"},
     {StoreFaults::Kind::Truncate, "truncate"},

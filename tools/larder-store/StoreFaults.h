@@ -17,6 +17,7 @@ class StoreFaults {
   enum class Kind {
     ServerError,  // "500": status 500 with a failure dictionary
     Stall,        // "stall": no answer until the server stops
+    Slow,         // "slow": the usual answer, one second late
     NotPlist,     // "not-plist": 200 with bytes that are no property list
     WrongShape,   // "wrong-shape": 200 with a property list of the wrong shape
     Truncate,     // "truncate" (assets): full Content-Length, half the bytes

@@ -96,6 +96,12 @@ bool readOptions(const PlistValue& entry, StoreItem& item, std::string* error) {
   }
   item.accountLess = accountLess.boolValue();
 
+  const PlistValue& incompatible = entry["incompatible"];
+  if (!incompatible.isNull() && !incompatible.isBoolean()) {
+    return fail(error, "incompatible is not a boolean");
+  }
+  item.incompatible = incompatible.boolValue();
+
   const PlistValue& preflight = entry["preflight"];
   if (preflight.isNull()) return true;
   if (!preflight.isDictionary()) return fail(error, "preflight is not a dictionary");

@@ -29,6 +29,9 @@ struct StoreItem {
   // Present when the item asks for a preflight check before its download.
   std::optional<Preflight> preflight;
   bool accountLess = false;
+  // The update check lists the item among the updates that cannot be
+  // installed on the client's machine.
+  bool incompatible = false;
   PackageDigest digest;  // filled by the catalogue
 
   [[nodiscard]] std::string packagePath() const { return folder + "/" + packageName; }

@@ -1,12 +1,11 @@
 #include "larder-store/StorePurchases.h"
 
 #include <charconv>
-#include <span>
 
 #include "larder-store/StoreAnswers.h"
+#include "larder-store/StoreRequestSignature.h"
 #include "platform/PropertyListSerialization.h"
 #include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendRequestSigner.h"
 #include "store-runtime/VendStringHelpers.h"
 
 namespace larder {
@@ -16,10 +15,6 @@ std::optional<std::uint64_t> positiveNumber(std::string_view text) {
   auto value = unsignedDecimalNumber(text);
   if (value == 0U) return std::nullopt;
   return value;
-}
-
-std::span<const std::uint8_t> bytesOf(std::string_view text) {
-  return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
 }
 
 StoreReply failure(int status, std::string_view type, std::string_view message) {
@@ -57,31 +52,10 @@ std::optional<std::uint64_t> StorePurchases::itemIdentifierOf(const PlistValue& 
   return std::nullopt;
 }
 
-StorePurchases::Signature StorePurchases::checkSignature(const httplib::Request& request,
-                                                         const StoreAccount** signer) const {
-  const std::string accountHeader(VendRequestSigner::kAccountHeader);
-  const std::string signatureHeader(VendRequestSigner::kSignatureHeader);
-  if (!request.has_header(accountHeader) && !request.has_header(signatureHeader)) {
-    return Signature::Absent;
-  }
-  const auto accountID = positiveNumber(request.get_header_value(accountHeader));
-  const StoreAccount* account =
-      accountID ? catalogue_.accounts().accountWithID(*accountID) : nullptr;
-  if (!account) return Signature::Invalid;
-  const VendRequestSigner verifier(account->signingKey);
-  const std::string expected =
-      verifier.requestSignature(request.method, request.target, bytesOf(request.body));
-  if (!VendRequestSigner::signaturesMatch(request.get_header_value(signatureHeader), expected)) {
-    return Signature::Invalid;
-  }
-  *signer = account;
-  return Signature::Valid;
-}
-
 StoreReply StorePurchases::buy(const httplib::Request& request, std::string_view baseURL) const {
-  const StoreAccount* signer = nullptr;
-  const Signature signature = checkSignature(request, &signer);
-  if (signature == Signature::Invalid) {
+  const auto signature = StoreRequestSignature::check(request, catalogue_.accounts());
+  const StoreAccount* signer = signature.signer;
+  if (signature.outcome == StoreRequestSignature::Outcome::Invalid) {
     TILL_LOG(2, "%@: refusing a purchase with a bad signature", "StorePurchases");
     return failure(401, "invalid-signature", "The request's signature is not valid.");
   }

@@ -31,9 +31,6 @@ class StorePurchases {
   static std::optional<std::string_view> queryValue(std::string_view query, std::string_view key);
 
  private:
-  enum class Signature { Absent, Invalid, Valid };
-  Signature checkSignature(const httplib::Request& request, const StoreAccount** signer) const;
-
   const StoreCatalogue& catalogue_;
 };
 

@@ -16,6 +16,18 @@ std::string_view storeRouteName(StoreRoute route) {
       return "assets";
     case StoreRoute::Preflight:
       return "preflight";
+    case StoreRoute::UpdateCheck:
+      return "available-software-updates";
+    case StoreRoute::OrvaneIDLookup:
+      return "orvane-id-lookup";
+    case StoreRoute::DAAPLogin:
+      return "daap-login";
+    case StoreRoute::DAAPUpdate:
+      return "daap-update";
+    case StoreRoute::DAAPDatabases:
+      return "daap-databases";
+    case StoreRoute::DAAPItems:
+      return "daap-items";
   }
   return "unknown";
 }

@@ -15,11 +15,19 @@ enum class StoreRoute {
   ItemLookup,
   Assets,
   Preflight,
+  UpdateCheck,
+  OrvaneIDLookup,
+  DAAPLogin,
+  DAAPUpdate,
+  DAAPDatabases,
+  DAAPItems,
 };
 
-inline constexpr std::array<StoreRoute, 6> kAllStoreRoutes{
-    StoreRoute::Bag,        StoreRoute::Authenticate, StoreRoute::BuyProduct,
-    StoreRoute::ItemLookup, StoreRoute::Assets,       StoreRoute::Preflight,
+inline constexpr std::array<StoreRoute, 12> kAllStoreRoutes{
+    StoreRoute::Bag,         StoreRoute::Authenticate,   StoreRoute::BuyProduct,
+    StoreRoute::ItemLookup,  StoreRoute::Assets,         StoreRoute::Preflight,
+    StoreRoute::UpdateCheck, StoreRoute::OrvaneIDLookup, StoreRoute::DAAPLogin,
+    StoreRoute::DAAPUpdate,  StoreRoute::DAAPDatabases,  StoreRoute::DAAPItems,
 };
 
 std::string_view storeRouteName(StoreRoute route);

@@ -49,7 +49,12 @@ AssetStream::Damage damageFor(std::optional<StoreFaults::Kind> fault) {
 }  // namespace
 
 StoreServer::StoreServer(StoreCatalogue catalogue, StoreFaults faults)
-    : catalogue_(std::move(catalogue)), faults_(std::move(faults)), purchases_(catalogue_) {
+    : catalogue_(std::move(catalogue)),
+      faults_(std::move(faults)),
+      purchases_(catalogue_),
+      updateCheck_(catalogue_),
+      orvaneIDLookup_(catalogue_),
+      cloudLibrary_(catalogue_) {
   // httplib owns the task queue it asks for and deletes it when it stops.
   http_.new_task_queue = [] {
     return std::make_unique<httplib::ThreadPool>(kWorkerThreads).release();
@@ -102,10 +107,39 @@ void StoreServer::installRoutes() {
             route(StoreRoute::Assets, handlerFor(&StoreServer::answerAsset)));
   http_.Get(below(StoreAnswers::kPreflightPrefix, R"((\d+))"),
             route(StoreRoute::Preflight, handlerFor(&StoreServer::answerPreflight)));
+  http_.Post(
+      exact(StoreAnswers::kUpdateCheckPath),
+      routeReadingBody(StoreRoute::UpdateCheck,
+                       [this](const std::optional<std::string>& body, httplib::Response& response) {
+                         send(response, updateCheck_.answer(body));
+                       }));
+  http_.Get(exact(StoreAnswers::kOrvaneIDLookupPath),
+            route(StoreRoute::OrvaneIDLookup,
+                  [this](const httplib::Request& request, httplib::Response& response) {
+                    send(response, orvaneIDLookup_.answer(request));
+                  }));
+  installCloudLibraryRoutes();
   http_.Get(exact(StoreAnswers::kRequestsPath),
             [this](const httplib::Request&, httplib::Response& response) {
               answerRequestCounts(response);
             });
+}
+
+void StoreServer::installCloudLibraryRoutes() {
+  const auto service =
+      [this](void (StoreDAAPService::*member)(const httplib::Request&, httplib::Response&) const) {
+        return [this, member](const httplib::Request& request, httplib::Response& response) {
+          (cloudLibrary_.*member)(request, response);
+        };
+      };
+  http_.Post(std::string(StoreDAAPService::kLoginPath),
+             route(StoreRoute::DAAPLogin, service(&StoreDAAPService::answerLogin)));
+  http_.Post(std::string(StoreDAAPService::kUpdatePath),
+             route(StoreRoute::DAAPUpdate, service(&StoreDAAPService::answerUpdate)));
+  http_.Post(std::string(StoreDAAPService::kDatabasesPath),
+             route(StoreRoute::DAAPDatabases, service(&StoreDAAPService::answerDatabases)));
+  http_.Post(std::string(StoreDAAPService::kItemsPattern),
+             route(StoreRoute::DAAPItems, service(&StoreDAAPService::answerItems)));
 }
 
 httplib::Server::Handler StoreServer::route(StoreRoute storeRoute, RouteHandler handler) {
@@ -113,6 +147,26 @@ httplib::Server::Handler StoreServer::route(StoreRoute storeRoute, RouteHandler 
                                                           httplib::Response& response) {
     counts_.count(storeRoute);
     if (!answeredByFault(storeRoute, response)) handler(request, response);
+  };
+}
+
+httplib::Server::HandlerWithContentReader StoreServer::routeReadingBody(StoreRoute storeRoute,
+                                                                        BodyRouteHandler handler) {
+  return [this, storeRoute, handler = std::move(handler)](const httplib::Request& request,
+                                                          httplib::Response& response,
+                                                          const httplib::ContentReader& reader) {
+    // The whole body is read first, so that a fault's answer never leaves
+    // half of it on the connection.
+    std::string bytes;
+    const bool decoded = reader([&](const char* data, std::size_t length) {
+      bytes.append(data, length);
+      return true;
+    });
+    const std::optional<std::string> body =
+        decoded ? std::optional<std::string>(std::move(bytes)) : std::nullopt;
+    route(storeRoute, [&](const httplib::Request&, httplib::Response& answer) {
+      handler(body, answer);
+    })(request, response);
   };
 }
 
@@ -129,6 +183,11 @@ bool StoreServer::answeredByFault(StoreRoute storeRoute, httplib::Response& resp
       stallGate_.wait();
       sendFailure(response, 503, "server-stopping", "The store is stopping.");
       return true;
+    case StoreFaults::Kind::Slow:
+      // Long enough for every caller of a test to arrive while the request
+      // is in flight; a stopping server lets it go at once.
+      stallGate_.waitFor(std::chrono::seconds(1));
+      return false;
     case StoreFaults::Kind::NotPlist:
       response.status = 200;
       response.set_content("larder-store: this answer is not a property list\n\x01\x02\xff",
@@ -186,7 +245,8 @@ void StoreServer::sendFailure(httplib::Response& response, int status, std::stri
 }
 
 void StoreServer::answerBag(const httplib::Request& request, httplib::Response& response) const {
-  send(response, {200, StoreAnswers::bag(baseURL(request), catalogue_.bagExtras()), {}});
+  const std::string base = baseURL(request);
+  send(response, {200, StoreAnswers::bag(base, cloudLibrary_.bagExtras(base)), {}});
 }
 
 void StoreServer::answerAuthenticate(const httplib::Request& request,

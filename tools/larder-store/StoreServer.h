@@ -7,12 +7,15 @@
 #include <string>
 
 #include "larder-store/StoreCatalogue.h"
+#include "larder-store/StoreDAAPService.h"
 #include "larder-store/StoreFaults.h"
 #include "larder-store/StoreHTTPServer.h"
+#include "larder-store/StoreOrvaneIDLookup.h"
 #include "larder-store/StorePurchases.h"
 #include "larder-store/StoreReply.h"
 #include "larder-store/StoreRequestCounts.h"
 #include "larder-store/StoreStallGate.h"
+#include "larder-store/StoreUpdateCheck.h"
 
 namespace larder {
 
@@ -39,10 +42,20 @@ class StoreServer {
 
  private:
   using RouteHandler = std::function<void(const httplib::Request&, httplib::Response&)>;
+  // Takes the body as read, or nullopt when it could not be decoded.
+  using BodyRouteHandler =
+      std::function<void(const std::optional<std::string>& body, httplib::Response&)>;
 
   void installRoutes();
+  // The cloud library's routes below the bag's "base-url".
+  void installCloudLibraryRoutes();
   // Counts the request, then lets a fault or `handler` answer it.
   httplib::Server::Handler route(StoreRoute storeRoute, RouteHandler handler);
+  // The same for a route that reads its body itself: httplib refuses a
+  // body it cannot decode (a damaged gzip stream) before any route, which
+  // the route would rather answer in its own words.
+  httplib::Server::HandlerWithContentReader routeReadingBody(StoreRoute storeRoute,
+                                                             BodyRouteHandler handler);
   bool answeredByFault(StoreRoute storeRoute, httplib::Response& response);
 
   void answerBag(const httplib::Request& request, httplib::Response& response) const;
@@ -64,6 +77,9 @@ class StoreServer {
   StoreCatalogue catalogue_;
   StoreFaults faults_;
   StorePurchases purchases_;
+  StoreUpdateCheck updateCheck_;
+  StoreOrvaneIDLookup orvaneIDLookup_;
+  StoreDAAPService cloudLibrary_;
   StoreRequestCounts counts_;
   StoreStallGate stallGate_;
   StoreHTTPServer http_;

@@ -7,6 +7,11 @@ void StoreStallGate::wait() {
   opened_.wait(lock, [this] { return open_; });
 }
 
+void StoreStallGate::waitFor(std::chrono::milliseconds delay) {
+  std::unique_lock lock(mutex_);
+  opened_.wait_for(lock, delay, [this] { return open_; });
+}
+
 void StoreStallGate::open() {
   {
     std::lock_guard lock(mutex_);

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <condition_variable>
 #include <mutex>
 
@@ -11,6 +12,8 @@ class StoreStallGate {
  public:
   // Returns once the gate is open.
   void wait();
+  // Returns once the gate is open or `delay` has passed.
+  void waitFor(std::chrono::milliseconds delay);
   void open();
 
  private:

@@ -119,7 +119,8 @@ int main(int argc, char** argv) {
       ->check(CLI::Range(0, 65535));
   app.add_option("--fault", serveOptions.faults,
                  "ROUTE=KIND: answer ROUTE (bag, authenticate, buy-product, item-lookup, assets, "
-                 "preflight) with a fault: 500, stall, not-plist, wrong-shape, truncate, corrupt");
+                 "preflight, daap-login, daap-update, daap-databases, daap-items, ...) with a "
+                 "fault: 500, stall, not-plist, wrong-shape, truncate, corrupt");
 
   app.add_flag("--exit-with-parent", serveOptions.exitWithParent,
                "stop when the thread that started the store ends (for test harnesses)");

@@ -12,8 +12,10 @@
 #include "store-runtime/JsonConversion.h"
 #include "tools/larderctl/DialogAgentCommand.h"
 #include "tools/larderctl/DialogCommand.h"
+#include "tools/larderctl/DmapDumpCommand.h"
 #include "tools/larderctl/ProductPrinter.h"
 #include "tools/larderctl/StoreCommands.h"
+#include "tools/larderctl/UpdatesCommand.h"
 
 namespace {
 
@@ -224,9 +226,22 @@ int main(int argc, char** argv) {
   downloads->add_option("--mask", downloadMask,
                         "download types: 1 install, 2 stage (default both)");
 
+  auto* updates = app.add_subcommand("updates", "list the updates known for the installed software");
+  bool checkFirst = false;
+  updates->add_flag("--check", checkFirst, "ask the store first");
+
+  auto* dmapDump = app.add_subcommand("dmap-dump", "decode a DMAP document and print it as JSON");
+  std::string dmapFile;
+  dmapDump->add_option("file", dmapFile, "the document; - for standard input")->required();
+
   CLI11_PARSE(app, argc, argv);
   try {
+    if (dmapDump->parsed()) return DmapDumpCommand(options.json).run(dmapFile);
     if (products->parsed()) return runProducts(options);
+    if (updates->parsed()) {
+      ServiceClient client = connect(options);
+      return UpdatesCommand(client, options.json).run(checkFirst);
+    }
     if (product->parsed()) return runProduct(options, bundleIdentifier, itemIdentifier);
     if (watch->parsed()) return runWatch(options);
     if (call->parsed()) return runCall(options, member, words);

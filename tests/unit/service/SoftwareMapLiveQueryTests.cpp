@@ -9,15 +9,6 @@
 namespace larder::testing {
 namespace {
 
-bool eventually(const std::function<bool()>& condition) {
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-  while (std::chrono::steady_clock::now() < deadline) {
-    if (condition()) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  return condition();
-}
-
 class SoftwareMapLiveQueryTest : public ServiceTest {};
 
 TEST_F(SoftwareMapLiveQueryTest, AnOverflowRestartsTheQueriesAndTheirResultsRepairTheMap) {

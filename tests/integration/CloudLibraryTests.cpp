@@ -1,0 +1,475 @@
+// The cloud library client session against the reference store on
+// loopback, in process: sign-in, login, revisions published while the
+// store runs, differences with deleted ids, token pairs, media kinds,
+// pre-orders, a store that stalls; and `larderctl dmap-dump`.
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <cstdlib>
+#include <memory>
+#include <mutex>
+#include <nlohmann/json.hpp>
+#include <optional>
+#include <thread>
+
+#include "LarderctlProcess.h"
+#include "ServiceHarness.h"
+#include "StoreCatalogueBuilder.h"
+#include "StoreServerProcess.h"
+#include "dmap/DAAPBuffer.h"
+#include "dmap/DAAPClient.h"
+#include "dmap/DAAPCode.h"
+#include "dmap/DAAPContainerScope.h"
+#include "dmap/DAAPItem.h"
+#include "dmap/DAAPItemsRequest.h"
+#include "platform/DispatchQueue.h"
+#include "platform/DispatchSemaphore.h"
+#include "platform/FileIO.h"
+#include "platform/PropertyListSerialization.h"
+#include "platform/RunLoop.h"
+#include "store-runtime/VendAccountService.h"
+#include "store-runtime/VendHTTPTransfer.h"
+#include "store-runtime/VendRequestSigner.h"
+#include "store-runtime/VendRuntime.h"
+#include "store-runtime/VendServiceProxy.h"
+#include "store-runtime/VendURLBag.h"
+
+namespace larder::testing {
+namespace {
+
+using namespace std::chrono_literals;
+
+constexpr std::uint64_t kAccountID = 8101;
+constexpr char kAccountName[] = "listener@example.org";
+constexpr char kPassword[] = "open sesame";
+
+// Sets variables for the span of a test and puts the old values back.
+class EnvironmentOverride {
+ public:
+  void set(const std::string& name, const std::string& value) {
+    const char* old = std::getenv(name.c_str());
+    saved_.emplace_back(name, old ? std::optional<std::string>(old) : std::nullopt);
+    ::setenv(name.c_str(), value.c_str(), 1);
+  }
+  ~EnvironmentOverride() {
+    for (auto it = saved_.rbegin(); it != saved_.rend(); ++it) {
+      if (it->second) {
+        ::setenv(it->first.c_str(), it->second->c_str(), 1);
+      } else {
+        ::unsetenv(it->first.c_str());
+      }
+    }
+  }
+
+ private:
+  std::vector<std::pair<std::string, std::optional<std::string>>> saved_;
+};
+
+class RecordingOwner : public LedgerDAAPClientDelegate {
+ public:
+  struct Update {
+    std::optional<DAAPArray> items;
+    std::optional<std::int64_t> latestVersion;
+    std::optional<DAAPArray> deleted;
+  };
+
+  std::optional<std::vector<PlistDictionary>> daapClientTokenPairsForLocalDatabaseWithClient(
+      DAAPClient&) override {
+    std::lock_guard lock(mutex_);
+    return tokenPairs_;
+  }
+  void daapClientUpdatedItemsWithLatestVersionDeletedItems(
+      DAAPClient&, const std::optional<DAAPArray>& items, std::optional<std::int64_t> latest,
+      const std::optional<DAAPArray>& deleted) override {
+    std::lock_guard lock(mutex_);
+    updates_.push_back({items, latest, deleted});
+  }
+  void daapClientHandledEventEventInfoWithSuccessError(DAAPClient&, std::int64_t event,
+                                                       const DAAPDictionary&, bool success,
+                                                       const OptionalError&) override {
+    std::lock_guard lock(mutex_);
+    events_.emplace_back(event, success);
+  }
+
+  void setTokenPairs(std::vector<PlistDictionary> pairs) {
+    std::lock_guard lock(mutex_);
+    tokenPairs_ = std::move(pairs);
+  }
+  std::vector<Update> updates() const {
+    std::lock_guard lock(mutex_);
+    return updates_;
+  }
+  std::vector<std::pair<std::int64_t, bool>> events() const {
+    std::lock_guard lock(mutex_);
+    return events_;
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  std::optional<std::vector<PlistDictionary>> tokenPairs_;
+  std::vector<Update> updates_;
+  std::vector<std::pair<std::int64_t, bool>> events_;
+};
+
+std::vector<std::uint64_t> itemIDs(const std::optional<DAAPArray>& items) {
+  std::vector<std::uint64_t> identifiers;
+  if (items) {
+    for (const DAAPValue& value : *items) identifiers.push_back(value.item()->itemID());
+  }
+  return identifiers;
+}
+
+std::vector<std::int64_t> numbers(const std::optional<DAAPArray>& values) {
+  std::vector<std::int64_t> result;
+  if (values) {
+    for (const DAAPValue& value : *values) result.push_back(value.int64Value());
+  }
+  return result;
+}
+
+const DAAPItem* findItem(const std::optional<DAAPArray>& items, std::uint64_t identifier) {
+  if (!items) return nullptr;
+  for (const DAAPValue& value : *items) {
+    if (value.item()->itemID() == identifier) return value.item().get();
+  }
+  return nullptr;
+}
+
+PlistDictionary libraryItem(std::uint64_t identifier, const std::string& name,
+                            PlistDictionary extra = {}) {
+  PlistDictionary item{{"id", identifier}, {"name", name}};
+  for (auto& [key, value] : extra) item[key] = std::move(value);
+  return item;
+}
+
+PlistDictionary revision(std::int64_t number, PlistArray items, PlistArray deleted = {}) {
+  return {{"revision", number}, {"items", std::move(items)}, {"deleted", std::move(deleted)}};
+}
+
+class CloudLibraryTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    catalogue_.addAccount(
+        {.accountID = kAccountID, .orvaneID = kAccountName, .password = kPassword});
+    environment_.set("LARDER_ROOT", platform_.root());
+    environment_.set("XDG_CONFIG_HOME", platform_.home() + "/.config");
+  }
+
+  void TearDown() override {
+    for (const auto& client : clients_) client->stopUpdating();
+    // A stopped store lets its stalled requests go, so queued polls end fast.
+    if (store_) store_->stop();
+    DAAPClient::pollingQueue()->sync([] {});
+    clients_.clear();
+    VendRuntime::setShared(nullptr);
+  }
+
+  void writeLibrary(const PlistArray& revisions, const PlistDictionary& bag = {}) {
+    catalogue_.writeFile("library.plist", PropertyListSerialization::writeXml(PlistDictionary{
+                                              {"bag", bag}, {"revisions", revisions}}));
+  }
+
+  void startStore(const std::vector<std::string>& faults = {}, double timeout = 10) {
+    store_ = std::make_unique<StoreServerProcess>(catalogue_.directory(), faults);
+    VendRuntimeConfiguration configuration;
+    configuration.bagURL = store_->bagURL();
+    configuration.stateDirectory = platform_.stateHome() + "/larder";
+    configuration.downloadsDirectory = platform_.cacheHome() + "/downloads";
+    configuration.connectTimeout = 2s;
+    configuration.requestTimeout = timeout;
+    runtime_ = std::make_shared<VendRuntime>(configuration);
+    VendRuntime::setShared(runtime_);
+  }
+
+  void signIn() {
+    bool signedIn = false;
+    VendServiceProxy proxy(VendStoreClient::initWithStoreClientType(1), runtime_);
+    proxy.accountServiceSynchronousBlock([&](VendAccountService& service, DispatchSemaphore& done) {
+      service.signIn(kAccountName, kPassword,
+                     [&](bool success, std::uint64_t, const OptionalError&) {
+                       signedIn = success;
+                       done.signal();
+                     });
+    });
+    ASSERT_TRUE(signedIn);
+  }
+
+  std::shared_ptr<DAAPClient> makeClient() {
+    auto client = DAAPClient::initWithServiceName(
+        "QzPurchaseDaap", VendStoreClient::initWithStoreClientType(1), owner_, runLoop_);
+    clients_.push_back(client);
+    return client;
+  }
+
+  struct Poll {
+    bool success = false;
+    std::optional<DAAPArray> items;
+    std::optional<DAAPArray> deleted;
+  };
+  static Poll pollAndWait(DAAPClient& client, bool forced) {
+    Poll poll;
+    DispatchSemaphore done;
+    client.pollForUpdatesWithForcedUpdate(forced,
+                                          [&](bool success, const std::optional<DAAPArray>& items,
+                                              const std::optional<DAAPArray>& deleted) {
+                                            poll = {success, items, deleted};
+                                            done.signal();
+                                          });
+    EXPECT_TRUE(done.waitFor(60s));
+    return poll;
+  }
+
+  std::uint64_t requests(const std::string& route) const { return store_->requestCount(route); }
+
+  TemporaryPlatform platform_;
+  EnvironmentOverride environment_;
+  StoreCatalogueBuilder catalogue_;
+  std::unique_ptr<StoreServerProcess> store_;
+  std::shared_ptr<VendRuntime> runtime_;
+  RunLoop runLoop_;
+  std::thread runLoopThread_{[this] { runLoop_.run(); }};
+  std::shared_ptr<RecordingOwner> owner_ = std::make_shared<RecordingOwner>();
+  std::vector<std::shared_ptr<DAAPClient>> clients_;
+
+ public:
+  ~CloudLibraryTest() override {
+    runLoop_.stop();
+    runLoopThread_.join();
+  }
+};
+
+TEST_F(CloudLibraryTest, NewRevisionBringsChangesAndDeletedIdsAndAnUnchangedOneNoItemsRequest) {
+  writeLibrary(
+      {revision(1, {libraryItem(1001, "Atlas"), libraryItem(1002, "Bestiary"),
+                    libraryItem(1003, "Cookbook")}),
+       revision(2, {libraryItem(1002, "Bestiary, second edition"), libraryItem(1004, "Dictionary")},
+                {1003})});
+  startStore();
+  signIn();
+  auto client = makeClient();
+  client->startUpdatingWithLocalVersion(1);
+  ASSERT_TRUE(eventually([&] { return owner_->updates().size() == 1; }, 30s));
+  DAAPClient::pollingQueue()->sync([] {});
+
+  const auto update = owner_->updates()[0];
+  EXPECT_EQ(itemIDs(update.items), (std::vector<std::uint64_t>{1002, 1004}));
+  EXPECT_EQ(update.latestVersion, 2);
+  EXPECT_EQ(numbers(update.deleted), (std::vector<std::int64_t>{1003}));
+  const DAAPItem* changed = findItem(update.items, 1002);
+  ASSERT_TRUE(changed);
+  EXPECT_EQ(changed->name(), "Bestiary, second edition");
+  EXPECT_EQ(changed->objectForKey("com.orvane.sonorel.cloud-purchased-token"), DAAPValue(2));
+  EXPECT_EQ(client->localVersion(), 2);
+  EXPECT_EQ(client->state(), DAAPClient::State::InStep);
+  EXPECT_EQ(requests("daap-login"), 1U);
+  EXPECT_EQ(requests("daap-update"), 1U);
+  EXPECT_EQ(requests("daap-items"), 1U);
+  for (const auto& [event, success] : owner_->events()) EXPECT_TRUE(success) << event;
+
+  // Nothing new: a login and a revision request, no items request.
+  const Poll unchanged = pollAndWait(*client, false);
+  EXPECT_TRUE(unchanged.success);
+  EXPECT_FALSE(unchanged.items);
+  EXPECT_EQ(requests("daap-login"), 2U);
+  EXPECT_EQ(requests("daap-update"), 2U);
+  EXPECT_EQ(requests("daap-items"), 1U);
+
+  // A revision published while the store runs.
+  writeLibrary(
+      {revision(1, {libraryItem(1001, "Atlas"), libraryItem(1002, "Bestiary"),
+                    libraryItem(1003, "Cookbook")}),
+       revision(2, {libraryItem(1002, "Bestiary, second edition"), libraryItem(1004, "Dictionary")},
+                {1003}),
+       revision(3, {libraryItem(1005, "Encyclopedia")}, {1001})});
+  const Poll changedAgain = pollAndWait(*client, false);
+  EXPECT_TRUE(changedAgain.success);
+  EXPECT_EQ(itemIDs(changedAgain.items), (std::vector<std::uint64_t>{1005}));
+  EXPECT_EQ(numbers(changedAgain.deleted), (std::vector<std::int64_t>{1001}));
+  EXPECT_EQ(client->localVersion(), 3);
+  EXPECT_EQ(requests("daap-items"), 2U);
+}
+
+TEST_F(CloudLibraryTest, FirstFetchLeavesOutWhatTheClientHoldsAndKindsItDidNotAskFor) {
+  const PlistDate release{2000000000};
+  writeLibrary({revision(
+      1, {libraryItem(2001, "Held", {{"media-kind", 2}}),
+          libraryItem(2002, "Stale token", {{"media-kind", 2}}),
+          libraryItem(2003, "A film", {{"media-kind", 4}}), libraryItem(2004, "Kindless"),
+          libraryItem(2005, "Coming soon",
+                      {{"media-kind", 2}, {"pre-order", true}, {"release-date", release}})})});
+  startStore();
+  signIn();
+  owner_->setTokenPairs({*DAAPClient::tokenPairWithCloudID(2001, 1),
+                         *DAAPClient::tokenPairWithCloudID(2002, 99),
+                         *DAAPClient::tokenPairWithCloudID(2999, 1)});
+  auto client = makeClient();
+  client->setMediaKinds({2});
+  // Not started, so the client holds no revision: a forced poll asks from 0.
+  const Poll poll = pollAndWait(*client, true);
+  ASSERT_TRUE(poll.success);
+  EXPECT_EQ(itemIDs(poll.items), (std::vector<std::uint64_t>{2002, 2004, 2005}));
+  EXPECT_EQ(numbers(poll.deleted), (std::vector<std::int64_t>{2999}));
+  const DAAPItem* preorder = findItem(poll.items, 2005);
+  ASSERT_TRUE(preorder);
+  EXPECT_EQ(preorder->objectForKey("com.orvane.sonorel.store.expected-release-date"),
+            DAAPValue(PlistDate{2000000000}));
+}
+
+TEST_F(CloudLibraryTest, StoreThatNeverAnswersTimesOutAndTheNextTickPollsAgain) {
+  writeLibrary({revision(4, {libraryItem(3001, "Never seen")})},
+               {{"update-polling-frequency-secs", 1}});
+  startStore({"daap-update=stall"}, 1);
+  signIn();
+  auto client = makeClient();
+  client->startUpdatingWithLocalVersion(1);
+  // Each poll logs in, then waits for a revision that never comes until
+  // the request gives up; the timer's next tick starts the next poll.
+  ASSERT_TRUE(eventually([&] { return requests("daap-update") >= 3; }, 60s));
+  EXPECT_GE(requests("daap-login"), 3U);
+  EXPECT_EQ(requests("daap-items"), 0U);
+  std::size_t failedRevisions = 0;
+  for (const auto& [event, success] : owner_->events()) {
+    if (event == DAAPClient::kEventGetLatestVersion) {
+      EXPECT_FALSE(success);
+      ++failedRevisions;
+    }
+  }
+  EXPECT_GE(failedRevisions, 2U);
+}
+
+TEST_F(CloudLibraryTest, FaultsAndRefusals) {
+  writeLibrary({revision(1, {libraryItem(4001, "Only")})});
+  startStore({"daap-items=500"});
+  // The bag names the service below the host the client used.
+  const PlistValue service = runtime_->urlBag().valueForKey(0, "purchase-daap");
+  ASSERT_TRUE(service.dictionary());
+  EXPECT_EQ(*service["base-url"].string(), store_->baseURL() + "/daap");
+
+  // Unsigned: refused before anything else.
+  VendURLRequest unsigned_(store_->baseURL() + "/daap/login");
+  unsigned_.setMethod("POST");
+  auto answer = VendHTTPTransfer::perform(unsigned_);
+  EXPECT_EQ(answer.response.statusCode, 401);
+  EXPECT_EQ(requests("daap-login"), 1U);
+
+  signIn();
+  auto client = makeClient();
+  const Poll poll = pollAndWait(*client, true);
+  EXPECT_TRUE(poll.success);  // the poll ran through; the items request failed
+  EXPECT_FALSE(poll.items);
+  EXPECT_EQ(requests("daap-items"), 1U);
+  EXPECT_EQ(client->localVersion(), std::nullopt);
+  ASSERT_FALSE(owner_->events().empty());
+  EXPECT_EQ(owner_->events().back(), std::make_pair(std::int64_t{4}, false));
+
+  // A session the store never gave is refused, and the answer is signed.
+  const auto account = runtime_->accountStore().primaryAccount();
+  ASSERT_TRUE(account);
+  VendURLRequest update(store_->baseURL() + "/daap/update");
+  update.setMethod("POST");
+  update.setValue("application/x-www-form-urlencoded", "Content-Type");
+  update.setBody(PlistData{'s', 'e', 's', 's', 'i', 'o', 'n', '-', 'i', 'd', '=', '9', '9', '9'});
+  VendRequestSigner(account->signingKey).sign(update, account->accountID);
+  answer = VendHTTPTransfer::perform(update);
+  EXPECT_EQ(answer.response.statusCode, 403);
+  EXPECT_TRUE(VendRequestSigner(account->signingKey).verifiedBody(answer.response, answer.body));
+}
+
+TEST_F(CloudLibraryTest, StoreWithoutLibraryHasNoServiceInItsBag) {
+  startStore();
+  EXPECT_TRUE(runtime_->urlBag().load(0).success);
+  EXPECT_TRUE(runtime_->urlBag().valueForKey(0, "purchase-daap").isNull());
+  signIn();
+  auto client = makeClient();
+  const Poll poll = pollAndWait(*client, false);
+  EXPECT_FALSE(poll.success);  // no URL, so no session
+  EXPECT_EQ(requests("daap-login"), 0U);
+}
+
+// A document as a store would send it, written with the client library's
+// own writer.
+PlistData sampleDocument() {
+  DAAPBuffer buffer;
+  {
+    DAAPContainerScope document(buffer, "mupd"_dmap);
+    buffer.appendUInt32(200, "mstt"_dmap);
+    buffer.appendUInt32(12, "musr"_dmap);
+    DAAPContainerScope listing(buffer, "mlcl"_dmap);
+    DAAPContainerScope item(buffer, "mlit"_dmap);
+    buffer.appendUInt64(5001, "miid"_dmap);
+    buffer.appendUTF8String(std::string_view("Grammar"), "minm"_dmap);
+    buffer.appendUInt32(1700000000, "asdp"_dmap);
+    buffer.appendUInt32(2, "aeMk"_dmap);
+  }
+  return buffer.takeData();
+}
+
+class DmapDumpTest : public ::testing::Test {
+ protected:
+  struct Run {
+    int status = -1;
+    std::string output;
+    std::string errors;
+  };
+  Run larderctl(const std::vector<std::string>& arguments) {
+    std::vector<std::string> argv{LARDERCTL_PATH};
+    argv.insert(argv.end(), arguments.begin(), arguments.end());
+    const std::string out = platform_.directory() + "/dump.out";
+    const std::string err = platform_.directory() + "/dump.err";
+    ChildProcess process(argv, {{"HOME", platform_.home()}}, out, err);
+    Run run;
+    run.status = process.wait();
+    run.output = readFile(out);
+    run.errors = readFile(err);
+    return run;
+  }
+  std::string writeDocument(const std::string& name, const PlistData& bytes) {
+    const std::string path = platform_.directory() + "/" + name;
+    EXPECT_TRUE(FileIO::writeAtomically(path, bytes));
+    return path;
+  }
+
+  TemporaryPlatform platform_;
+};
+
+TEST_F(DmapDumpTest, PrintsTheDecodedDocumentAsJson) {
+  const std::string path = writeDocument("update.dmap", sampleDocument());
+  const Run run = larderctl({"dmap-dump", path});
+  ASSERT_EQ(run.status, 0) << run.errors;
+  EXPECT_NE(run.output.find("\n  \"dmap.serverrevision\": 12"), std::string::npos)
+      << "indented for people: " << run.output;
+  const auto json = nlohmann::json::parse(run.output);
+  EXPECT_EQ(json["dmap.status"], 200);
+  EXPECT_EQ(json["dmap.serverrevision"], 12);
+  ASSERT_EQ(json["dmap.listing"].size(), 1U);
+  const auto& item = json["dmap.listing"][0];
+  EXPECT_EQ(item["dmap.itemid"], 5001);
+  EXPECT_EQ(item["name"], "Grammar");
+  EXPECT_EQ(item["com.orvane.sonorel.extended-media-kind"], 2);
+  EXPECT_EQ(item["daap.songdatepurchased"], "2023-11-14T22:13:20Z");
+
+  const Run line = larderctl({"--json", "dmap-dump", path});
+  ASSERT_EQ(line.status, 0) << line.errors;
+  EXPECT_EQ(line.output.find('\n'), line.output.size() - 1) << "one line: " << line.output;
+  const auto compact = nlohmann::json::parse(line.output);
+  EXPECT_EQ(compact["dmap.listing"][0]["daap.songdatepurchased"], 1700000000);
+}
+
+TEST_F(DmapDumpTest, RefusesWhatItCannotReadOrDecode) {
+  const Run missing = larderctl({"dmap-dump", platform_.directory() + "/absent.dmap"});
+  EXPECT_EQ(missing.status, 1);
+  EXPECT_NE(missing.errors.find("cannot read"), std::string::npos) << missing.errors;
+  EXPECT_TRUE(missing.output.empty());
+
+  PlistData truncated = sampleDocument();
+  truncated.resize(truncated.size() - 3);
+  const Run cut = larderctl({"dmap-dump", writeDocument("cut.dmap", truncated)});
+  EXPECT_EQ(cut.status, 1);
+  EXPECT_NE(cut.errors.find("is not a DMAP document"), std::string::npos) << cut.errors;
+  EXPECT_TRUE(cut.output.empty());
+}
+
+}  // namespace
+}  // namespace larder::testing

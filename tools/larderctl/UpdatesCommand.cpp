@@ -1,0 +1,88 @@
+#include "tools/larderctl/UpdatesCommand.h"
+
+#include <iomanip>
+#include <iostream>
+#include <sstream>
+
+#include "store-runtime/JsonConversion.h"
+
+namespace larder {
+namespace {
+
+std::string textOr(const PlistValue& value, const char* fallback = "-") {
+  const std::string* text = value.string();
+  return text && !text->empty() ? *text : fallback;
+}
+
+std::string marksOf(const PlistValue& update) {
+  std::string marks;
+  if (update["hasBeenSeenByUser"].boolValue()) marks += "seen ";
+  if (update["isStaged"].boolValue()) marks += "staged ";
+  if (std::int64_t code = update["autoUpdateAbortCode"].int64Value(); code != 0) {
+    marks += "abort=" + std::to_string(code) + " ";
+  }
+  if (!marks.empty()) marks.pop_back();
+  return marks;
+}
+
+}  // namespace
+
+int UpdatesCommand::run(bool check) {
+  PlistValue success = true;
+  PlistValue error = PlistDictionary{};
+  PlistValue available;
+  if (check) {
+    PlistArray reply =
+        client_.call("CheckForUpdatesWithUserHasSeenUpdates", {false}, kCheckTimeoutMicroseconds);
+    success = reply.at(0);
+    available = reply.at(1);
+    error = reply.at(2);
+  } else {
+    available = client_.call("AvailableUpdates", {}).at(0);
+  }
+  const PlistValue incompatible = client_.call("IncompatibleUpdates", {}).at(0);
+  if (json_) {
+    printJson(success, available, incompatible, error);
+  } else {
+    if (!success.boolValue()) {
+      std::cerr << "larderctl: the update check failed: " << textOr(error["description"], "unknown")
+                << " (code " << error["code"].int64Value() << "); showing what the service knew"
+                << std::endl;
+    }
+    printTable(available.array() ? *available.array() : PlistArray{}, false);
+    if (const PlistArray* list = incompatible.array(); list && !list->empty()) {
+      std::cout << "\nIncompatible with this machine:\n";
+      printTable(*list, true);
+    }
+  }
+  return success.boolValue() ? 0 : 1;
+}
+
+void UpdatesCommand::printTable(const PlistArray& updates, bool incompatible) const {
+  if (updates.empty()) {
+    if (!incompatible) std::cout << "No updates available." << std::endl;
+    return;
+  }
+  std::cout << std::left << std::setw(12) << "ITEM" << std::setw(34) << "BUNDLE ID" << std::setw(12)
+            << "VERSION" << std::setw(28) << "TITLE"
+            << "MARKS" << '\n';
+  for (const PlistValue& update : updates) {
+    std::cout << std::left << std::setw(12) << update["itemIdentifier"].uint64Value()
+              << std::setw(34) << textOr(update["bundleID"]) << std::setw(12)
+              << textOr(update["version"]) << std::setw(28) << textOr(update["title"])
+              << marksOf(update) << '\n';
+  }
+  std::cout << std::flush;
+}
+
+void UpdatesCommand::printJson(const PlistValue& success, const PlistValue& available,
+                               const PlistValue& incompatible, const PlistValue& error) const {
+  PlistDictionary result{
+      {"success", success}, {"updates", available}, {"incompatibleUpdates", incompatible}};
+  if (const PlistDictionary* failure = error.dictionary(); failure && !failure->empty()) {
+    result.emplace("error", error);
+  }
+  std::cout << JsonConversion::toJson(result).dump() << std::endl;
+}
+
+}  // namespace larder
