@@ -73,7 +73,7 @@ VendURLBag::LoadResult VendURLBag::fetch(std::int64_t bagType, Entry& entry) {
   } else if (auto bag = VendStoreAnswer::dictionary(answer.body, &result.error)) {
     std::lock_guard lock(mutex_);
     entry.expiry = std::chrono::steady_clock::now() + lifetimeOf(*bag);
-    entry.bag = std::move(*bag);
+    entry.bag = std::make_shared<const PlistDictionary>(std::move(*bag));
     result.success = true;
   }
   if (!result.success) {
@@ -83,7 +83,8 @@ VendURLBag::LoadResult VendURLBag::fetch(std::int64_t bagType, Entry& entry) {
   return result;
 }
 
-std::optional<PlistDictionary> VendURLBag::cachedBag(std::int64_t bagType, bool loadIfNeeded) {
+std::shared_ptr<const PlistDictionary> VendURLBag::cachedBag(std::int64_t bagType,
+                                                             bool loadIfNeeded) {
   if (loadIfNeeded) load(bagType);
   Entry& entry = entryForType(bagType);
   std::lock_guard lock(mutex_);
@@ -117,7 +118,7 @@ std::optional<std::string> VendURLBag::urlForKey(std::int64_t bagType, std::stri
 }
 
 bool VendURLBag::isValid(std::int64_t bagType) {
-  return cachedBag(bagType, true).has_value();
+  return cachedBag(bagType, true) != nullptr;
 }
 
 bool VendURLBag::regexWithKeyMatchesString(std::int64_t bagType, std::string_view key,

@@ -59,13 +59,14 @@ class VendURLBag {
  private:
   struct Entry {
     std::mutex fetchMutex;  // one fetch at a time for this type
-    std::optional<PlistDictionary> bag;
+    // Immutable once fetched, so a lookup shares it instead of copying.
+    std::shared_ptr<const PlistDictionary> bag;
     std::chrono::steady_clock::time_point expiry;
   };
 
   Entry& entryForType(std::int64_t bagType);
   LoadResult fetch(std::int64_t bagType, Entry& entry);
-  std::optional<PlistDictionary> cachedBag(std::int64_t bagType, bool loadIfNeeded);
+  std::shared_ptr<const PlistDictionary> cachedBag(std::int64_t bagType, bool loadIfNeeded);
   void notifyObservers(const LoadResult& result);
 
   VendRuntimeConfiguration configuration_;

@@ -245,11 +245,13 @@ void UpdateQueue::checkForUpdatesWithCompletionHandler(CompletionHandler handler
     if (loadInProgress_) return;
     loadInProgress_ = true;
     auto operation = std::make_shared<LoadUpdateQueueOperation>(storeClient_, softwareMap_);
-    operation->setCompletionHandler([self = shared_from_this()](VendOperation& finished,
-                                                                bool success,
-                                                                const OptionalError& error) {
-      self->updateCheckDidFinish(static_cast<LoadUpdateQueueOperation&>(finished), success, error);
-    });
+    // The handler runs while the operation finishes, so the operation it
+    // names is alive; holding it strongly would make a cycle.
+    operation->setCompletionHandler(
+        [self = shared_from_this(), load = operation.get()](
+            VendOperation& /*finished*/, bool success, const OptionalError& error) {
+          self->updateCheckDidFinish(*load, success, error);
+        });
     VendOperationQueue::mainQueue().addOperation(std::move(operation));
   });
 }
