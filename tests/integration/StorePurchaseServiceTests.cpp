@@ -25,7 +25,7 @@ class StorePurchaseServiceTest : public ::testing::Test {
     catalogue_.addAccount({.accountID = 8123, .orvaneID = kAccountName, .password = kPassword});
     catalogue_.addItem(
         {.wareID = 901, .bundleID = "com.example.Atlas", .title = "Atlas", .version = "3.1"});
-    store_ = std::make_unique<StoreServerProcess>(catalogue_.directory());
+    store_ = std::make_unique<StoreServerProcess>(catalogue_.directory(), storeFaults());
     fs::create_directories(platform_.root() + "/Applications");
     service_ = std::make_unique<ServiceProcess>(
         platform_, bus_, std::vector<std::string>{},
@@ -33,6 +33,8 @@ class StorePurchaseServiceTest : public ::testing::Test {
                                            {"LARDER_STORE_TIMEOUT", "5"}});
     ASSERT_TRUE(service_->waitUntilServing()) << service_->log();
   }
+
+  [[nodiscard]] virtual std::vector<std::string> storeFaults() const { return {}; }
 
   // Runs larderctl to its end; its exit status.
   int run(const std::vector<std::string>& arguments, std::string* output = nullptr,
@@ -68,8 +70,9 @@ TEST_F(StorePurchaseServiceTest, SignedInPurchaseInstallsTheBundleAndTheMapSeesI
 
   ASSERT_EQ(run({"purchase", "901"}, &output, &errors), 0) << errors << service_->log();
   EXPECT_NE(output.find("com.example.Atlas"), std::string::npos) << output;
-  ASSERT_TRUE(eventually([&] { return fs::exists(bundlePath() + "/purchase.plist"); }, 20s))
-      << service_->log();
+  // larderctl follows the install to its end.
+  EXPECT_NE(output.find("installed Atlas at " + bundlePath()), std::string::npos) << output;
+  ASSERT_TRUE(fs::exists(bundlePath() + "/purchase.plist")) << service_->log();
   EXPECT_TRUE(eventually(
       [&] {
         return run({"product", "--bundle-id", "com.example.Atlas"}, &output) == 0;
@@ -102,5 +105,29 @@ TEST_F(StorePurchaseServiceTest, WithoutAgentOrAccountThePurchaseFailsAsCancelle
   EXPECT_NE(errors.find("code 401"), std::string::npos) << errors;
 }
 
+// Every package the store sends fails its digests.
+class CorruptStorePurchaseServiceTest : public StorePurchaseServiceTest {
+ protected:
+  [[nodiscard]] std::vector<std::string> storeFaults() const override {
+    return {"assets=corrupt"};
+  }
+};
+
+TEST_F(CorruptStorePurchaseServiceTest, LarderctlSaysWhenThePurchasedDownloadIsNotInstalled) {
+  ASSERT_EQ(run({"signin", kAccountName, "--password", kPassword}), 0) << service_->log();
+  std::string output;
+  std::string errors;
+  EXPECT_EQ(run({"purchase", "901"}, &output, &errors), 1) << output << errors;
+  EXPECT_NE(errors.find("the download of Atlas (901) ended without an installed application"),
+            std::string::npos)
+      << errors;
+  EXPECT_EQ(output.find("installed Atlas"), std::string::npos) << output;
+  EXPECT_FALSE(fs::exists(bundlePath()));
+  // Without waiting, larderctl returns once the store has answered.
+  EXPECT_EQ(run({"purchase", "901", "--no-wait"}, &output, &errors), 0) << errors;
+  EXPECT_NE(output.find("downloading 901"), std::string::npos) << output;
+}
+
 }  // namespace
 }  // namespace larder::testing
+

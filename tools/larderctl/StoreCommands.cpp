@@ -1,11 +1,20 @@
 #include "tools/larderctl/StoreCommands.h"
 
+#include <chrono>
 #include <iostream>
+#include <map>
+#include <thread>
 
 #include "store-runtime/JsonConversion.h"
+#include "tools/larderctl/ProgressBar.h"
 
 namespace larder {
 namespace {
+
+constexpr std::int64_t kAllDownloadTypes = 3;
+constexpr std::chrono::milliseconds kDownloadPollInterval{200};
+// How long an ended download may take to show up as installed software.
+constexpr std::chrono::seconds kInstalledSightingLimit{10};
 
 std::string describeDownload(const PlistValue& download) {
   const PlistValue& metadata = download["metadata"];
@@ -71,7 +80,8 @@ int StoreCommands::account() {
   return 0;
 }
 
-int StoreCommands::purchase(std::uint64_t itemIdentifier, const std::string& buyParameters) {
+int StoreCommands::purchase(std::uint64_t itemIdentifier, const std::string& buyParameters,
+                            bool wait) {
   const std::string parameters =
       buyParameters.empty() ? "itemId=" + std::to_string(itemIdentifier) : buyParameters;
   PlistArray reply = client_.callStoreRuntime("Purchase", {itemIdentifier, parameters},
@@ -84,7 +94,56 @@ int StoreCommands::purchase(std::uint64_t itemIdentifier, const std::string& buy
   for (const PlistValue& download : *reply.at(2).array()) {
     std::cout << "downloading " << describeDownload(download) << std::endl;
   }
-  return 0;
+  return wait ? followDownloads(*reply.at(2).array()) : 0;
+}
+
+int StoreCommands::followDownloads(const PlistArray& started) {
+  std::map<std::uint64_t, std::string> pending;
+  for (const PlistValue& download : started) {
+    const PlistValue& metadata = download["metadata"];
+    const std::string* title = metadata["title"].string();
+    pending.emplace(metadata["itemIdentifier"].uint64Value(), title ? *title : "");
+  }
+  ProgressBar bar(stderr);
+  int status = 0;
+  while (!pending.empty()) {
+    const PlistArray reply = client_.callStoreRuntime("Downloads", {kAllDownloadTypes});
+    std::map<std::uint64_t, double> progress;
+    for (const PlistValue& download : *reply.at(0).array()) {
+      const std::uint64_t item = download["metadata"]["itemIdentifier"].uint64Value();
+      if (!pending.contains(item) || download["status"]["isFailed"].boolValue()) continue;
+      progress.emplace(item, download["progress"].doubleValue());
+    }
+    for (auto entry = pending.begin(); entry != pending.end();) {
+      if (progress.contains(entry->first)) {
+        bar.show(progress[entry->first], entry->second);
+        ++entry;
+        continue;
+      }
+      bar.clear();
+      if (!reportInstalled(entry->first, entry->second)) status = 1;
+      entry = pending.erase(entry);
+    }
+    if (!pending.empty()) std::this_thread::sleep_for(kDownloadPollInterval);
+  }
+  return status;
+}
+
+// A download leaves the list when it has ended either way; the software
+// map tells which, once its live query has seen the bundle arrive.
+bool StoreCommands::reportInstalled(std::uint64_t itemIdentifier, const std::string& title) {
+  const auto deadline = std::chrono::steady_clock::now() + kInstalledSightingLimit;
+  do {
+    const PlistValue product = client_.call("ProductForItemIdentifier", {itemIdentifier}).at(0);
+    if (const std::string* path = product["bundlePath"].string()) {
+      std::cout << "installed " << title << " at " << *path << std::endl;
+      return true;
+    }
+    std::this_thread::sleep_for(kDownloadPollInterval);
+  } while (std::chrono::steady_clock::now() < deadline);
+  std::cerr << "larderctl: the download of " << title << " (" << itemIdentifier
+            << ") ended without an installed application; the service's log says why" << std::endl;
+  return false;
 }
 
 int StoreCommands::downloads(std::int64_t typeMask) {

@@ -22,11 +22,15 @@ class StoreCommands {
   int signIn(const std::string& accountName, std::optional<std::string> password);
   int signOut();
   int account();
-  int purchase(std::uint64_t itemIdentifier, const std::string& buyParameters);
+  // With `wait`, follows the downloads until they are installed, with a
+  // progress bar on a terminal; 1 when one of them did not end installed.
+  int purchase(std::uint64_t itemIdentifier, const std::string& buyParameters, bool wait);
   int downloads(std::int64_t typeMask);
 
  private:
   int reportFailure(const PlistValue& error) const;
+  int followDownloads(const PlistArray& started);
+  bool reportInstalled(std::uint64_t itemIdentifier, const std::string& title);
 
   ServiceClient& client_;
   bool json_;

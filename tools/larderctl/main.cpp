@@ -221,12 +221,16 @@ int main(int argc, char** argv) {
   purchase->add_option("item", purchaseItem, "store item identifier")->required();
   purchase->add_option("--buy-params", buyParameters,
                        "the store's buy parameters (default itemId=ITEM)");
+  bool noWait = false;
+  purchase->add_flag("--no-wait", noWait,
+                     "return once the store has answered, without following the install");
   auto* downloads = app.add_subcommand("downloads", "list the downloads in progress");
   std::int64_t downloadMask = 3;
   downloads->add_option("--mask", downloadMask,
                         "download types: 1 install, 2 stage (default both)");
 
-  auto* updates = app.add_subcommand("updates", "list the updates known for the installed software");
+  auto* updates =
+      app.add_subcommand("updates", "list the updates known for the installed software");
   bool checkFirst = false;
   updates->add_flag("--check", checkFirst, "ask the store first");
 
@@ -254,7 +258,7 @@ int main(int argc, char** argv) {
       if (signin->parsed()) return store.signIn(accountName, password);
       if (signout->parsed()) return store.signOut();
       if (account->parsed()) return store.account();
-      if (purchase->parsed()) return store.purchase(purchaseItem, buyParameters);
+      if (purchase->parsed()) return store.purchase(purchaseItem, buyParameters, !noWait);
       return store.downloads(downloadMask);
     }
   } catch (const sdbus::Error& error) {
