@@ -20,6 +20,7 @@ ServiceClient::ServiceClient(const std::string& serviceName, std::uint64_t timeo
 ServiceClient::ServiceClient(std::unique_ptr<sdbus::IConnection> connection,
                              const std::string& serviceName, std::uint64_t timeoutMicroseconds)
     : connection_(std::move(connection)),
+      serviceName_(serviceName),
       proxy_(sdbus::createProxy(*connection_, serviceName, std::string(RequestTable::kObjectPath))),
       timeout_(timeoutMicroseconds) {
   connection_->enterEventLoopAsync();

@@ -46,12 +46,14 @@ class ServiceClient {
                                  std::function<void(const PlistValue&, std::int64_t)> onChange);
 
   sdbus::IConnection& connection() { return *connection_; }
+  [[nodiscard]] const std::string& serviceName() const { return serviceName_; }
 
  private:
   PlistArray callMethod(std::string_view interfaceName, const BusMethod& method,
                         const PlistArray& arguments, std::uint64_t timeoutMicroseconds);
 
   std::unique_ptr<sdbus::IConnection> connection_;
+  std::string serviceName_;
   std::unique_ptr<sdbus::IProxy> proxy_;
   std::unique_ptr<sdbus::IObject> observer_;
   std::uint64_t timeout_;

@@ -131,6 +131,21 @@ TEST_F(DialogAgentTest, AnAgentAnsweringOtherGivesExitCodeTwoAndJsonHasTheAnswer
   EXPECT_NE(agent->output().find("answered 2 (Skip)"), std::string::npos) << agent->output();
 }
 
+TEST_F(DialogAgentTest, AnAgentRegistersAgainWhenTheServiceRestarts) {
+  auto agent = startAgent({"--answer", "ok", "--count", "1"});
+  service_->stop();
+  service_ = std::make_unique<ServiceProcess>(platform_, bus_);
+  ASSERT_TRUE(service_->waitUntilServing()) << service_->log();
+  ASSERT_TRUE(eventually([&] {
+    const std::string errors = agent->errors();
+    const auto first = errors.find("registered");
+    return first != std::string::npos && errors.find("registered", first + 1) != std::string::npos;
+  })) << agent->errors();
+  EXPECT_EQ(dialogOutput({"--message", "Still there?", "--ok", "Yes"}), "1\n")
+      << "the restarted service finds the agent" << service_->log();
+  EXPECT_TRUE(agent->waitForExit());
+}
+
 TEST_F(DialogAgentTest, WithoutAnAgentADialogIsCancelledAtOnce) {
   const auto started = Clock::now();
   EXPECT_EQ(dialogOutput({"--message", "Anyone there?", "--ok", "Yes"}), "0\n");

@@ -1,6 +1,7 @@
 #include "tools/larderctl/DialogAgent.h"
 
 #include <sys/eventfd.h>
+#include <utility>
 
 #include <algorithm>
 #include <stdexcept>
@@ -45,6 +46,31 @@ DialogAgent::DialogAgent(sdbus::IConnection& connection, std::string objectPath)
         [this, handler](sdbus::MethodCall call) { (this->*handler)(call); }, flags);
   }
   object_->finishRegistration();
+}
+
+void DialogAgent::watchServiceRestarts(sdbus::IConnection& connection,
+                                       const std::string& serviceName) {
+  ownerWatch_ = connection.addMatch(
+      "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop.DBus',"
+      "member='NameOwnerChanged',path='/org/freedesktop/DBus',arg0='" +
+          serviceName + "'",
+      [this](sdbus::Message& signal) {
+        std::string name;
+        std::string oldOwner;
+        std::string newOwner;
+        signal >> name >> oldOwner >> newOwner;
+        if (newOwner.empty()) return;
+        {
+          std::lock_guard lock(mutex_);
+          serviceRestarted_ = true;
+        }
+        wake();
+      });
+}
+
+bool DialogAgent::takeServiceRestart() {
+  std::lock_guard lock(mutex_);
+  return std::exchange(serviceRestarted_, false);
 }
 
 void DialogAgent::wake() const {

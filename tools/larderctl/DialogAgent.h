@@ -49,6 +49,13 @@ class DialogAgent {
   [[nodiscard]] int wakeDescriptor() const { return wake_.get(); }
   void drainWake() const;
 
+  // Watches the bus for a new owner of `serviceName`: a service that was
+  // restarted has forgotten its agents. Reported through
+  // `takeServiceRestart` and the wake descriptor.
+  void watchServiceRestarts(sdbus::IConnection& connection, const std::string& serviceName);
+  // True once after each new owner.
+  bool takeServiceRestart();
+
   std::optional<Dialog> takeDialog();
   std::vector<Dismissal> takeDismissals();
   // Answers a taken dialog; false when it was dismissed meanwhile and so
@@ -72,7 +79,9 @@ class DialogAgent {
   // Every dialog not answered yet, queued or taken, by ticket.
   std::map<std::uint64_t, OpenDialog> open_;
   std::vector<Dismissal> dismissals_;
+  bool serviceRestarted_ = false;
   std::unique_ptr<sdbus::IObject> object_;
+  sdbus::Slot ownerWatch_;
 };
 
 }  // namespace larder

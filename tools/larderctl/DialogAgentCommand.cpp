@@ -132,9 +132,8 @@ class DialogAgentCommand::Session {
         signals_(terminationSignalDescriptor()) {}
 
   int run() {
-    client_.callDialogAgents("RegisterDialogAgent", {std::string(kObjectPath)});
-    std::cerr << "larderctl: dialog agent " << client_.connection().getUniqueName() << " "
-              << kObjectPath << " registered" << std::endl;
+    agent_.watchServiceRestarts(client_.connection(), client_.serviceName());
+    registerAgent();
     while (!done()) {
       if (!current_) startNextDialog();
       if (done()) break;
@@ -185,11 +184,19 @@ class DialogAgentCommand::Session {
     if (descriptors[1].revents != 0) return false;
     if (descriptors[0].revents != 0) {
       agent_.drainWake();
+      // A restarted service has forgotten its agents.
+      if (agent_.takeServiceRestart()) registerAgent();
       handleDismissals();
     }
     if (descriptors[2].revents != 0) readInput();
     if (deadline_ && Clock::now() >= *deadline_) answerCurrent(fixedAnswer());
     return true;
+  }
+
+  void registerAgent() {
+    client_.callDialogAgents("RegisterDialogAgent", {std::string(kObjectPath)});
+    std::cerr << "larderctl: dialog agent " << client_.connection().getUniqueName() << " "
+              << kObjectPath << " registered" << std::endl;
   }
 
   [[nodiscard]] int pollTimeout() const {
