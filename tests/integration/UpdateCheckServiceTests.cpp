@@ -56,11 +56,13 @@ class UpdateCheckServiceTest : public ::testing::Test {
     platform_.installBundle({applications, "Atlas", "com.example.atlas", "1.0", 101});
     platform_.installBundle({applications, "Birch", "com.example.birch", "1.0", 102});
     platform_.installBundle({applications, "Cedar", "com.example.cedar", "1.0", 103});
+    writeStoreSettings();
     store_ = std::make_unique<StoreServerProcess>(catalogue_.directory(), storeFaults());
     startService();
   }
 
   [[nodiscard]] virtual std::vector<std::string> storeFaults() const { return {}; }
+  virtual void writeStoreSettings() {}
 
   void startService() {
     service_.reset();
@@ -134,6 +136,31 @@ TEST_F(SlowStoreUpdateCheckTest, TenClientsCheckingAtOnceCauseOneStoreRequestAnd
       clients[0]->call("AvailableUpdateWithItemIdentifier", {std::uint64_t{101}});
   EXPECT_EQ(*one.at(0)["version"].string(), "2.0");
   EXPECT_EQ(*one.at(0)["bundleID"].string(), "com.example.atlas");
+}
+
+// The store's answer carries, after its own items, entries that make no
+// update record and one that does.
+class MalformedAnswerUpdateCheckTest : public UpdateCheckServiceTest {
+ protected:
+  void writeStoreSettings() override {
+    catalogue_.writeStoreSettings(PlistDictionary{
+        {"extraUpdateItems", PlistArray{"not an item", PlistDictionary{{"ware-id", "not a number"}},
+                                        PlistDictionary{{"bundle-id", "com.example.nowareid"}},
+                                        PlistDictionary{{"ware-id", 104},
+                                                        {"bundle-id", "com.example.dune"},
+                                                        {"title", "Dune"},
+                                                        {"version", "4.0"}}}}});
+  }
+};
+
+TEST_F(MalformedAnswerUpdateCheckTest, TheGoodItemsOfAnAnswerAreKeptAndTheOthersDropped) {
+  auto asking = client();
+  const PlistArray reply =
+      asking->call("CheckForUpdatesWithUserHasSeenUpdates", {false}, kCheckTimeout);
+  ASSERT_TRUE(reply.at(0).boolValue()) << service_->log();
+  EXPECT_EQ(identifiersOf(reply.at(1)), (std::vector<std::uint64_t>{101, 104}));
+  EXPECT_EQ(identifiersOf(asking->call("AvailableUpdates", {}).at(0)),
+            (std::vector<std::uint64_t>{101, 104}));
 }
 
 TEST_F(UpdateCheckServiceTest, LarderctlListsTheUpdatesAndTheyOutliveARestartOfTheService) {
