@@ -59,4 +59,23 @@ class Larderctl {
   ChildProcess process_;
 };
 
+// What one larderctl run ended with; status -1 when it did not end in time.
+struct LarderctlRun {
+  int status = -1;
+  std::string output;
+  std::string errors;
+};
+
+// Runs larderctl to its end, at most `timeout`; `name` names its files.
+inline LarderctlRun runLarderctl(const TemporaryPlatform& platform, const PrivateBus& bus,
+                                 const std::vector<std::string>& arguments, const std::string& name,
+                                 std::chrono::milliseconds timeout = std::chrono::seconds(90)) {
+  Larderctl larderctl(platform, bus, arguments, name);
+  LarderctlRun run;
+  if (larderctl.waitForExit(timeout)) run.status = larderctl.process().wait();
+  run.output = larderctl.output();
+  run.errors = larderctl.errors();
+  return run;
+}
+
 }  // namespace larder::testing

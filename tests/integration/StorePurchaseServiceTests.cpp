@@ -39,12 +39,11 @@ class StorePurchaseServiceTest : public ::testing::Test {
   // Runs larderctl to its end; its exit status.
   int run(const std::vector<std::string>& arguments, std::string* output = nullptr,
           std::string* errors = nullptr) {
-    Larderctl larderctl(platform_, bus_, arguments, "larderctl-" + std::to_string(++runs_));
-    if (!larderctl.waitForExit(60s)) return -1;
-    const int status = larderctl.process().wait();
-    if (output) *output = larderctl.output();
-    if (errors) *errors = larderctl.errors();
-    return status;
+    LarderctlRun ran =
+        runLarderctl(platform_, bus_, arguments, "larderctl-" + std::to_string(++runs_), 60s);
+    if (output) *output = std::move(ran.output);
+    if (errors) *errors = std::move(ran.errors);
+    return ran.status;
   }
 
   [[nodiscard]] std::string bundlePath() const {
@@ -108,9 +107,7 @@ TEST_F(StorePurchaseServiceTest, WithoutAgentOrAccountThePurchaseFailsAsCancelle
 // Every package the store sends fails its digests.
 class CorruptStorePurchaseServiceTest : public StorePurchaseServiceTest {
  protected:
-  [[nodiscard]] std::vector<std::string> storeFaults() const override {
-    return {"assets=corrupt"};
-  }
+  [[nodiscard]] std::vector<std::string> storeFaults() const override { return {"assets=corrupt"}; }
 };
 
 TEST_F(CorruptStorePurchaseServiceTest, LarderctlSaysWhenThePurchasedDownloadIsNotInstalled) {
@@ -130,4 +127,3 @@ TEST_F(CorruptStorePurchaseServiceTest, LarderctlSaysWhenThePurchasedDownloadIsN
 
 }  // namespace
 }  // namespace larder::testing
-

@@ -82,12 +82,11 @@ class UpdateCheckServiceTest : public ::testing::Test {
 
   int run(const std::vector<std::string>& arguments, std::string* output = nullptr,
           std::string* errors = nullptr) {
-    Larderctl larderctl(platform_, bus_, arguments, "larderctl-" + std::to_string(++runs_));
-    if (!larderctl.waitForExit(90s)) return -1;
-    const int status = larderctl.process().wait();
-    if (output) *output = larderctl.output();
-    if (errors) *errors = larderctl.errors();
-    return status;
+    LarderctlRun ran =
+        runLarderctl(platform_, bus_, arguments, "larderctl-" + std::to_string(++runs_), 90s);
+    if (output) *output = std::move(ran.output);
+    if (errors) *errors = std::move(ran.errors);
+    return ran.status;
   }
 
   StoreCatalogueBuilder catalogue_;
