@@ -63,6 +63,17 @@ std::vector<std::string> describeInterface(const std::string& xml, const std::st
   return methods;
 }
 
+// The introspection document of the object at `path` of `destination`.
+std::string introspect(sdbus::IConnection& connection, const std::string& destination,
+                       const std::string& path) {
+  auto proxy = sdbus::createProxy(connection, destination, path);
+  std::string xml;
+  proxy->callMethod("Introspect")
+      .onInterface("org.freedesktop.DBus.Introspectable")
+      .storeResultsTo(xml);
+  return xml;
+}
+
 class DialogAgentTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -260,11 +271,7 @@ TEST_F(DialogAgentTest, AtTheEndOfInputAnInteractiveAgentCancels) {
 
 TEST_F(DialogAgentTest, TheLiveInterfacesMatchTheCommittedDescriptions) {
   auto connection = bus_.connect();
-  auto service = sdbus::createProxy(*connection, "com.orvane.larderd", "/com/orvane/larderd");
-  std::string xml;
-  service->callMethod("Introspect")
-      .onInterface("org.freedesktop.DBus.Introspectable")
-      .storeResultsTo(xml);
+  const std::string xml = introspect(*connection, "com.orvane.larderd", "/com/orvane/larderd");
   const std::string registry(DialogAgentRegistry::kInterfaceName);
   std::vector<std::string> committed = describeInterface(
       readFile(sourcePath("data/dbus/com.orvane.larderd.DialogAgents.xml")), registry);
@@ -276,11 +283,7 @@ TEST_F(DialogAgentTest, TheLiveInterfacesMatchTheCommittedDescriptions) {
   auto agent = startAgent({"--answer", "ok"});
   const std::string name = agentName(*agent);
   ASSERT_FALSE(name.empty()) << agent->errors();
-  auto agentProxy = sdbus::createProxy(*connection, name, "/com/orvane/larderctl/DialogAgent");
-  std::string agentXml;
-  agentProxy->callMethod("Introspect")
-      .onInterface("org.freedesktop.DBus.Introspectable")
-      .storeResultsTo(agentXml);
+  const std::string agentXml = introspect(*connection, name, "/com/orvane/larderctl/DialogAgent");
   const std::string agentInterface(DialogAgentRegistry::kAgentInterfaceName);
   std::vector<std::string> committedAgent = describeInterface(
       readFile(sourcePath("data/dbus/com.orvane.larderd.VendDialogAgent.xml")), agentInterface);

@@ -29,36 +29,13 @@
 #include "store-runtime/VendAccountStore.h"
 #include "store-runtime/VendRequestSigner.h"
 #include "store-runtime/VendRuntime.h"
+#include "tests/unit/ScopedEnvironment.h"
 
 namespace larder::dmaptest {
 
 namespace fs = std::filesystem;
 
-// Sets variables for as long as it lives and puts the old values back.
-class ScopedEnvironment {
- public:
-  ScopedEnvironment() = default;
-  ~ScopedEnvironment() {
-    for (auto it = saved_.rbegin(); it != saved_.rend(); ++it) {
-      if (it->second) {
-        ::setenv(it->first.c_str(), it->second->c_str(), 1);
-      } else {
-        ::unsetenv(it->first.c_str());
-      }
-    }
-  }
-  ScopedEnvironment(const ScopedEnvironment&) = delete;
-  ScopedEnvironment& operator=(const ScopedEnvironment&) = delete;
-
-  void set(const std::string& name, const std::string& value) {
-    const char* old = std::getenv(name.c_str());
-    saved_.emplace_back(name, old ? std::optional<std::string>(old) : std::nullopt);
-    ::setenv(name.c_str(), value.c_str(), 1);
-  }
-
- private:
-  std::vector<std::pair<std::string, std::optional<std::string>>> saved_;
-};
+using ScopedEnvironment = larder::testing::ScopedEnvironment;
 
 class TemporaryFolder {
  public:

@@ -34,6 +34,7 @@
 #include "store-runtime/TillDownload.h"
 #include "store-runtime/VendError.h"
 #include "store-runtime/VendRuntime.h"
+#include "tests/unit/ScopedEnvironment.h"
 
 namespace larder::testing {
 
@@ -214,17 +215,11 @@ class PrivateRoot {
     base_ = fs::path(::mkdtemp(pattern.data()));
     fs::create_directories(root() / "Applications");
     fs::create_directories(home());
-    saveAndSet("LARDER_ROOT", root().string());
-    saveAndSet("HOME", home().string());
+    environment_.set("LARDER_ROOT", root().string());
+    environment_.set("HOME", home().string());
   }
   ~PrivateRoot() {
-    for (const auto& [name, value] : saved_) {
-      if (value) {
-        ::setenv(name.c_str(), value->c_str(), 1);
-      } else {
-        ::unsetenv(name.c_str());
-      }
-    }
+    environment_.restore();
     std::error_code ignored;
     fs::remove_all(base_, ignored);
   }
@@ -247,14 +242,8 @@ class PrivateRoot {
   }
 
  private:
-  void saveAndSet(const std::string& name, const std::string& value) {
-    const char* old = std::getenv(name.c_str());
-    saved_.emplace_back(name, old ? std::optional<std::string>(old) : std::nullopt);
-    ::setenv(name.c_str(), value.c_str(), 1);
-  }
-
   fs::path base_;
-  std::vector<std::pair<std::string, std::optional<std::string>>> saved_;
+  ScopedEnvironment environment_;
 };
 
 // Serves files on 127.0.0.1 with range requests, counts requests and can

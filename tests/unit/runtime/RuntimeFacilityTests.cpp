@@ -42,6 +42,7 @@
 #include "store-runtime/VendManagedRestrictions.h"
 #include "store-runtime/VendStoreClient.h"
 #include "store-runtime/VendStringHelpers.h"
+#include "tests/unit/ScopedEnvironment.h"
 
 namespace larder {
 namespace {
@@ -95,10 +96,7 @@ class RuntimeFacilityTest : public ::testing::Test {
                                                "__OSINSTALL_ENVIRONMENT"};
 
   void SetUp() override {
-    for (const char* name : kVariables) {
-      const char* value = std::getenv(name);
-      saved_.emplace_back(name, value ? std::optional<std::string>(value) : std::nullopt);
-    }
+    for (const char* name : kVariables) environment_.save(name);
     std::string pattern = (fs::temp_directory_path() / "larder-facilities-XXXXXX").string();
     ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
     temporary_ = pattern;
@@ -120,13 +118,7 @@ class RuntimeFacilityTest : public ::testing::Test {
     for (const std::string& folder : lockedFolders_) ::chmod(folder.c_str(), 0755);
     std::error_code code;
     fs::remove_all(temporary_, code);
-    for (const auto& [name, value] : saved_) {
-      if (value) {
-        ::setenv(name.c_str(), value->c_str(), 1);
-      } else {
-        ::unsetenv(name.c_str());
-      }
-    }
+    environment_.restore();
   }
 
   std::string rooted(std::string_view path) const { return root_ + std::string(path); }
@@ -155,7 +147,7 @@ class RuntimeFacilityTest : public ::testing::Test {
   std::string root_;
   std::string home_;
   std::vector<std::string> lockedFolders_;
-  std::vector<std::pair<std::string, std::optional<std::string>>> saved_;
+  testing::ScopedEnvironment environment_;
 };
 
 // ---------------------------------------------------------------- gzip

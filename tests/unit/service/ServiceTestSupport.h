@@ -29,6 +29,7 @@
 #include "software-map/VendSoftwareMapObserver.h"
 #include "store-runtime/LedgerSoftwareProduct.h"
 #include "store-runtime/TillLogManager.h"
+#include "tests/unit/ScopedEnvironment.h"
 
 namespace larder::testing {
 
@@ -188,10 +189,7 @@ class ServiceTest : public ::testing::Test {
                                                "XDG_STATE_HOME", "__OSINSTALL_ENVIRONMENT"};
 
   void SetUp() override {
-    for (const char* name : kVariables) {
-      const char* value = std::getenv(name);
-      saved_.emplace_back(name, value ? std::optional<std::string>(value) : std::nullopt);
-    }
+    for (const char* name : kVariables) environment_.save(name);
     ::unsetenv("__OSINSTALL_ENVIRONMENT");
     std::string pattern = (fs::temp_directory_path() / "larder-service-XXXXXX").string();
     ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
@@ -206,13 +204,7 @@ class ServiceTest : public ::testing::Test {
     for (const std::string& folder : lockedFolders_) ::chmod(folder.c_str(), 0755);
     std::error_code code;
     fs::remove_all(temporary_, code);
-    for (const auto& [name, value] : saved_) {
-      if (value) {
-        ::setenv(name.c_str(), value->c_str(), 1);
-      } else {
-        ::unsetenv(name.c_str());
-      }
-    }
+    environment_.restore();
   }
 
   // Points the variables at folders `rootName` and `homeName` of the
@@ -299,7 +291,7 @@ class ServiceTest : public ::testing::Test {
   std::string root_;
   std::string home_;
   int savedLevel_ = 2;
-  std::vector<std::pair<std::string, std::optional<std::string>>> saved_;
+  ScopedEnvironment environment_;
   std::vector<std::string> lockedFolders_;
 };
 
