@@ -27,7 +27,7 @@ using namespace std::chrono_literals;
 using Clock = std::chrono::steady_clock;
 
 std::string sourcePath(const std::string& relative) {
-  return (fs::path(__FILE__).parent_path().parent_path().parent_path() / relative).string();
+  return (fs::path(LARDER_SOURCE_DIR) / relative).string();
 }
 
 // The methods of one interface in an introspection document, one line per
