@@ -73,9 +73,7 @@ const BusMethod* DialogAgentRegistry::findMethod(std::string_view member) {
 }
 
 DialogAgentRegistry::DialogAgentRegistry()
-    : agentCalls_(DispatchQueue::create(
-          "com.orvane.larderd.DialogAgents", DispatchQueue::Kind::Concurrent,
-          {.concurrentWorkers = kConcurrentDialogs, .idleTimeout = std::chrono::seconds(10)})) {}
+    : agentCalls_(std::make_shared<VendElasticQueue>("com.orvane.larderd.DialogAgents")) {}
 
 DialogAgentRegistry::~DialogAgentRegistry() = default;
 

@@ -16,8 +16,8 @@
 #include <sdbus-c++/Message.h>
 
 #include "AssetService/BusMethod.h"
-#include "platform/DispatchQueue.h"
 #include "store-runtime/VendDialogPresenter.h"
+#include "store-runtime/VendElasticQueue.h"
 
 namespace larder {
 
@@ -38,8 +38,6 @@ class DialogAgentRegistry final : public VendDialogPresenter,
   static constexpr std::string_view kInterfaceName = "com.orvane.larderd.DialogAgents";
   static constexpr std::string_view kAgentInterfaceName = "com.orvane.larderd.VendDialogAgent";
   static constexpr std::chrono::seconds kAgentCallTimeout = std::chrono::hours(1);
-  // Dialogs up at the same time; later ones wait for a worker.
-  static constexpr std::size_t kConcurrentDialogs = 32;
 
   // com.orvane.larderd.DialogAgents, on the service object.
   static std::span<const BusMethod> methods();
@@ -89,7 +87,9 @@ class DialogAgentRegistry final : public VendDialogPresenter,
   std::vector<PendingDialog> takePendingDialogs(
       const std::function<bool(const PendingDialog&)>& matches);
 
-  std::shared_ptr<DispatchQueue> agentCalls_;
+  // Each dialog waits for its agent's answer on a thread of its own, so a
+  // dialog that nobody answers never holds up the next one.
+  std::shared_ptr<VendElasticQueue> agentCalls_;
   mutable std::mutex mutex_;
   sdbus::IConnection* connection_ = nullptr;
   // Oldest first; the last one is asked.

@@ -1,11 +1,12 @@
 #include "store-runtime/VendAccountService.h"
 
-#include "platform/DispatchQueue.h"
 #include "platform/DispatchSemaphore.h"
 #include "platform/PropertyListSerialization.h"
 #include "store-runtime/TillLogManager.h"
 #include "store-runtime/VendDialog.h"
 #include "store-runtime/VendDialogPresenter.h"
+#include "store-runtime/VendElasticQueue.h"
+#include "store-runtime/VendPropertyListProvider.h"
 #include "store-runtime/VendStoreAnswer.h"
 #include "store-runtime/VendStoreURLOperation.h"
 
@@ -163,6 +164,11 @@ VendAccountService::SignInResult VendAccountService::authenticateWithStore(
     const std::string& accountName, const std::string& password) {
   auto operation = VendStoreURLOperation::propertyListOperationWithURLBagKey(
       std::string(kAuthenticateBagKey), storeClient_);
+  // The sign-in answer is not signed (there is no key yet), so nothing it
+  // orders may install software: only purchase answers start downloads.
+  auto provider = std::static_pointer_cast<VendPropertyListProvider>(operation->dataProvider());
+  provider->setShouldProcessDownloads(false);
+  provider->setShouldTriggerDownloads(false);
   VendURLRequest request;
   request.setMethod("POST");
   request.setValue("application/x-plist", "Content-Type");
@@ -176,7 +182,12 @@ VendAccountService::SignInResult VendAccountService::authenticateWithStore(
              error ? error->descriptionText() : "no error");
     return {std::nullopt, error};
   }
-  auto account = accountFromAnswer(operation->dataProvider()->output());
+  const PlistValue& answer = provider->output();
+  if (const PlistArray* downloads = answer["downloads"].array(); downloads && !downloads->empty()) {
+    TILL_LOG(1, "%@: The sign-in answer carries %@ download(s); they are ignored", kSpeaker,
+             downloads->size());
+  }
+  auto account = accountFromAnswer(answer);
   if (!account) {
     return {std::nullopt,
             VendStoreAnswer::error(VendStoreAnswer::kWrongShape,

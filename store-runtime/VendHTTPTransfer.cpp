@@ -3,9 +3,12 @@
 #include <curl/curl.h>
 
 #include <algorithm>
+#include <cctype>
 #include <cmath>
 #include <memory>
 #include <mutex>
+
+#include "store-runtime/VendRequestSigner.h"
 
 namespace larder {
 namespace {
@@ -26,12 +29,22 @@ struct ListDeleter {
 struct TransferState {
   const VendHTTPTransfer::Options* options = nullptr;
   VendHTTPTransfer::Result* result = nullptr;
+  std::chrono::steady_clock::time_point started;
+  double stallSeconds = 0;
   bool headDelivered = false;
   bool aborted = false;
   bool tooLarge = false;
+  bool overTime = false;
+  bool locationSeen = false;
+
+  // A redirect's head and body are not the answer; they stay here.
+  [[nodiscard]] bool isRedirect() const {
+    const long status = result->response.statusCode;
+    return locationSeen && status >= 300 && status < 400;
+  }
 
   void deliverHead() {
-    if (headDelivered) return;
+    if (headDelivered || isRedirect()) return;
     headDelivered = true;
     if (options->onResponse) options->onResponse(result->response);
   }
@@ -64,12 +77,17 @@ std::size_t receiveHeader(char* buffer, std::size_t size, std::size_t count, voi
     // its status is the one `onResponse` sees.
     state.result->response.headers.clear();
     state.result->response.statusCode = statusCodeOf(line);
+    state.locationSeen = false;
     return line.size();
   }
   const auto colon = line.find(':');
   if (colon != std::string_view::npos) {
-    state.result->response.headers.emplace_back(trimmed(line.substr(0, colon)),
-                                                trimmed(line.substr(colon + 1)));
+    std::string name = trimmed(line.substr(0, colon));
+    std::string lowered = name;
+    std::ranges::transform(lowered, lowered.begin(),
+                           [](unsigned char c) { return std::tolower(c); });
+    if (lowered == "location") state.locationSeen = true;
+    state.result->response.headers.emplace_back(std::move(name), trimmed(line.substr(colon + 1)));
   }
   return line.size();
 }
@@ -77,6 +95,7 @@ std::size_t receiveHeader(char* buffer, std::size_t size, std::size_t count, voi
 std::size_t receiveBody(char* buffer, std::size_t size, std::size_t count, void* context) {
   auto& state = *static_cast<TransferState*>(context);
   const std::size_t length = size * count;
+  if (state.isRedirect()) return length;
   state.deliverHead();
   const auto* bytes = reinterpret_cast<const std::uint8_t*>(buffer);
   if (state.options->onData) {
@@ -95,10 +114,16 @@ std::size_t receiveBody(char* buffer, std::size_t size, std::size_t count, void*
   return length;
 }
 
-int reportProgress(void* context, curl_off_t expected, curl_off_t received, curl_off_t,
-                   curl_off_t) {
+int reportProgress(void* context, curl_off_t expected, curl_off_t received, curl_off_t toSend,
+                   curl_off_t sent) {
   auto& state = *static_cast<TransferState*>(context);
-  if (!state.options->onProgress) return 0;
+  const auto bytes = static_cast<std::uint64_t>(std::max({expected, received, toSend, sent}));
+  if (std::chrono::steady_clock::now() - state.started >
+      VendHTTPTransfer::totalTimeBound(state.stallSeconds, bytes)) {
+    state.overTime = true;
+    return 1;
+  }
+  if (!state.options->onProgress || state.isRedirect()) return 0;
   const auto offset = state.options->resumeFrom;
   if (state.options->onProgress(static_cast<std::uint64_t>(received) + offset,
                                 expected > 0 ? static_cast<std::uint64_t>(expected) + offset : 0)) {
@@ -139,29 +164,61 @@ std::unique_ptr<curl_slist, ListDeleter> headerList(const VendURLRequest& reques
 
 }  // namespace
 
-VendHTTPTransfer::Result VendHTTPTransfer::perform(const VendURLRequest& request) {
-  return perform(request, Options{});
+namespace {
+
+// Parts of a URL that decide where it goes; nullopt for a URL that does
+// not parse.
+struct Origin {
+  std::string scheme;
+  std::string host;
+  std::string port;
+  bool operator==(const Origin&) const = default;
+};
+
+std::optional<Origin> originOf(std::string_view url) {
+  std::unique_ptr<CURLU, decltype(&curl_url_cleanup)> parsed(curl_url(), curl_url_cleanup);
+  if (!parsed) return std::nullopt;
+  const std::string text(url);
+  if (curl_url_set(parsed.get(), CURLUPART_URL, text.c_str(), 0) != CURLUE_OK) return std::nullopt;
+  const auto part = [&](CURLUPart which, unsigned int flags) -> std::optional<std::string> {
+    char* value = nullptr;
+    if (curl_url_get(parsed.get(), which, &value, flags) != CURLUE_OK || !value)
+      return std::nullopt;
+    std::string copy(value);
+    curl_free(value);
+    return copy;
+  };
+  auto scheme = part(CURLUPART_SCHEME, 0);
+  auto host = part(CURLUPART_HOST, 0);
+  auto port = part(CURLUPART_PORT, CURLU_DEFAULT_PORT);
+  if (!scheme || !host || !port) return std::nullopt;
+  std::ranges::transform(*scheme, scheme->begin(), [](unsigned char c) { return std::tolower(c); });
+  std::ranges::transform(*host, host->begin(), [](unsigned char c) { return std::tolower(c); });
+  return Origin{std::move(*scheme), std::move(*host), std::move(*port)};
 }
 
-VendHTTPTransfer::Result VendHTTPTransfer::perform(const VendURLRequest& request,
-                                                   const Options& options) {
-  initializeCurlOnce();
+// One exchange without following redirects; `redirectURL` gets the
+// Location of a redirect answer, resolved against the request's URL.
+VendHTTPTransfer::Result performOnce(const VendURLRequest& request,
+                                     const VendHTTPTransfer::Options& options,
+                                     std::chrono::steady_clock::time_point started,
+                                     std::string& redirectURL) {
+  using Result = VendHTTPTransfer::Result;
   Result result;
   std::unique_ptr<CURL, EasyDeleter> easy(curl_easy_init());
   if (!easy) {
     result.error = transferError(CURLE_FAILED_INIT, "the HTTP transport could not start");
     return result;
   }
-  TransferState state{&options, &result};
+  const long stallSeconds = std::max(1L, std::lround(request.timeoutInterval()));
+  TransferState state{&options, &result, started, static_cast<double>(stallSeconds)};
   CURL* handle = easy.get();
   auto headers = headerList(request);
-  const long stallSeconds = std::max(1L, std::lround(request.timeoutInterval()));
 
   curl_easy_setopt(handle, CURLOPT_URL, request.url().c_str());
   curl_easy_setopt(handle, CURLOPT_PROTOCOLS_STR, "http,https");
-  curl_easy_setopt(handle, CURLOPT_REDIR_PROTOCOLS_STR, "http,https");
-  curl_easy_setopt(handle, CURLOPT_FOLLOWLOCATION, 1L);
-  curl_easy_setopt(handle, CURLOPT_MAXREDIRS, 5L);
+  // Redirects are followed by `perform`, which decides what goes along.
+  curl_easy_setopt(handle, CURLOPT_FOLLOWLOCATION, 0L);
   curl_easy_setopt(handle, CURLOPT_NOSIGNAL, 1L);
   curl_easy_setopt(handle, CURLOPT_ACCEPT_ENCODING, "");
   curl_easy_setopt(handle, CURLOPT_HTTPHEADER, headers.get());
@@ -196,8 +253,22 @@ VendHTTPTransfer::Result VendHTTPTransfer::perform(const VendURLRequest& request
       curl_easy_getinfo(handle, CURLINFO_EFFECTIVE_URL, &effective) == CURLE_OK && effective) {
     result.response.url = effective;
   }
+  if (code == CURLE_OK && state.isRedirect()) {
+    if (char* location = nullptr;
+        curl_easy_getinfo(handle, CURLINFO_REDIRECT_URL, &location) == CURLE_OK && location) {
+      redirectURL = location;
+    }
+  }
   if (code == CURLE_OK) {
     state.deliverHead();
+  } else if (state.overTime) {
+    const auto bound = std::chrono::duration_cast<std::chrono::seconds>(
+        VendHTTPTransfer::totalTimeBound(state.stallSeconds, 0));
+    result.error =
+        transferError(CURLE_OPERATION_TIMEDOUT,
+                      "the transfer took longer than its time bound (" +
+                          std::to_string(bound.count()) + " s plus its size at " +
+                          std::to_string(VendHTTPTransfer::kMinimumRate / 1024) + " KiB/s)");
   } else if (state.aborted) {
     result.error = transferError(VendError::kCancelledCode, "the transfer was cancelled");
   } else if (state.tooLarge) {
@@ -206,6 +277,63 @@ VendHTTPTransfer::Result VendHTTPTransfer::perform(const VendURLRequest& request
     result.error = transferError(code, curl_easy_strerror(code));
   }
   return result;
+}
+
+}  // namespace
+
+VendHTTPTransfer::Redirect VendHTTPTransfer::redirectPolicy(std::string_view fromURL,
+                                                            std::string_view toURL) {
+  const auto from = originOf(fromURL);
+  const auto to = originOf(toURL);
+  if (!from || !to) return Redirect::kRefuse;
+  if (to->scheme != "https" && to->scheme != "http") return Redirect::kRefuse;
+  if (from->scheme == "https" && to->scheme != "https") return Redirect::kRefuse;
+  return *from == *to ? Redirect::kFollow : Redirect::kFollowWithoutAccount;
+}
+
+std::chrono::milliseconds VendHTTPTransfer::totalTimeBound(double stallSeconds,
+                                                           std::uint64_t bytes) {
+  const double seconds =
+      2 * std::max(1.0, stallSeconds) + static_cast<double>(bytes) / kMinimumRate;
+  return std::chrono::milliseconds(std::llround(seconds * 1000));
+}
+
+VendHTTPTransfer::Result VendHTTPTransfer::perform(const VendURLRequest& request) {
+  return perform(request, Options{});
+}
+
+VendHTTPTransfer::Result VendHTTPTransfer::perform(const VendURLRequest& request,
+                                                   const Options& options) {
+  initializeCurlOnce();
+  const auto started = std::chrono::steady_clock::now();
+  VendURLRequest current = request;
+  for (int redirects = 0;; ++redirects) {
+    std::string next;
+    Result result = performOnce(current, options, started, next);
+    if (result.error || next.empty()) return result;
+    const Redirect decision = redirectPolicy(current.url(), next);
+    if (decision == Redirect::kRefuse || redirects == kMaximumRedirects) {
+      result.error = transferError(
+          decision == Redirect::kRefuse ? CURLE_UNSUPPORTED_PROTOCOL : CURLE_TOO_MANY_REDIRECTS,
+          decision == Redirect::kRefuse
+              ? "refused the redirect from " + current.url() + " to " + next
+              : "too many redirects, the last to " + next);
+      return result;
+    }
+    if (decision == Redirect::kFollowWithoutAccount) {
+      current.setValue("", VendRequestSigner::kAccountHeader);
+      current.setValue("", VendRequestSigner::kSignatureHeader);
+    }
+    const long status = result.response.statusCode;
+    // As browsers do: 303 always, and 301 and 302 of a POST, go on as a
+    // plain fetch; 307 and 308 repeat the request as it was.
+    if (status == 303 || ((status == 301 || status == 302) && current.method() == "POST")) {
+      current.setMethod("GET");
+      current.setBody({});
+      current.setValue("", "Content-Type");
+    }
+    current.setURL(std::move(next));
+  }
 }
 
 }  // namespace larder

@@ -14,9 +14,15 @@
 namespace larder {
 
 // One HTTP exchange over libcurl. Every transfer ends: the connection has
-// a time limit of its own, and a transfer that makes no progress for the
-// request's `timeoutInterval` fails, so a synchronous caller never hangs on
-// a lost reply. gzip and deflate answers are decoded on the way in.
+// a time limit of its own, a transfer that makes no progress for the
+// request's `timeoutInterval` fails, and so does one that takes longer than
+// `totalTimeBound` (a trickle just above the stall limit), so a synchronous
+// caller never hangs on a lost or starved reply. gzip and deflate answers
+// are decoded on the way in.
+//
+// Redirects are followed (at most `kMaximumRedirects`) as `redirectPolicy`
+// decides: never from https to http or to another scheme, and without the
+// account and signature headers to any other origin.
 class VendHTTPTransfer {
  public:
   struct Options {
@@ -48,6 +54,21 @@ class VendHTTPTransfer {
   static Result perform(const VendURLRequest& request);
 
   static constexpr std::string_view kErrorDomain = "VendHTTPErrorDomain";
+
+  enum class Redirect {
+    kRefuse,                // a downgrade (https to http), another scheme, or no URL
+    kFollow,                // same scheme, host and port: the request goes on as it is
+    kFollowWithoutAccount,  // another origin: the account and signature headers stay behind
+  };
+  static Redirect redirectPolicy(std::string_view fromURL, std::string_view toURL);
+  static constexpr int kMaximumRedirects = 5;
+
+  // The longest a transfer may take in all: twice its stall limit, plus its
+  // bytes (the larger of the expected and the received count, both ways) at
+  // `kMinimumRate`. A 1 GB package with the default stall limit of 60 s may
+  // take 2 + 8.5 hours; a small answer 2 minutes.
+  static std::chrono::milliseconds totalTimeBound(double stallSeconds, std::uint64_t bytes);
+  static constexpr std::uint64_t kMinimumRate = 32u * 1024u;  // bytes per second
 };
 
 }  // namespace larder

@@ -2,11 +2,11 @@
 
 #include <cstdlib>
 
-#include "platform/DispatchQueue.h"
 #include "platform/Environment.h"
 #include "store-runtime/VendAccountStore.h"
 #include "store-runtime/VendCancellingDialogPresenter.h"
 #include "store-runtime/VendDownloadManager.h"
+#include "store-runtime/VendElasticQueue.h"
 #include "store-runtime/VendURLBag.h"
 
 namespace larder {
@@ -42,9 +42,7 @@ VendRuntime::VendRuntime(VendRuntimeConfiguration configuration)
       urlBag_(std::make_unique<VendURLBag>(configuration_)),
       accountStore_(std::make_unique<VendAccountStore>(configuration_)),
       downloadManager_(std::make_unique<VendDownloadManager>(configuration_)),
-      serviceQueue_(DispatchQueue::create(
-          "com.orvane.larderd.VendServices", DispatchQueue::Kind::Concurrent,
-          {.concurrentWorkers = 16, .idleTimeout = std::chrono::seconds(10)})) {}
+      serviceQueue_(std::make_shared<VendElasticQueue>("com.orvane.larderd.VendServices")) {}
 
 VendRuntime::~VendRuntime() = default;
 

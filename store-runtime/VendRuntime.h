@@ -7,11 +7,11 @@
 
 namespace larder {
 
-class DispatchQueue;
 class VendAccountStore;
 class VendAssetService;
 class VendDialogPresenter;
 class VendDownloadManager;
+class VendElasticQueue;
 class VendURLBag;
 
 // Where the runtime talks to and keeps its files.
@@ -49,9 +49,13 @@ class VendRuntime {
   [[nodiscard]] VendURLBag& urlBag() { return *urlBag_; }
   [[nodiscard]] VendAccountStore& accountStore() { return *accountStore_; }
   [[nodiscard]] VendDownloadManager& downloadManager() { return *downloadManager_; }
-  // Where the services run their replies: concurrent, so that a reply that
-  // waits for a person (a sign-in dialog) does not hold up the others.
-  [[nodiscard]] const std::shared_ptr<DispatchQueue>& serviceQueue() const { return serviceQueue_; }
+  // Where the services run their calls. A call may wait without a time
+  // limit, for a person (a sign-in dialog) or for another service call it
+  // made (a purchase waits for the sign-in), so every call gets a thread of
+  // its own when none is idle: no call waits behind another.
+  [[nodiscard]] const std::shared_ptr<VendElasticQueue>& serviceQueue() const {
+    return serviceQueue_;
+  }
 
   void setDialogPresenter(std::shared_ptr<VendDialogPresenter> presenter);
   // Never null: without one installed, a presenter that cancels every dialog.
@@ -64,7 +68,7 @@ class VendRuntime {
   std::unique_ptr<VendURLBag> urlBag_;
   std::unique_ptr<VendAccountStore> accountStore_;
   std::unique_ptr<VendDownloadManager> downloadManager_;
-  std::shared_ptr<DispatchQueue> serviceQueue_;
+  std::shared_ptr<VendElasticQueue> serviceQueue_;
   mutable std::mutex hooksMutex_;
   std::shared_ptr<VendDialogPresenter> dialogPresenter_;
   std::shared_ptr<VendAssetService> assetService_;

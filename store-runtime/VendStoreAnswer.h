@@ -22,6 +22,8 @@ class VendStoreAnswer {
     kNoStore = -3,
     kBadSignature = -4,
     kNotSignedIn = -5,
+    // A purchase answer that delivers another item than the one bought.
+    kWrongItem = -6,
   };
 
   // The parsed answer, or an error that says why there is none.

@@ -1,11 +1,11 @@
 #include "store-runtime/VendTransactionService.h"
 
-#include "platform/DispatchQueue.h"
 #include "platform/PropertyListSerialization.h"
 #include "store-runtime/TillDownload.h"
 #include "store-runtime/TillLogManager.h"
 #include "store-runtime/VendAccountStore.h"
 #include "store-runtime/VendDownloadService.h"
+#include "store-runtime/VendElasticQueue.h"
 #include "store-runtime/VendPropertyListProvider.h"
 #include "store-runtime/VendRequestSigner.h"
 #include "store-runtime/VendStoreAnswer.h"
@@ -41,6 +41,30 @@ std::string queryText(const PlistDictionary& request) {
 PlistData xmlBody(const PlistValue& value) {
   const std::string xml = PropertyListSerialization::writeXml(value);
   return {xml.begin(), xml.end()};
+}
+
+// The item a purchase buys: its identifier, else the one its buy
+// parameters name; 0 when neither says.
+std::uint64_t itemBought(const TillPurchase& purchase) {
+  if (purchase.itemIdentifier() != 0) return purchase.itemIdentifier();
+  return TillPurchase::itemIdentifierFromBuyParameters(purchase.buyParameters()).value_or(0);
+}
+
+// An answer is bound to what was bought: a download of any other item (a
+// store, or anyone between it and us, swapping the package) is refused
+// before anything is fetched.
+OptionalError wrongItemIn(const TillPurchase& purchase, const TillPurchaseResponse& response) {
+  const std::uint64_t bought = itemBought(purchase);
+  if (bought == 0) return std::nullopt;
+  for (const auto& download : response.downloads()) {
+    const std::uint64_t delivered = download->metadata().itemIdentifier();
+    if (delivered == bought) continue;
+    return VendStoreAnswer::error(VendStoreAnswer::kWrongItem,
+                                  "The store's purchase answer delivers item " +
+                                      std::to_string(delivered) + ", not the item bought (" +
+                                      std::to_string(bought) + ")");
+  }
+  return std::nullopt;
 }
 
 VendError notSignedIn() {
@@ -121,6 +145,11 @@ VendTransactionService::PurchaseOutcome VendTransactionService::purchase(
     return {std::nullopt,
             VendStoreAnswer::error(VendStoreAnswer::kWrongShape,
                                    "The store's purchase answer has the wrong shape")};
+  }
+  if (auto refusal = wrongItemIn(purchase, *response)) {
+    TILL_LOG(1, "%@: Purchase of %@ refused: %@", kSpeaker, purchase.itemIdentifier(),
+             refusal->descriptionText());
+    return {std::nullopt, refusal};
   }
   TILL_LOG(2, "%@: Purchased %@ with %@ downloads", kSpeaker, purchase.itemIdentifier(),
            response->downloads().size());

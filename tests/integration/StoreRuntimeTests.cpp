@@ -5,11 +5,14 @@
 
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <chrono>
+#include <condition_variable>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <thread>
 
@@ -18,14 +21,17 @@
 #include "StoreServerProcess.h"
 #include "platform/DispatchSemaphore.h"
 #include "store-runtime/TillDownload.h"
+#include "store-runtime/TillLogManager.h"
 #include "store-runtime/TillPurchase.h"
 #include "store-runtime/VendAccountService.h"
 #include "store-runtime/VendAccountStore.h"
 #include "store-runtime/VendDialogPresenter.h"
 #include "store-runtime/VendDownloadService.h"
+#include "store-runtime/VendHTTPTransfer.h"
 #include "store-runtime/VendRequestSigner.h"
 #include "store-runtime/VendRuntime.h"
 #include "store-runtime/VendServiceProxy.h"
+#include "store-runtime/VendStoreAnswer.h"
 #include "store-runtime/VendTransactionService.h"
 #include "store-runtime/VendURLBag.h"
 
@@ -445,6 +451,173 @@ TEST_F(StoreRuntimeTest, ItemLookupFindsTheItemByIdentifierAndByBundle) {
   auto byBundle = lookup({{"bundleId", "com.example.Notes"}, {"p", "lockup"}});
   ASSERT_TRUE(byBundle["results"].dictionary());
   EXPECT_EQ(byBundle["results"].dictionary()->size(), 1U);
+}
+
+// Holds every dialog unanswered until the test lets them go as cancelled.
+class HoldingPresenter : public VendDialogPresenter {
+ public:
+  void present(const VendDialog&, Reply reply) override {
+    std::lock_guard lock(mutex_);
+    held_.push_back(std::move(reply));
+  }
+  void dismiss(std::string_view, std::int64_t) override {}
+  std::size_t heldCount() {
+    std::lock_guard lock(mutex_);
+    return held_.size();
+  }
+  void cancelAll() {
+    std::vector<Reply> held;
+    {
+      std::lock_guard lock(mutex_);
+      held.swap(held_);
+    }
+    for (Reply& reply : held) reply({VendDialogButton::kCancel, {}});
+  }
+
+ private:
+  std::mutex mutex_;
+  std::vector<Reply> held_;
+};
+
+// More purchases than any fixed pool of workers, each waiting for a sign-in
+// that is itself a service call: all of them end, and the account service
+// still answers at once. Once with no dialog agent (every sign-in is
+// cancelled at once), once with dialogs nobody answers until the end.
+TEST_F(StoreRuntimeTest, PurchasesWaitingForSignInNeverStarveOtherServiceCalls) {
+  constexpr int kPurchases = 20;
+  for (const bool holdDialogs : {false, true}) {
+    SCOPED_TRACE(holdDialogs ? "dialogs held" : "no dialog agent");
+    startStore({"bag=slow"});
+    auto holding = std::make_shared<HoldingPresenter>();
+    if (holdDialogs) runtime_->setDialogPresenter(holding);
+    // Shared with the replies, which may outlive a failed assertion.
+    struct Tally {
+      std::mutex mutex;
+      std::condition_variable changed;
+      int ended = 0;
+      int cancelled = 0;
+    };
+    auto tally = std::make_shared<Tally>();
+    auto transactions = proxy_->transactionService();
+    for (int index = 0; index < kPurchases; ++index) {
+      auto purchase = TillPurchase::purchaseWithBuyParameters("itemId=501&price=0");
+      transactions->performPurchase(
+          purchase, {}, VendTransactionService::kLeaveDownloadsToCaller,
+          [tally](const std::optional<TillPurchaseResponse>&, bool, const OptionalError& error) {
+            std::lock_guard lock(tally->mutex);
+            ++tally->ended;
+            if (error && error->code == VendError::kCancelledCode) ++tally->cancelled;
+            tally->changed.notify_all();
+          });
+    }
+    const auto answersWithin = [&](std::chrono::milliseconds limit) {
+      auto answered = std::make_shared<DispatchSemaphore>();
+      proxy_->accountService()->primaryAccount(
+          [answered](std::optional<VendAccount>) { answered->signal(); });
+      return answered->waitFor(limit);
+    };
+    if (holdDialogs) {
+      const auto deadline = std::chrono::steady_clock::now() + 30s;
+      while (holding->heldCount() < kPurchases && std::chrono::steady_clock::now() < deadline)
+        std::this_thread::sleep_for(20ms);
+      ASSERT_EQ(holding->heldCount(), static_cast<std::size_t>(kPurchases));
+      EXPECT_TRUE(answersWithin(1s)) << "a held dialog held up the account service";
+      holding->cancelAll();
+    }
+    {
+      std::unique_lock lock(tally->mutex);
+      ASSERT_TRUE(tally->changed.wait_for(lock, 30s, [&] { return tally->ended == kPurchases; }))
+          << tally->ended << " of " << kPurchases << " purchases ended";
+      EXPECT_EQ(tally->cancelled, kPurchases);
+    }
+    EXPECT_TRUE(answersWithin(1s));
+  }
+}
+
+TEST_F(StoreRuntimeTest, ASignInAnswerThatCarriesDownloadsInstallsNothing) {
+  startStore({"authenticate=with-downloads"});
+  std::mutex mutex;
+  std::vector<std::string> errors;
+  auto sink = TillLogManager::sharedManager().addSink([&](int level, const std::string& line) {
+    std::lock_guard lock(mutex);
+    if (level == 1) errors.push_back(line);
+  });
+  signIn();
+  // A purchase through the same service after the sign-in has ended: by
+  // then a download the sign-in had started would be under way.
+  ASSERT_TRUE(purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller).success);
+  std::size_t downloads = 99;
+  proxy_->downloadServiceSynchronousBlock(
+      [&](VendDownloadService& service, DispatchSemaphore& done) {
+        service.downloadsWithTypeMask(-1, [&](const auto& list) {
+          downloads = list.size();
+          done.signal();
+        });
+      });
+  EXPECT_EQ(downloads, 0U);
+  EXPECT_EQ(store_->requestCount("assets"), 0U);
+  EXPECT_FALSE(fs::exists(installedBundle()));
+  std::lock_guard lock(mutex);
+  EXPECT_EQ(std::ranges::count_if(errors,
+                                  [](const std::string& line) {
+                                    return line.find(
+                                               "sign-in answer carries 1 download(s); they "
+                                               "are ignored") != std::string::npos;
+                                  }),
+            1);
+}
+
+TEST_F(StoreRuntimeTest, APurchaseAnswerForAnotherItemIsRefused) {
+  startStore({"buy-product=other-item"});
+  signIn();
+  const auto result = purchase(kNotesItem, 0);
+  EXPECT_FALSE(result.success);
+  EXPECT_FALSE(result.response);
+  ASSERT_TRUE(result.error);
+  EXPECT_EQ(result.error->code, VendStoreAnswer::kWrongItem);
+  EXPECT_NE(result.error->descriptionText().find("not the item bought (501)"), std::string::npos)
+      << result.error->descriptionText();
+  EXPECT_EQ(store_->requestCount("assets"), 0U);
+}
+
+// The store sends the signed purchase from 127.0.0.1 to localhost: the
+// request arrives there without the account and its signature (and so is
+// refused as unsigned).
+TEST_F(StoreRuntimeTest, ACrossHostRedirectLeavesTheAccountHeadersBehind) {
+  startStore({"buy-product=redirect-host"});
+  signIn();
+  const auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
+  ASSERT_TRUE(result.error);
+  EXPECT_EQ(result.error->code, 401);
+  EXPECT_EQ(store_->requestCount("buy-product"), 2U);
+  EXPECT_EQ(store_->signedRequestCount("buy-product"), 1U);
+}
+
+TEST_F(StoreRuntimeTest, ATricklingTransferEndsWithinItsTimeBound) {
+  catalogue_.addItem({.wareID = 502,
+                      .bundleID = "com.example.Small",
+                      .title = "Small",
+                      .version = "1.0",
+                      .payloadBytes = 16 * 1024});
+  startStore({"assets=trickle"});
+  signIn();
+  auto bought = purchase(502, VendTransactionService::kLeaveDownloadsToCaller);
+  ASSERT_TRUE(bought.response && !bought.response->downloads().empty());
+  const auto assets = bought.response->downloads().front()->assets();
+  ASSERT_FALSE(assets.empty());
+  VendURLRequest request = assets.front().URLRequest();
+  request.setTimeoutInterval(1);  // the trickle never stalls for a second
+  const auto size = static_cast<std::uint64_t>(assets.front().fileSize());
+  const auto bound = VendHTTPTransfer::totalTimeBound(1, size);
+  ASSERT_LT(bound, 5s);
+  const auto started = std::chrono::steady_clock::now();
+  const auto result = VendHTTPTransfer::perform(request);
+  const auto took = std::chrono::steady_clock::now() - started;
+  ASSERT_TRUE(result.error);
+  EXPECT_EQ(result.error->domain, VendHTTPTransfer::kErrorDomain);
+  EXPECT_EQ(result.error->code, 28) << result.error->descriptionText();  // timed out
+  EXPECT_GE(took, bound);
+  EXPECT_LT(took, bound + 2s);
 }
 
 }  // namespace

@@ -81,7 +81,15 @@ void StoreServerProcess::awaitListeningLine(std::chrono::milliseconds timeout) {
 }
 
 std::uint64_t StoreServerProcess::requestCount(const std::string& route) const {
-  VendURLRequest request(baseURL_ + "/_larder/requests");
+  return countAt("/_larder/requests", route);
+}
+
+std::uint64_t StoreServerProcess::signedRequestCount(const std::string& route) const {
+  return countAt("/_larder/signed-requests", route);
+}
+
+std::uint64_t StoreServerProcess::countAt(const std::string& path, const std::string& route) const {
+  VendURLRequest request(baseURL_ + path);
   request.setTimeoutInterval(10);
   const auto result = VendHTTPTransfer::perform(request);
   const auto counts = result.error ? std::nullopt : PropertyListSerialization::read(result.body);

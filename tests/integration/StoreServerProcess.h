@@ -34,6 +34,8 @@ class StoreServerProcess {
   // How many requests reached `route` ("bag", "assets", ...), as the store
   // counts them; throws when the store does not answer.
   [[nodiscard]] std::uint64_t requestCount(const std::string& route) const;
+  // Requests of the route that carried an account or signature header.
+  [[nodiscard]] std::uint64_t signedRequestCount(const std::string& route) const;
 
   // What the store wrote on standard error so far.
   [[nodiscard]] std::string errorOutput() const;
@@ -44,6 +46,7 @@ class StoreServerProcess {
   [[nodiscard]] bool isRunning() { return process_.isRunning(); }
 
  private:
+  [[nodiscard]] std::uint64_t countAt(const std::string& path, const std::string& route) const;
   static std::string makeLogDirectory();
   void awaitListeningLine(std::chrono::milliseconds timeout);
 

@@ -23,6 +23,7 @@ class StoreAnswers {
   static constexpr std::string_view kOrvaneIDLookupPath = "/orvane-id-lookup";
   static constexpr std::string_view kInvitationsPrefix = "/invitations/";
   static constexpr std::string_view kRequestsPath = "/_larder/requests";
+  static constexpr std::string_view kSignedRequestsPath = "/_larder/signed-requests";
 
   // The store's own entries and then `extras`, which win; an extra string
   // that begins with "/" is a path on this store and becomes absolute.

@@ -6,7 +6,7 @@
 namespace larder {
 namespace {
 
-constexpr std::array<std::pair<StoreFaults::Kind, std::string_view>, 7> kKindNames{{
+constexpr std::array<std::pair<StoreFaults::Kind, std::string_view>, 11> kKindNames{{
     {StoreFaults::Kind::ServerError, "500"},
     {StoreFaults::Kind::Stall, "stall"},
     {StoreFaults::Kind::Slow, "slow"},
@@ -14,6 +14,10 @@ constexpr std::array<std::pair<StoreFaults::Kind, std::string_view>, 7> kKindNam
     {StoreFaults::Kind::WrongShape, "wrong-shape"},
     {StoreFaults::Kind::Truncate, "truncate"},
     {StoreFaults::Kind::Corrupt, "corrupt"},
+    {StoreFaults::Kind::Trickle, "trickle"},
+    {StoreFaults::Kind::WithDownloads, "with-downloads"},
+    {StoreFaults::Kind::OtherItem, "other-item"},
+    {StoreFaults::Kind::RedirectHost, "redirect-host"},
 }};
 
 }  // namespace
@@ -46,13 +50,31 @@ std::optional<StoreFaults> StoreFaults::parse(const std::vector<std::string>& fa
         *error = "fault \"" + faultText + "\" is not ROUTE=KIND with a known route and kind";
       return std::nullopt;
     }
-    if (appliesOnlyToAssets(*kind) && *route != StoreRoute::Assets) {
-      if (error) *error = "fault \"" + faultText + "\" applies only to the assets route";
+    if (const auto only = onlyRouteOf(*kind); only && *route != *only) {
+      if (error) {
+        *error = "fault \"" + faultText + "\" applies only to the " +
+                 std::string(storeRouteName(*only)) + " route";
+      }
       return std::nullopt;
     }
     faults.faults_[*route] = *kind;
   }
   return faults;
+}
+
+std::optional<StoreRoute> StoreFaults::onlyRouteOf(Kind kind) {
+  switch (kind) {
+    case Kind::Truncate:
+    case Kind::Corrupt:
+    case Kind::Trickle:
+      return StoreRoute::Assets;
+    case Kind::WithDownloads:
+      return StoreRoute::Authenticate;
+    case Kind::OtherItem:
+      return StoreRoute::BuyProduct;
+    default:
+      return std::nullopt;
+  }
 }
 
 std::optional<StoreFaults::Kind> StoreFaults::faultFor(StoreRoute route) const {

@@ -15,13 +15,17 @@ namespace larder {
 class StoreFaults {
  public:
   enum class Kind {
-    ServerError,  // "500": status 500 with a failure dictionary
-    Stall,        // "stall": no answer until the server stops
-    Slow,         // "slow": the usual answer, one second late
-    NotPlist,     // "not-plist": 200 with bytes that are no property list
-    WrongShape,   // "wrong-shape": 200 with a property list of the wrong shape
-    Truncate,     // "truncate" (assets): full Content-Length, half the bytes
-    Corrupt,      // "corrupt" (assets): bytes flipped in the middle
+    ServerError,    // "500": status 500 with a failure dictionary
+    Stall,          // "stall": no answer until the server stops
+    Slow,           // "slow": the usual answer, one second late
+    NotPlist,       // "not-plist": 200 with bytes that are no property list
+    WrongShape,     // "wrong-shape": 200 with a property list of the wrong shape
+    Truncate,       // "truncate" (assets): full Content-Length, half the bytes
+    Corrupt,        // "corrupt" (assets): bytes flipped in the middle
+    Trickle,        // "trickle" (assets): a few bytes every quarter second
+    WithDownloads,  // "with-downloads" (authenticate): the answer orders a download
+    OtherItem,      // "other-item" (buy-product): the download is of another item
+    RedirectHost,   // "redirect-host": 307 from 127.0.0.1 to localhost, same port and target
   };
 
   // Parses every "ROUTE=KIND" text; on the first bad one returns nullopt and
@@ -36,9 +40,8 @@ class StoreFaults {
 
  private:
   static std::optional<Kind> kindNamed(std::string_view name);
-  static bool appliesOnlyToAssets(Kind kind) {
-    return kind == Kind::Truncate || kind == Kind::Corrupt;
-  }
+  // The one route a kind applies to, for those that apply to one only.
+  static std::optional<StoreRoute> onlyRouteOf(Kind kind);
 
   std::map<StoreRoute, Kind> faults_;
 };

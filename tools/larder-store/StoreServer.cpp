@@ -123,6 +123,10 @@ void StoreServer::installRoutes() {
             [this](const httplib::Request&, httplib::Response& response) {
               answerRequestCounts(response);
             });
+  http_.Get(exact(StoreAnswers::kSignedRequestsPath),
+            [this](const httplib::Request&, httplib::Response& response) {
+              send(response, {200, signedCounts_.toDictionary(), {}});
+            });
 }
 
 void StoreServer::installCloudLibraryRoutes() {
@@ -146,7 +150,11 @@ httplib::Server::Handler StoreServer::route(StoreRoute storeRoute, RouteHandler 
   return [this, storeRoute, handler = std::move(handler)](const httplib::Request& request,
                                                           httplib::Response& response) {
     counts_.count(storeRoute);
-    if (!answeredByFault(storeRoute, response)) handler(request, response);
+    if (request.has_header(std::string(VendRequestSigner::kAccountHeader)) ||
+        request.has_header(std::string(VendRequestSigner::kSignatureHeader))) {
+      signedCounts_.count(storeRoute);
+    }
+    if (!answeredByFault(storeRoute, request, response)) handler(request, response);
   };
 }
 
@@ -170,7 +178,8 @@ httplib::Server::HandlerWithContentReader StoreServer::routeReadingBody(StoreRou
   };
 }
 
-bool StoreServer::answeredByFault(StoreRoute storeRoute, httplib::Response& response) {
+bool StoreServer::answeredByFault(StoreRoute storeRoute, const httplib::Request& request,
+                                  httplib::Response& response) {
   const auto fault = faults_.faultFor(storeRoute);
   if (!fault) return false;
   TILL_LOG(3, "%@: fault %@ on %@", "StoreServer", StoreFaults::kindName(*fault),
@@ -196,9 +205,22 @@ bool StoreServer::answeredByFault(StoreRoute storeRoute, httplib::Response& resp
     case StoreFaults::Kind::WrongShape:
       send(response, {200, PlistArray{"an", "array", "where", "a", "dictionary", "belongs"}, {}});
       return true;
+    case StoreFaults::Kind::RedirectHost: {
+      // Only the first leg: the other name of the same server answers as usual.
+      const std::string host = request.get_header_value("Host");
+      constexpr std::string_view kLoopback = "127.0.0.1:";
+      if (!host.starts_with(kLoopback)) return false;
+      response.status = 307;
+      response.set_header("Location",
+                          "http://localhost:" + host.substr(kLoopback.size()) + request.target);
+      return true;
+    }
     case StoreFaults::Kind::Truncate:
     case StoreFaults::Kind::Corrupt:
-      return false;  // the assets route damages its own bytes
+    case StoreFaults::Kind::Trickle:
+    case StoreFaults::Kind::WithDownloads:
+    case StoreFaults::Kind::OtherItem:
+      return false;  // the route itself misbehaves
   }
   return false;
 }
@@ -265,12 +287,31 @@ void StoreServer::answerAuthenticate(const httplib::Request& request,
     return;
   }
   TILL_LOG(2, "%@: %@ signed in", "StoreServer", *name);
-  send(response, {200, account->toAuthenticationDictionary(), {}});
+  PlistDictionary answer = account->toAuthenticationDictionary();
+  if (faults_.faultFor(StoreRoute::Authenticate) == StoreFaults::Kind::WithDownloads &&
+      !catalogue_.items().empty()) {
+    answer["downloads"] =
+        PlistArray{StoreAnswers::download(catalogue_.items().begin()->second, baseURL(request))};
+  }
+  send(response, {200, std::move(answer), {}});
 }
 
 void StoreServer::answerBuyProduct(const httplib::Request& request,
                                    httplib::Response& response) const {
-  send(response, purchases_.buy(request, baseURL(request)));
+  StoreReply reply = purchases_.buy(request, baseURL(request));
+  if (faults_.faultFor(StoreRoute::BuyProduct) == StoreFaults::Kind::OtherItem) {
+    // Signed as usual: the store itself sends the wrong item.
+    PlistDictionary* answer = reply.body.dictionary();
+    PlistArray* downloads = answer ? (*answer)["downloads"].array() : nullptr;
+    for (std::size_t index = 0; downloads && index < downloads->size(); ++index) {
+      PlistDictionary* download = (*downloads)[index].dictionary();
+      PlistDictionary* metadata = download ? (*download)["metadata"].dictionary() : nullptr;
+      if (metadata && (*metadata)["itemIdentifier"].isInteger()) {
+        (*metadata)["itemIdentifier"] = (*metadata)["itemIdentifier"].uint64Value() + 1;
+      }
+    }
+  }
+  send(response, reply);
 }
 
 void StoreServer::answerItemLookup(const httplib::Request& request,
@@ -328,9 +369,14 @@ void StoreServer::answerAsset(const httplib::Request& request, httplib::Response
   }
   response.set_content_provider(
       range.length, type,
-      [stream, first = range.first](std::size_t offset, std::size_t length,
-                                    httplib::DataSink& sink) {
-        return stream->provide(first + offset, length, sink);
+      [this, stream, first = range.first,
+       trickle = faults_.faultFor(StoreRoute::Assets) == StoreFaults::Kind::Trickle](
+          std::size_t offset, std::size_t length, httplib::DataSink& sink) {
+        if (!trickle) return stream->provide(first + offset, length, sink);
+        // Fast enough never to stall, far too slow to finish; a stopping
+        // server ends it.
+        if (stallGate_.waitFor(std::chrono::milliseconds(250))) return false;
+        return stream->provide(first + offset, std::min<std::size_t>(length, 4), sink);
       });
 }
 

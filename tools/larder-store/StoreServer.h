@@ -56,7 +56,8 @@ class StoreServer {
   // the route would rather answer in its own words.
   httplib::Server::HandlerWithContentReader routeReadingBody(StoreRoute storeRoute,
                                                              BodyRouteHandler handler);
-  bool answeredByFault(StoreRoute storeRoute, httplib::Response& response);
+  bool answeredByFault(StoreRoute storeRoute, const httplib::Request& request,
+                       httplib::Response& response);
 
   void answerBag(const httplib::Request& request, httplib::Response& response) const;
   void answerAuthenticate(const httplib::Request& request, httplib::Response& response) const;
@@ -81,7 +82,10 @@ class StoreServer {
   StoreOrvaneIDLookup orvaneIDLookup_;
   StoreDAAPService cloudLibrary_;
   StoreRequestCounts counts_;
-  StoreStallGate stallGate_;
+  // Requests that carried an account or signature header.
+  StoreRequestCounts signedCounts_;
+  // Waited on by const routes too (a trickling asset).
+  mutable StoreStallGate stallGate_;
   StoreHTTPServer http_;
   std::string host_;
   int port_ = 0;

@@ -7,9 +7,9 @@ void StoreStallGate::wait() {
   opened_.wait(lock, [this] { return open_; });
 }
 
-void StoreStallGate::waitFor(std::chrono::milliseconds delay) {
+bool StoreStallGate::waitFor(std::chrono::milliseconds delay) {
   std::unique_lock lock(mutex_);
-  opened_.wait_for(lock, delay, [this] { return open_; });
+  return opened_.wait_for(lock, delay, [this] { return open_; });
 }
 
 void StoreStallGate::open() {

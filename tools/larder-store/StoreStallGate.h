@@ -12,8 +12,8 @@ class StoreStallGate {
  public:
   // Returns once the gate is open.
   void wait();
-  // Returns once the gate is open or `delay` has passed.
-  void waitFor(std::chrono::milliseconds delay);
+  // Returns once the gate is open or `delay` has passed; true when open.
+  bool waitFor(std::chrono::milliseconds delay);
   void open();
 
  private:
