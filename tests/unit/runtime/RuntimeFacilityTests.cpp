@@ -39,6 +39,7 @@
 #include "store-runtime/VendError.h"
 #include "store-runtime/VendFileManager.h"
 #include "store-runtime/VendGzip.h"
+#include "store-runtime/VendHTTPTransfer.h"
 #include "store-runtime/VendManagedRestrictions.h"
 #include "store-runtime/VendStoreClient.h"
 #include "store-runtime/VendStringHelpers.h"
@@ -897,6 +898,28 @@ TEST_F(RuntimeFacilityTest, DisplayNamePrefersTheBundlesOwnNames) {
   EXPECT_EQ(VendFileManager::displayNameAtPath(bare), "Bare Folder");
   EXPECT_EQ(VendFileManager::displayNameAtPath(bare + "/"), "Bare Folder");
   EXPECT_EQ(VendFileManager::displayNameAtPath(rooted("/Applications/Gone.app")), "Gone");
+}
+
+TEST(VendHTTPTransfer, RedirectsNeverDowngradeAndLeaveTheAccountAtItsOrigin) {
+  using Redirect = VendHTTPTransfer::Redirect;
+  const struct {
+    const char* from;
+    const char* to;
+    Redirect expected;
+  } cases[] = {
+      {"https://store.example/a", "https://store.example/b", Redirect::kFollow},
+      {"https://store.example/a", "https://STORE.example:443/b", Redirect::kFollow},
+      {"http://store.example/a", "https://store.example/b", Redirect::kFollowWithoutAccount},
+      {"https://store.example/a", "https://cdn.example/b", Redirect::kFollowWithoutAccount},
+      {"https://store.example/a", "https://store.example:8443/b", Redirect::kFollowWithoutAccount},
+      {"https://store.example/a", "http://store.example/b", Redirect::kRefuse},
+      {"https://store.example/a", "ftp://store.example/b", Redirect::kRefuse},
+      {"http://store.example/a", "file:///etc/passwd", Redirect::kRefuse},
+      {"https://store.example/a", "not a url", Redirect::kRefuse},
+  };
+  for (const auto& c : cases) {
+    EXPECT_EQ(VendHTTPTransfer::redirectPolicy(c.from, c.to), c.expected) << c.from << " -> " << c.to;
+  }
 }
 
 }  // namespace
