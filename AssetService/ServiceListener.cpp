@@ -105,6 +105,16 @@ void ServiceListener::resume() {
   connection_->enterEventLoopAsync();
 }
 
+void ServiceListener::stopServing() {
+  if (!connection_) return;
+  try {
+    connection_->releaseName(serviceName_);
+  } catch (const sdbus::Error& error) {
+    TILL_LOG(3, "%@: could not release %@: %@", kSpeaker, serviceName_, error.what());
+  }
+  connection_->leaveEventLoop();
+}
+
 std::size_t ServiceListener::connectionCount() const {
   std::lock_guard lock(peersMutex_);
   return peers_.size();

@@ -39,6 +39,9 @@ class ServiceListener {
   // Connects, exports the object, takes the name and starts delivering
   // requests on the bus thread. Throws sdbus::Error when the bus refuses.
   void resume();
+  // Gives up the name and stops reading the bus: no request is taken after
+  // it. Replies to requests already taken are still sent.
+  void stopServing();
 
   [[nodiscard]] std::size_t connectionCount() const;
 

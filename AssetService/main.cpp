@@ -1,20 +1,27 @@
 // larderd: the per-user store service.
+#include <atomic>
+#include <chrono>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <memory>
 #include <string>
+#include <thread>
 
 #include "AssetService/AssetServiceDelegate.h"
 #include "AssetService/DialogAgentRegistry.h"
 #include "AssetService/ServiceListener.h"
+#include "AssetService/StopSignals.h"
 #include "AssetService/StoreRuntimeInterface.h"
 #include "notifications/UserNotificationCenterDelegate.h"
 #include "platform/Confinement.h"
+#include "platform/DispatchSemaphore.h"
 #include "platform/RunLoop.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/TillLogManager.h"
 #include "store-runtime/VendRuntime.h"
+#include "update-queue/UpdateQueue.h"
 
 namespace {
 
@@ -22,8 +29,38 @@ constexpr const char* kProfileName = "com.orvane.larderd";
 constexpr const char* kServiceName = "com.orvane.larderd";
 constexpr const char* kDaemonServiceName = "com.orvane.larderd.daemon";
 
+// How long the writes queued before a stop may take to reach the disk.
+constexpr std::chrono::seconds kStopWriteBound{2};
+
 bool isDaemonMode(int argc, const char** argv) {
   return argc == 2 && std::strcmp(argv[1], "daemon") == 0;
+}
+
+// Waits, at most `kStopWriteBound`, for what the map and the update queues
+// have queued for the disk.
+bool finishPendingWrites() {
+  auto finished = std::make_shared<larder::DispatchSemaphore>();
+  std::thread([finished] {
+    larder::SoftwareMap::sharedInstance().finishPendingWrites();
+    larder::UpdateQueue::finishPendingWritesOfAllQueues();
+    finished->signal();
+  }).detach();
+  return finished->waitFor(kStopWriteBound);
+}
+
+// No static destructor runs: they would wait for requests that may wait
+// for a person without a time limit, and everything worth keeping is on
+// disk by now.
+[[noreturn]] void stopOrderly(larder::ServiceListener& listener, int signal) {
+  TILL_LOG(2, "%@: %@ received, stopping", "larderd", strsignal(signal));
+  listener.stopServing();
+  if (!finishPendingWrites()) {
+    TILL_LOG(1, "%@: queued writes did not finish within %@ s; stopping without them", "larderd",
+             kStopWriteBound.count());
+  }
+  TILL_LOG(2, "%@: stopped", "larderd");
+  std::fflush(stderr);
+  std::_Exit(EXIT_SUCCESS);
 }
 
 }  // namespace
@@ -35,6 +72,7 @@ int main(int argc, const char** argv) {
     std::fprintf(stderr, "confinement: %s\n", confinementError.c_str());
     return -1;
   }
+  StopSignals::block();
   const bool daemonMode = isDaemonMode(argc, argv);
   TillLogManager::sharedManager().logLevel(3, "int main(int, const char **)", __FILE__, __LINE__,
                                            "%s %@", "int main(int, const char **)",
@@ -56,7 +94,13 @@ int main(int argc, const char** argv) {
     TILL_LOG(1, "%@: cannot serve on the bus: %@", "larderd", error.what());
     return EXIT_FAILURE;
   }
+  // The stop runs on the main thread once its run loop has let go.
+  static std::atomic<int> stopSignal{0};
+  StopSignals::watch([](int signal) {
+    stopSignal.store(signal);
+    RunLoop::main().stop();
+  });
   TILL_LOG(3, "starting runloop");
   RunLoop::main().run();
-  return EXIT_FAILURE;
+  stopOrderly(listener, stopSignal.load());
 }

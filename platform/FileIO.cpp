@@ -6,10 +6,14 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <charconv>
+#include <csignal>
 #include <cstring>
 #include <filesystem>
 #include <random>
+#include <string_view>
 #include <utility>
 
 namespace larder {
@@ -33,9 +37,35 @@ bool writeAll(int fd, std::span<const std::uint8_t> bytes) {
   return true;
 }
 
+constexpr std::string_view kTemporaryInfix = ".tmp-";
+
 std::string temporarySibling(const std::string& path) {
   thread_local std::mt19937_64 generator{std::random_device{}()};
-  return path + ".tmp-" + std::to_string(::getpid()) + "-" + std::to_string(generator());
+  return path + std::string(kTemporaryInfix) + std::to_string(::getpid()) + "-" +
+         std::to_string(generator());
+}
+
+// The process id in a temporary sibling's name ("NAME.tmp-PID-RANDOM"), or
+// nullopt when `name` is not one of `base`'s.
+std::optional<pid_t> writerOfTemporary(std::string_view name, std::string_view base) {
+  if (!name.starts_with(base)) return std::nullopt;
+  name.remove_prefix(base.size());
+  if (!name.starts_with(kTemporaryInfix)) return std::nullopt;
+  name.remove_prefix(kTemporaryInfix.size());
+  const auto dash = name.find('-');
+  if (dash == std::string_view::npos || dash + 1 == name.size()) return std::nullopt;
+  const std::string_view random = name.substr(dash + 1);
+  if (!std::ranges::all_of(random, [](char c) { return c >= '0' && c <= '9'; })) {
+    return std::nullopt;
+  }
+  pid_t pid = 0;
+  const auto [end, code] = std::from_chars(name.data(), name.data() + dash, pid);
+  if (code != std::errc{} || end != name.data() + dash || pid <= 0) return std::nullopt;
+  return pid;
+}
+
+bool isStaleWriter(pid_t pid) {
+  return pid == ::getpid() || (::kill(pid, 0) != 0 && errno == ESRCH);
 }
 
 void syncParentDirectory(const std::string& path) {
@@ -121,6 +151,23 @@ bool FileIO::writeInPlace(const std::string& path, std::span<const std::uint8_t>
   if (!writeAll(file.get(), bytes)) return fail(error, "write " + path);
   if (::close(file.release()) != 0) return fail(error, "close " + path);
   return true;
+}
+
+std::size_t FileIO::removeStaleTemporaries(const std::string& path) {
+  const std::filesystem::path target(path);
+  const std::string base = target.filename().string();
+  std::error_code code;
+  std::filesystem::directory_iterator entries(
+      target.has_parent_path() ? target.parent_path() : std::filesystem::path("."), code);
+  std::size_t removed = 0;
+  for (; !code && entries != std::filesystem::directory_iterator(); entries.increment(code)) {
+    const std::string name = entries->path().filename().string();
+    const std::optional<pid_t> writer = writerOfTemporary(name, base);
+    if (!writer || !isStaleWriter(*writer)) continue;
+    std::error_code removal;
+    if (std::filesystem::remove(entries->path(), removal)) ++removed;
+  }
+  return removed;
 }
 
 bool FileIO::writeAtomically(const std::string& path, std::string_view text, std::string* error) {

@@ -33,6 +33,13 @@ class FileIO {
                            std::string* error = nullptr);
 
   static bool createDirectories(const std::string& path, std::string* error = nullptr);
+
+  // Removes the temporary siblings of `path` that `writeAtomically` left
+  // behind in a process that died mid-write: those of a process that no
+  // longer runs, and those bearing our own process id (called before this
+  // process writes `path`, so none of them can be in progress; a reused id
+  // is common in containers). Returns how many went.
+  static std::size_t removeStaleTemporaries(const std::string& path);
 };
 
 }  // namespace larder

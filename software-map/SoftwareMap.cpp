@@ -94,6 +94,11 @@ void SoftwareMap::waitUntilIdle() {
   }
 }
 
+void SoftwareMap::finishPendingWrites() {
+  dispatchQueue_->barrierSync([] {});
+  storeQueue_->sync([] {});
+}
+
 // MARK: load and store
 
 std::string SoftwareMap::persistedStoreURL() const {
@@ -131,6 +136,12 @@ void SoftwareMap::asyncInitializeAndLoadPersistedStore() {
 }
 
 std::optional<PlistValue> SoftwareMap::loadPersistedStore() {
+  // A write cut short by a crash leaves its temporary file behind; nothing
+  // else would ever remove it.
+  if (const std::size_t stale = FileIO::removeStaleTemporaries(persistedStoreURL()); stale > 0) {
+    TILL_LOG(2, "%@: Removed %@ stale temporary file(s) beside %@", kSpeaker, stale,
+             persistedStoreURL());
+  }
   std::optional<PlistData> data = FileIO::read(persistedStoreURL());
   if (!data || data->empty()) {
     TILL_LOG(2, "%@: Persisted SoftwareMap not found", kSpeaker);
@@ -195,8 +206,10 @@ void SoftwareMap::writePersistedStoreToDisk() {
         {{std::string(kAppsByPathKey), KeyedArchive::dictionary(std::move(records))}});
     PlistData data = KeyedArchive::archivedData(root);
     std::string error;
-    if (!data.empty() && !FileIO::writeAtomically(path, data, &error)) {
+    if (data.empty()) return;
+    if (!FileIO::writeAtomically(path, data, &error)) {
       TILL_LOG(1, "%@: Exception writing persisted SoftwareMap to %@ - %@", kSpeaker, path, error);
+      return;
     }
     TILL_LOG(2, "%@: Updated persisted SoftwareMap at %@", kSpeaker, path);
   });

@@ -121,6 +121,10 @@ class SoftwareMap {
 
   // Waits until every task enqueued on the map's queues so far has run.
   void waitUntilIdle();
+  // Waits until the changes made so far are on disk: the change under way
+  // ends, then the writes it queued. Unlike `waitUntilIdle` it does not wait
+  // for the observers.
+  void finishPendingWrites();
 
   // Makes both live queries behave as on an overflow of the kernel's event
   // queue, for tests of the recovery.

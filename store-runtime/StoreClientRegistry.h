@@ -4,6 +4,7 @@
 #include <memory>
 #include <mutex>
 #include <string>
+#include <vector>
 
 #include "store-runtime/VendStoreClient.h"
 
@@ -34,6 +35,18 @@ class StoreClientRegistry {
     std::shared_ptr<Object> object = make(*storeClient);
     objects_.emplace(storeClient->identifier(), object);
     return object;
+  }
+
+  // Calls `visit` with every object, outside the lock, so that it may use
+  // the registry.
+  template <typename Visitor>
+  void forEach(Visitor&& visit) const {
+    std::vector<std::shared_ptr<Object>> objects;
+    {
+      std::lock_guard lock(mutex_);
+      for (const auto& entry : objects_) objects.push_back(entry.second);
+    }
+    for (const auto& object : objects) visit(*object);
   }
 
   [[nodiscard]] std::size_t size() const {

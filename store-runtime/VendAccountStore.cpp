@@ -36,6 +36,7 @@ VendAccountStore::VendAccountStore(const VendRuntimeConfiguration& configuration
 }
 
 void VendAccountStore::load() {
+  FileIO::removeStaleTemporaries(path_);
   auto bytes = FileIO::read(path_, 1U << 20U);
   if (!bytes) return;
   auto parsed = PropertyListSerialization::read(*bytes);

@@ -109,6 +109,11 @@ std::shared_ptr<UpdateQueue> UpdateQueue::updateQueueForStoreClient(
   });
 }
 
+void UpdateQueue::finishPendingWritesOfAllQueues() {
+  // Every change, and the write that follows it, is a barrier.
+  registry().forEach([](UpdateQueue& queue) { queue.dispatchQueue_->barrierSync([] {}); });
+}
+
 // --- Cache ---
 
 std::optional<std::string> UpdateQueue::cachePath() {

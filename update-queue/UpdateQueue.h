@@ -48,6 +48,9 @@ class UpdateQueue : public std::enable_shared_from_this<UpdateQueue> {
   // software map; nullptr for a client without identifier. Until the
   // update controller owns the queues, this is their registry.
   static std::shared_ptr<UpdateQueue> updateQueueForStoreClient(const VendStoreClient* storeClient);
+  // Waits until the change under way on every queue of the registry, and
+  // the cache write it makes, has ended.
+  static void finishPendingWritesOfAllQueues();
 
   // Starts a check unless one is in flight; the handler, if any, gets the
   // result of the check in flight. Returns at once.

@@ -4,6 +4,8 @@
 
 #include <sdbus-c++/Error.h>
 #include <sdbus-c++/IProxy.h>
+#include <csignal>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <mutex>
@@ -137,6 +139,34 @@ TEST_F(ServiceTest, RecoveryModeAnswersFromThePersistedStoreAndNeverChangesIt) {
       1u);
   EXPECT_TRUE(service->logLines("Software map rebuild took").empty());
   EXPECT_EQ(FileIO::read(platform.persistedStorePath()), before);
+}
+
+// systemd and the end of a session stop the service with SIGTERM, a
+// terminal with SIGINT: the change the map has just taken reaches the disk
+// before the service exits 0. The fillers make the write take a while.
+TEST_F(ServiceTest, AStopSignalFinishesTheQueuedWritesAndExitsZero) {
+  for (int index = 0; index < 400; ++index) {
+    const std::string name = "Filler" + std::to_string(index);
+    installStoreApp(applications(), name, "com.example.filler" + std::to_string(index), "1.0",
+                    static_cast<std::uint64_t>(20000 + index));
+  }
+  for (const int signal : {SIGTERM, SIGINT}) {
+    SCOPED_TRACE(strsignal(signal));
+    auto service = startService();
+    ASSERT_TRUE(service->waitForLog("Software map rebuild took")) << service->log();
+    const std::string identifier = "com.example.late" + std::to_string(signal);
+    const std::string late = installStoreApp(applications(), "Late" + std::to_string(signal),
+                                             identifier, "1.0", static_cast<std::uint64_t>(signal));
+    auto client = connectClient(bus);
+    ASSERT_TRUE(eventually([&] {
+      return !dictionaryAt(client->call("ProductForBundleIdentifier", {identifier}), 0).empty();
+    }));
+    EXPECT_EQ(service->process().stop(signal), 0) << service->log();
+    EXPECT_EQ(service->logLines("larderd: stopped").size(), 1u) << service->log();
+    const auto stored = FileIO::read(platform.persistedStorePath());
+    ASSERT_TRUE(stored);
+    EXPECT_NE(std::string(stored->begin(), stored->end()).find(late), std::string::npos);
+  }
 }
 
 TEST_F(ServiceTest, DamagedStoreFilesCostOneLineAndAnEmptyMap) {

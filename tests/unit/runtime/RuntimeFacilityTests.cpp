@@ -918,7 +918,8 @@ TEST(VendHTTPTransfer, RedirectsNeverDowngradeAndLeaveTheAccountAtItsOrigin) {
       {"https://store.example/a", "not a url", Redirect::kRefuse},
   };
   for (const auto& c : cases) {
-    EXPECT_EQ(VendHTTPTransfer::redirectPolicy(c.from, c.to), c.expected) << c.from << " -> " << c.to;
+    EXPECT_EQ(VendHTTPTransfer::redirectPolicy(c.from, c.to), c.expected)
+        << c.from << " -> " << c.to;
   }
 }
 

@@ -1,6 +1,8 @@
 // The software map's persisted store: what a discovery writes, what a later
 // process reads back, and how damaged files are survived.
 #include <gtest/gtest.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <filesystem>
 #include <random>
@@ -70,16 +72,17 @@ class SoftwareMapStoreTest : public ServiceTest {
 };
 
 TEST_F(SoftwareMapStoreTest, LaterMapAnswersFromWhatDiscoveryStored) {
-  Purchase numeric{"com.example.numeric", "2.4.1", PlistValue(5551), PlistValue(88),
-                   "opaque-numeric", 1300000000.0};
-  Purchase textual{"com.example.textual", "1.0", PlistValue("1234567890123"), PlistValue("42"),
-                   std::nullopt, std::nullopt};
-  std::string numericPath = makeBundle(rootApplications(), "Numeric", "com.example.numeric",
-                                       "2.4.1", numeric);
+  Purchase numeric{"com.example.numeric", "2.4.1",          PlistValue(5551),
+                   PlistValue(88),        "opaque-numeric", 1300000000.0};
+  Purchase textual{"com.example.textual", "1.0",        PlistValue("1234567890123"),
+                   PlistValue("42"),      std::nullopt, std::nullopt};
+  std::string numericPath =
+      makeBundle(rootApplications(), "Numeric", "com.example.numeric", "2.4.1", numeric);
   std::string textualPath =
       makeBundle(homeApplications(), "Textual", "com.example.textual", "1.0", textual);
-  std::string installerPath = makeBundle(rootApplications() + "/Utilities", "Setup",
-                                         "com.orvane.SetupHerald.Helper", "5.0", std::nullopt, "512");
+  std::string installerPath =
+      makeBundle(rootApplications() + "/Utilities", "Setup", "com.orvane.SetupHerald.Helper", "5.0",
+                 std::nullopt, "512");
 
   std::vector<LedgerSoftwareProductFields> discovered;
   {
@@ -166,8 +169,8 @@ TEST_F(SoftwareMapStoreTest, DamagedStoresGiveAnEmptyMap) {
                          {{"appsByPath", KeyedArchive::dictionary(std::move(byPath))}})),
                      "evil-class", kNoDictionaryLine, 1);
 
-  expectEmptyMapFrom(KeyedArchive::archivedData(KeyedArchive::array(
-                         {LedgerSoftwareProduct(record(0)).encodeWithCoder()})),
+  expectEmptyMapFrom(KeyedArchive::archivedData(
+                         KeyedArchive::array({LedgerSoftwareProduct(record(0)).encodeWithCoder()})),
                      "array-root", kNoDictionaryLine, 1);
   expectEmptyMapFrom(KeyedArchive::archivedData(PlistArray{"plain"}), "plain-array-root",
                      kNoDictionaryLine, 1);
@@ -246,9 +249,9 @@ TEST_F(SoftwareMapStoreTest, SmallStoreIsDescribedInTheLogLineLargeOneInASideFil
     LogCapture log;
     SoftwareMap map(options(storePath("six"), false));
     map.waitUntilIdle();
-    EXPECT_EQ(log.countExactly("SoftwareMap: After loading persisted store, SoftwareMap has 6 items",
-                               2),
-              1U)
+    EXPECT_EQ(
+        log.countExactly("SoftwareMap: After loading persisted store, SoftwareMap has 6 items", 2),
+        1U)
         << log.dump();
     EXPECT_EQ(log.countContaining("After loading persisted store, SoftwareMap is"), 0U);
     std::optional<PlistData> bytes = FileIO::read(sideFile);
@@ -257,10 +260,47 @@ TEST_F(SoftwareMapStoreTest, SmallStoreIsDescribedInTheLogLineLargeOneInASideFil
     ASSERT_TRUE(side && side->dictionary());
     ASSERT_EQ(side->dictionary()->size(), 6U);
     for (const auto& fields : records(6)) {
-      EXPECT_EQ((*side)[fields.bundlePath], PlistValue(LedgerSoftwareProduct(fields).toDictionary()))
+      EXPECT_EQ((*side)[fields.bundlePath],
+                PlistValue(LedgerSoftwareProduct(fields).toDictionary()))
           << fields.bundlePath;
     }
   }
+}
+
+// A process killed mid-write leaves its temporary file; the next start
+// removes those of dead writers (and of its own id, reused across restarts)
+// and nothing else. A write that fails says so and only so.
+TEST_F(SoftwareMapStoreTest, StartRemovesStaleTemporariesAndAFailedWriteIsNotReportedAsDone) {
+  const pid_t child = ::fork();
+  if (child == 0) ::_exit(0);
+  ASSERT_GT(child, 0);
+  ::waitpid(child, nullptr, 0);
+  const std::string store = storePath();
+  const std::string dead = store + ".tmp-" + std::to_string(child) + "-4242";
+  const std::string ours = store + ".tmp-" + std::to_string(::getpid()) + "-7";
+  const std::string living = store + ".tmp-1-9";
+  const std::string unrelated = store + ".tmp-notes";
+  for (const auto& path : {dead, ours, living, unrelated}) writeBytes(path, PlistData{'x'});
+  {
+    SoftwareMap map(options(store, false));
+    map.waitUntilIdle();
+  }
+  EXPECT_FALSE(std::filesystem::exists(dead));
+  EXPECT_FALSE(std::filesystem::exists(ours));
+  EXPECT_TRUE(std::filesystem::exists(living));
+  EXPECT_TRUE(std::filesystem::exists(unrelated));
+
+  makeStoreBundle(rootApplications(), "Fresh", "com.example.fresh", "1.0", 31);
+  const std::string blocked = stateFolder() + "/not-a-folder";
+  writeBytes(blocked, PlistData{'x'});
+  LogCapture log;
+  {
+    SoftwareMap map(options(blocked + "/SoftwareMap", false));
+    map.reloadFromApplicationRegistry();
+    map.waitUntilIdle();
+  }
+  EXPECT_EQ(log.countContaining("Exception writing persisted SoftwareMap"), 1U) << log.dump();
+  EXPECT_EQ(log.countContaining("Updated persisted SoftwareMap"), 0U) << log.dump();
 }
 
 // The load is the first barrier of the map's queue: a lookup made at once
