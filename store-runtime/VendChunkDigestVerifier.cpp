@@ -1,9 +1,9 @@
 #include "store-runtime/VendChunkDigestVerifier.h"
 
-#include <openssl/evp.h>
-
 #include <algorithm>
 #include <cstring>
+
+#include "store-runtime/CryptoLibrary.h"
 
 namespace larder {
 
@@ -42,8 +42,8 @@ std::string toHex(const std::uint8_t* bytes, std::size_t length) {
 }
 
 const EVP_MD* digestForLength(std::size_t length) {
-  if (length == kSha256Length) return EVP_sha256();
-  if (length == kMd5Length) return EVP_md5();
+  if (length == kSha256Length) return CryptoLibrary::shared().sha256();
+  if (length == kMd5Length) return CryptoLibrary::shared().md5();
   return nullptr;
 }
 
@@ -51,11 +51,12 @@ const EVP_MD* digestForLength(std::size_t length) {
 
 struct VendChunkDigestVerifier::Hasher {
   struct ContextDeleter {
-    void operator()(EVP_MD_CTX* context) const { EVP_MD_CTX_free(context); }
+    void operator()(EVP_MD_CTX* context) const { CryptoLibrary::shared().contextFree(context); }
   };
-  explicit Hasher(const EVP_MD* algorithm) : algorithm(algorithm), context(EVP_MD_CTX_new()) {}
+  explicit Hasher(const EVP_MD* algorithm)
+      : algorithm(algorithm), context(CryptoLibrary::shared().contextNew()) {}
 
-  void start() { EVP_DigestInit_ex(context.get(), algorithm, nullptr); }
+  void start() { CryptoLibrary::shared().digestInit(context.get(), algorithm, nullptr); }
 
   const EVP_MD* algorithm;
   std::unique_ptr<EVP_MD_CTX, ContextDeleter> context;
@@ -120,7 +121,7 @@ void VendChunkDigestVerifier::completeChunk() {
   }
   std::uint8_t digest[EVP_MAX_MD_SIZE];
   unsigned int length = 0;
-  EVP_DigestFinal_ex(hasher_->context.get(), digest, &length);
+  CryptoLibrary::shared().digestFinal(hasher_->context.get(), digest, &length);
   const std::uint8_t* expected = expected_.data() + chunkIndex_ * digestLength_;
   if (length != digestLength_ || std::memcmp(digest, expected, digestLength_) != 0) {
     fail(Failure::kDigestMismatch,
@@ -143,7 +144,7 @@ bool VendChunkDigestVerifier::update(std::span<const std::uint8_t> bytes) {
   while (!bytes.empty()) {
     const std::size_t take =
         static_cast<std::size_t>(std::min<std::uint64_t>(bytes.size(), chunkSize_ - inChunk_));
-    EVP_DigestUpdate(hasher_->context.get(), bytes.data(), take);
+    CryptoLibrary::shared().digestUpdate(hasher_->context.get(), bytes.data(), take);
     received_ += take;
     inChunk_ += take;
     bytes = bytes.subspan(take);

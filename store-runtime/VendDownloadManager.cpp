@@ -1,7 +1,5 @@
 #include "store-runtime/VendDownloadManager.h"
 
-#include <openssl/evp.h>
-
 #include <algorithm>
 #include <cerrno>
 #include <cmath>
@@ -10,6 +8,7 @@
 
 #include "platform/DispatchQueue.h"
 #include "platform/Environment.h"
+#include "store-runtime/CryptoLibrary.h"
 #include "store-runtime/TillLogManager.h"
 #include "store-runtime/VendAssetFetcher.h"
 #include "store-runtime/VendDownloadError.h"
@@ -26,7 +25,8 @@ constexpr std::string_view kSpeaker = "VendDownloadManager";
 std::string hexPrefixOfSha256(std::string_view text, std::size_t bytes) {
   unsigned char digest[EVP_MAX_MD_SIZE];
   unsigned int length = 0;
-  EVP_Digest(text.data(), text.size(), digest, &length, EVP_sha256(), nullptr);
+  const CryptoLibrary& crypto = CryptoLibrary::shared();
+  crypto.digest(text.data(), text.size(), digest, &length, crypto.sha256(), nullptr);
   static constexpr char kDigits[] = "0123456789abcdef";
   std::string hex;
   for (std::size_t i = 0; i < std::min<std::size_t>(bytes, length); ++i) {

@@ -1,28 +1,31 @@
 #include "store-runtime/VendHTTPTransfer.h"
 
-#include <curl/curl.h>
-
 #include <algorithm>
 #include <cctype>
 #include <cmath>
 #include <memory>
 #include <mutex>
 
+#include "store-runtime/CurlLibrary.h"
 #include "store-runtime/VendRequestSigner.h"
 
 namespace larder {
 namespace {
 
-void initializeCurlOnce() {
-  static std::once_flag once;
-  std::call_once(once, [] { curl_global_init(CURL_GLOBAL_DEFAULT); });
+// The loaded library. Both entry points, `perform` and `redirectPolicy`,
+// make sure it loaded before anything below runs.
+const CurlLibrary& curl() {
+  return *CurlLibrary::shared(nullptr);
 }
 
 struct EasyDeleter {
-  void operator()(CURL* handle) const { curl_easy_cleanup(handle); }
+  void operator()(CURL* handle) const { curl().easyCleanup(handle); }
 };
 struct ListDeleter {
-  void operator()(curl_slist* list) const { curl_slist_free_all(list); }
+  void operator()(curl_slist* list) const { curl().slistFreeAll(list); }
+};
+struct URLDeleter {
+  void operator()(CURLU* url) const { curl().urlCleanup(url); }
 };
 
 // What the callbacks share while one transfer runs.
@@ -144,20 +147,20 @@ VendError transferError(long code, std::string description) {
 std::unique_ptr<curl_slist, ListDeleter> headerList(const VendURLRequest& request) {
   curl_slist* list = nullptr;
   // curl would otherwise send "Expect: 100-continue" and wait for it.
-  list = curl_slist_append(list, "Expect:");
+  list = curl().slistAppend(list, "Expect:");
   for (const auto& [name, value] : request.headers()) {
     std::string line = name;
     line += ": ";
     line += value;
-    list = curl_slist_append(list, line.c_str());
+    list = curl().slistAppend(list, line.c_str());
   }
   if (request.cachePolicy() == VendURLRequest::kReloadIgnoringLocalCacheData) {
-    list = curl_slist_append(list, "Cache-Control: no-cache");
+    list = curl().slistAppend(list, "Cache-Control: no-cache");
   }
   // A body is sent with the type its request names, or with none: curl
   // would call it a form.
   if (!request.valueForHeaderField("Content-Type")) {
-    list = curl_slist_append(list, "Content-Type:");
+    list = curl().slistAppend(list, "Content-Type:");
   }
   return std::unique_ptr<curl_slist, ListDeleter>(list);
 }
@@ -176,16 +179,16 @@ struct Origin {
 };
 
 std::optional<Origin> originOf(std::string_view url) {
-  std::unique_ptr<CURLU, decltype(&curl_url_cleanup)> parsed(curl_url(), curl_url_cleanup);
+  std::unique_ptr<CURLU, URLDeleter> parsed(curl().url());
   if (!parsed) return std::nullopt;
   const std::string text(url);
-  if (curl_url_set(parsed.get(), CURLUPART_URL, text.c_str(), 0) != CURLUE_OK) return std::nullopt;
+  if (curl().urlSet(parsed.get(), CURLUPART_URL, text.c_str(), 0) != CURLUE_OK) return std::nullopt;
   const auto part = [&](CURLUPart which, unsigned int flags) -> std::optional<std::string> {
     char* value = nullptr;
-    if (curl_url_get(parsed.get(), which, &value, flags) != CURLUE_OK || !value)
+    if (curl().urlGet(parsed.get(), which, &value, flags) != CURLUE_OK || !value)
       return std::nullopt;
     std::string copy(value);
-    curl_free(value);
+    curl().free(value);
     return copy;
   };
   auto scheme = part(CURLUPART_SCHEME, 0);
@@ -205,7 +208,7 @@ VendHTTPTransfer::Result performOnce(const VendURLRequest& request,
                                      std::string& redirectURL) {
   using Result = VendHTTPTransfer::Result;
   Result result;
-  std::unique_ptr<CURL, EasyDeleter> easy(curl_easy_init());
+  std::unique_ptr<CURL, EasyDeleter> easy(curl().easyInit());
   if (!easy) {
     result.error = transferError(CURLE_FAILED_INIT, "the HTTP transport could not start");
     return result;
@@ -215,47 +218,47 @@ VendHTTPTransfer::Result performOnce(const VendURLRequest& request,
   CURL* handle = easy.get();
   auto headers = headerList(request);
 
-  curl_easy_setopt(handle, CURLOPT_URL, request.url().c_str());
-  curl_easy_setopt(handle, CURLOPT_PROTOCOLS_STR, "http,https");
+  curl().easySetopt(handle, CURLOPT_URL, request.url().c_str());
+  curl().easySetopt(handle, CURLOPT_PROTOCOLS_STR, "http,https");
   // Redirects are followed by `perform`, which decides what goes along.
-  curl_easy_setopt(handle, CURLOPT_FOLLOWLOCATION, 0L);
-  curl_easy_setopt(handle, CURLOPT_NOSIGNAL, 1L);
-  curl_easy_setopt(handle, CURLOPT_ACCEPT_ENCODING, "");
-  curl_easy_setopt(handle, CURLOPT_HTTPHEADER, headers.get());
-  curl_easy_setopt(handle, CURLOPT_CONNECTTIMEOUT_MS,
-                   static_cast<long>(options.connectTimeout.count()));
-  curl_easy_setopt(handle, CURLOPT_LOW_SPEED_LIMIT, 1L);
-  curl_easy_setopt(handle, CURLOPT_LOW_SPEED_TIME, stallSeconds);
-  curl_easy_setopt(handle, CURLOPT_HEADERFUNCTION, receiveHeader);
-  curl_easy_setopt(handle, CURLOPT_HEADERDATA, &state);
-  curl_easy_setopt(handle, CURLOPT_WRITEFUNCTION, receiveBody);
-  curl_easy_setopt(handle, CURLOPT_WRITEDATA, &state);
-  curl_easy_setopt(handle, CURLOPT_XFERINFOFUNCTION, reportProgress);
-  curl_easy_setopt(handle, CURLOPT_XFERINFODATA, &state);
-  curl_easy_setopt(handle, CURLOPT_NOPROGRESS, 0L);
-  curl_easy_setopt(handle, CURLOPT_BUFFERSIZE, 512L * 1024L);
+  curl().easySetopt(handle, CURLOPT_FOLLOWLOCATION, 0L);
+  curl().easySetopt(handle, CURLOPT_NOSIGNAL, 1L);
+  curl().easySetopt(handle, CURLOPT_ACCEPT_ENCODING, "");
+  curl().easySetopt(handle, CURLOPT_HTTPHEADER, headers.get());
+  curl().easySetopt(handle, CURLOPT_CONNECTTIMEOUT_MS,
+                    static_cast<long>(options.connectTimeout.count()));
+  curl().easySetopt(handle, CURLOPT_LOW_SPEED_LIMIT, 1L);
+  curl().easySetopt(handle, CURLOPT_LOW_SPEED_TIME, stallSeconds);
+  curl().easySetopt(handle, CURLOPT_HEADERFUNCTION, receiveHeader);
+  curl().easySetopt(handle, CURLOPT_HEADERDATA, &state);
+  curl().easySetopt(handle, CURLOPT_WRITEFUNCTION, receiveBody);
+  curl().easySetopt(handle, CURLOPT_WRITEDATA, &state);
+  curl().easySetopt(handle, CURLOPT_XFERINFOFUNCTION, reportProgress);
+  curl().easySetopt(handle, CURLOPT_XFERINFODATA, &state);
+  curl().easySetopt(handle, CURLOPT_NOPROGRESS, 0L);
+  curl().easySetopt(handle, CURLOPT_BUFFERSIZE, 512L * 1024L);
   if (options.resumeFrom > 0) {
-    curl_easy_setopt(handle, CURLOPT_RESUME_FROM_LARGE,
-                     static_cast<curl_off_t>(options.resumeFrom));
+    curl().easySetopt(handle, CURLOPT_RESUME_FROM_LARGE,
+                      static_cast<curl_off_t>(options.resumeFrom));
   }
   if (request.method() == "POST") {
-    curl_easy_setopt(handle, CURLOPT_POST, 1L);
-    curl_easy_setopt(handle, CURLOPT_POSTFIELDSIZE_LARGE,
-                     static_cast<curl_off_t>(request.body().size()));
-    curl_easy_setopt(handle, CURLOPT_POSTFIELDS, request.body().data());
+    curl().easySetopt(handle, CURLOPT_POST, 1L);
+    curl().easySetopt(handle, CURLOPT_POSTFIELDSIZE_LARGE,
+                      static_cast<curl_off_t>(request.body().size()));
+    curl().easySetopt(handle, CURLOPT_POSTFIELDS, request.body().data());
   } else if (request.method() != "GET") {
-    curl_easy_setopt(handle, CURLOPT_CUSTOMREQUEST, request.method().c_str());
+    curl().easySetopt(handle, CURLOPT_CUSTOMREQUEST, request.method().c_str());
   }
 
-  const CURLcode code = curl_easy_perform(handle);
-  curl_easy_getinfo(handle, CURLINFO_RESPONSE_CODE, &result.response.statusCode);
+  const CURLcode code = curl().easyPerform(handle);
+  curl().easyGetinfo(handle, CURLINFO_RESPONSE_CODE, &result.response.statusCode);
   if (char* effective = nullptr;
-      curl_easy_getinfo(handle, CURLINFO_EFFECTIVE_URL, &effective) == CURLE_OK && effective) {
+      curl().easyGetinfo(handle, CURLINFO_EFFECTIVE_URL, &effective) == CURLE_OK && effective) {
     result.response.url = effective;
   }
   if (code == CURLE_OK && state.isRedirect()) {
     if (char* location = nullptr;
-        curl_easy_getinfo(handle, CURLINFO_REDIRECT_URL, &location) == CURLE_OK && location) {
+        curl().easyGetinfo(handle, CURLINFO_REDIRECT_URL, &location) == CURLE_OK && location) {
       redirectURL = location;
     }
   }
@@ -274,7 +277,7 @@ VendHTTPTransfer::Result performOnce(const VendURLRequest& request,
   } else if (state.tooLarge) {
     result.error = transferError(CURLE_FILESIZE_EXCEEDED, "the answer is larger than allowed");
   } else {
-    result.error = transferError(code, curl_easy_strerror(code));
+    result.error = transferError(code, curl().easyStrerror(code));
   }
   return result;
 }
@@ -283,6 +286,7 @@ VendHTTPTransfer::Result performOnce(const VendURLRequest& request,
 
 VendHTTPTransfer::Redirect VendHTTPTransfer::redirectPolicy(std::string_view fromURL,
                                                             std::string_view toURL) {
+  if (!CurlLibrary::shared(nullptr)) return Redirect::kRefuse;
   const auto from = originOf(fromURL);
   const auto to = originOf(toURL);
   if (!from || !to) return Redirect::kRefuse;
@@ -304,7 +308,11 @@ VendHTTPTransfer::Result VendHTTPTransfer::perform(const VendURLRequest& request
 
 VendHTTPTransfer::Result VendHTTPTransfer::perform(const VendURLRequest& request,
                                                    const Options& options) {
-  initializeCurlOnce();
+  if (std::string error; !CurlLibrary::shared(&error)) {
+    Result result;
+    result.error = transferError(CURLE_FAILED_INIT, "the HTTP transport could not start: " + error);
+    return result;
+  }
   const auto started = std::chrono::steady_clock::now();
   VendURLRequest current = request;
   for (int redirects = 0;; ++redirects) {

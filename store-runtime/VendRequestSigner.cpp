@@ -1,10 +1,8 @@
 #include "store-runtime/VendRequestSigner.h"
 
-#include <openssl/crypto.h>
-#include <openssl/evp.h>
-#include <openssl/hmac.h>
-
 #include <array>
+
+#include "store-runtime/CryptoLibrary.h"
 
 namespace larder {
 namespace {
@@ -31,8 +29,9 @@ PlistData message(std::string_view head, std::span<const std::uint8_t> body) {
 std::string VendRequestSigner::hmac(std::span<const std::uint8_t> text) const {
   std::array<std::uint8_t, EVP_MAX_MD_SIZE> digest{};
   unsigned int length = 0;
-  HMAC(EVP_sha256(), key_.data(), static_cast<int>(key_.size()), text.data(), text.size(),
-       digest.data(), &length);
+  const CryptoLibrary& crypto = CryptoLibrary::shared();
+  crypto.hmac(crypto.sha256(), key_.data(), static_cast<int>(key_.size()), text.data(), text.size(),
+              digest.data(), &length);
   return hexString({digest.data(), length});
 }
 
@@ -66,7 +65,8 @@ std::optional<PlistData> VendRequestSigner::verifiedBody(const VendURLResponse& 
 }
 
 bool VendRequestSigner::signaturesMatch(std::string_view a, std::string_view b) {
-  return a.size() == b.size() && CRYPTO_memcmp(a.data(), b.data(), a.size()) == 0;
+  return a.size() == b.size() &&
+         CryptoLibrary::shared().constantTimeCompare(a.data(), b.data(), a.size()) == 0;
 }
 
 std::string VendRequestSigner::pathAndQuery(std::string_view url) {
