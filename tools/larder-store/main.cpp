@@ -18,6 +18,7 @@
 #include "larder-store/StoreCatalogue.h"
 #include "larder-store/StoreFaults.h"
 #include "larder-store/StoreServer.h"
+#include "platform/StopSignals.h"
 
 namespace {
 
@@ -36,14 +37,6 @@ struct PackOptions {
   std::string bundle;
   std::string output;
 };
-
-sigset_t stopSignals() {
-  sigset_t signals;
-  sigemptyset(&signals);
-  sigaddset(&signals, SIGTERM);
-  sigaddset(&signals, SIGINT);
-  return signals;
-}
 
 std::string urlHost(const std::string& host) {
   return host.find(':') == std::string::npos ? host : "[" + host + "]";
@@ -67,8 +60,8 @@ int serve(const ServeOptions& options) {
   }
   // The stop signals are taken by one thread of their own, so that every
   // other thread (httplib's workers included) runs with them blocked.
-  const sigset_t signals = stopSignals();
-  pthread_sigmask(SIG_BLOCK, &signals, nullptr);
+  const sigset_t signals = StopSignals::set();
+  StopSignals::block();
   // A test that crashes must not leave its store running: the end of the
   // thread that started us stops us like SIGTERM does.
   if (options.exitWithParent) {

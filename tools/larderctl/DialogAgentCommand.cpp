@@ -16,6 +16,7 @@
 #include <sdbus-c++/Error.h>
 #include <nlohmann/json.hpp>
 
+#include "platform/StopSignals.h"
 #include "tools/larderctl/DialogAgent.h"
 #include "tools/larderctl/DialogPrompt.h"
 
@@ -25,16 +26,8 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-sigset_t terminationSignals() {
-  sigset_t signals;
-  sigemptyset(&signals);
-  sigaddset(&signals, SIGINT);
-  sigaddset(&signals, SIGTERM);
-  return signals;
-}
-
 int terminationSignalDescriptor() {
-  sigset_t signals = terminationSignals();
+  sigset_t signals = StopSignals::set();
   const int descriptor = ::signalfd(-1, &signals, SFD_CLOEXEC | SFD_NONBLOCK);
   if (descriptor < 0) throw std::runtime_error("cannot watch for signals");
   return descriptor;
@@ -316,8 +309,7 @@ class DialogAgentCommand::Session {
 };
 
 void DialogAgentCommand::blockTerminationSignals() {
-  sigset_t signals = terminationSignals();
-  pthread_sigmask(SIG_BLOCK, &signals, nullptr);
+  StopSignals::block();
 }
 
 DialogAgentCommand::DialogAgentCommand(ServiceClient& client, DialogAgentOptions options)

@@ -9,6 +9,7 @@
 #include "AssetService/DBusValueCodec.h"
 #include "AssetService/RequestTable.h"
 #include "AssetService/ServiceClient.h"
+#include "platform/StopSignals.h"
 #include "store-runtime/JsonConversion.h"
 #include "tools/larderctl/DialogAgentCommand.h"
 #include "tools/larderctl/DialogCommand.h"
@@ -93,11 +94,7 @@ int runProduct(const GlobalOptions& options, const std::string& bundleIdentifier
 }
 
 int runWatch(const GlobalOptions& options) {
-  sigset_t signals;
-  sigemptyset(&signals);
-  sigaddset(&signals, SIGINT);
-  sigaddset(&signals, SIGTERM);
-  pthread_sigmask(SIG_BLOCK, &signals, nullptr);
+  StopSignals::block();
 
   ServiceClient client = connect(options);
   ProductPrinter printer(options.json);
@@ -109,6 +106,7 @@ int runWatch(const GlobalOptions& options) {
       *client.call("AddSoftwareMapObserver", {std::string(kObserverPath)}).at(0).string();
   if (!options.json)
     std::cerr << "larderctl: watching the software map (token " << token << ")" << std::endl;
+  const sigset_t signals = StopSignals::set();
   int received = 0;
   sigwait(&signals, &received);
   client.call("RemoveSoftwareMapObserver", {token});

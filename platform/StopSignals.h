@@ -1,14 +1,18 @@
 #pragma once
 
+#include <csignal>
 #include <functional>
 
 namespace larder {
 
-// SIGTERM (systemd, the end of a session) and SIGINT (a terminal) ask the
-// service to stop. Both are taken by a thread of their own with sigwait, so
-// that the stop runs as ordinary code and not inside a signal handler.
+// SIGTERM (systemd, the end of a session) and SIGINT (a terminal) ask a
+// program to stop. They are taken by one thread (sigwait) or a descriptor
+// (signalfd), so that the stop runs as ordinary code and not inside a
+// signal handler.
 class StopSignals {
  public:
+  // SIGTERM and SIGINT.
+  static sigset_t set();
   // Blocks both in the calling thread and so in every thread it starts
   // afterwards; call before any thread starts, or one of them may take the
   // signal with its default action and end the process on the spot.
