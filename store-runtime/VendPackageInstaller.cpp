@@ -1,7 +1,5 @@
 #include "store-runtime/VendPackageInstaller.h"
 
-#include <archive.h>
-#include <archive_entry.h>
 #include <fcntl.h>
 #include <stdio.h>
 #include <sys/stat.h>
@@ -17,6 +15,7 @@
 #include "platform/Bundle.h"
 #include "platform/Environment.h"
 #include "platform/FileDescriptor.h"
+#include "store-runtime/ArchiveLibrary.h"
 #include "store-runtime/TillLogManager.h"
 #include "store-runtime/VendDownloadError.h"
 #include "store-runtime/VendPackageEntryPolicy.h"
@@ -37,11 +36,15 @@ constexpr std::size_t kReadBlockSize = 1u << 20u;
 constexpr int kExtractFlags =
     ARCHIVE_EXTRACT_SECURE_NODOTDOT | ARCHIVE_EXTRACT_SECURE_SYMLINKS | ARCHIVE_EXTRACT_TIME;
 
+const ArchiveLibrary& archiveLibrary() {
+  return ArchiveLibrary::shared();
+}
+
 struct ReadArchiveDeleter {
-  void operator()(archive* handle) const { archive_read_free(handle); }
+  void operator()(archive* handle) const { archiveLibrary().readFree(handle); }
 };
 struct WriteArchiveDeleter {
-  void operator()(archive* handle) const { archive_write_free(handle); }
+  void operator()(archive* handle) const { archiveLibrary().writeFree(handle); }
 };
 using ReadArchive = std::unique_ptr<archive, ReadArchiveDeleter>;
 using WriteArchive = std::unique_ptr<archive, WriteArchiveDeleter>;
@@ -60,14 +63,14 @@ VendError systemFailure(const std::string& what, const std::string& path, int er
 }
 
 std::string archiveText(archive* handle) {
-  const char* text = archive_error_string(handle);
+  const char* text = archiveLibrary().errorString(handle);
   return text ? text : "unknown archive error";
 }
 
 VendPackageEntryPolicy::Kind kindOf(archive_entry* entry) {
   using Kind = VendPackageEntryPolicy::Kind;
-  if (archive_entry_hardlink(entry)) return Kind::kHardLink;
-  switch (archive_entry_filetype(entry)) {
+  if (archiveLibrary().entryHardlink(entry)) return Kind::kHardLink;
+  switch (archiveLibrary().entryFiletype(entry)) {
     case AE_IFREG:
       return Kind::kFile;
     case AE_IFDIR:
@@ -81,21 +84,22 @@ VendPackageEntryPolicy::Kind kindOf(archive_entry* entry) {
 
 VendPackageEntryPolicy::Entry describe(archive_entry* entry) {
   VendPackageEntryPolicy::Entry described;
-  const char* pathname = archive_entry_pathname(entry);
+  const char* pathname = archiveLibrary().entryPathname(entry);
   described.pathname = pathname ? pathname : "";
   described.kind = kindOf(entry);
   const char* target = described.kind == VendPackageEntryPolicy::Kind::kHardLink
-                           ? archive_entry_hardlink(entry)
-                           : archive_entry_symlink(entry);
+                           ? archiveLibrary().entryHardlink(entry)
+                           : archiveLibrary().entrySymlink(entry);
   described.linkTarget = target ? target : "";
-  described.sparse = archive_entry_sparse_count(entry) > 0;
+  described.sparse = archiveLibrary().entrySparseCount(entry) > 0;
   return described;
 }
 
 ReadArchive openPackage(const std::string& packagePath, OptionalError& error) {
-  ReadArchive reader(archive_read_new());
-  archive_read_support_format_tar(reader.get());
-  if (archive_read_open_filename(reader.get(), packagePath.c_str(), kReadBlockSize) != ARCHIVE_OK) {
+  ReadArchive reader(archiveLibrary().readNew());
+  archiveLibrary().readSupportFormatTar(reader.get());
+  if (archiveLibrary().readOpenFilename(reader.get(), packagePath.c_str(), kReadBlockSize) !=
+      ARCHIVE_OK) {
     error =
         installFailure("Cannot open the package " + packagePath + ": " + archiveText(reader.get()));
     return nullptr;
@@ -114,7 +118,7 @@ OptionalError forEachEntry(
   if (!reader) return error;
   archive_entry* entry = nullptr;
   for (;;) {
-    const int status = archive_read_next_header(reader.get(), &entry);
+    const int status = archiveLibrary().readNextHeader(reader.get(), &entry);
     if (status == ARCHIVE_EOF) break;
     if (status < ARCHIVE_WARN) {
       return installFailure("The package " + packagePath +
@@ -145,20 +149,20 @@ OptionalError copyEntryData(archive* reader, archive* writer, const std::string&
   std::size_t size = 0;
   la_int64_t offset = 0;
   for (;;) {
-    const int status = archive_read_data_block(reader, &block, &size, &offset);
+    const int status = archiveLibrary().readDataBlock(reader, &block, &size, &offset);
     if (status == ARCHIVE_EOF) return std::nullopt;
     if (status < ARCHIVE_WARN) {
       return installFailure("The package " + packagePath + " is damaged: " + archiveText(reader));
     }
-    if (archive_write_data_block(writer, block, size, offset) < ARCHIVE_WARN) {
+    if (archiveLibrary().writeDataBlock(writer, block, size, offset) < ARCHIVE_WARN) {
       return installFailure("Cannot extract " + packagePath + ": " + archiveText(writer));
     }
   }
 }
 
 OptionalError extractPackage(const std::string& packagePath, const std::string& staging) {
-  WriteArchive writer(archive_write_disk_new());
-  archive_write_disk_set_options(writer.get(), kExtractFlags);
+  WriteArchive writer(archiveLibrary().writeDiskNew());
+  archiveLibrary().writeDiskSetOptions(writer.get(), kExtractFlags);
   VendPackageEntryPolicy policy;
   OptionalError error = forEachEntry(
       packagePath, policy,
@@ -166,27 +170,27 @@ OptionalError extractPackage(const std::string& packagePath, const std::string& 
           const VendPackageEntryPolicy::Decision& decision) -> OptionalError {
         if (decision.relativePath.empty())
           return std::nullopt;  // the bundle folder is the staging folder
-        archive_entry_set_pathname(entry, (staging + "/" + decision.relativePath).c_str());
+        archiveLibrary().entrySetPathname(entry, (staging + "/" + decision.relativePath).c_str());
         if (!decision.hardLinkRelativePath.empty()) {
-          archive_entry_set_hardlink(entry,
-                                     (staging + "/" + decision.hardLinkRelativePath).c_str());
+          archiveLibrary().entrySetHardlink(
+              entry, (staging + "/" + decision.hardLinkRelativePath).c_str());
         }
-        if (archive_write_header(writer.get(), entry) < ARCHIVE_WARN) {
+        if (archiveLibrary().writeHeader(writer.get(), entry) < ARCHIVE_WARN) {
           return installFailure("Cannot extract \"" + decision.relativePath + "\" of " +
                                 packagePath + ": " + archiveText(writer.get()));
         }
-        if (archive_entry_size(entry) > 0) {
+        if (archiveLibrary().entrySize(entry) > 0) {
           if (OptionalError failure = copyEntryData(reader, writer.get(), packagePath))
             return failure;
         }
-        if (archive_write_finish_entry(writer.get()) < ARCHIVE_WARN) {
+        if (archiveLibrary().writeFinishEntry(writer.get()) < ARCHIVE_WARN) {
           return installFailure("Cannot extract \"" + decision.relativePath + "\" of " +
                                 packagePath + ": " + archiveText(writer.get()));
         }
         return std::nullopt;
       });
   if (error) return error;
-  if (archive_write_close(writer.get()) != ARCHIVE_OK) {
+  if (archiveLibrary().writeClose(writer.get()) != ARCHIVE_OK) {
     return installFailure("Cannot finish extracting " + packagePath + ": " +
                           archiveText(writer.get()));
   }

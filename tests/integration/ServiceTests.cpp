@@ -169,6 +169,20 @@ TEST_F(ServiceTest, AStopSignalFinishesTheQueuedWritesAndExitsZero) {
   }
 }
 
+// The transport, the digests and the unpacker are opened on first use:
+// a service that has not spoken to a store maps none of them.
+TEST_F(ServiceTest, AnIdleServiceMapsNeitherTheTransportNorTheUnpacker) {
+  installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
+  auto service = startService();
+  ASSERT_TRUE(service->waitForLog("Software map rebuild took")) << service->log();
+  std::ifstream maps("/proc/" + std::to_string(service->process().pid()) + "/maps");
+  const std::string mapped((std::istreambuf_iterator<char>(maps)), std::istreambuf_iterator<char>());
+  ASSERT_NE(mapped.find("libc.so"), std::string::npos);
+  for (const char* library : {"libcurl.so", "libcrypto.so", "libarchive.so"}) {
+    EXPECT_EQ(mapped.find(library), std::string::npos) << library;
+  }
+}
+
 TEST_F(ServiceTest, DamagedStoreFilesCostOneLineAndAnEmptyMap) {
   installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
   {
