@@ -2,10 +2,10 @@
 
 #include <time.h>
 
-#include <condition_variable>
-#include <mutex>
 #include <optional>
 #include <thread>
+
+#include "platform/Mutex.h"
 
 namespace larder {
 
@@ -33,7 +33,7 @@ class SystemClock final : public BackgroundActivityClock {
 
   ~SystemClock() override {
     {
-      std::lock_guard lock(mutex_);
+      MutexLock lock(mutex_);
       stopping_ = true;
     }
     changed_.notify_all();
@@ -44,7 +44,7 @@ class SystemClock final : public BackgroundActivityClock {
 
   void scheduleWakeUp(TimePoint time, std::function<void()> wake) override {
     {
-      std::lock_guard lock(mutex_);
+      MutexLock lock(mutex_);
       request_ = Request{time, std::move(wake)};
       if (!thread_.joinable()) thread_ = std::thread([this] { run(); });
     }
@@ -52,10 +52,10 @@ class SystemClock final : public BackgroundActivityClock {
   }
 
   void cancelWakeUp() override {
-    std::unique_lock lock(mutex_);
+    MutexLock lock(mutex_);
     request_.reset();
     if (std::this_thread::get_id() == thread_.get_id()) return;
-    changed_.wait(lock, [this] { return !firing_; });
+    changed_.wait(lock, [this]() REQUIRES(mutex_) { return !firing_; });
   }
 
  private:
@@ -65,7 +65,7 @@ class SystemClock final : public BackgroundActivityClock {
   };
 
   void run() {
-    std::unique_lock lock(mutex_);
+    MutexLock lock(mutex_);
     while (!stopping_) {
       if (!request_) {
         changed_.wait(lock);
@@ -87,11 +87,13 @@ class SystemClock final : public BackgroundActivityClock {
     }
   }
 
-  std::mutex mutex_;
-  std::condition_variable changed_;
-  std::optional<Request> request_;
-  bool firing_ = false;
-  bool stopping_ = false;
+  Mutex mutex_;
+  ConditionVariable changed_;
+  std::optional<Request> request_ GUARDED_BY(mutex_);
+  bool firing_ GUARDED_BY(mutex_) = false;
+  bool stopping_ GUARDED_BY(mutex_) = false;
+  // Started under the lock; joined by the destructor, when no other
+  // thread uses the clock any more.
   std::thread thread_;
 };
 

@@ -2,8 +2,9 @@
 
 #include <algorithm>
 #include <map>
-#include <mutex>
 #include <utility>
+
+#include "platform/Mutex.h"
 
 namespace larder {
 
@@ -36,7 +37,7 @@ class BackgroundActivityScheduler::Core : public std::enable_shared_from_this<Co
   bool add(std::string name, BackgroundActivityCriteria criteria, Handler handler) {
     std::vector<Invocation> invocations;
     {
-      std::lock_guard lock(mutex_);
+      MutexLock lock(mutex_);
       if (shutDown_) return false;
       const TimePoint now = clock_.now();
       Entry entry{{name, criteria, BackgroundActivityState::Waiting, now + criteria.delay, 0},
@@ -51,7 +52,7 @@ class BackgroundActivityScheduler::Core : public std::enable_shared_from_this<Co
   }
 
   bool remove(std::string_view name) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     auto found = entries_.find(name);
     if (found == entries_.end()) return false;
     entries_.erase(found);
@@ -59,14 +60,14 @@ class BackgroundActivityScheduler::Core : public std::enable_shared_from_this<Co
   }
 
   std::optional<BackgroundActivity> snapshot(std::string_view name) const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     auto found = entries_.find(name);
     if (found == entries_.end()) return std::nullopt;
     return found->second.activity;
   }
 
   std::vector<std::string> names() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     std::vector<std::string> names;
     for (const auto& [name, entry] : entries_) names.push_back(name);
     return names;
@@ -75,7 +76,7 @@ class BackgroundActivityScheduler::Core : public std::enable_shared_from_this<Co
   void evaluate() {
     std::vector<Invocation> invocations;
     {
-      std::lock_guard lock(mutex_);
+      MutexLock lock(mutex_);
       if (shutDown_) return;
       evaluateLocked(clock_.now(), invocations);
     }
@@ -83,7 +84,7 @@ class BackgroundActivityScheduler::Core : public std::enable_shared_from_this<Co
   }
 
   void shutDown() {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     shutDown_ = true;
   }
 
@@ -103,13 +104,13 @@ class BackgroundActivityScheduler::Core : public std::enable_shared_from_this<Co
   };
 
   bool isShutDown() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return shutDown_;
   }
 
   // Starts what is due, defers what has waited past its grace, and asks the clock for the next
   // moment anything can happen.
-  void evaluateLocked(TimePoint now, std::vector<Invocation>& invocations) {
+  void evaluateLocked(TimePoint now, std::vector<Invocation>& invocations) REQUIRES(mutex_) {
     std::optional<bool> onMains;
     auto mainsPower = [&] {
       if (!onMains) onMains = power_->isOnMainsPower();
@@ -145,7 +146,7 @@ class BackgroundActivityScheduler::Core : public std::enable_shared_from_this<Co
 
   // A wake-up that finds nothing to do is harmless, so a stale one is left rather than
   // cancelled: cancelling waits for a wake-up in progress, which may be waiting for our mutex.
-  void scheduleNextWakeUpLocked(TimePoint now) {
+  void scheduleNextWakeUpLocked(TimePoint now) REQUIRES(mutex_) {
     std::optional<TimePoint> next;
     auto consider = [&](TimePoint time) {
       if (!next || time < *next) next = time;
@@ -171,7 +172,7 @@ class BackgroundActivityScheduler::Core : public std::enable_shared_from_this<Co
   void didFinishRun(const std::string& name, std::uint64_t generation) {
     std::vector<Invocation> invocations;
     {
-      std::lock_guard lock(mutex_);
+      MutexLock lock(mutex_);
       auto found = entries_.find(name);
       if (found == entries_.end() || found->second.generation != generation) return;
       Entry& entry = found->second;
@@ -210,10 +211,10 @@ class BackgroundActivityScheduler::Core : public std::enable_shared_from_this<Co
   const std::shared_ptr<DispatchQueue> handlerQueue_;
   const Duration powerCheckInterval_;
 
-  mutable std::mutex mutex_;
-  std::map<std::string, Entry, std::less<>> entries_;
-  std::uint64_t nextGeneration_ = 1;
-  bool shutDown_ = false;
+  mutable Mutex mutex_;
+  std::map<std::string, Entry, std::less<>> entries_ GUARDED_BY(mutex_);
+  std::uint64_t nextGeneration_ GUARDED_BY(mutex_) = 1;
+  bool shutDown_ GUARDED_BY(mutex_) = false;
 };
 
 BackgroundActivityScheduler::BackgroundActivityScheduler()

@@ -30,8 +30,8 @@ std::optional<std::chrono::steady_clock::time_point> deadlineAfter(
     std::chrono::milliseconds timeout) {
   using Clock = std::chrono::steady_clock;
   const Clock::time_point now = Clock::now();
-  const auto room = std::chrono::duration_cast<std::chrono::milliseconds>(
-      Clock::time_point::max() - now);
+  const auto room =
+      std::chrono::duration_cast<std::chrono::milliseconds>(Clock::time_point::max() - now);
   if (timeout >= room) {
     return std::nullopt;
   }
@@ -41,7 +41,7 @@ std::optional<std::chrono::steady_clock::time_point> deadlineAfter(
 }  // namespace
 
 struct DispatchQueueCore::SyncTurn {
-  std::condition_variable came;
+  ConditionVariable came;
   bool admitted = false;
 };
 
@@ -72,7 +72,7 @@ DispatchQueueCore::DispatchQueueCore(CreationKey, Settings settings)
 DispatchQueueCore::~DispatchQueueCore() = default;
 
 void DispatchQueueCore::submit(std::function<void()> work, Admission admission) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   enqueueLocked(WorkItem{std::move(work), nullptr, admission});
   admitLocked();
 }
@@ -86,31 +86,31 @@ void DispatchQueueCore::runSync(const std::function<void()>& work, Admission adm
 
 void DispatchQueueCore::waitForTurn(Admission admission) {
   SyncTurn turn;
-  std::unique_lock lock(mutex_);
+  MutexLock lock(mutex_);
   enqueueLocked(WorkItem{{}, &turn, admission});
   admitLocked();
   turn.came.wait(lock, [&turn] { return turn.admitted; });
 }
 
 void DispatchQueueCore::finishSync(Admission admission) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   finishLocked(admission, /*wasAsync=*/false);
   admitLocked();
 }
 
 void DispatchQueueCore::readerLeftWhileBarrierPending() {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   admitLocked();
 }
 
 void DispatchQueueCore::abandon() {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   abandoned_ = true;
   workReady_.notify_all();
 }
 
 std::size_t DispatchQueueCore::workerCount() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return workers_;
 }
 
@@ -226,7 +226,7 @@ void DispatchQueueCore::spawnWorkerLocked() {
 
 void DispatchQueueCore::workerLoop() {
   nameWorkerThread();
-  std::unique_lock lock(mutex_);
+  MutexLock lock(mutex_);
   while (waitForReadyWorkLocked(lock)) {
     WorkItem item = std::move(ready_.front());
     ready_.pop_front();
@@ -243,7 +243,7 @@ void DispatchQueueCore::workerLoop() {
   --workers_;
 }
 
-bool DispatchQueueCore::waitForReadyWorkLocked(std::unique_lock<std::mutex>& lock) {
+bool DispatchQueueCore::waitForReadyWorkLocked(MutexLock& lock) {
   const auto idleDeadline = deadlineAfter(idleTimeout_);
   while (ready_.empty()) {
     if (abandoned_) {

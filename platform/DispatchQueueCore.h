@@ -1,13 +1,13 @@
 #pragma once
 
 #include <chrono>
-#include <condition_variable>
 #include <cstddef>
 #include <deque>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <string>
+
+#include "platform/Mutex.h"
 
 namespace larder {
 
@@ -80,16 +80,16 @@ class DispatchQueueCore : public std::enable_shared_from_this<DispatchQueueCore>
   void waitForTurn(Admission admission);
   void finishSync(Admission admission);
 
-  void enqueueLocked(WorkItem item);
-  void admitLocked();
-  [[nodiscard]] bool exclusiveMayStartLocked() const;
-  void startLocked(WorkItem item);
-  void finishLocked(Admission admission, bool wasAsync);
+  void enqueueLocked(WorkItem item) REQUIRES(mutex_);
+  void admitLocked() REQUIRES(mutex_);
+  [[nodiscard]] bool exclusiveMayStartLocked() const REQUIRES(mutex_);
+  void startLocked(WorkItem item) REQUIRES(mutex_);
+  void finishLocked(Admission admission, bool wasAsync) REQUIRES(mutex_);
 
-  void ensureWorkersLocked(std::size_t newlyReady);
-  void spawnWorkerLocked();
-  void workerLoop();
-  [[nodiscard]] bool waitForReadyWorkLocked(std::unique_lock<std::mutex>& lock);
+  void ensureWorkersLocked(std::size_t newlyReady) REQUIRES(mutex_);
+  void spawnWorkerLocked() REQUIRES(mutex_);
+  void workerLoop() EXCLUDES(mutex_);
+  [[nodiscard]] bool waitForReadyWorkLocked(MutexLock& lock) REQUIRES(mutex_);
   void runAsyncItem(const std::function<void()>& work) noexcept;
   void nameWorkerThread() const noexcept;
 
@@ -98,18 +98,19 @@ class DispatchQueueCore : public std::enable_shared_from_this<DispatchQueueCore>
   const std::chrono::milliseconds idleTimeout_;
   const std::unique_ptr<ReaderGate> readerGate_;
 
-  mutable std::mutex mutex_;
-  std::condition_variable workReady_;
-  std::deque<WorkItem> pending_;  // not yet admitted, in submission order
-  std::deque<WorkItem> ready_;    // admitted asynchronous items waiting for a worker
-  std::size_t sharedTurnsPending_ = 0;  // synchronous shared items in pending_
-  std::size_t sharedRunning_ = 0;
-  bool exclusiveRunning_ = false;
-  std::size_t exclusiveOutstanding_ = 0;  // queued or running
-  std::size_t asyncAdmitted_ = 0;         // in ready_ or running on a worker
-  std::size_t workers_ = 0;
-  std::size_t busyWorkers_ = 0;
-  bool abandoned_ = false;
+  mutable Mutex mutex_;
+  ConditionVariable workReady_;
+  std::deque<WorkItem> pending_ GUARDED_BY(mutex_);  // not yet admitted, in submission order
+  std::deque<WorkItem> ready_
+      GUARDED_BY(mutex_);  // admitted asynchronous items waiting for a worker
+  std::size_t sharedTurnsPending_ GUARDED_BY(mutex_) = 0;  // synchronous shared items in pending_
+  std::size_t sharedRunning_ GUARDED_BY(mutex_) = 0;
+  bool exclusiveRunning_ GUARDED_BY(mutex_) = false;
+  std::size_t exclusiveOutstanding_ GUARDED_BY(mutex_) = 0;  // queued or running
+  std::size_t asyncAdmitted_ GUARDED_BY(mutex_) = 0;         // in ready_ or running on a worker
+  std::size_t workers_ GUARDED_BY(mutex_) = 0;
+  std::size_t busyWorkers_ GUARDED_BY(mutex_) = 0;
+  bool abandoned_ GUARDED_BY(mutex_) = false;
 };
 
 }  // namespace larder

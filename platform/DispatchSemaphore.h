@@ -1,9 +1,9 @@
 #pragma once
 
 #include <chrono>
-#include <condition_variable>
-#include <mutex>
 #include <optional>
+
+#include "platform/Mutex.h"
 
 namespace larder {
 
@@ -20,9 +20,9 @@ class DispatchSemaphore {
   bool waitFor(std::chrono::steady_clock::duration timeout);
 
  private:
-  std::mutex mutex_;
-  std::condition_variable condition_;
-  long count_;
+  Mutex mutex_;
+  ConditionVariable condition_;
+  long count_ GUARDED_BY(mutex_);
 };
 
 }  // namespace larder

@@ -73,8 +73,7 @@ class ConditionVariable {
     condition_.wait(lock.lock_, std::move(predicate));
   }
   template <typename Rep, typename Period, typename Predicate>
-  bool wait_for(MutexLock& lock, std::chrono::duration<Rep, Period> timeout,
-                Predicate predicate) {
+  bool wait_for(MutexLock& lock, std::chrono::duration<Rep, Period> timeout, Predicate predicate) {
     return condition_.wait_for(lock.lock_, timeout, std::move(predicate));
   }
   template <typename Clock, typename Duration, typename Predicate>
@@ -85,6 +84,10 @@ class ConditionVariable {
   template <typename Rep, typename Period>
   std::cv_status wait_for(MutexLock& lock, std::chrono::duration<Rep, Period> timeout) {
     return condition_.wait_for(lock.lock_, timeout);
+  }
+  template <typename Clock, typename Duration>
+  std::cv_status wait_until(MutexLock& lock, std::chrono::time_point<Clock, Duration> deadline) {
+    return condition_.wait_until(lock.lock_, deadline);
   }
 
  private:

@@ -1,16 +1,16 @@
 #include "platform/RunLoop.h"
 
 #include <algorithm>
-#include <condition_variable>
 #include <cstdio>
 #include <deque>
 #include <exception>
 #include <map>
-#include <mutex>
 #include <optional>
 #include <set>
 #include <string>
 #include <utility>
+
+#include "platform/Mutex.h"
 
 namespace larder {
 
@@ -67,20 +67,21 @@ struct RunLoop::State {
   // Ordered by due time, then by id: ids grow in creation order.
   using ScheduleEntry = std::pair<Clock::time_point, TimerId>;
 
-  void runPostedLocked(std::unique_lock<std::mutex>& lock);
-  void fireDueTimersLocked(std::unique_lock<std::mutex>& lock);
-  void waitForWorkLocked(std::unique_lock<std::mutex>& lock);
-  [[nodiscard]] std::optional<Clock::time_point> nextWakeUpLocked() const;
+  void runPostedLocked() REQUIRES(mutex);
+  void fireDueTimersLocked() REQUIRES(mutex);
+  void waitForWorkLocked(MutexLock& lock) REQUIRES(mutex);
+  [[nodiscard]] std::optional<Clock::time_point> nextWakeUpLocked() const REQUIRES(mutex);
   std::shared_ptr<const std::function<void()>> takeTimerForFiringLocked(TimerId id,
-                                                                        Clock::time_point now);
+                                                                        Clock::time_point now)
+      REQUIRES(mutex);
 
-  std::mutex mutex;
-  std::condition_variable wakeUp;
-  std::deque<std::function<void()>> posted;
-  std::map<TimerId, Timer> timers;
-  std::set<ScheduleEntry> schedule;
-  TimerId nextTimerId = 1;
-  bool stopRequested = false;
+  Mutex mutex;
+  ConditionVariable wakeUp;
+  std::deque<std::function<void()>> posted GUARDED_BY(mutex);
+  std::map<TimerId, Timer> timers GUARDED_BY(mutex);
+  std::set<ScheduleEntry> schedule GUARDED_BY(mutex);
+  TimerId nextTimerId GUARDED_BY(mutex) = 1;
+  bool stopRequested GUARDED_BY(mutex) = false;
 };
 
 RunLoop& RunLoop::main() {
@@ -93,7 +94,7 @@ RunLoop::RunLoop() : state_(std::make_unique<State>()) {}
 RunLoop::~RunLoop() = default;
 
 void RunLoop::perform(std::function<void()> work) {
-  std::lock_guard lock(state_->mutex);
+  MutexLock lock(state_->mutex);
   state_->posted.push_back(std::move(work));
   state_->wakeUp.notify_one();
 }
@@ -103,7 +104,7 @@ RunLoop::TimerId RunLoop::addTimer(Clock::duration interval, bool repeats,
   const Clock::duration shortest = repeats ? Clock::duration(1) : Clock::duration::zero();
   interval = std::max(interval, shortest);
   tolerance = std::max(tolerance, Clock::duration::zero());
-  std::lock_guard lock(state_->mutex);
+  MutexLock lock(state_->mutex);
   const TimerId id = state_->nextTimerId++;
   const Clock::time_point due = saturatingAdd(Clock::now(), interval);
   state_->timers.emplace(
@@ -115,7 +116,7 @@ RunLoop::TimerId RunLoop::addTimer(Clock::duration interval, bool repeats,
 }
 
 void RunLoop::cancelTimer(TimerId id) {
-  std::lock_guard lock(state_->mutex);
+  MutexLock lock(state_->mutex);
   const auto timer = state_->timers.find(id);
   if (timer == state_->timers.end()) {
     return;
@@ -125,43 +126,43 @@ void RunLoop::cancelTimer(TimerId id) {
 }
 
 void RunLoop::run() {
-  std::unique_lock lock(state_->mutex);
+  MutexLock lock(state_->mutex);
   while (!state_->stopRequested) {
-    state_->runPostedLocked(lock);
-    state_->fireDueTimersLocked(lock);
+    state_->runPostedLocked();
+    state_->fireDueTimersLocked();
     state_->waitForWorkLocked(lock);
   }
   state_->stopRequested = false;
 }
 
 void RunLoop::stop() {
-  std::lock_guard lock(state_->mutex);
+  MutexLock lock(state_->mutex);
   state_->stopRequested = true;
   state_->wakeUp.notify_all();
 }
 
 // Runs what was posted before this pass began; work posted meanwhile waits for the next pass, so
 // that work which keeps posting more cannot starve the timers.
-void RunLoop::State::runPostedLocked(std::unique_lock<std::mutex>& lock) {
+void RunLoop::State::runPostedLocked() {
   for (std::size_t budget = posted.size(); budget > 0 && !stopRequested; --budget) {
     std::function<void()> work = std::move(posted.front());
     posted.pop_front();
-    lock.unlock();
+    mutex.unlock();
     invokeReportingExceptions(work);
     work = nullptr;  // captures are released outside the lock too
-    lock.lock();
+    mutex.lock();
   }
 }
 
-void RunLoop::State::fireDueTimersLocked(std::unique_lock<std::mutex>& lock) {
+void RunLoop::State::fireDueTimersLocked() {
   const Clock::time_point now = Clock::now();
   while (!stopRequested && !schedule.empty() && schedule.begin()->first <= now) {
     const TimerId id = schedule.begin()->second;
     std::shared_ptr<const std::function<void()>> work = takeTimerForFiringLocked(id, now);
-    lock.unlock();
+    mutex.unlock();
     invokeReportingExceptions(*work);
     work.reset();
-    lock.lock();
+    mutex.lock();
   }
 }
 
@@ -181,7 +182,7 @@ std::shared_ptr<const std::function<void()>> RunLoop::State::takeTimerForFiringL
   return work;
 }
 
-void RunLoop::State::waitForWorkLocked(std::unique_lock<std::mutex>& lock) {
+void RunLoop::State::waitForWorkLocked(MutexLock& lock) {
   if (stopRequested || !posted.empty()) {
     return;
   }
