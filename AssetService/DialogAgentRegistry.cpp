@@ -79,7 +79,7 @@ DialogAgentRegistry::~DialogAgentRegistry() = default;
 
 void DialogAgentRegistry::exportOn(sdbus::IObject& object, sdbus::IConnection& connection) {
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     connection_ = &connection;
   }
   exportBusMethods<DialogAgentRegistry>(
@@ -93,7 +93,7 @@ void DialogAgentRegistry::exportOn(sdbus::IObject& object, sdbus::IConnection& c
 void DialogAgentRegistry::registerAgent(sdbus::MethodCall call) {
   Agent agent{call.getSender(), *DBusValueCodec::read(call, "o").string(), 0};
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     std::erase_if(agents_, [&](const Agent& known) {
       return known.peer == agent.peer && known.objectPath == agent.objectPath;
     });
@@ -109,7 +109,7 @@ void DialogAgentRegistry::unregisterAgent(sdbus::MethodCall call) {
   const std::string objectPath = *DBusValueCodec::read(call, "o").string();
   std::size_t removed = 0;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     removed = std::erase_if(agents_, [&](const Agent& known) {
       return known.peer == peer && known.objectPath == objectPath;
     });
@@ -137,7 +137,7 @@ void DialogAgentRegistry::present(const VendDialog& dialog, Reply reply) {
   Agent agent;
   std::uint64_t ticket = 0;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (!agents_.empty() && connection_) {
       agent = agents_.back();
       ticket = nextTicket_++;
@@ -161,7 +161,7 @@ void DialogAgentRegistry::askAgent(const Agent& agent, const VendDialog& dialog,
                                    std::uint64_t ticket) {
   sdbus::IConnection* connection = nullptr;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     // Dismissed, or its agent left, while it waited for a worker.
     if (!pending_.contains(ticket)) return;
     connection = connection_;
@@ -185,7 +185,7 @@ void DialogAgentRegistry::askAgent(const Agent& agent, const VendDialog& dialog,
 void DialogAgentRegistry::agentFailed(const Agent& agent, const std::string& why) {
   std::size_t removed = 0;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     removed = std::erase_if(
         agents_, [&](const Agent& known) { return known.registration == agent.registration; });
   }
@@ -196,7 +196,7 @@ void DialogAgentRegistry::agentFailed(const Agent& agent, const std::string& why
 void DialogAgentRegistry::answer(std::uint64_t ticket, VendDialogAnswer answer) {
   Reply reply;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     auto found = pending_.find(ticket);
     // Already answered by a dismissal or by its agent leaving.
     if (found == pending_.end()) return;
@@ -209,7 +209,7 @@ void DialogAgentRegistry::answer(std::uint64_t ticket, VendDialogAnswer answer) 
 std::vector<DialogAgentRegistry::PendingDialog> DialogAgentRegistry::takePendingDialogs(
     const std::function<bool(const PendingDialog&)>& matches) {
   std::vector<PendingDialog> taken;
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   for (auto entry = pending_.begin(); entry != pending_.end();) {
     if (matches(entry->second)) {
       taken.push_back(std::move(entry->second));
@@ -240,7 +240,7 @@ void DialogAgentRegistry::tellAgentOfDismissal(const Agent& agent,
                                                std::int64_t exitCode) {
   sdbus::IConnection* connection = nullptr;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     connection = connection_;
   }
   if (!connection) return;
@@ -261,7 +261,7 @@ void DialogAgentRegistry::peerDidLeave(const std::string& peer) {
   std::size_t removed = 0;
   std::size_t waiting = 0;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     removed = std::erase_if(agents_, [&](const Agent& known) { return known.peer == peer; });
     waiting = static_cast<std::size_t>(std::ranges::count_if(
         pending_, [&](const auto& entry) { return entry.second.agent.peer == peer; }));
@@ -276,7 +276,7 @@ void DialogAgentRegistry::peerDidLeave(const std::string& peer) {
 }
 
 std::size_t DialogAgentRegistry::agentCount() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return agents_.size();
 }
 

@@ -5,7 +5,6 @@
 #include <functional>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <span>
 #include <string>
 #include <string_view>
@@ -16,6 +15,7 @@
 #include <sdbus-c++/Message.h>
 
 #include "AssetService/BusMethod.h"
+#include "platform/Mutex.h"
 #include "store-runtime/VendDialogPresenter.h"
 #include "store-runtime/VendElasticQueue.h"
 
@@ -90,15 +90,15 @@ class DialogAgentRegistry final : public VendDialogPresenter,
   // Each dialog waits for its agent's answer on a thread of its own, so a
   // dialog that nobody answers never holds up the next one.
   std::shared_ptr<VendElasticQueue> agentCalls_;
-  mutable std::mutex mutex_;
-  sdbus::IConnection* connection_ = nullptr;
+  mutable Mutex mutex_;
+  sdbus::IConnection* connection_ GUARDED_BY(mutex_) = nullptr;
   // Oldest first; the last one is asked.
-  std::vector<Agent> agents_;
-  std::uint64_t nextRegistration_ = 1;
+  std::vector<Agent> agents_ GUARDED_BY(mutex_);
+  std::uint64_t nextRegistration_ GUARDED_BY(mutex_) = 1;
   // Dialogs handed to an agent and not answered yet, by ticket: the same
   // dialog may be up twice.
-  std::map<std::uint64_t, PendingDialog> pending_;
-  std::uint64_t nextTicket_ = 1;
+  std::map<std::uint64_t, PendingDialog> pending_ GUARDED_BY(mutex_);
+  std::uint64_t nextTicket_ GUARDED_BY(mutex_) = 1;
 };
 
 }  // namespace larder

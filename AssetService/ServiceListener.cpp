@@ -116,12 +116,12 @@ void ServiceListener::stopServing() {
 }
 
 std::size_t ServiceListener::connectionCount() const {
-  std::lock_guard lock(peersMutex_);
+  MutexLock lock(peersMutex_);
   return peers_.size();
 }
 
 std::shared_ptr<AssetServiceInterface> ServiceListener::interfaceForPeer(const std::string& peer) {
-  std::lock_guard lock(peersMutex_);
+  MutexLock lock(peersMutex_);
   auto found = peers_.find(peer);
   if (found != peers_.end()) return found->second;
   auto interface = AssetServiceDelegate::clientInterface(peer, softwareMap_, remoteObjects_);
@@ -137,7 +137,7 @@ void ServiceListener::peerDidChangeOwner(sdbus::Message& signal) {
   signal >> name >> oldOwner >> newOwner;
   if (!newOwner.empty()) return;
   if (dialogAgents_) dialogAgents_->peerDidLeave(name);
-  std::lock_guard lock(peersMutex_);
+  MutexLock lock(peersMutex_);
   // Work the peer left queued still runs: its items hold the object.
   if (peers_.erase(name) > 0) TILL_LOG(3, "%@: connection from %@ ended", kSpeaker, name);
 }

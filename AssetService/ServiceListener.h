@@ -2,7 +2,6 @@
 
 #include <map>
 #include <memory>
-#include <mutex>
 #include <string>
 
 #include <sdbus-c++/IConnection.h>
@@ -12,6 +11,7 @@
 #include "AssetService/AssetServiceDelegate.h"
 #include "AssetService/AssetServiceInterface.h"
 #include "AssetService/RequestTable.h"
+#include "platform/Mutex.h"
 
 namespace larder {
 
@@ -61,8 +61,9 @@ class ServiceListener {
   std::unique_ptr<sdbus::IObject> object_;
   std::shared_ptr<RemoteObjects> remoteObjects_;
 
-  mutable std::mutex peersMutex_;
-  std::map<std::string, std::shared_ptr<AssetServiceInterface>, std::less<>> peers_;
+  mutable Mutex peersMutex_;
+  std::map<std::string, std::shared_ptr<AssetServiceInterface>, std::less<>> peers_
+      GUARDED_BY(peersMutex_);
 };
 
 }  // namespace larder

@@ -103,12 +103,12 @@ std::shared_ptr<TillDownload> TillDownload::initWithAssets(std::vector<TillDownl
 }
 
 TillDownloadFields TillDownload::snapshot() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return fields_;
 }
 
 void TillDownload::update(const std::function<void(TillDownloadFields&)>& change) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   change(fields_);
 }
 

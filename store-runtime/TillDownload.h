@@ -3,12 +3,12 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "platform/Mutex.h"
 #include "platform/PlistValue.h"
 #include "store-runtime/TillDownloadAsset.h"
 #include "store-runtime/TillDownloadMetadata.h"
@@ -94,17 +94,17 @@ class TillDownload {
   // One field read or written under the record's lock.
   template <typename Value>
   Value field(Value TillDownloadFields::*member) const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return fields_.*member;
   }
   template <typename Value, typename Given>
   void setField(Value TillDownloadFields::*member, Given&& value) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     fields_.*member = std::forward<Given>(value);
   }
 
-  mutable std::mutex mutex_;
-  TillDownloadFields fields_;
+  mutable Mutex mutex_;
+  TillDownloadFields fields_ GUARDED_BY(mutex_);
 };
 
 using TillDownloadRef = std::shared_ptr<TillDownload>;

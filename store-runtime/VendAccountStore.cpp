@@ -36,6 +36,8 @@ VendAccountStore::VendAccountStore(const VendRuntimeConfiguration& configuration
 }
 
 void VendAccountStore::load() {
+  // Only the constructor calls it, but the analysis wants the lock all the same.
+  MutexLock lock(mutex_);
   FileIO::removeStaleTemporaries(path_);
   auto bytes = FileIO::read(path_, 1U << 20U);
   if (!bytes) return;
@@ -50,11 +52,11 @@ void VendAccountStore::load() {
     }
   }
   const PlistValue& primary = (*parsed)["primaryAccountID"];
-  if (primary.isInteger() && findAccount(primary.uint64Value()))
+  if (primary.isInteger() && findAccountLocked(primary.uint64Value()))
     primaryAccountID_ = primary.uint64Value();
 }
 
-void VendAccountStore::save() const {
+void VendAccountStore::saveLocked() const {
   PlistArray entries;
   for (const VendAccount& account : accounts_) {
     PlistDictionary entry = account.toDictionary();
@@ -70,17 +72,17 @@ void VendAccountStore::save() const {
 }
 
 std::optional<VendAccount> VendAccountStore::primaryAccount() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   if (!primaryAccountID_) return std::nullopt;
-  return findAccount(*primaryAccountID_);
+  return findAccountLocked(*primaryAccountID_);
 }
 
 std::optional<VendAccount> VendAccountStore::accountWithID(std::uint64_t accountID) const {
-  std::lock_guard lock(mutex_);
-  return findAccount(accountID);
+  MutexLock lock(mutex_);
+  return findAccountLocked(accountID);
 }
 
-std::optional<VendAccount> VendAccountStore::findAccount(std::uint64_t accountID) const {
+std::optional<VendAccount> VendAccountStore::findAccountLocked(std::uint64_t accountID) const {
   auto found = std::find_if(accounts_.begin(), accounts_.end(), [&](const VendAccount& account) {
     return account.accountID == accountID;
   });
@@ -89,7 +91,7 @@ std::optional<VendAccount> VendAccountStore::findAccount(std::uint64_t accountID
 }
 
 std::optional<VendAccount> VendAccountStore::accountWithName(std::string_view orvaneID) const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   auto found = std::find_if(accounts_.begin(), accounts_.end(), [&](const VendAccount& account) {
     return account.orvaneID == orvaneID;
   });
@@ -99,12 +101,12 @@ std::optional<VendAccount> VendAccountStore::accountWithName(std::string_view or
 
 void VendAccountStore::signIn(VendAccount account) {
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     std::erase_if(accounts_,
                   [&](const VendAccount& known) { return known.accountID == account.accountID; });
     primaryAccountID_ = account.accountID;
     accounts_.push_back(account);
-    save();
+    saveLocked();
   }
   TILL_LOG(2, "%@: Account %@ is now the primary account", kSpeaker, account.orvaneID);
   notify(account);
@@ -112,27 +114,27 @@ void VendAccountStore::signIn(VendAccount account) {
 
 void VendAccountStore::signOut() {
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (!primaryAccountID_) return;
     const std::uint64_t signedOut = *primaryAccountID_;
     std::erase_if(accounts_,
                   [&](const VendAccount& known) { return known.accountID == signedOut; });
     primaryAccountID_.reset();
-    save();
+    saveLocked();
   }
   notify(std::nullopt);
 }
 
 void VendAccountStore::addObserver(const std::shared_ptr<VendAccountStoreObserver>& observer) {
   if (!observer) return;
-  std::lock_guard lock(observersMutex_);
+  MutexLock lock(observersMutex_);
   observers_.push_back(observer);
 }
 
 void VendAccountStore::notify(const std::optional<VendAccount>& primary) {
   std::vector<std::shared_ptr<VendAccountStoreObserver>> observers;
   {
-    std::lock_guard lock(observersMutex_);
+    MutexLock lock(observersMutex_);
     observers = observers_;
   }
   for (const auto& observer : observers) observer->primaryAccountDidChange(primary);

@@ -1,11 +1,11 @@
 #pragma once
 
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "platform/Mutex.h"
 #include "store-runtime/VendAccount.h"
 #include "store-runtime/VendRuntime.h"
 
@@ -40,17 +40,17 @@ class VendAccountStore {
 
  private:
   void load();
-  void save() const;  // under mutex_
-  [[nodiscard]] std::optional<VendAccount> findAccount(
-      std::uint64_t accountID) const;  // under mutex_
+  void saveLocked() const REQUIRES(mutex_);
+  [[nodiscard]] std::optional<VendAccount> findAccountLocked(std::uint64_t accountID) const
+      REQUIRES(mutex_);
   void notify(const std::optional<VendAccount>& primary);
 
   std::string path_;
-  mutable std::mutex mutex_;
-  std::vector<VendAccount> accounts_;
-  std::optional<std::uint64_t> primaryAccountID_;
-  std::mutex observersMutex_;
-  std::vector<std::shared_ptr<VendAccountStoreObserver>> observers_;
+  mutable Mutex mutex_;
+  std::vector<VendAccount> accounts_ GUARDED_BY(mutex_);
+  std::optional<std::uint64_t> primaryAccountID_ GUARDED_BY(mutex_);
+  Mutex observersMutex_;
+  std::vector<std::shared_ptr<VendAccountStoreObserver>> observers_ GUARDED_BY(observersMutex_);
 };
 
 }  // namespace larder

@@ -20,7 +20,7 @@ constexpr std::chrono::milliseconds kCancelPollInterval{100};
 // late reply never signals a semaphore that is gone.
 struct PendingAnswer {
   DispatchSemaphore answered;
-  std::mutex mutex;
+  Mutex mutex;
   std::int64_t exitCode = VendDialogButton::kCancel;
 };
 
@@ -35,17 +35,17 @@ std::shared_ptr<VendDialogOperation> VendDialogOperation::operationWithDialog(
 }
 
 std::optional<VendDialogButton> VendDialogOperation::selectedButton() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return selectedButton_;
 }
 
 void VendDialogOperation::setPerformDefaultActions(bool performDefaultActions) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   performDefaultActions_ = performDefaultActions;
 }
 
 bool VendDialogOperation::performDefaultActions() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return performDefaultActions_;
 }
 
@@ -67,7 +67,7 @@ std::int64_t VendDialogOperation::waitForExitCode() {
   auto pending = std::make_shared<PendingAnswer>();
   ui->displayDialog(dialog_, delegate(), [pending](std::int64_t exitCode) {
     {
-      std::lock_guard lock(pending->mutex);
+      MutexLock lock(pending->mutex);
       pending->exitCode = exitCode;
     }
     pending->answered.signal();
@@ -80,14 +80,14 @@ std::int64_t VendDialogOperation::waitForExitCode() {
       dismissedOnCancel = true;
     }
   }
-  std::lock_guard lock(pending->mutex);
+  MutexLock lock(pending->mutex);
   return pending->exitCode;
 }
 
 void VendDialogOperation::recordExitCode(std::int64_t exitCode) {
   std::optional<VendDialogButton> button = dialog_.buttonForExitCode(exitCode);
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     selectedButton_ = button;
   }
   if (!button) {

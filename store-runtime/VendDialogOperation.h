@@ -1,9 +1,9 @@
 #pragma once
 
 #include <memory>
-#include <mutex>
 #include <optional>
 
+#include "platform/Mutex.h"
 #include "store-runtime/VendDialog.h"
 #include "store-runtime/VendOperation.h"
 
@@ -45,9 +45,9 @@ class VendDialogOperation : public VendOperation {
   void recordExitCode(std::int64_t exitCode);
 
   VendDialog dialog_;
-  mutable std::mutex mutex_;
-  std::optional<VendDialogButton> selectedButton_;
-  bool performDefaultActions_ = true;
+  mutable Mutex mutex_;
+  std::optional<VendDialogButton> selectedButton_ GUARDED_BY(mutex_);
+  bool performDefaultActions_ GUARDED_BY(mutex_) = true;
 };
 
 }  // namespace larder

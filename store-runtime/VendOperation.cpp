@@ -16,37 +16,37 @@ constexpr std::string_view kSpeaker = "VendOperation";
 VendOperation::VendOperation(VendStoreClient storeClient) : storeClient_(std::move(storeClient)) {}
 
 void VendOperation::setSuccess(bool success) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   success_ = success;
 }
 
 bool VendOperation::success() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return success_;
 }
 
 void VendOperation::setError(OptionalError error) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   error_ = std::move(error);
 }
 
 OptionalError VendOperation::error() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return error_;
 }
 
 void VendOperation::setCompletionHandler(CompletionHandler handler) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   completionHandler_ = std::move(handler);
 }
 
 void VendOperation::setDelegate(std::shared_ptr<VendOperationDelegate> delegate) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   delegate_ = std::move(delegate);
 }
 
 std::shared_ptr<VendOperationDelegate> VendOperation::delegate() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return delegate_;
 }
 
@@ -57,7 +57,7 @@ bool VendOperation::isCancelled() const {
 }
 
 std::shared_ptr<VendServiceProxy> VendOperation::serviceProxy() {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   if (!serviceProxy_) serviceProxy_ = std::make_shared<VendServiceProxy>(storeClient_);
   return serviceProxy_;
 }
@@ -112,7 +112,7 @@ void VendOperation::finish() {
   bool succeeded = false;
   OptionalError failure;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     handler = std::move(completionHandler_);
     completionHandler_ = nullptr;
     succeeded = success_;

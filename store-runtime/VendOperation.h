@@ -4,10 +4,10 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string_view>
 
+#include "platform/Mutex.h"
 #include "platform/PlistValue.h"
 #include "store-runtime/VendAccount.h"
 #include "store-runtime/VendError.h"
@@ -64,8 +64,8 @@ class VendOperation : public std::enable_shared_from_this<VendOperation> {
   // bag cannot be loaded or lacks the key.
   PlistValue valueForURLBagKey(std::string_view key);
 
-  void setRequiredBagType(std::int64_t type) { requiredBagType_ = type; }
-  [[nodiscard]] std::int64_t requiredBagType() const { return requiredBagType_; }
+  void setRequiredBagType(std::int64_t type) { requiredBagType_.store(type); }
+  [[nodiscard]] std::int64_t requiredBagType() const { return requiredBagType_.load(); }
 
   // For the queue: runs the operation once; later calls do nothing.
   void start();
@@ -83,13 +83,13 @@ class VendOperation : public std::enable_shared_from_this<VendOperation> {
   void finish();
 
   VendStoreClient storeClient_;
-  mutable std::mutex mutex_;
-  bool success_ = false;
-  OptionalError error_;
-  CompletionHandler completionHandler_;
-  std::shared_ptr<VendOperationDelegate> delegate_;
-  std::shared_ptr<VendServiceProxy> serviceProxy_;
-  std::int64_t requiredBagType_ = 0;
+  mutable Mutex mutex_;
+  bool success_ GUARDED_BY(mutex_) = false;
+  OptionalError error_ GUARDED_BY(mutex_);
+  CompletionHandler completionHandler_ GUARDED_BY(mutex_);
+  std::shared_ptr<VendOperationDelegate> delegate_ GUARDED_BY(mutex_);
+  std::shared_ptr<VendServiceProxy> serviceProxy_ GUARDED_BY(mutex_);
+  std::atomic<std::int64_t> requiredBagType_{0};
   std::atomic<bool> started_{false};
   std::atomic<bool> cancelled_{false};
   // The operation running this one as a sub-operation, while it does.

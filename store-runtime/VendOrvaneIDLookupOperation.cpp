@@ -40,12 +40,12 @@ VendOrvaneIDLookupOperation::orvaneIDLookupOperationForPurchaseRecord(
 }
 
 std::optional<std::string> VendOrvaneIDLookupOperation::orvaneID() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return orvaneID_;
 }
 
 void VendOrvaneIDLookupOperation::setOrvaneID(std::string orvaneID) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   orvaneID_ = std::move(orvaneID);
 }
 

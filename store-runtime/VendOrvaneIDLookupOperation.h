@@ -1,11 +1,11 @@
 #pragma once
 
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
 
+#include "platform/Mutex.h"
 #include "store-runtime/VendOperation.h"
 #include "store-runtime/VendPurchaseRecord.h"
 
@@ -45,8 +45,8 @@ class VendOrvaneIDLookupOperation : public VendOperation {
   void setOrvaneID(std::string orvaneID);
 
   VendPurchaseRecord purchaseRecord_;
-  mutable std::mutex mutex_;
-  std::optional<std::string> orvaneID_;
+  mutable Mutex mutex_;
+  std::optional<std::string> orvaneID_ GUARDED_BY(mutex_);
 };
 
 }  // namespace larder

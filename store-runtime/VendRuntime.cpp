@@ -12,8 +12,8 @@
 namespace larder {
 namespace {
 
-std::mutex& sharedRuntimeMutex() {
-  static std::mutex mutex;
+Mutex& sharedRuntimeMutex() {
+  static Mutex mutex;
   return mutex;
 }
 
@@ -47,7 +47,7 @@ VendRuntime::VendRuntime(VendRuntimeConfiguration configuration)
 VendRuntime::~VendRuntime() = default;
 
 std::shared_ptr<VendRuntime> VendRuntime::shared() {
-  std::lock_guard lock(sharedRuntimeMutex());
+  MutexLock lock(sharedRuntimeMutex());
   auto& runtime = sharedRuntimeSlot();
   if (!runtime)
     runtime = std::make_shared<VendRuntime>(VendRuntimeConfiguration::fromEnvironment());
@@ -55,29 +55,29 @@ std::shared_ptr<VendRuntime> VendRuntime::shared() {
 }
 
 void VendRuntime::setShared(std::shared_ptr<VendRuntime> runtime) {
-  std::lock_guard lock(sharedRuntimeMutex());
+  MutexLock lock(sharedRuntimeMutex());
   sharedRuntimeSlot() = std::move(runtime);
 }
 
 void VendRuntime::setDialogPresenter(std::shared_ptr<VendDialogPresenter> presenter) {
-  std::lock_guard lock(hooksMutex_);
+  MutexLock lock(hooksMutex_);
   dialogPresenter_ = std::move(presenter);
 }
 
 std::shared_ptr<VendDialogPresenter> VendRuntime::dialogPresenter() const {
-  std::lock_guard lock(hooksMutex_);
+  MutexLock lock(hooksMutex_);
   if (dialogPresenter_) return dialogPresenter_;
   static const auto cancelling = std::make_shared<VendCancellingDialogPresenter>();
   return cancelling;
 }
 
 void VendRuntime::setAssetService(std::shared_ptr<VendAssetService> service) {
-  std::lock_guard lock(hooksMutex_);
+  MutexLock lock(hooksMutex_);
   assetService_ = std::move(service);
 }
 
 std::shared_ptr<VendAssetService> VendRuntime::assetService() const {
-  std::lock_guard lock(hooksMutex_);
+  MutexLock lock(hooksMutex_);
   return assetService_;
 }
 

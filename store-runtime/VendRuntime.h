@@ -2,8 +2,9 @@
 
 #include <chrono>
 #include <memory>
-#include <mutex>
 #include <string>
+
+#include "platform/Mutex.h"
 
 namespace larder {
 
@@ -69,9 +70,9 @@ class VendRuntime {
   std::unique_ptr<VendAccountStore> accountStore_;
   std::unique_ptr<VendDownloadManager> downloadManager_;
   std::shared_ptr<VendElasticQueue> serviceQueue_;
-  mutable std::mutex hooksMutex_;
-  std::shared_ptr<VendDialogPresenter> dialogPresenter_;
-  std::shared_ptr<VendAssetService> assetService_;
+  mutable Mutex hooksMutex_;
+  std::shared_ptr<VendDialogPresenter> dialogPresenter_ GUARDED_BY(hooksMutex_);
+  std::shared_ptr<VendAssetService> assetService_ GUARDED_BY(hooksMutex_);
 };
 
 }  // namespace larder

@@ -174,27 +174,27 @@ void UpdateQueue::save() {
 // --- Lists ---
 
 std::shared_ptr<const UpdateQueue::UpdateList> UpdateQueue::availableUpdates() const {
-  std::lock_guard lock(snapshotMutex_);
+  MutexLock lock(snapshotMutex_);
   return availableUpdates_;
 }
 
 std::shared_ptr<const UpdateQueue::UpdateList> UpdateQueue::incompatibleUpdates() const {
-  std::lock_guard lock(snapshotMutex_);
+  MutexLock lock(snapshotMutex_);
   return incompatibleUpdates_;
 }
 
 void UpdateQueue::publish(UpdateList available) {
   auto snapshot = std::make_shared<const UpdateList>(std::move(available));
-  std::lock_guard lock(snapshotMutex_);
+  MutexLock lock(snapshotMutex_);
   availableUpdates_ = std::move(snapshot);
 }
 
 void UpdateQueue::publishIncompatible(std::shared_ptr<const UpdateList> incompatible) {
-  std::lock_guard lock(snapshotMutex_);
+  MutexLock lock(snapshotMutex_);
   incompatibleUpdates_ = std::move(incompatible);
 }
 
-LedgerUpdateRef UpdateQueue::availableUpdateWithItemIdentifierLocked(
+LedgerUpdateRef UpdateQueue::availableUpdateWithItemIdentifierOnQueue(
     std::uint64_t itemIdentifier) const {
   for (const LedgerUpdateRef& update : *availableUpdates()) {
     if (update->itemIdentifierValue() == itemIdentifier) return update;
@@ -203,7 +203,7 @@ LedgerUpdateRef UpdateQueue::availableUpdateWithItemIdentifierLocked(
 }
 
 LedgerUpdateRef UpdateQueue::updateWithItemIdentifier(std::uint64_t itemIdentifier) const {
-  if (auto update = availableUpdateWithItemIdentifierLocked(itemIdentifier)) return update;
+  if (auto update = availableUpdateWithItemIdentifierOnQueue(itemIdentifier)) return update;
   if (!updatesBeingDownloaded_) return nullptr;
   auto found = updatesBeingDownloaded_->find(itemIdentifier);
   return found == updatesBeingDownloaded_->end() ? nullptr : found->second;
@@ -211,7 +211,7 @@ LedgerUpdateRef UpdateQueue::updateWithItemIdentifier(std::uint64_t itemIdentifi
 
 LedgerUpdateRef UpdateQueue::availableUpdateWithItemIdentifier(std::uint64_t itemIdentifier) {
   LedgerUpdateRef update;
-  dispatchQueue_->sync([&] { update = availableUpdateWithItemIdentifierLocked(itemIdentifier); });
+  dispatchQueue_->sync([&] { update = availableUpdateWithItemIdentifierOnQueue(itemIdentifier); });
   return update;
 }
 

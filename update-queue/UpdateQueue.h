@@ -4,13 +4,13 @@
 #include <cstdint>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
 
 #include "platform/DispatchQueue.h"
+#include "platform/Mutex.h"
 #include "store-runtime/LedgerUpdate.h"
 #include "store-runtime/VendError.h"
 #include "store-runtime/VendStoreClient.h"
@@ -95,7 +95,7 @@ class UpdateQueue : public std::enable_shared_from_this<UpdateQueue> {
  private:
   // Inside a barrier or a read.
   LedgerUpdateRef updateWithItemIdentifier(std::uint64_t itemIdentifier) const;
-  LedgerUpdateRef availableUpdateWithItemIdentifierLocked(std::uint64_t itemIdentifier) const;
+  LedgerUpdateRef availableUpdateWithItemIdentifierOnQueue(std::uint64_t itemIdentifier) const;
   void availableUpdatesDidChange();
   void readUpdatesFromPersistedStore();
   void writeUpdatesToPersistedStore(const UpdateList& available,
@@ -127,9 +127,9 @@ class UpdateQueue : public std::enable_shared_from_this<UpdateQueue> {
 
   // The two lists are published whole, so that a reader outside the queue
   // takes its snapshot with one pointer copy.
-  mutable std::mutex snapshotMutex_;
-  std::shared_ptr<const UpdateList> availableUpdates_;
-  std::shared_ptr<const UpdateList> incompatibleUpdates_;
+  mutable Mutex snapshotMutex_;
+  std::shared_ptr<const UpdateList> availableUpdates_ GUARDED_BY(snapshotMutex_);
+  std::shared_ptr<const UpdateList> incompatibleUpdates_ GUARDED_BY(snapshotMutex_);
 
   std::shared_ptr<DispatchQueue> dispatchQueue_;
 };

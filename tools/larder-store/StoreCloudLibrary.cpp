@@ -27,7 +27,7 @@ bool isWanted(const StoreLibraryItem& item, const StoreCloudLibrary::ItemsQuery&
 }  // namespace
 
 StoreCloudLibrary::StoreCloudLibrary(std::string path) : path_(std::move(path)) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   refreshLocked();
 }
 
@@ -113,13 +113,13 @@ std::uint32_t StoreCloudLibrary::currentRevisionLocked() const {
 }
 
 bool StoreCloudLibrary::isPresent() {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   refreshLocked();
   return present_;
 }
 
 std::optional<PlistDictionary> StoreCloudLibrary::bagEntry(std::string_view baseURL) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   refreshLocked();
   if (!present_) return std::nullopt;
   PlistDictionary entry{{"base-url", std::string(baseURL) + std::string(kBasePath)}};
@@ -128,7 +128,7 @@ std::optional<PlistDictionary> StoreCloudLibrary::bagEntry(std::string_view base
 }
 
 std::uint32_t StoreCloudLibrary::login(std::uint64_t accountID) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   const std::uint32_t session = nextSession_++;
   if (nextSession_ > static_cast<std::uint32_t>(std::numeric_limits<std::int32_t>::max())) {
     nextSession_ = 1;  // the wire's session id is a signed 32-bit number
@@ -139,28 +139,28 @@ std::uint32_t StoreCloudLibrary::login(std::uint64_t accountID) {
 }
 
 bool StoreCloudLibrary::hasSession(std::uint32_t sessionID, std::uint64_t accountID) const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return std::find(sessions_.begin(), sessions_.end(), std::pair{sessionID, accountID}) !=
          sessions_.end();
 }
 
 std::uint32_t StoreCloudLibrary::currentRevision() {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   refreshLocked();
   return currentRevisionLocked();
 }
 
 std::size_t StoreCloudLibrary::itemCount() {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   refreshLocked();
   std::map<std::uint64_t, Entry> items;
   std::map<std::uint64_t, std::uint32_t> deletions;
-  stateAt(currentRevisionLocked(), items, deletions);
+  stateAtLocked(currentRevisionLocked(), items, deletions);
   return items.size();
 }
 
-void StoreCloudLibrary::stateAt(std::uint32_t revision, std::map<std::uint64_t, Entry>& items,
-                                std::map<std::uint64_t, std::uint32_t>& deletions) const {
+void StoreCloudLibrary::stateAtLocked(std::uint32_t revision, std::map<std::uint64_t, Entry>& items,
+                                      std::map<std::uint64_t, std::uint32_t>& deletions) const {
   for (const Revision& entry : revisions_) {
     if (entry.number > revision) break;
     for (const StoreLibraryItem& item : entry.items) {
@@ -175,14 +175,14 @@ void StoreCloudLibrary::stateAt(std::uint32_t revision, std::map<std::uint64_t, 
 }
 
 StoreCloudLibrary::Changes StoreCloudLibrary::changes(const ItemsQuery& query) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   refreshLocked();
   Changes changes;
   changes.revision = std::min(query.latestVersion, currentRevisionLocked());
   changes.full = query.localVersion == 0 || query.localVersion >= changes.revision;
   std::map<std::uint64_t, Entry> items;
   std::map<std::uint64_t, std::uint32_t> deletions;
-  stateAt(changes.revision, items, deletions);
+  stateAtLocked(changes.revision, items, deletions);
   changes.totalCount = items.size();
   std::map<std::uint64_t, std::uint32_t> held;
   for (const auto& pair : query.held) held[pair.clientID] = pair.tokenCode;

@@ -4,7 +4,6 @@
 #include <deque>
 #include <filesystem>
 #include <map>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -13,6 +12,7 @@
 
 #include "dmap/DAAPItemsRequest.h"
 #include "larder-store/StoreLibraryItem.h"
+#include "platform/Mutex.h"
 #include "platform/PlistValue.h"
 
 namespace larder {
@@ -81,23 +81,23 @@ class StoreCloudLibrary {
   };
   using Stamp = std::pair<std::filesystem::file_time_type, std::uintmax_t>;
 
-  void refreshLocked();
-  void loadLocked();
+  void refreshLocked() REQUIRES(mutex_);
+  void loadLocked() REQUIRES(mutex_);
   std::optional<Revision> revisionFromEntry(const PlistValue& entry, std::uint32_t previous,
                                             std::size_t index) const;
   // The library as of `revision`, by cloud id, and when each id was deleted.
-  void stateAt(std::uint32_t revision, std::map<std::uint64_t, Entry>& items,
-               std::map<std::uint64_t, std::uint32_t>& deletions) const;
-  [[nodiscard]] std::uint32_t currentRevisionLocked() const;
+  void stateAtLocked(std::uint32_t revision, std::map<std::uint64_t, Entry>& items,
+                     std::map<std::uint64_t, std::uint32_t>& deletions) const REQUIRES(mutex_);
+  [[nodiscard]] std::uint32_t currentRevisionLocked() const REQUIRES(mutex_);
 
   std::string path_;
-  mutable std::mutex mutex_;
-  std::optional<Stamp> stamp_;
-  bool present_ = false;
-  PlistDictionary bagSettings_;
-  std::vector<Revision> revisions_;
-  std::deque<std::pair<std::uint32_t, std::uint64_t>> sessions_;
-  std::uint32_t nextSession_ = 1;
+  mutable Mutex mutex_;
+  std::optional<Stamp> stamp_ GUARDED_BY(mutex_);
+  bool present_ GUARDED_BY(mutex_) = false;
+  PlistDictionary bagSettings_ GUARDED_BY(mutex_);
+  std::vector<Revision> revisions_ GUARDED_BY(mutex_);
+  std::deque<std::pair<std::uint32_t, std::uint64_t>> sessions_ GUARDED_BY(mutex_);
+  std::uint32_t nextSession_ GUARDED_BY(mutex_) = 1;
 };
 
 }  // namespace larder

@@ -3,18 +3,18 @@
 namespace larder {
 
 void StoreStallGate::wait() {
-  std::unique_lock lock(mutex_);
-  opened_.wait(lock, [this] { return open_; });
+  MutexLock lock(mutex_);
+  opened_.wait(lock, [this]() REQUIRES(mutex_) { return open_; });
 }
 
 bool StoreStallGate::waitFor(std::chrono::milliseconds delay) {
-  std::unique_lock lock(mutex_);
-  return opened_.wait_for(lock, delay, [this] { return open_; });
+  MutexLock lock(mutex_);
+  return opened_.wait_for(lock, delay, [this]() REQUIRES(mutex_) { return open_; });
 }
 
 void StoreStallGate::open() {
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     open_ = true;
   }
   opened_.notify_all();

@@ -1,8 +1,8 @@
 #pragma once
 
 #include <chrono>
-#include <condition_variable>
-#include <mutex>
+
+#include "platform/Mutex.h"
 
 namespace larder {
 
@@ -17,9 +17,9 @@ class StoreStallGate {
   void open();
 
  private:
-  std::mutex mutex_;
-  std::condition_variable opened_;
-  bool open_ = false;
+  Mutex mutex_;
+  ConditionVariable opened_;
+  bool open_ GUARDED_BY(mutex_) = false;
 };
 
 }  // namespace larder

@@ -61,7 +61,7 @@ void DialogAgent::watchServiceRestarts(sdbus::IConnection& connection,
         signal >> name >> oldOwner >> newOwner;
         if (newOwner.empty()) return;
         {
-          std::lock_guard lock(mutex_);
+          MutexLock lock(mutex_);
           serviceRestarted_ = true;
         }
         wake();
@@ -69,7 +69,7 @@ void DialogAgent::watchServiceRestarts(sdbus::IConnection& connection,
 }
 
 bool DialogAgent::takeServiceRestart() {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return std::exchange(serviceRestarted_, false);
 }
 
@@ -91,7 +91,7 @@ void DialogAgent::displayDialog(sdbus::MethodCall call) {
     dialog.identifier = *identifier;
   }
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     dialog.ticket = nextTicket_++;
     open_.emplace(dialog.ticket, OpenDialog{dialog, std::move(call)});
     queued_.push_back(std::move(dialog));
@@ -105,7 +105,7 @@ void DialogAgent::dismissDialog(sdbus::MethodCall call) {
   const std::int64_t exitCode = arguments.at(1).int64Value();
   std::vector<OpenDialog> dismissed;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     for (auto entry = open_.begin(); entry != open_.end();) {
       if (entry->second.dialog.identifier == identifier) {
         dismissed.push_back(std::move(entry->second));
@@ -124,7 +124,7 @@ void DialogAgent::dismissDialog(sdbus::MethodCall call) {
 }
 
 std::optional<DialogAgent::Dialog> DialogAgent::takeDialog() {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   if (queued_.empty()) return std::nullopt;
   Dialog dialog = std::move(queued_.front());
   queued_.pop_front();
@@ -132,14 +132,14 @@ std::optional<DialogAgent::Dialog> DialogAgent::takeDialog() {
 }
 
 std::vector<DialogAgent::Dismissal> DialogAgent::takeDismissals() {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return std::exchange(dismissals_, {});
 }
 
 bool DialogAgent::answer(std::uint64_t ticket, const VendDialogAnswer& answer) {
   std::optional<OpenDialog> open;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     auto found = open_.find(ticket);
     if (found == open_.end()) return false;
     open = std::move(found->second);

@@ -4,7 +4,6 @@
 #include <deque>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -14,6 +13,7 @@
 #include <sdbus-c++/Message.h>
 
 #include "platform/FileDescriptor.h"
+#include "platform/Mutex.h"
 #include "platform/PlistValue.h"
 #include "store-runtime/VendDialog.h"
 
@@ -69,17 +69,17 @@ class DialogAgent {
 
   std::string objectPath_;
   FileDescriptor wake_;
-  std::mutex mutex_;
-  std::uint64_t nextTicket_ = 1;
-  std::deque<Dialog> queued_;
+  Mutex mutex_;
+  std::uint64_t nextTicket_ GUARDED_BY(mutex_) = 1;
+  std::deque<Dialog> queued_ GUARDED_BY(mutex_);
   struct OpenDialog {
     Dialog dialog;
     sdbus::MethodCall call;
   };
   // Every dialog not answered yet, queued or taken, by ticket.
-  std::map<std::uint64_t, OpenDialog> open_;
-  std::vector<Dismissal> dismissals_;
-  bool serviceRestarted_ = false;
+  std::map<std::uint64_t, OpenDialog> open_ GUARDED_BY(mutex_);
+  std::vector<Dismissal> dismissals_ GUARDED_BY(mutex_);
+  bool serviceRestarted_ GUARDED_BY(mutex_) = false;
   std::unique_ptr<sdbus::IObject> object_;
   sdbus::Slot ownerWatch_;
 };
