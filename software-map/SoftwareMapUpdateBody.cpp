@@ -2,12 +2,12 @@
 // with a look at the disk: which bundle an incoming version replaces and
 // whether a pushed install may go ahead.
 #include <charconv>
-#include <mutex>
 #include <unordered_set>
 
 #include "platform/ApplicationRegistry.h"
 #include "platform/Environment.h"
 #include "platform/FileIO.h"
+#include "platform/Mutex.h"
 #include "platform/PropertyListSerialization.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/TillLogManager.h"
@@ -132,8 +132,8 @@ class XmlBodyWriter {
 // has been read. The lock is held through the read, so a thread that comes
 // while another reads waits for the whole list.
 struct HeldBundledManifest {
-  std::mutex mutex;
-  std::shared_ptr<const PlistArray> rows;
+  Mutex mutex;
+  std::shared_ptr<const PlistArray> rows GUARDED_BY(mutex);
 };
 
 HeldBundledManifest& heldBundledManifest() {
@@ -182,7 +182,7 @@ std::shared_ptr<const PlistArray> readBundledManifestRows() {
 
 std::shared_ptr<const PlistArray> bundledManifestRows() {
   HeldBundledManifest& held = heldBundledManifest();
-  std::lock_guard lock(held.mutex);
+  MutexLock lock(held.mutex);
   if (!held.rows) held.rows = readBundledManifestRows();
   return held.rows;
 }
@@ -389,7 +389,7 @@ SoftwareMap::SoftwareEntries SoftwareMap::bundledApplicationsListConditional(
 
 void SoftwareMap::resetBundledManifestForTesting() {
   HeldBundledManifest& held = heldBundledManifest();
-  std::lock_guard lock(held.mutex);
+  MutexLock lock(held.mutex);
   held.rows.reset();
 }
 

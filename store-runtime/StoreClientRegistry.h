@@ -2,10 +2,10 @@
 
 #include <map>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <vector>
 
+#include "platform/Mutex.h"
 #include "store-runtime/VendStoreClient.h"
 
 namespace larder {
@@ -29,7 +29,7 @@ class StoreClientRegistry {
   template <typename Factory>
   std::shared_ptr<Object> objectForStoreClient(const VendStoreClient* storeClient, Factory&& make) {
     if (!storeClient || storeClient->identifier().empty()) return nullptr;
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     auto found = objects_.find(storeClient->identifier());
     if (found != objects_.end()) return found->second;
     std::shared_ptr<Object> object = make(*storeClient);
@@ -43,20 +43,20 @@ class StoreClientRegistry {
   void forEach(Visitor&& visit) const {
     std::vector<std::shared_ptr<Object>> objects;
     {
-      std::lock_guard lock(mutex_);
+      MutexLock lock(mutex_);
       for (const auto& entry : objects_) objects.push_back(entry.second);
     }
     for (const auto& object : objects) visit(*object);
   }
 
   [[nodiscard]] std::size_t size() const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return objects_.size();
   }
 
  private:
-  mutable std::mutex mutex_;
-  std::map<std::string, std::shared_ptr<Object>, std::less<>> objects_;
+  mutable Mutex mutex_;
+  std::map<std::string, std::shared_ptr<Object>, std::less<>> objects_ GUARDED_BY(mutex_);
 };
 
 }  // namespace larder

@@ -37,7 +37,7 @@ void persist(const std::string& bundleIdentifier, bool locked) {
 }  // namespace
 
 void VendApplicationLocks::lock(const std::string& bundleIdentifier) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   const std::size_t count = ++counts_[bundleIdentifier];
   TILL_LOG(2, "%@: Locked applications of %@ (%lu)", kSpeaker, bundleIdentifier, count);
   // The file is written under the lock, so that a lock and an unlock of the
@@ -46,7 +46,7 @@ void VendApplicationLocks::lock(const std::string& bundleIdentifier) {
 }
 
 void VendApplicationLocks::unlock(const std::string& bundleIdentifier) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   const auto found = counts_.find(bundleIdentifier);
   if (found == counts_.end()) {
     TILL_LOG(1, "%@: Ignoring unlock of %@, which is not locked", kSpeaker, bundleIdentifier);
@@ -60,7 +60,7 @@ void VendApplicationLocks::unlock(const std::string& bundleIdentifier) {
 }
 
 std::size_t VendApplicationLocks::lockCount(const std::string& bundleIdentifier) const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   const auto found = counts_.find(bundleIdentifier);
   return found == counts_.end() ? 0 : found->second;
 }

@@ -2,9 +2,10 @@
 
 #include <cstddef>
 #include <map>
-#include <mutex>
 #include <string>
 #include <vector>
+
+#include "platform/Mutex.h"
 
 namespace larder {
 
@@ -28,8 +29,8 @@ class VendApplicationLocks {
   static std::vector<std::string> persistedIdentifiers();
 
  private:
-  mutable std::mutex mutex_;
-  std::map<std::string, std::size_t, std::less<>> counts_;
+  mutable Mutex mutex_;
+  std::map<std::string, std::size_t, std::less<>> counts_ GUARDED_BY(mutex_);
 };
 
 }  // namespace larder

@@ -1,11 +1,10 @@
 #include "store-runtime/VendElasticQueue.h"
 
-#include <condition_variable>
 #include <deque>
 #include <exception>
-#include <mutex>
 #include <thread>
 
+#include "platform/Mutex.h"
 #include "store-runtime/TillLogManager.h"
 
 namespace larder {
@@ -13,18 +12,19 @@ namespace larder {
 struct VendElasticQueue::State {
   std::string name;
   std::chrono::milliseconds idleTimeout;
-  mutable std::mutex mutex;
-  std::condition_variable workAvailable;
-  mutable std::condition_variable allFinished;
-  std::deque<std::function<void()>> pending;
-  std::size_t running = 0;
-  std::size_t idleThreads = 0;
-  std::size_t threads = 0;
+  mutable Mutex mutex;
+  ConditionVariable workAvailable;
+  mutable ConditionVariable allFinished;
+  std::deque<std::function<void()>> pending GUARDED_BY(mutex);
+  std::size_t running GUARDED_BY(mutex) = 0;
+  std::size_t idleThreads GUARDED_BY(mutex) = 0;
+  std::size_t threads GUARDED_BY(mutex) = 0;
 
   // Waits for a task; false when none came within the idle timeout.
-  bool takeNext(std::unique_lock<std::mutex>& lock, std::function<void()>& next) {
+  bool takeNext(MutexLock& lock, std::function<void()>& next) REQUIRES(mutex) {
     ++idleThreads;
-    const bool woken = workAvailable.wait_for(lock, idleTimeout, [&] { return !pending.empty(); });
+    const bool woken = workAvailable.wait_for(lock, idleTimeout,
+                                              [&]() REQUIRES(mutex) { return !pending.empty(); });
     --idleThreads;
     if (!woken) return false;
     next = std::move(pending.front());
@@ -34,10 +34,10 @@ struct VendElasticQueue::State {
   }
 
   void work() {
-    std::unique_lock lock(mutex);
+    MutexLock lock(mutex);
     std::function<void()> task;
     while (takeNext(lock, task)) {
-      lock.unlock();
+      mutex.unlock();
       try {
         task();
       } catch (const std::exception& exception) {
@@ -46,7 +46,7 @@ struct VendElasticQueue::State {
         TILL_LOG(1, "%@: A task of %@ failed", "VendElasticQueue", name);
       }
       task = nullptr;
-      lock.lock();
+      mutex.lock();
       --running;
       if (pending.empty() && running == 0) allFinished.notify_all();
     }
@@ -64,7 +64,7 @@ VendElasticQueue::~VendElasticQueue() = default;
 
 void VendElasticQueue::async(std::function<void()> task) {
   if (!task) return;
-  std::lock_guard lock(state_->mutex);
+  MutexLock lock(state_->mutex);
   state_->pending.push_back(std::move(task));
   // Every queued task needs a thread of its own, or one waiting for
   // another could starve it.
@@ -81,18 +81,20 @@ const std::string& VendElasticQueue::name() const {
 }
 
 std::size_t VendElasticQueue::taskCount() const {
-  std::lock_guard lock(state_->mutex);
+  MutexLock lock(state_->mutex);
   return state_->pending.size() + state_->running;
 }
 
 std::size_t VendElasticQueue::threadCount() const {
-  std::lock_guard lock(state_->mutex);
+  MutexLock lock(state_->mutex);
   return state_->threads;
 }
 
 void VendElasticQueue::waitUntilIdle() const {
-  std::unique_lock lock(state_->mutex);
-  state_->allFinished.wait(lock, [&] { return state_->pending.empty() && state_->running == 0; });
+  MutexLock lock(state_->mutex);
+  state_->allFinished.wait(lock, [&]() REQUIRES(state_->mutex) {
+    return state_->pending.empty() && state_->running == 0;
+  });
 }
 
 }  // namespace larder
