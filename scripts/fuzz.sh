@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # Builds every libFuzzer target with clang under ASan/UBSan and runs each
-# over its corpus for a bounded time. Usage: scripts/fuzz.sh [seconds-per-target] [build-dir]
+# over its corpus for a bounded time; the build is also the lock-annotation
+# check. Usage: scripts/fuzz.sh [seconds-per-target] [build-dir]
 set -euo pipefail
 cd "$(dirname "$0")/.."
 seconds=${1:-60}
@@ -8,7 +9,9 @@ build=${2:-build-fuzz}
 ./scripts/install-deps.sh
 cmake -S . -B "$build" -G Ninja -DCMAKE_CXX_COMPILER=clang++ -DCMAKE_BUILD_TYPE=RelWithDebInfo \
   -DLARDER_FUZZ=ON -DLARDER_SANITIZE=address -DLARDER_TESTS=OFF -DLARDER_BENCH=OFF
-cmake --build "$build" -j"$(nproc)" --target larder_fuzzers
+# clang also checks the lock annotations here (-Wthread-safety is an error),
+# so the tools are built too: everything with a lock is compiled by clang.
+cmake --build "$build" -j"$(nproc)" --target larder_fuzzers larderctl larder-store
 for target in "$build"/fuzz/fuzz_*; do
   [ -x "$target" ] || continue
   name=$(basename "$target")
