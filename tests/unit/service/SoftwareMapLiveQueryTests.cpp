@@ -9,7 +9,32 @@
 namespace larder::testing {
 namespace {
 
-class SoftwareMapLiveQueryTest : public ServiceTest {};
+class SoftwareMapLiveQueryTest : public ServiceTest {
+ protected:
+  // A map kept live by both queries, once their first results are merged.
+  std::unique_ptr<SoftwareMap> startLiveMap(const LogCapture& log) {
+    SoftwareMap::Options options = this->options(storePath("live"), true);
+    options.liveQueries = true;
+    auto map = std::make_unique<SoftwareMap>(options);
+    EXPECT_TRUE(
+        eventually([&] { return log.countContaining("MetadataQuery initial load took") >= 2; }));
+    return map;
+  }
+};
+
+TEST_F(SoftwareMapLiveQueryTest, ABundleDeletedIsAnnouncedAsNoLongerInstalled) {
+  std::string path = makeStoreBundle(rootApplications(), "Gone", "com.example.gone", "1.0", 21);
+  LogCapture log;
+  std::unique_ptr<SoftwareMap> map = startLiveMap(log);
+  auto observer = std::make_shared<RecordingObserver>();
+  map->addObserver(observer);
+  fs::remove_all(path);
+  ASSERT_TRUE(eventually([&] { return !observer->calls().empty(); })) << log.dump();
+  RecordingObserver::Call call = observer->calls().front();
+  EXPECT_EQ(call.state, kSoftwareProductRemoved);
+  EXPECT_EQ(call.fieldsAtCall.bundlePath, path);
+  EXPECT_FALSE(call.fieldsAtCall.installed);
+}
 
 TEST_F(SoftwareMapLiveQueryTest, AnOverflowRestartsTheQueriesAndTheirResultsRepairTheMap) {
   makeStoreBundle(rootApplications(), "Before", "com.example.before", "1.0", 31);
