@@ -1,5 +1,9 @@
-// The live queries as the map uses them: recovery from a lost event queue.
+// The live queries as the map uses them: removals, announced replacements and recovery from a
+// lost event queue.
 #include <gtest/gtest.h>
+
+#include <fcntl.h>
+#include <stdio.h>
 
 #include <chrono>
 #include <thread>
@@ -34,6 +38,29 @@ TEST_F(SoftwareMapLiveQueryTest, ABundleDeletedIsAnnouncedAsNoLongerInstalled) {
   EXPECT_EQ(call.state, kSoftwareProductRemoved);
   EXPECT_EQ(call.fieldsAtCall.bundlePath, path);
   EXPECT_FALSE(call.fieldsAtCall.installed);
+}
+
+TEST_F(SoftwareMapLiveQueryTest, AnAnnouncedReplacementBringsTheNewVersionWithoutAScan) {
+  std::string path =
+      makeStoreBundle(rootApplications(), "Updating", "com.example.updating", "2.4", 41, 240);
+  LogCapture log;
+  std::unique_ptr<SoftwareMap> map = startLiveMap(log);
+  LedgerSoftwareProductRef record = map->productForItemIdentifier(41);
+  ASSERT_NE(record, nullptr);
+
+  map->productAtPathWillBeUpdatedToBundleVersionStoreVersion(path, "2.5", 250);
+  // As the installer does: the new bundle is exchanged with the old, which is then deleted.
+  std::string staged =
+      makeStoreBundle(temporary() + "/staging", "Updating", "com.example.updating", "2.5", 41, 250);
+  ASSERT_EQ(::renameat2(AT_FDCWD, staged.c_str(), AT_FDCWD, path.c_str(), RENAME_EXCHANGE), 0);
+  fs::remove_all(staged);
+  // The new item's arrival ends the expectation; only then is the update reported done.
+  ASSERT_TRUE(eventually([&] { return !record->snapshot().metadataChangeIsExpected; }));
+  map->productAtPathWasUpdatedToBundleVersionStoreVersion(path, true, "2.5", 250);
+
+  EXPECT_TRUE(eventually([&] { return record->bundleVersion() == "2.5"; })) << log.dump();
+  EXPECT_EQ(record->snapshot().versionIdentifier, 250);
+  EXPECT_EQ(map->productForItemIdentifier(41), record);
 }
 
 TEST_F(SoftwareMapLiveQueryTest, AnOverflowRestartsTheQueriesAndTheirResultsRepairTheMap) {
