@@ -27,6 +27,11 @@ std::string Environment::variable(const char* name) {
   return value ? std::string(value) : std::string();
 }
 
+std::optional<std::string> Environment::variableIfSet(const char* name) {
+  const char* value = std::getenv(name);  // NOLINT(concurrency-mt-unsafe): nothing sets variables
+  return value ? std::optional<std::string>(value) : std::nullopt;
+}
+
 std::string Environment::platformRoot() {
   std::string root = variable("LARDER_ROOT");
   if (root.empty()) return "/";

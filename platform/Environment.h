@@ -1,5 +1,6 @@
 #pragma once
 
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -29,6 +30,9 @@ class Environment {
 
   // Reads a variable; empty when unset.
   static std::string variable(const char* name);
+  // Reads a variable whose being set means something even when its value
+  // is empty; nullopt when unset.
+  static std::optional<std::string> variableIfSet(const char* name);
 };
 
 }  // namespace larder

@@ -73,7 +73,8 @@ MetadataBundleIndex::Changes MetadataBundleIndex::gather(Clock::time_point now) 
 }
 
 bool MetadataBundleIndex::hasPendingWork() const {
-  return scopeChanged_ || !dirtyFolders_.empty() || !dirtyBundles_.empty();
+  return scopeChanged_ || !dirtyFolders_.empty() || !dirtyBundles_.empty() ||
+         !replacementsOwingChange_.empty();
 }
 
 MetadataBundleIndex::Changes MetadataBundleIndex::applyPendingWork(Clock::time_point now) {
@@ -83,13 +84,17 @@ MetadataBundleIndex::Changes MetadataBundleIndex::applyPendingWork(Clock::time_p
 MetadataBundleIndex::Changes MetadataBundleIndex::applyWork(Clock::time_point now,
                                                             bool allowSettling) {
   Changes changes;
-  dropDeletedBundles(changes);
+  // Owed by earlier work only: a replacement found now is told changed next time, after its added.
+  const auto owed = replacementsOwingChange_;
+  forgetOldVacatedPaths(now);
+  dropDeletedBundles(now, changes);
   if (scopeChanged_) {
     scopeChanged_ = false;
     refreshScope();
   }
   reconcileDirtyFolders(now, changes);
   readDirtyBundles(now, allowSettling, changes);
+  reportReplacementsAsChanged(owed, changes);
   sortByPath(changes.added);
   sortByPath(changes.changed);
   return changes;
@@ -213,7 +218,7 @@ bool MetadataBundleIndex::isStillAt(const std::string& path, const BundleKey& ke
 void MetadataBundleIndex::reconcileDirtyFolders(Clock::time_point now, Changes& changes) {
   if (dirtyFolders_.empty()) return;
   std::map<BundleKey, std::string> found = listDirtyFolders();
-  reconcileTrackedBundles(found, changes);
+  reconcileTrackedBundles(found, now, changes);
   for (const auto& [key, path] : found) startTracking(key, path, now);
   dirtyFolders_.clear();
 }
@@ -233,7 +238,7 @@ std::map<MetadataBundleIndex::BundleKey, std::string> MetadataBundleIndex::listD
 }
 
 void MetadataBundleIndex::reconcileTrackedBundles(std::map<BundleKey, std::string>& found,
-                                                  Changes& changes) {
+                                                  Clock::time_point now, Changes& changes) {
   for (auto next = bundles_.begin(); next != bundles_.end();) {
     const BundleKey key = next->first;
     TrackedBundle& bundle = next->second;
@@ -248,7 +253,7 @@ void MetadataBundleIndex::reconcileTrackedBundles(std::map<BundleKey, std::strin
       }
       found.erase(seen);
     } else if (dirtyFolders_.contains(parentPath(bundle.path)) && !isStillAt(bundle.path, key)) {
-      dropBundle(key, changes);
+      dropBundle(key, now, changes);
     }
   }
 }
@@ -262,6 +267,7 @@ void MetadataBundleIndex::startTracking(const BundleKey& key, const std::string&
   TrackedBundle bundle;
   bundle.path = path;
   bundle.foundAt = now;
+  bundle.replacesAnother = vacatedPaths_.erase(path) > 0;
   if (watch >= 0) {
     bundle.watch = watch;
     bundleByWatch_[watch] = key;
@@ -271,19 +277,24 @@ void MetadataBundleIndex::startTracking(const BundleKey& key, const std::string&
 }
 
 // Before any folder is listed: a folder listed now may already have the inode of a deleted one.
-void MetadataBundleIndex::dropDeletedBundles(Changes& changes) {
+void MetadataBundleIndex::dropDeletedBundles(Clock::time_point now, Changes& changes) {
   const std::set<BundleKey> keys = dirtyBundles_;
   for (const BundleKey& key : keys) {
     auto found = bundles_.find(key);
-    if (found != bundles_.end() && found->second.deleted) dropBundle(key, changes);
+    if (found != bundles_.end() && found->second.deleted) dropBundle(key, now, changes);
   }
 }
 
-void MetadataBundleIndex::dropBundle(const BundleKey& key, Changes& changes) {
+void MetadataBundleIndex::dropBundle(const BundleKey& key, Clock::time_point now,
+                                     Changes& changes) {
   auto found = bundles_.find(key);
   if (found == bundles_.end()) return;
   TrackedBundle& bundle = found->second;
-  if (bundle.matches) changes.removed.push_back(bundle.item);
+  if (bundle.matches) {
+    changes.removed.push_back(bundle.item);
+    vacatedPaths_.insert_or_assign(bundle.path, now);
+  }
+  replacementsOwingChange_.erase(key);
   if (bundle.watch >= 0) {
     bundleByWatch_.erase(bundle.watch);
     watcher_.removeWatch(bundle.watch);
@@ -318,15 +329,19 @@ void MetadataBundleIndex::readBundle(const BundleKey& key, Clock::time_point now
     return;
   }
   bundle.settled = true;
-  recordReading(bundle, std::make_shared<const PlistDictionary>(std::move(reading->attributes)),
-                changes);
+  const bool added = recordReading(
+      bundle, std::make_shared<const PlistDictionary>(std::move(reading->attributes)), changes);
+  if (added && std::exchange(bundle.replacesAnother, false)) {
+    replacementsOwingChange_.insert_or_assign(key, bundle.item);
+  }
 }
 
-void MetadataBundleIndex::recordReading(TrackedBundle& bundle,
+bool MetadataBundleIndex::recordReading(TrackedBundle& bundle,
                                         std::shared_ptr<const PlistDictionary> attributes,
                                         Changes& changes) {
   const bool matches = predicate_.matches(*attributes);
-  if (matches && !bundle.matches) {
+  const bool added = matches && !bundle.matches;
+  if (added) {
     if (!bundle.item) bundle.item = std::make_shared<MetadataItem>(MetadataItem::Access{});
     changes.added.push_back({bundle.item, attributes});
   } else if (!matches && bundle.matches) {
@@ -336,6 +351,31 @@ void MetadataBundleIndex::recordReading(TrackedBundle& bundle,
   }
   bundle.matches = matches;
   bundle.attributes = std::move(attributes);
+  return added;
+}
+
+// MARK: replacements
+
+void MetadataBundleIndex::forgetOldVacatedPaths(Clock::time_point now) {
+  std::erase_if(vacatedPaths_,
+                [&](const auto& entry) { return now - entry.second > options_.settleLimit; });
+}
+
+// A replacement's item is told changed even when a reading found nothing new since its added:
+// the change is the replacement itself. One already told changed by this work is not told twice.
+void MetadataBundleIndex::reportReplacementsAsChanged(
+    const std::map<BundleKey, std::shared_ptr<MetadataItem>>& owed, Changes& changes) {
+  for (const auto& [key, item] : owed) {
+    auto due = replacementsOwingChange_.find(key);
+    if (due == replacementsOwingChange_.end() || due->second != item) continue;
+    replacementsOwingChange_.erase(due);
+    auto found = bundles_.find(key);
+    if (found == bundles_.end() || !found->second.matches || found->second.item != item) continue;
+    const bool toldAlready =
+        std::any_of(changes.changed.begin(), changes.changed.end(),
+                    [&](const ItemChange& change) { return change.item == item; });
+    if (!toldAlready) changes.changed.push_back({item, found->second.attributes});
+  }
 }
 
 }  // namespace larder

@@ -31,6 +31,12 @@ namespace larder {
 // take its place. Two paths to one folder (a symbolic link beside the bundle) are one bundle,
 // at the path found first.
 //
+// A replacement is also told as a change once it has settled: the new item, added, comes again
+// as changed in the next application of work. An owner that keeps its record across the
+// replacement (an update it was warned of) ignores the removal and the addition and takes the
+// new bundle's attributes from that change, as from any other. A folder counts as the
+// replacement when it turns up at the path within the settle limit of the old one's going.
+//
 // Events only mark work: a folder to list again, a bundle to read again, or the scope to
 // recompute. `applyPendingWork` does the work in one go, which is what coalesces a burst of
 // events into one change per bundle. Used from one thread only.
@@ -90,6 +96,8 @@ class MetadataBundleIndex {
     // Read for good: no longer possibly half copied in.
     bool settled = false;
     bool matches = false;
+    // Took the path of a matching bundle that went just before.
+    bool replacesAnother = false;
     std::shared_ptr<const PlistDictionary> attributes;
     std::shared_ptr<MetadataItem> item;
   };
@@ -112,15 +120,20 @@ class MetadataBundleIndex {
   void unwatchFolder(std::size_t index);
   void reconcileDirtyFolders(Clock::time_point now, Changes& changes);
   std::map<BundleKey, std::string> listDirtyFolders() const;
-  void reconcileTrackedBundles(std::map<BundleKey, std::string>& found, Changes& changes);
+  void reconcileTrackedBundles(std::map<BundleKey, std::string>& found, Clock::time_point now,
+                               Changes& changes);
   void startTracking(const BundleKey& key, const std::string& path, Clock::time_point now);
-  void dropDeletedBundles(Changes& changes);
-  void dropBundle(const BundleKey& key, Changes& changes);
+  void dropDeletedBundles(Clock::time_point now, Changes& changes);
+  void dropBundle(const BundleKey& key, Clock::time_point now, Changes& changes);
   void readDirtyBundles(Clock::time_point now, bool allowSettling, Changes& changes);
   void readBundle(const BundleKey& key, Clock::time_point now, bool allowSettling,
                   Changes& changes);
-  void recordReading(TrackedBundle& bundle, std::shared_ptr<const PlistDictionary> attributes,
+  // Whether the bundle's item was added by this reading.
+  bool recordReading(TrackedBundle& bundle, std::shared_ptr<const PlistDictionary> attributes,
                      Changes& changes);
+  void forgetOldVacatedPaths(Clock::time_point now);
+  void reportReplacementsAsChanged(const std::map<BundleKey, std::shared_ptr<MetadataItem>>& owed,
+                                   Changes& changes);
 
   MetadataQueryPredicate predicate_;
   MetadataIndexWatcher& watcher_;
@@ -134,6 +147,10 @@ class MetadataBundleIndex {
   bool scopeChanged_ = false;
   std::set<std::string> dirtyFolders_;
   std::set<BundleKey> dirtyBundles_;
+  // Paths whose matching bundle went, with when: a folder arriving there soon replaces it.
+  std::map<std::string, Clock::time_point> vacatedPaths_;
+  // Replacements reported added, whose "changed" is due at the next application of work.
+  std::map<BundleKey, std::shared_ptr<MetadataItem>> replacementsOwingChange_;
   bool broken_ = false;
 };
 

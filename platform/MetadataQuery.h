@@ -51,6 +51,7 @@ struct MetadataQueryUpdate {
 // An item stays the same object while its bundle folder does: renamed or moved between watched
 // folders of one file system it is "changed" with its new path; a folder deleted or replaced,
 // or moved across file systems (a copy and a delete), is "removed" and its successor "added".
+// A successor at the same path is then also "changed", in a later event, once it has settled.
 //
 // Each bundle costs one inotify watch (fs.inotify.max_user_watches). A bundle that cannot get
 // one is still followed as it comes, goes and moves, but edits of its property lists wait for

@@ -80,9 +80,10 @@ void logChangeList(std::string_view kind, const SoftwareMap::ProductList& produc
 }  // namespace
 
 void SoftwareMap::initialDiscovery() {
-  if (std::string recovery = Environment::variable("__OSINSTALL_ENVIRONMENT"); !recovery.empty()) {
+  // The install environment may set the variable without a value: being set is what counts.
+  if (std::optional<std::string> recovery = Environment::variableIfSet("__OSINSTALL_ENVIRONMENT")) {
     TILL_LOG(1, "%@: Running in recovery mode (%s) - Disabling all software map sources", kSpeaker,
-             recovery);
+             *recovery);
     return;
   }
   ProductList discovered = discoverAppsUsingAppRegistry();

@@ -332,6 +332,8 @@ void SoftwareMap::mergeUpdate(const MappedApplications& added, const MappedAppli
                "being updated: %@",
                kSpeaker, existing);
     } else {
+      // Observers get the record itself: it must say that it is no longer there.
+      existing->update([](LedgerSoftwareProductFields& fields) { fields.installed = false; });
       changes.removed.push_back(existing);
       appsByPath_->erase(existing->bundlePath());
     }

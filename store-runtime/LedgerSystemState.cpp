@@ -59,7 +59,7 @@ bool LedgerIsDimWake() {
 }
 
 bool LedgerOnRecoveryPartition() {
-  return !Environment::variable("__OSINSTALL_ENVIRONMENT").empty();
+  return Environment::variableIfSet("__OSINSTALL_ENVIRONMENT").has_value();
 }
 
 bool LedgerIsGuestUserName(std::string_view userName) {

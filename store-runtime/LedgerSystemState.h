@@ -18,7 +18,7 @@ namespace larder {
 bool LedgerIsDimWake();
 
 // The process runs from an OS install environment: the variable
-// __OSINSTALL_ENVIRONMENT is set to a non-empty value.
+// __OSINSTALL_ENVIRONMENT is set, to any value, the empty one included.
 bool LedgerOnRecoveryPartition();
 
 // The session is a guest session: "guestUser" (boolean) of the system

@@ -531,6 +531,14 @@ TEST_F(MetadataQueryTest, ReplacingABundleIsARemovalAndAnAddition) {
   ASSERT_EQ(merged.added.size(), 1u);
   EXPECT_NE(merged.added[0].item, old);
   EXPECT_EQ(merged.added[0].attributes.at("kHostItemVersion"), PlistValue("2.0"));
+  // Settled, the replacement is told as a change of the new item too.
+  std::optional<RecordedUpdate> settled = recorder->nextUpdate();
+  ASSERT_TRUE(settled.has_value());
+  EXPECT_THAT(settled->added, IsEmpty());
+  EXPECT_THAT(settled->removed, IsEmpty());
+  ASSERT_EQ(settled->changed.size(), 1u);
+  EXPECT_EQ(settled->changed[0].item, merged.added[0].item);
+  EXPECT_EQ(settled->changed[0].attributes.at("kHostItemVersion"), PlistValue("2.0"));
 }
 
 // Deleted and made again at once, the new folder often gets the inode of the old one: it must
@@ -560,6 +568,13 @@ TEST_F(MetadataQueryTest, BundleDeletedAndMadeAgainIsANewItem) {
     EXPECT_EQ(merged.added[0].path(), applications(name));
     EXPECT_EQ(merged.added[0].attributes.at("kHostItemVersion"), PlistValue(name));
     ASSERT_EQ(query->resultCount(), 1u);
+    if (name == std::string("Notes.app")) {
+      // At the same path it is a replacement, which is also told as a change once settled.
+      std::optional<RecordedUpdate> settled = recorder->nextUpdate();
+      ASSERT_TRUE(settled.has_value());
+      ASSERT_EQ(settled->changed.size(), 1u);
+      EXPECT_EQ(settled->changed[0].item, merged.added[0].item);
+    }
   }
 }
 

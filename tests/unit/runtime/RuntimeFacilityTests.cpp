@@ -622,10 +622,19 @@ TEST_F(RuntimeFacilityTest, DimWakeGuestAndRecoveryComeFromTheirSources) {
   EXPECT_FALSE(LedgerIsGuestUserName("root"));
   EXPECT_FALSE(LedgerIsGuestUserName(""));
 
-  ::setenv("__OSINSTALL_ENVIRONMENT", "1", 1);
-  EXPECT_TRUE(LedgerOnRecoveryPartition());
-  ::setenv("__OSINSTALL_ENVIRONMENT", "", 1);
-  EXPECT_FALSE(LedgerOnRecoveryPartition());
+  // Being set is what counts, whatever the value.
+  struct RecoveryCase {
+    const char* value;  // nullptr: unset
+    bool recovery;
+  };
+  for (const RecoveryCase& c :
+       {RecoveryCase{nullptr, false}, RecoveryCase{"", true}, RecoveryCase{"1", true}}) {
+    if (c.value)
+      ::setenv("__OSINSTALL_ENVIRONMENT", c.value, 1);
+    else
+      ::unsetenv("__OSINSTALL_ENVIRONMENT");
+    EXPECT_EQ(LedgerOnRecoveryPartition(), c.recovery) << (c.value ? c.value : "(unset)");
+  }
 }
 
 TEST_F(RuntimeFacilityTest, CriticalUpdateTimeStampIsKeptPerUser) {

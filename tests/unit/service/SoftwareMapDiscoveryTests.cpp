@@ -98,16 +98,29 @@ TEST_F(SoftwareMapDiscoveryTest, DiscoveryTakesStoreBundlesAndTheSetupHeraldOnly
 
 TEST_F(SoftwareMapDiscoveryTest, RecoveryEnvironmentDisablesDiscovery) {
   makeStoreBundle(rootApplications(), "Store", "com.example.store", "1.0", 1);
-  ::setenv("__OSINSTALL_ENVIRONMENT", "1", 1);
-  LogCapture log;
-  SoftwareMap map(options(storePath(), true));
-  map.waitUntilIdle();
-  EXPECT_TRUE(map.allProducts().empty());
-  EXPECT_EQ(log.countExactly("SoftwareMap: Running in recovery mode (1) - Disabling all software "
-                             "map sources",
-                             1),
-            1U)
-      << log.dump();
+  // Set at all, the empty value included, is recovery.
+  struct Case {
+    const char* value;  // nullptr: unset
+    std::size_t productsFound;
+  };
+  for (const Case& c : {Case{nullptr, 1}, Case{"", 0}, Case{"1", 0}}) {
+    const std::string value = c.value ? c.value : "";
+    if (c.value)
+      ::setenv("__OSINSTALL_ENVIRONMENT", c.value, 1);
+    else
+      ::unsetenv("__OSINSTALL_ENVIRONMENT");
+    LogCapture log;
+    // A store of its own: recovery keeps what an earlier case stored.
+    SoftwareMap map(options(storePath(c.value ? "set-" + value : "unset"), true));
+    map.waitUntilIdle();
+    EXPECT_EQ(map.allProducts().size(), c.productsFound)
+        << "value: " << (c.value ? value : "unset");
+    EXPECT_EQ(log.countExactly("SoftwareMap: Running in recovery mode (" + value +
+                                   ") - Disabling all software map sources",
+                               1),
+              c.value ? 1U : 0U)
+        << log.dump();
+  }
 }
 
 TEST_F(SoftwareMapDiscoveryTest, ReloadMergesIntoTheSameRecordsAndNotifiesInOrder) {

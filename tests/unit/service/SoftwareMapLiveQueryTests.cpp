@@ -1,5 +1,9 @@
-// The live queries as the map uses them: recovery from a lost event queue.
+// The live queries as the map uses them: removals, announced replacements and recovery from a
+// lost event queue.
 #include <gtest/gtest.h>
+
+#include <fcntl.h>
+#include <stdio.h>
 
 #include <chrono>
 #include <thread>
@@ -9,7 +13,55 @@
 namespace larder::testing {
 namespace {
 
-class SoftwareMapLiveQueryTest : public ServiceTest {};
+class SoftwareMapLiveQueryTest : public ServiceTest {
+ protected:
+  // A map kept live by both queries, once their first results are merged.
+  std::unique_ptr<SoftwareMap> startLiveMap(const LogCapture& log) {
+    SoftwareMap::Options options = this->options(storePath("live"), true);
+    options.liveQueries = true;
+    auto map = std::make_unique<SoftwareMap>(options);
+    EXPECT_TRUE(
+        eventually([&] { return log.countContaining("MetadataQuery initial load took") >= 2; }));
+    return map;
+  }
+};
+
+TEST_F(SoftwareMapLiveQueryTest, ABundleDeletedIsAnnouncedAsNoLongerInstalled) {
+  std::string path = makeStoreBundle(rootApplications(), "Gone", "com.example.gone", "1.0", 21);
+  LogCapture log;
+  std::unique_ptr<SoftwareMap> map = startLiveMap(log);
+  auto observer = std::make_shared<RecordingObserver>();
+  map->addObserver(observer);
+  fs::remove_all(path);
+  ASSERT_TRUE(eventually([&] { return !observer->calls().empty(); })) << log.dump();
+  RecordingObserver::Call call = observer->calls().front();
+  EXPECT_EQ(call.state, kSoftwareProductRemoved);
+  EXPECT_EQ(call.fieldsAtCall.bundlePath, path);
+  EXPECT_FALSE(call.fieldsAtCall.installed);
+}
+
+TEST_F(SoftwareMapLiveQueryTest, AnAnnouncedReplacementBringsTheNewVersionWithoutAScan) {
+  std::string path =
+      makeStoreBundle(rootApplications(), "Updating", "com.example.updating", "2.4", 41, 240);
+  LogCapture log;
+  std::unique_ptr<SoftwareMap> map = startLiveMap(log);
+  LedgerSoftwareProductRef record = map->productForItemIdentifier(41);
+  ASSERT_NE(record, nullptr);
+
+  map->productAtPathWillBeUpdatedToBundleVersionStoreVersion(path, "2.5", 250);
+  // As the installer does: the new bundle is exchanged with the old, which is then deleted.
+  std::string staged =
+      makeStoreBundle(temporary() + "/staging", "Updating", "com.example.updating", "2.5", 41, 250);
+  ASSERT_EQ(::renameat2(AT_FDCWD, staged.c_str(), AT_FDCWD, path.c_str(), RENAME_EXCHANGE), 0);
+  fs::remove_all(staged);
+  // The new item's arrival ends the expectation; only then is the update reported done.
+  ASSERT_TRUE(eventually([&] { return !record->snapshot().metadataChangeIsExpected; }));
+  map->productAtPathWasUpdatedToBundleVersionStoreVersion(path, true, "2.5", 250);
+
+  EXPECT_TRUE(eventually([&] { return record->bundleVersion() == "2.5"; })) << log.dump();
+  EXPECT_EQ(record->snapshot().versionIdentifier, 250);
+  EXPECT_EQ(map->productForItemIdentifier(41), record);
+}
 
 TEST_F(SoftwareMapLiveQueryTest, AnOverflowRestartsTheQueriesAndTheirResultsRepairTheMap) {
   makeStoreBundle(rootApplications(), "Before", "com.example.before", "1.0", 31);
