@@ -55,6 +55,10 @@ std::optional<std::string> TillDownloadAsset::unusableReason() const {
   if (numberOfBytesToHash_ <= 0) {
     return "asset chunk size " + std::to_string(numberOfBytesToHash_) + " is not positive";
   }
+  if (std::optional<std::string> problem = VendChunkDigestVerifier::chunkSizeProblem(
+          static_cast<std::uint64_t>(numberOfBytesToHash_))) {
+    return "asset " + *problem;
+  }
   const auto chunks = static_cast<std::uint64_t>((fileSize_ - 1) / numberOfBytesToHash_ + 1);
   if (hashes_.size() != chunks) {
     return "asset of " + std::to_string(fileSize_) + " bytes in chunks of " +

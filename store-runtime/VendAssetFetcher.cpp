@@ -1,10 +1,13 @@
 #include "store-runtime/VendAssetFetcher.h"
 
 #include <curl/curl.h>
+#include <sys/statvfs.h>
 #include <unistd.h>
 
 #include <atomic>
+#include <cerrno>
 #include <cmath>
+#include <cstring>
 #include <filesystem>
 
 #include "store-runtime/TillLogManager.h"
@@ -17,6 +20,9 @@ namespace larder {
 namespace {
 
 constexpr std::string_view kSpeaker = "VendAssetFetcher";
+// What a download must leave free on its file system, for the install that
+// follows and for everything else kept there.
+constexpr std::uint64_t kSpareBytes = 64u << 20u;
 
 VendURLRequest requestFor(const TillDownloadAsset& asset,
                           const VendAssetFetcher::Settings& settings) {
@@ -61,6 +67,28 @@ bool isRangeRefusal(const VendHTTPTransfer::Result& result) {
          result.response.statusCode == 416;
 }
 
+// A store may announce any size, and its bytes are checked only as they
+// arrive: a file that cannot fit is refused before the first one, rather
+// than found out when the disk is full.
+OptionalError roomFor(const std::string& partialPath, std::uint64_t bytes) {
+  const std::string folder = std::filesystem::path(partialPath).parent_path().string();
+  struct statvfs info {};
+  if (::statvfs(folder.c_str(), &info) != 0) {
+    return VendDownloadError::make(
+        VendDownloadError::kFileSystem,
+        "Cannot inspect the file system of " + folder + ": " + std::strerror(errno));
+  }
+  const std::uint64_t available = static_cast<std::uint64_t>(info.f_bavail) * info.f_frsize;
+  if (bytes <= available && available - bytes >= kSpareBytes) return std::nullopt;
+  VendError error = VendDownloadError::make(
+      VendDownloadError::kFileSystem,
+      "The download " + partialPath + " needs " + std::to_string(bytes) +
+          " more bytes; the file system of " + folder + " has " + std::to_string(available) +
+          " free and keeps " + std::to_string(kSpareBytes) + " of them spare");
+  TILL_LOG(1, "%@: Refusing to download: %@", kSpeaker, error.descriptionText());
+  return error;
+}
+
 void removeFile(const std::string& path) {
   std::error_code ignored;
   std::filesystem::remove(path, ignored);
@@ -99,6 +127,9 @@ AttemptResult fetchOnce(const TillDownloadAsset& asset, const std::string& parti
   if (offset == fileSize) {
     if (OptionalError error = writer->finish()) return failed(std::move(*error));
     return {Attempt::kDone, {VendAssetFetcher::Outcome::kCompleted, std::nullopt}};
+  }
+  if (OptionalError error = roomFor(partialPath, fileSize - offset)) {
+    return failed(std::move(*error));
   }
 
   const VendURLRequest request = requestFor(asset, settings);

@@ -119,7 +119,9 @@ VendAssetFileWriter::VendAssetFileWriter(int fd, std::string path, VendChunkDige
     : fd_(fd),
       path_(std::move(path)),
       verifier_(std::move(verifier)),
-      existingBytes_(existingBytes) {
+      existingBytes_(existingBytes),
+      declaredSize_(verifier_.fileSize()),
+      written_(existingBytes) {
   filling_.reserve(kBufferSize);
   consumer_ = std::thread([this] { consume(); });
 }
@@ -131,6 +133,16 @@ VendAssetFileWriter::~VendAssetFileWriter() {
 
 bool VendAssetFileWriter::append(std::span<const std::uint8_t> bytes) {
   if (failed()) return false;
+  // The verifier would catch a longer file too, but only on the hashing
+  // thread, after the bytes were on disk: a store that sends without end
+  // would fill it first.
+  if (bytes.size() > declaredSize_ - written_) {
+    recordFailure(VendDownloadError::make(
+        VendDownloadError::kSizeMismatch,
+        "The download " + path_ + " is longer than the " + std::to_string(declaredSize_) +
+            " bytes its manifest announces; the rest was not written"));
+    return false;
+  }
   // Written straight from the transfer's own buffer while its bytes are
   // still in the processor's cache; the copy for the hashing thread then
   // reads them from there too.
@@ -138,6 +150,7 @@ bool VendAssetFileWriter::append(std::span<const std::uint8_t> bytes) {
     recordFailure(fileError("write", path_, errno));
     return false;
   }
+  written_ += bytes.size();
   while (!bytes.empty()) {
     const std::size_t take = std::min(bytes.size(), kBufferSize - filling_.size());
     filling_.insert(filling_.end(), bytes.begin(),

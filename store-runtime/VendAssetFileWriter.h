@@ -42,7 +42,8 @@ class VendAssetFileWriter {
   [[nodiscard]] std::uint64_t existingBytes() const { return existingBytes_; }
 
   // Takes the next bytes of the transfer. False once a digest, the size or
-  // the disk has failed: the transfer should stop.
+  // the disk has failed: the transfer should stop. Bytes beyond the size
+  // the manifest announces fail at once and are not written.
   bool append(std::span<const std::uint8_t> bytes);
   [[nodiscard]] bool failed() const { return failed_.load(std::memory_order_relaxed); }
 
@@ -69,6 +70,8 @@ class VendAssetFileWriter {
   std::string path_;
   VendChunkDigestVerifier verifier_;  // touched by the hashing thread only, until drained
   std::uint64_t existingBytes_;
+  std::uint64_t declaredSize_;  // the manifest's, fixed when opened
+  std::uint64_t written_;       // in the file, the existing bytes included
   Buffer filling_;
 
   std::mutex mutex_;

@@ -62,6 +62,15 @@ struct VendChunkDigestVerifier::Hasher {
   std::unique_ptr<EVP_MD_CTX, ContextDeleter> context;
 };
 
+std::optional<std::string> VendChunkDigestVerifier::chunkSizeProblem(std::uint64_t chunkSize) {
+  if (chunkSize == 0) return "chunk size is 0";
+  if (chunkSize > kMaxChunkSize) {
+    return "chunk size " + std::to_string(chunkSize) + " is over the limit of " +
+           std::to_string(kMaxChunkSize) + " bytes";
+  }
+  return std::nullopt;
+}
+
 std::optional<std::string> VendChunkDigestVerifier::digestListProblem(
     const std::vector<std::string>& hexDigests) {
   if (hexDigests.empty()) return "no digests";
@@ -83,8 +92,8 @@ std::optional<std::string> VendChunkDigestVerifier::digestListProblem(
 VendChunkDigestVerifier::VendChunkDigestVerifier(std::uint64_t fileSize, std::uint64_t chunkSize,
                                                  const std::vector<std::string>& hexDigests)
     : fileSize_(fileSize), chunkSize_(chunkSize), expectedCount_(hexDigests.size()) {
-  if (chunkSize_ == 0) {
-    fail(Failure::kBadManifest, "the manifest's chunk size is 0");
+  if (std::optional<std::string> problem = chunkSizeProblem(chunkSize_)) {
+    fail(Failure::kBadManifest, "the manifest's " + *problem);
     return;
   }
   if (std::optional<std::string> problem = digestListProblem(hexDigests)) {

@@ -22,12 +22,19 @@ class VendChunkDigestVerifier {
  public:
   enum class Failure {
     kNone,
-    kBadManifest,     // digests that are not hex of one known length, or a zero chunk size
+    kBadManifest,     // digests that are not hex of one known length, or a chunk size of 0
+                      // or over kMaxChunkSize
     kDigestMismatch,  // a chunk's digest differs
     kTooLong,         // more bytes than the file size
     kTooShort,        // the transfer ended before the file size
     kChunkCount,      // the file has more or fewer chunks than digests
   };
+
+  // The most bytes one digest may cover. A bad chunk is found only when
+  // its last byte arrives, so this bounds what a store can have written
+  // before its bytes are caught; one digest for a whole file of any size
+  // bounds nothing.
+  static constexpr std::uint64_t kMaxChunkSize = 64u << 20u;
 
   VendChunkDigestVerifier(std::uint64_t fileSize, std::uint64_t chunkSize,
                           const std::vector<std::string>& hexDigests);
@@ -51,6 +58,8 @@ class VendChunkDigestVerifier {
   [[nodiscard]] std::uint64_t bytesReceived() const { return received_; }
   [[nodiscard]] std::uint64_t fileSize() const { return fileSize_; }
 
+  // Why a chunk size cannot be checked against, or nullopt.
+  static std::optional<std::string> chunkSizeProblem(std::uint64_t chunkSize);
   // Why a list of hex digests cannot be checked against, or nullopt.
   static std::optional<std::string> digestListProblem(const std::vector<std::string>& hexDigests);
 

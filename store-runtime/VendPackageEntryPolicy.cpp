@@ -80,24 +80,26 @@ std::optional<std::string> VendPackageEntryPolicy::symlinkEscape(
     const std::vector<std::string>& linkPlace, std::string_view target) {
   if (target.empty()) return "has an empty target";
   if (target.front() == '/') return "points to the absolute path \"" + std::string(target) + "\"";
-  // Resolve the target from the folder that holds the link, by name only:
-  // every link inside the bundle is checked the same way, so a chain of
-  // links cannot leave it either.
-  std::vector<std::string_view> resolved(linkPlace.begin(), linkPlace.end());
-  if (!resolved.empty()) resolved.pop_back();
-  std::size_t start = 0;
-  while (start <= target.size()) {
-    const std::size_t end = target.find('/', start);
-    const std::string_view part =
-        target.substr(start, end == std::string_view::npos ? std::string_view::npos : end - start);
-    if (part == "..") {
-      if (resolved.empty()) return "points outside the bundle (\"" + std::string(target) + "\")";
-      resolved.pop_back();
-    } else if (!part.empty() && part != ".") {
-      resolved.push_back(part);
+  // A name in a target may be another link of the package, and a ".."
+  // after it climbs from wherever that link leads, not from the folder its
+  // name suggests: a chain of such links leaves the bundle while each one
+  // looks contained by name. So ".." may only lead a target. Climbing from
+  // the link's own folder is then exact, because that folder and those
+  // above it are real folders (nothing is extracted through a link), and
+  // every link a target then descends through is held to the same rule.
+  std::size_t depth = linkPlace.empty() ? 0 : linkPlace.size() - 1;
+  bool descended = false;
+  for (std::string_view part : components(target)) {
+    if (part != "..") {
+      descended = true;
+    } else if (descended) {
+      return "climbs with \"..\" after a name, which may be a link (\"" + std::string(target) +
+             "\")";
+    } else if (depth == 0) {
+      return "points outside the bundle (\"" + std::string(target) + "\")";
+    } else {
+      --depth;
     }
-    if (end == std::string_view::npos) break;
-    start = end + 1;
   }
   return std::nullopt;
 }

@@ -10,8 +10,9 @@ namespace larder {
 // Decides, entry by entry, whether a package may be extracted. A package
 // holds exactly one top-level "<Name>.app" folder, and nothing in it may
 // reach outside that folder: no absolute or climbing paths, no links that
-// resolve outside it, no devices, no second top-level item. Stateful: the
-// first entry fixes the bundle folder's name for the rest.
+// resolve outside it (a link's target may climb with ".." only at its
+// start), no devices, no second top-level item. Stateful: the first entry
+// fixes the bundle folder's name for the rest.
 class VendPackageEntryPolicy {
  public:
   enum class Kind { kFile, kDirectory, kSymlink, kHardLink, kOther };

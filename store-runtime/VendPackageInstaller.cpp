@@ -18,6 +18,7 @@
 #include "store-runtime/ArchiveLibrary.h"
 #include "store-runtime/TillLogManager.h"
 #include "store-runtime/VendDownloadError.h"
+#include "store-runtime/VendFileManager.h"
 #include "store-runtime/VendPackageEntryPolicy.h"
 
 namespace larder {
@@ -249,12 +250,15 @@ std::optional<fs::path> makeTemporaryFolder(const fs::path& parent, std::string_
   return fs::path(pattern);
 }
 
+// A bundle without an identifier could never be found again to be
+// updated or replaced, and one with another identifier is not what was
+// bought.
 OptionalError checkBundleIdentifier(const fs::path& staging, const std::string& expected,
                                     const std::string& packagePath) {
-  if (expected.empty()) return std::nullopt;
   std::optional<Bundle> bundle = Bundle::open(staging.string());
   std::optional<std::string> found = bundle ? bundle->identifier() : std::nullopt;
-  if (found && *found != expected) {
+  if (!found || found->empty()) return unsafe(packagePath, "its bundle has no identifier");
+  if (!expected.empty() && *found != expected) {
     return unsafe(packagePath, "it holds the bundle \"" + *found + "\", the download is for \"" +
                                    expected + "\"");
   }
@@ -325,13 +329,29 @@ struct Destination {
   bool replacing = false;
 };
 
+// The identifier comes from the store, which may name any application
+// installed here: only store software in an application folder, which
+// this user may replace, is taken over.
+std::optional<Destination> installedDestination(const std::string& bundleIdentifier,
+                                                const std::string& installed,
+                                                OptionalError& error) {
+  if (VendFileManager::isInstallableAtPath(installed) &&
+      VendFileManager::isQuaymartAppAtPath(installed)) {
+    return Destination{fs::path(installed), true};
+  }
+  error = installFailure("Cannot install \"" + bundleIdentifier + "\": the installed bundle " +
+                         installed + " is not store software that may be replaced");
+  TILL_LOG(1, "%@: Refusing to replace %@: %@", kSpeaker, installed, error->descriptionText());
+  return std::nullopt;
+}
+
 std::optional<Destination> destinationFor(const std::string& bundleIdentifier,
                                           const std::string& bundleFolderName,
                                           OptionalError& error) {
   if (!bundleIdentifier.empty()) {
     if (std::optional<std::string> installed =
             ApplicationRegistry::pathForBundleIdentifier(bundleIdentifier)) {
-      return Destination{fs::path(*installed), true};
+      return installedDestination(bundleIdentifier, *installed, error);
     }
   }
   fs::path path = fs::path(Environment::rootedPath("/Applications")) / bundleFolderName;

@@ -14,9 +14,10 @@ namespace larder {
 //  - the staging folder then takes the destination's place in one rename
 //    (a new bundle) or one exchange (a bundle that is already installed,
 //    whose old tree is removed afterwards).
-// The destination is the installed bundle of that identifier, else
-// "<root>/Applications/<Name>.app". After a failure the destination is as
-// it was and no staging folder remains.
+// The destination is the installed bundle of that identifier, which must be
+// store software this user may replace, else "<root>/Applications/<Name>.app".
+// After a failure the destination is as it was and no staging folder
+// remains.
 class VendPackageInstaller {
  public:
   struct Options {
@@ -35,8 +36,8 @@ class VendPackageInstaller {
   VendPackageInstaller() = default;
   explicit VendPackageInstaller(Options options) : options_(options) {}
 
-  // `bundleIdentifier` finds the installed bundle to replace; when it is
-  // not empty, the package's bundle must carry the same identifier.
+  // `bundleIdentifier` finds the installed bundle to replace; the package's
+  // bundle must carry an identifier, the same one when it is not empty.
   [[nodiscard]] Result install(const std::string& packagePath,
                                const std::string& bundleIdentifier) const;
 

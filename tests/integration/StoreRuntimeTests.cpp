@@ -11,6 +11,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -20,6 +21,8 @@
 #include "StoreCatalogueBuilder.h"
 #include "StoreServerProcess.h"
 #include "platform/DispatchSemaphore.h"
+#include "platform/FileIO.h"
+#include "platform/PropertyListSerialization.h"
 #include "store-runtime/TillDownload.h"
 #include "store-runtime/TillLogManager.h"
 #include "store-runtime/TillPurchase.h"
@@ -174,8 +177,8 @@ class StoreRuntimeTest : public ::testing::Test {
   }
 
   // The purchase's one download, to be installed by the test.
-  std::shared_ptr<TillDownload> purchasedDownload() {
-    auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
+  std::shared_ptr<TillDownload> purchasedDownload(std::uint64_t item = kNotesItem) {
+    auto result = purchase(item, VendTransactionService::kLeaveDownloadsToCaller);
     EXPECT_TRUE(result.success) << (result.error ? result.error->descriptionText() : "");
     if (!result.response || result.response->downloads().size() != 1) return nullptr;
     auto download = result.response->downloads().front();
@@ -222,6 +225,55 @@ TEST_F(StoreRuntimeTest, PurchaseDownloadsChecksAndInstallsTheBundle) {
   EXPECT_TRUE(fs::exists(installedBundle() + "/bundle.plist"));
   EXPECT_TRUE(fs::exists(installedBundle() + "/purchase.plist"));
   EXPECT_EQ(store_->requestCount("buy-product"), 1U);
+}
+
+// Every path below `folder`, with a hash of the contents of its files.
+std::map<std::string, std::size_t> filesBelow(const std::string& folder) {
+  std::map<std::string, std::size_t> files;
+  for (const auto& entry : fs::recursive_directory_iterator(folder)) {
+    const auto bytes = FileIO::read(entry.path().string());
+    files[fs::relative(entry.path(), folder).string()] =
+        bytes ? std::hash<std::string>{}(std::string(bytes->begin(), bytes->end())) : 0;
+  }
+  return files;
+}
+
+// The store names the bundle to replace by the identifier it sends, and
+// sends the bundle too: neither may take over anything but store software
+// of the identifier bought.
+TEST_F(StoreRuntimeTest, AnInstallReplacesOnlyStoreSoftwareWithTheBundleBought) {
+  const std::string applications = platform_.root() + "/Applications";
+  platform_.installBundle({applications, "Other", "com.example.Other"});
+  platform_.installBundle({applications, "Notes", "com.example.Notes", "1.0", kNotesItem});
+  catalogue_.addItem({.wareID = 502, .bundleID = "com.example.Other", .title = "Other"});
+  const std::string nameless = catalogue_.makeBundle("Nameless", "", "1.0", 503, 4096);
+  FileIO::writeAtomically(
+      nameless + "/bundle.plist",
+      PropertyListSerialization::writeXml(PlistDictionary{{"HostBundleExecutable", "Nameless"}}));
+  catalogue_.addItem({.wareID = 503,
+                      .bundleID = "com.example.Nameless",
+                      .title = "Nameless",
+                      .bundlePath = nameless});
+  catalogue_.addItem(
+      {.wareID = 504,
+       .bundleID = "com.example.Notes",
+       .title = "Impostor",
+       .bundlePath = catalogue_.makeBundle("Impostor", "com.example.Impostor", "9.0", 504, 4096)});
+  const auto before = filesBelow(applications);
+  startStore();
+  signIn();
+  const std::vector<std::pair<std::uint64_t, std::string>> refusals = {
+      {502, "is not store software"}, {503, "has no identifier"}, {504, "com.example.Impostor"}};
+  for (const auto& [item, phrase] : refusals) {
+    SCOPED_TRACE(item);
+    auto download = purchasedDownload(item);
+    ASSERT_TRUE(download);
+    auto outcome = install(download);
+    const std::string why = outcome.error ? outcome.error->description : "";
+    EXPECT_EQ(outcome.result, 0);
+    EXPECT_NE(why.find(phrase), std::string::npos) << why;
+  }
+  EXPECT_EQ(filesBelow(applications), before);
 }
 
 TEST_F(StoreRuntimeTest, PurchaseWithoutOptionsStartsTheInstallItself) {

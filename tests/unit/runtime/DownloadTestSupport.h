@@ -198,10 +198,13 @@ inline std::string bundlePackage(const std::string& name, const std::string& ide
       .bytes();
 }
 
-// Installs a bundle directly, as if it had been there before.
+// Installs a bundle directly, as if the store had installed it before.
 inline void installBundleDirectly(const fs::path& path, const std::string& identifier,
                                   const std::string& version) {
   writeFile(path / "bundle.plist", bundleInfo(identifier, version));
+  writeFile(path / "purchase.plist",
+            PropertyListSerialization::writeXml(
+                PlistDictionary{{"bundleIdentifier", identifier}, {"bundleVersion", version}}));
   writeFile(path / "resources/version.txt", version);
   writeFile(path / "resources/only-in-old.txt", "old");
 }
