@@ -1,5 +1,6 @@
 #include "AssetService/AssetServiceInterface.h"
 
+#include "AssetService/ServiceError.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/TillLogManager.h"
 #include "update-queue/UpdateQueue.h"
@@ -147,8 +148,12 @@ void AssetServiceInterface::checkForUpdatesWithUserHasSeenUpdates(
     return;
   }
   auto queue = updateQueue();
-  // Without a queue the reply belonged to it: it is never sent.
-  if (!queue) return;
+  // Without a store client there is no queue for the reply to belong to;
+  // the caller hears so at once instead of waiting out its timeout.
+  if (!queue) {
+    if (reply) throw ServiceError::noStoreClient("CheckForUpdatesWithUserHasSeenUpdates");
+    return;
+  }
   queue->checkForUpdatesWithCompletionHandler(
       [queue, userHasSeenUpdates, reply = std::move(reply)](
           bool success, const UpdateQueue::UpdateList& available,

@@ -11,6 +11,8 @@
 #include <sdbus-c++/IObject.h>
 #include <sdbus-c++/Message.h>
 
+#include "AssetService/ServiceError.h"
+
 namespace larder {
 
 // One method of an interface the service exports beside its request
@@ -35,7 +37,8 @@ inline const BusMethod* findBusMethod(std::span<const BusMethod> methods, std::s
 
 // Adds `methods` of `interfaceName` to the object, each handled by the
 // target's member function of the same name. A D-Bus error thrown by a
-// handler becomes the call's error reply.
+// handler becomes the call's error reply, and so does any other failure,
+// as the service's Failed error: a caller is never left to its timeout.
 template <typename Target>
 void exportBusMethods(
     sdbus::IObject& object, std::string_view interfaceName, std::span<const BusMethod> methods,
@@ -43,16 +46,19 @@ void exportBusMethods(
     const std::shared_ptr<Target>& target) {
   for (const BusMethod& method : methods) {
     auto handler = handlers.at(method.member);
-    object.registerMethod(std::string(interfaceName), std::string(method.member),
-                          std::string(method.inSignature), method.inNames,
-                          std::string(method.outSignature), method.outNames,
-                          [target, handler](sdbus::MethodCall call) {
-                            try {
-                              ((*target).*handler)(call);
-                            } catch (const sdbus::Error& error) {
-                              call.createErrorReply(error).send();
-                            }
-                          });
+    object.registerMethod(
+        std::string(interfaceName), std::string(method.member), std::string(method.inSignature),
+        method.inNames, std::string(method.outSignature), method.outNames,
+        [target, handler](sdbus::MethodCall call) {
+          try {
+            ((*target).*handler)(call);
+          } catch (const sdbus::Error& error) {
+            call.createErrorReply(error).send();
+          } catch (const std::exception& failure) {
+            call.createErrorReply(sdbus::Error(std::string(ServiceError::kFailed), failure.what()))
+                .send();
+          }
+        });
   }
 }
 

@@ -1,5 +1,8 @@
 #include "AssetService/DBusValueCodec.h"
 
+#include <algorithm>
+#include <array>
+
 #include <sdbus-c++/Error.h>
 #include <sdbus-c++/Types.h>
 
@@ -31,6 +34,24 @@ std::size_t completeTypeLength(std::string_view signature) {
     default:
       return 1;
   }
+}
+
+// A property list keeps no unsigned kind below 2^63, so the keys of
+// record fields that are uint64 say it: their values travel as `t`, as the
+// documented types promise, whatever their size.
+bool isUnsignedField(std::string_view key) {
+  static constexpr std::array<std::string_view, 9> kKeys = {
+      "accountID",           "accountIdentifier",  "daapItemIdentifier",
+      "daapPurchasedToken",  "downloadAssetSize",  "itemIdentifier",
+      "oaxenItemIdentifier", "publicationVersion", "ware-id"};
+  return std::ranges::find(kKeys, key) != kKeys.end();
+}
+
+std::string signatureInDictionary(std::string_view key, const PlistValue& value) {
+  const bool nonNegative = value.type() == PlistValue::Type::UnsignedInteger ||
+                           (value.type() == PlistValue::Type::Integer && value.int64Value() >= 0);
+  if (nonNegative && isUnsignedField(key)) return "t";
+  return DBusValueCodec::naturalSignature(value);
 }
 
 template <typename T>
@@ -198,7 +219,7 @@ class Writer {
                                                                                  : "/");
         return;
       case 'v':
-        writeVariant(value);
+        writeVariant(value, DBusValueCodec::naturalSignature(value));
         return;
       case 'a':
         writeArray(signature.substr(1), value);
@@ -209,8 +230,7 @@ class Writer {
   }
 
  private:
-  void writeVariant(const PlistValue& value) {
-    std::string contents = DBusValueCodec::naturalSignature(value);
+  void writeVariant(const PlistValue& value, const std::string& contents) {
     message_.openVariant(contents);
     write(contents, value);
     message_.closeVariant();
@@ -244,7 +264,11 @@ class Writer {
         if (element.isNull()) continue;
         message_.openDictEntry(inner);
         message_ << key;
-        write(valueType, element);
+        if (valueType == "v") {
+          writeVariant(element, signatureInDictionary(key, element));
+        } else {
+          write(valueType, element);
+        }
         message_.closeDictEntry();
       }
     }

@@ -13,8 +13,9 @@ namespace larder {
 // Moves property-list values in and out of D-Bus messages, driven by the
 // D-Bus signature of each argument. Records and dictionaries travel as
 // a{sv}; values inside variants take their natural signature (see
-// `naturalSignature`). An absent value is written as the empty value of
-// the signature: "" for a string, 0, false, an empty container.
+// `naturalSignature`), except that the uint64 fields of records
+// (identifiers, tokens, sizes: see docs/dbus.md) go as `t`. An absent value is written as the empty
+// value of the signature: "" for a string, 0, false, an empty container.
 class DBusValueCodec {
  public:
   // Deepest nesting accepted from a peer; deeper input is refused.

@@ -5,6 +5,7 @@
 
 #include "AssetService/AssetServiceInterface.h"
 #include "AssetService/DBusValueCodec.h"
+#include "AssetService/ServiceError.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/TillLogManager.h"
 #include "update-queue/UpdateQueue.h"
@@ -15,7 +16,7 @@ namespace {
 
 using Arguments = PlistArray;
 constexpr auto kEmpty = WithoutTarget::kEmptyReply;
-constexpr auto kNoReply = WithoutTarget::kNoReply;
+constexpr auto kErrorReply = WithoutTarget::kErrorReply;
 constexpr auto kNothing = WithoutTarget::kNothing;
 
 void answer(const ReplyHandler& reply, PlistArray outArguments) {
@@ -151,10 +152,10 @@ constexpr std::array kRequests = std::to_array<RequestDescriptor>({
    false, nullptr, kNothing},
   {"startAppUpdates:andOSUpdates:withDelegate:replyBlock:",
    "StartAppUpdatesAndOSUpdatesWithDelegate", "aa{sv}aa{sv}o", "ba{sv}",
-   "appUpdates,osUpdates,delegate", "success,error", false, nullptr, kNoReply},
+   "appUpdates,osUpdates,delegate", "success,error", false, nullptr, kErrorReply},
   {"startAppInstallWithTags:fallbackPurchase:reply:", "StartAppInstallWithTagsFallbackPurchase",
    "asa{sv}", "bsa{sv}a{sv}", "tags,fallbackPurchase", "success,path,response,error", false,
-   nullptr, kNoReply},
+   nullptr, kErrorReply},
   {"checkForUpdatesWithUserHasSeenUpdates:replyBlock:", "CheckForUpdatesWithUserHasSeenUpdates",
    "b", "baa{sv}a{sv}", "userHasSeenUpdates", "success,updates,error", false,
    [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {
@@ -177,7 +178,7 @@ constexpr std::array kRequests = std::to_array<RequestDescriptor>({
      }
    }},
   {"updatesForTags:replyBlock:", "UpdatesForTags", "as", "aa{sv}", "tags", "updates", false,
-   nullptr, kNoReply},
+   nullptr, kErrorReply},
   {"willInteractivelyPurchaseItemIdentifier:replyBlock:", "WillInteractivelyPurchaseItemIdentifier",
    "t", "b", "itemIdentifier", "proceed", false, nullptr, kEmpty},
   {"didInteractivelyPurchaseItemIdentifier:success:", "DidInteractivelyPurchaseItemIdentifierSuccess",
@@ -194,9 +195,9 @@ constexpr std::array kRequests = std::to_array<RequestDescriptor>({
   {"osUpdateScanInProgressWithReplyBlock:", "OsUpdateScanInProgress", "", "b", "", "inProgress",
    true, nullptr, kEmpty},
   {"hideOSUpdatesWithProductKeys:withReplyBlock:", "HideOSUpdatesWithProductKeys", "as", "b",
-   "productKeys", "success", false, nullptr, kNoReply},
+   "productKeys", "success", false, nullptr, kErrorReply},
   {"unhideAllOSUpdatesWithReplyBlock:", "UnhideAllOSUpdates", "", "b", "", "success", false,
-   nullptr, kNoReply},
+   nullptr, kErrorReply},
   {"startOSUpdateScanWithForceFullScan:reportProgressImmediately:launchedFromNotification:"
    "userHasSeenAllUpdates:checkForOtherUpdates:",
    "StartOSUpdateScanWithForceFullScanReportProgressImmediatelyLaunchedFromNotification"
@@ -253,15 +254,16 @@ constexpr std::array kRequests = std::to_array<RequestDescriptor>({
   {"redownloadWithItemIdentifier:bundleIdentifier:storeClientType:replyBlock:",
    "RedownloadWithItemIdentifierBundleIdentifierStoreClientType", "xsx", "bxsa{sv}",
    "itemIdentifier,bundleIdentifier,storeClientType", "success,itemIdentifier,path,error", false,
-   setStoreClientFromType<2>},
+   setStoreClientFromType<2>, kErrorReply},
   {"processMDMManifestURL:options:storeClientType:replyBlock:",
    "ProcessMDMManifestURLOptionsStoreClientType", "sa{sv}x", "bava{sv}",
-   "manifestURL,options,storeClientType", "success,items,error", false, setStoreClientFromType<2>},
+   "manifestURL,options,storeClientType", "success,items,error", false,
+   setStoreClientFromType<2>, kErrorReply},
   {"accountLessDownloadWithItemIdentifier:bundleIdentifier:externalVersionIdentifier:options:"
    "replyBlock:",
    "AccountLessDownloadWithItemIdentifierBundleIdentifierExternalVersionIdentifierOptions",
    "tsxa{sv}", "bxsa{sv}", "itemIdentifier,bundleIdentifier,externalVersionIdentifier,options",
-   "success,itemIdentifier,path,error", false, nullptr, kNoReply},
+   "success,itemIdentifier,path,error", false, nullptr, kErrorReply},
   {"accountLessDownloadHeartbeat", "AccountLessDownloadHeartbeat", "", "", "", "", false, nullptr,
    kNothing},
 
@@ -280,7 +282,7 @@ constexpr std::array kRequests = std::to_array<RequestDescriptor>({
   {"removeLibraryObserver:", "RemoveLibraryObserver", "o", "", "observer", "", false, nullptr,
    kNothing},
   {"pollForPurchasedBooksWithReplyBlock:", "PollForPurchasedBooks", "", "b", "", "polled", false,
-   nullptr, kNoReply},
+   nullptr, kErrorReply},
   {"redownloadBooksWithItemIdentifiers:accountID:", "RedownloadBooksWithItemIdentifiersAccountID",
    "att", "", "itemIdentifiers,accountID", "", false, nullptr, kNothing},
   {"pollForPurchasedItems:", "PollForPurchasedItems", "b", "", "force", "", false, nullptr,
@@ -351,10 +353,14 @@ void RequestTable::perform(const RequestDescriptor& request, AssetServiceInterfa
                            const PlistArray& arguments, const ReplyHandler& reply) {
   if (request.handler) {
     request.handler(interface, arguments, reply);
-    return;
+  } else {
+    TILL_LOG(3, "%@: %@ has no target in this build", "AssetServiceInterface", request.selector);
+    if (request.withoutTarget == WithoutTarget::kEmptyReply) answer(reply, {});
   }
-  TILL_LOG(3, "%@: %@ has no target in this build", "AssetServiceInterface", request.selector);
-  if (request.withoutTarget == WithoutTarget::kEmptyReply) answer(reply, {});
+  // Also after a handler that did the part of the request this build has.
+  if (request.withoutTarget == WithoutTarget::kErrorReply && reply) {
+    throw ServiceError::notAvailable(request.member);
+  }
 }
 
 std::string RequestTable::introspectionXml() {

@@ -19,7 +19,9 @@ using ReplyHandler = std::function<void(PlistArray outArguments)>;
 enum class WithoutTarget {
   kNothing,     // no reply arguments: nothing to do
   kEmptyReply,  // the request answers with the empty value of each argument
-  kNoReply,     // the reply handler belonged to the target: it is never called
+  // The reply belonged to the target: a caller that waits for one gets the
+  // NotAvailable error instead of its timeout.
+  kErrorReply,
 };
 
 // One row of the service's request table.
@@ -34,7 +36,8 @@ struct RequestDescriptor {
   // connection's request queue.
   bool direct = false;
   // Null for requests whose target is not part of this build; they behave
-  // as `withoutTarget` says.
+  // as `withoutTarget` says. A handler that does only the part of a request
+  // this build has may come with `kErrorReply` for the rest.
   void (*handler)(AssetServiceInterface&, const PlistArray&, const ReplyHandler&) = nullptr;
   WithoutTarget withoutTarget = WithoutTarget::kNothing;
 };
@@ -49,7 +52,8 @@ class RequestTable {
   static const RequestDescriptor* find(std::string_view member);
 
   // Runs `request` against `interface`: its handler, or the behaviour for
-  // a missing target.
+  // a missing target. Throws `ServiceError` for a request that wants a reply
+  // it cannot have; one sent without wanting a reply never throws it.
   static void perform(const RequestDescriptor& request, AssetServiceInterface& interface,
                       const PlistArray& arguments, const ReplyHandler& reply);
 

@@ -5,6 +5,7 @@
 
 #include "AssetService/DBusValueCodec.h"
 #include "AssetService/DialogAgentRegistry.h"
+#include "AssetService/ServiceError.h"
 #include "AssetService/StoreRuntimeInterface.h"
 #include "platform/Environment.h"
 #include "software-map/SoftwareMap.h"
@@ -46,6 +47,15 @@ class DBusSoftwareMapObserver final : public VendSoftwareMapObserver {
  private:
   std::unique_ptr<sdbus::IProxy> proxy_;
 };
+
+void sendError(sdbus::MethodCall& call, const ServiceError& error) {
+  try {
+    call.createErrorReply(sdbus::Error(error.name(), error.what())).send();
+  } catch (const sdbus::Error& failure) {
+    TILL_LOG(2, "%@: Error answer to %@ not delivered: %@", kSpeaker, call.getSender(),
+             failure.getMessage());
+  }
+}
 
 }  // namespace
 
@@ -164,13 +174,12 @@ void ServiceListener::dispatch(const RequestDescriptor& request, sdbus::MethodCa
     try {
       RequestTable::perform(request, *interface, arguments, reply);
       if (request.outSignature.empty() && reply) reply({});
+    } catch (const ServiceError& error) {
+      TILL_LOG(2, "%@: %@ refused: %@", kSpeaker, request.selector, error.what());
+      if (reply) sendError(*pending, error);
     } catch (const std::exception& exception) {
       TILL_LOG(1, "%@: %@ failed: %@", kSpeaker, request.selector, exception.what());
-      if (reply) {
-        pending
-            ->createErrorReply(sdbus::Error("org.freedesktop.DBus.Error.Failed", exception.what()))
-            .send();
-      }
+      if (reply) sendError(*pending, ServiceError::failed(exception.what()));
     }
   };
   if (request.direct) {

@@ -35,9 +35,6 @@ constexpr std::string_view kReasonHeader = "Client-Cloud-DAAP-Request-Reason";
 constexpr std::string_view kGuidHeader = "X-Guid";
 constexpr std::string_view kItemsComponent = "items";
 constexpr std::string_view kPreordersQuery = "includePreorders=1";
-// The store client layer has one URL bag for this client: the default one,
-// which the account service also reads values from.
-constexpr std::int64_t kRequiredBagType = 0;
 constexpr std::uint8_t kItemKind = 2;
 // What follows the `adsr` header of an items body without query and token
 // pairs: mstc, mlid, musr and mder (12 bytes each), mikd (9) and the
@@ -209,8 +206,10 @@ void DAAPClient::startUpdatingWithLocalVersion(std::optional<std::int64_t> local
   auto accounts = serviceProxy_.accountService();
   accounts->removeURLBagObserver(bagObserver_);  // a second start must not observe twice
   accounts->addURLBagObserver(bagObserver_);
+  // The account service reads the settings from the store client's bag
+  // and tells the observer of that bag's fetches: load that same bag.
   accounts->loadURLBagWithType(
-      kRequiredBagType,
+      storeClient_.requiredBagType(),
       [weak = weak_from_this()](bool success, bool loaded, const OptionalError& error) {
         const auto self = weak.lock();
         // The runtime tells its bag observers of every fetch, this client
@@ -289,12 +288,12 @@ RunLoop::TimerId DAAPClient::makeTimer(double seconds, void (DAAPClient::*fired)
 }
 
 void DAAPClient::pollingTimerFired() {
-  if (delegate_.expired()) return;
+  if (!delegate()) return;
   enqueueTickPoll(false, pollingTickQueued_);
 }
 
 void DAAPClient::forcedRefreshTimerFired() {
-  if (delegate_.expired()) return;
+  if (!delegate()) return;
   enqueueTickPoll(true, forcedRefreshTickQueued_);
 }
 
@@ -341,8 +340,9 @@ void DAAPClient::poll(bool forcedUpdate, const PollCompletionHandler& handler) {
   const std::optional<DAAPArray> items =
       itemsWithLocalVersion(local.value_or(0), latest, tokenPairs, kPollReason, &deleted);
   const std::optional<DAAPArray> filtered = filteredItems(items);
-  if (owner) {
-    owner->daapClientUpdatedItemsWithLatestVersionDeletedItems(*this, filtered, latest, deleted);
+  // Asked again: the owner may have cleared itself while the request ran.
+  if (const auto current = delegate()) {
+    current->daapClientUpdatedItemsWithLatestVersionDeletedItems(*this, filtered, latest, deleted);
   }
   // The revision this poll saw, not the field, which a bag update may
   // have cleared meanwhile; without one the owner's revision stays.
@@ -406,6 +406,16 @@ std::string DAAPClient::nameForEvent(std::int64_t event) {
 }
 
 // Fields
+
+std::shared_ptr<LedgerDAAPClientDelegate> DAAPClient::delegate() const {
+  std::lock_guard lock(mutex_);
+  return delegate_.lock();
+}
+
+void DAAPClient::setDelegate(const std::shared_ptr<LedgerDAAPClientDelegate>& delegate) {
+  std::lock_guard lock(mutex_);
+  delegate_ = delegate;
+}
 
 std::optional<std::int64_t> DAAPClient::localVersion() const {
   std::lock_guard lock(mutex_);

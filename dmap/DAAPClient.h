@@ -121,9 +121,10 @@ class DAAPClient : public std::enable_shared_from_this<DAAPClient> {
 
   [[nodiscard]] const std::string& serviceName() const { return serviceName_; }
   [[nodiscard]] const VendStoreClient& storeClient() const { return storeClient_; }
-  [[nodiscard]] std::shared_ptr<LedgerDAAPClientDelegate> delegate() const {
-    return delegate_.lock();
-  }
+  [[nodiscard]] std::shared_ptr<LedgerDAAPClientDelegate> delegate() const;
+  // Held weakly. Null clears it: an owner that goes away before the client
+  // does is told nothing more, even by a poll already under way.
+  void setDelegate(const std::shared_ptr<LedgerDAAPClientDelegate>& delegate);
   [[nodiscard]] std::optional<std::int64_t> localVersion() const;
   [[nodiscard]] std::optional<std::int64_t> latestVersion() const;
   [[nodiscard]] std::optional<std::int64_t> sessionID() const;
@@ -215,7 +216,7 @@ class DAAPClient : public std::enable_shared_from_this<DAAPClient> {
 
   const std::string serviceName_;
   const VendStoreClient storeClient_;
-  const std::weak_ptr<LedgerDAAPClientDelegate> delegate_;
+  std::weak_ptr<LedgerDAAPClientDelegate> delegate_;  // under mutex_
   RunLoop& runLoop_;
   VendServiceProxy serviceProxy_;
   std::shared_ptr<VendURLBagObserver> bagObserver_;

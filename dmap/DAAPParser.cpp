@@ -6,6 +6,7 @@
 
 #include "dmap/DAAPBytes.h"
 #include "dmap/DAAPCode.h"
+#include "dmap/DAAPDocumentBudget.h"
 #include "platform/PropertyListSerialization.h"
 #include "store-runtime/TillLogManager.h"
 
@@ -154,10 +155,11 @@ bool isNonEmpty(const DAAPValue& value) {
 }
 
 // Embedded property lists are small; these bounds keep a hostile one from
-// costing more than a few megabytes or a deep stack.
-PlistReadLimits embeddedPlistLimits() {
+// costing more than its share of the document's budget or a deep stack.
+PlistReadLimits embeddedPlistLimits(std::size_t listSize) {
   PlistReadLimits limits;
-  limits.maxBytes = std::size_t{16} * 1024 * 1024;
+  limits.maxBytes =
+      std::min(std::size_t{16} * 1024 * 1024, DAAPDocumentBudget::remaining(listSize));
   limits.maxDepth = 32;
   limits.maxObjects = 65536;
   return limits;
@@ -187,6 +189,7 @@ DAAPValue DAAPParser::decodeData(Bytes data) {
              DAAPCode::character(code, 2), DAAPCode::character(code, 3));
     return {};
   }
+  const DAAPDocumentBudget budget(data.size());
   return sharedInstance().processResponseCode(code, data.subspan(DAAPTagReader::kHeaderSize, size));
 }
 
@@ -335,11 +338,12 @@ DAAPValue DAAPParser::processXMLContent(Bytes bytes) const {
   if (bytes.empty()) return {};
   std::string error;
   const std::optional<PlistValue> plist =
-      PropertyListSerialization::read(bytes, &error, embeddedPlistLimits());
+      PropertyListSerialization::read(bytes, &error, embeddedPlistLimits(bytes.size()));
   if (!plist) {
     TILL_LOG(3, "%@: Attempting to process XML response: %@", kSpeaker, error);
     return {};
   }
+  DAAPDocumentBudget::charge(*plist);
   return DAAPValue::fromPlist(*plist);
 }
 

@@ -2,11 +2,13 @@
 
 #include "platform/KeyedArchive.h"
 #include "store-runtime/RecordFieldReader.h"
+#include "store-runtime/TillLogManager.h"
 
 namespace larder {
 
 namespace {
 
+constexpr std::string_view kSpeaker = "LedgerUpdate";
 constexpr std::string_view kDictionaryKey = "dictionary";
 
 enum class Kind { Identifier, String, Date, Boolean, Integer };
@@ -69,17 +71,37 @@ std::optional<PlistValue> defaultOnWire(Kind kind) {
   }
 }
 
+// The item with every known key in the type of its kind: a value that
+// converts is stored converted, one that doesn't is dropped with a log
+// line. A store that sends a number for a version must not lose the whole
+// item, and with it the cached record, over one field.
+PlistDictionary readableItem(PlistDictionary item) {
+  const PlistDictionary sent = item;
+  RecordFieldReader reader(sent, RecordFieldReader::Reading::kConverting);
+  for (const ItemField& field : kItemFields) {
+    const auto found = item.find(field.itemKey);
+    if (found == item.end()) continue;
+    if (std::optional<PlistValue> value = readKind(reader, field.itemKey, field.kind)) {
+      found->second = std::move(*value);
+      continue;
+    }
+    TILL_LOG(2, "%@: Item %@ has an unreadable \"%@\" (%@); the field is skipped", kSpeaker,
+             reader.value(LedgerUpdate::kWareIDKey), std::string(field.itemKey), found->second);
+    item.erase(found);
+  }
+  return item;
+}
+
 }  // namespace
 
 bool LedgerUpdate::isValidItem(const PlistDictionary& item) {
-  RecordFieldReader reader(item);
-  for (const ItemField& field : kItemFields) readKind(reader, field.itemKey, field.kind);
-  return reader.ok() && reader.unsignedInteger(kWareIDKey).value_or(0) > 0;
+  RecordFieldReader reader(item, RecordFieldReader::Reading::kConverting);
+  return reader.unsignedInteger(kWareIDKey).value_or(0) > 0;
 }
 
 std::shared_ptr<LedgerUpdate> LedgerUpdate::initWithDictionary(PlistDictionary item) {
   if (!isValidItem(item)) return nullptr;
-  return std::make_shared<LedgerUpdate>(Validated{}, std::move(item));
+  return std::make_shared<LedgerUpdate>(Validated{}, readableItem(std::move(item)));
 }
 
 LedgerUpdate::LedgerUpdate(Validated, PlistDictionary item)
@@ -200,7 +222,8 @@ PlistDictionary LedgerUpdate::toDictionary() const {
 
 std::shared_ptr<LedgerUpdate> LedgerUpdate::fromDictionary(const PlistDictionary& dictionary) {
   RecordFieldReader reader(dictionary);
-  PlistDictionary item = reader.dictionary(kDictionaryKey).value_or(PlistDictionary{});
+  PlistDictionary item =
+      readableItem(reader.dictionary(kDictionaryKey).value_or(PlistDictionary{}));
   if (!reader.ok()) return nullptr;
   RecordFieldReader itemReader(item);
   for (const ItemField& field : kItemFields) {

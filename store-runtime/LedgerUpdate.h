@@ -47,8 +47,10 @@ class LedgerUpdate {
   static constexpr std::string_view kDidFailToAutoInstallKey = "local.didFailToAutoInstall";
 
   // The record of one item, or nullptr when the item has no "ware-id" above
-  // 0 or a known key holds a value of the wrong type, so that a caller can
-  // keep the good items of a list and drop the others.
+  // 0, so that a caller can keep the good items of a list and drop the
+  // others. A known key of another type is converted when it can be (a
+  // number as version text, date text as a date) and otherwise left out:
+  // one odd field costs that field, not the item.
   static std::shared_ptr<LedgerUpdate> initWithDictionary(PlistDictionary item);
   static bool isValidItem(const PlistDictionary& item);
 

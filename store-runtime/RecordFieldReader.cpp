@@ -1,6 +1,12 @@
 #include "store-runtime/RecordFieldReader.h"
 
+#include <algorithm>
+#include <array>
+#include <cctype>
+#include <charconv>
 #include <cmath>
+
+#include "store-runtime/RecordDateText.h"
 
 namespace larder {
 
@@ -9,6 +15,44 @@ namespace {
 const PlistDictionary& emptyDictionary() {
   static const PlistDictionary empty;
   return empty;
+}
+
+// Shortest text that reads back as the same number.
+std::optional<std::string> numberText(const PlistValue& value) {
+  if (value.type() == PlistValue::Type::Integer) return std::to_string(value.int64Value());
+  if (value.type() == PlistValue::Type::UnsignedInteger) return std::to_string(value.uint64Value());
+  if (!value.isReal() || !std::isfinite(value.doubleValue())) return std::nullopt;
+  std::array<char, 32> buffer{};
+  const auto [end, failure] =
+      std::to_chars(buffer.data(), buffer.data() + buffer.size(), value.doubleValue());
+  if (failure != std::errc()) return std::nullopt;
+  return std::string(buffer.data(), end);
+}
+
+template <typename Integer>
+std::optional<Integer> wholeText(const std::string& text) {
+  Integer number{};
+  const auto [end, failure] = std::from_chars(text.data(), text.data() + text.size(), number);
+  if (failure != std::errc() || end != text.data() + text.size()) return std::nullopt;
+  return number;
+}
+
+std::optional<std::int64_t> integralReal(const PlistValue& value) {
+  // 2^63 is the first real outside the range.
+  constexpr double kLimit = 9223372036854775808.0;
+  const double real = value.doubleValue();
+  if (!value.isReal() || std::trunc(real) != real || real < -kLimit || real >= kLimit) {
+    return std::nullopt;
+  }
+  return static_cast<std::int64_t>(real);
+}
+
+std::optional<bool> booleanText(std::string text) {
+  std::ranges::transform(text, text.begin(),
+                         [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+  if (text == "true" || text == "yes" || text == "1") return true;
+  if (text == "false" || text == "no" || text == "0") return false;
+  return std::nullopt;
 }
 
 }  // namespace
@@ -26,6 +70,9 @@ std::optional<std::string> RecordFieldReader::string(std::string_view key) {
   const PlistValue& stored = value(key);
   if (stored.isNull()) return std::nullopt;
   if (const std::string* text = stored.string()) return *text;
+  if (converting_) {
+    if (auto text = numberText(stored)) return text;
+  }
   return refuse<std::string>();
 }
 
@@ -33,6 +80,12 @@ std::optional<std::int64_t> RecordFieldReader::integer(std::string_view key) {
   const PlistValue& stored = value(key);
   if (stored.isNull()) return std::nullopt;
   if (stored.type() == PlistValue::Type::Integer) return stored.int64Value();
+  if (converting_) {
+    if (auto number = integralReal(stored)) return number;
+    if (const std::string* text = stored.string()) {
+      if (auto number = wholeText<std::int64_t>(*text)) return number;
+    }
+  }
   return refuse<std::int64_t>();
 }
 
@@ -42,6 +95,9 @@ std::optional<std::uint64_t> RecordFieldReader::unsignedInteger(std::string_view
   if (stored.type() == PlistValue::Type::UnsignedInteger) return stored.uint64Value();
   if (stored.type() == PlistValue::Type::Integer && stored.int64Value() >= 0) {
     return stored.uint64Value();
+  }
+  if (const std::string* text = converting_ ? stored.string() : nullptr) {
+    if (auto number = wholeText<std::uint64_t>(*text)) return number;
   }
   return refuse<std::uint64_t>();
 }
@@ -59,6 +115,9 @@ std::optional<bool> RecordFieldReader::boolean(std::string_view key) {
   const PlistValue& stored = value(key);
   if (stored.isNull()) return std::nullopt;
   if (stored.isBoolean() || stored.isInteger()) return stored.boolValue();
+  if (const std::string* text = converting_ ? stored.string() : nullptr) {
+    if (auto flag = booleanText(*text)) return flag;
+  }
   return refuse<bool>();
 }
 
@@ -71,6 +130,9 @@ std::optional<PlistDate> RecordFieldReader::date(std::string_view key) {
   }
   if ((stored.isInteger() || stored.isReal()) && std::isfinite(stored.doubleValue())) {
     return PlistDate{stored.doubleValue()};
+  }
+  if (const std::string* text = converting_ ? stored.string() : nullptr) {
+    if (auto date = RecordDateText::parse(*text)) return date;
   }
   return refuse<PlistDate>();
 }

@@ -16,9 +16,17 @@ namespace larder {
 // key is never a failure. Values come from files and from other processes,
 // so every reader also refuses what its type cannot hold (a negative
 // identifier, a date that is not a finite number).
+//
+// A converting reader takes what another sender may well mean: a number
+// where text is expected reads as its decimal text, date text in ISO 8601
+// form as a date, "true" or "NO" as a boolean, an integral real or integer
+// text as an integer. What still cannot be read fails as above.
 class RecordFieldReader {
  public:
-  explicit RecordFieldReader(const PlistDictionary& source) : source_(source) {}
+  enum class Reading { kExact, kConverting };
+
+  explicit RecordFieldReader(const PlistDictionary& source, Reading reading = Reading::kExact)
+      : source_(source), converting_(reading == Reading::kConverting) {}
   // A value that is not a dictionary reads as an empty, failed record.
   explicit RecordFieldReader(const PlistValue& source);
 
@@ -52,6 +60,7 @@ class RecordFieldReader {
   }
 
   const PlistDictionary& source_;
+  bool converting_ = false;
   bool ok_ = true;
 };
 

@@ -105,6 +105,16 @@ void describeInto(std::ostringstream& out, const PlistValue& value, int indent) 
   }
 }
 
+// The first bytes of a long text, cut where a UTF-8 sequence starts, and
+// its full length: a client's 10 MB string would otherwise make every line
+// that names it 10 MB long.
+std::string shortened(const std::string& text) {
+  if (text.size() <= LogArgument::kMaxTextBytes) return text;
+  std::size_t cut = LogArgument::kMaxTextBytes;
+  while (cut > 0 && (static_cast<unsigned char>(text[cut]) & 0xC0) == 0x80) --cut;
+  return text.substr(0, cut) + "\u2026(" + std::to_string(text.size()) + " bytes)";
+}
+
 }  // namespace
 
 std::string describePlistValue(const PlistValue& value) {
@@ -121,7 +131,7 @@ TillLogManager& TillLogManager::sharedManager() {
 TillLogManager::TillLogManager() : level_(levelFromEnvironment()) {}
 
 std::string LogArgument::render(std::string_view conversion) const {
-  if (const std::string* text = std::get_if<std::string>(&value_)) return *text;
+  if (const std::string* text = std::get_if<std::string>(&value_)) return shortened(*text);
   char last = conversion.back();
   bool wantsNumber = last != '@' && last != 's' && last != 'c' && last != 'p';
   // printf's length modifiers of the format are replaced by our own, so

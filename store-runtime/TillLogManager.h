@@ -21,8 +21,12 @@ std::string describePlistValue(const PlistValue& value);
 // conversion such as "%.4f" or "%lu" prints them as printf would; anything
 // else is its description: records describe themselves, property lists
 // print as text, null pointers as "(null)". "%@" takes any argument.
+// A text longer than `kMaxTextBytes` is cut there and followed by its full
+// length, "…(10485760 bytes)"; what must be kept whole goes to a side file.
 class LogArgument {
  public:
+  static constexpr std::size_t kMaxTextBytes = 4096;
+
   LogArgument(std::string text) : value_(std::move(text)) {}  // NOLINT(google-explicit-constructor)
   LogArgument(const char* text)
       : value_(std::string(text)) {}  // NOLINT(google-explicit-constructor)

@@ -51,7 +51,9 @@ VendDialog signInDialog(const VendAuthenticationContext& context) {
 
 VendAccountService::VendAccountService(VendStoreClient storeClient,
                                        std::shared_ptr<VendRuntime> runtime)
-    : storeClient_(std::move(storeClient)), runtime_(std::move(runtime)) {}
+    : storeClient_(std::move(storeClient)),
+      runtime_(std::move(runtime)),
+      bagType_(storeClient_.requiredBagType()) {}
 
 void VendAccountService::async(std::function<void()> work) {
   runtime_->serviceQueue()->async(std::move(work));
@@ -71,7 +73,7 @@ void VendAccountService::valueForURLBagKey(std::string key, std::function<void(P
 }
 
 void VendAccountService::addURLBagObserver(const std::shared_ptr<VendURLBagObserver>& observer) {
-  runtime_->urlBag().addObserver(observer);
+  runtime_->urlBag().addObserver(bagType_, observer);
 }
 
 void VendAccountService::removeURLBagObserver(const std::shared_ptr<VendURLBagObserver>& observer) {

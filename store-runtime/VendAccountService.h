@@ -27,7 +27,9 @@ class VendAccountService {
   VendAccountService(VendStoreClient storeClient, std::shared_ptr<VendRuntime> runtime);
 
   void loadURLBagWithType(std::int64_t bagType, BagReply reply);
+  // The bag of the store client's required type.
   void valueForURLBagKey(std::string key, std::function<void(PlistValue)> reply);
+  // Told of the fetches of the store client's required bag type only.
   void addURLBagObserver(const std::shared_ptr<VendURLBagObserver>& observer);
   void removeURLBagObserver(const std::shared_ptr<VendURLBagObserver>& observer);
   void isValid(std::function<void(bool)> reply);
@@ -56,7 +58,7 @@ class VendAccountService {
 
   VendStoreClient storeClient_;
   std::shared_ptr<VendRuntime> runtime_;
-  std::int64_t bagType_ = 0;
+  std::int64_t bagType_;
 };
 
 }  // namespace larder

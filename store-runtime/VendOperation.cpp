@@ -13,7 +13,8 @@ namespace {
 constexpr std::string_view kSpeaker = "VendOperation";
 }
 
-VendOperation::VendOperation(VendStoreClient storeClient) : storeClient_(std::move(storeClient)) {}
+VendOperation::VendOperation(VendStoreClient storeClient)
+    : storeClient_(std::move(storeClient)), requiredBagType_(storeClient_.requiredBagType()) {}
 
 void VendOperation::setSuccess(bool success) {
   MutexLock lock(mutex_);
@@ -75,6 +76,10 @@ void VendOperation::reportProgress(double fraction) {
 }
 
 bool VendOperation::runSubOperation(VendOperation& subOperation, OptionalError* error) {
+  // The work runs for this operation, so it reads the bag this one reads:
+  // an update check's request URL must come from the bag its switches came
+  // from.
+  subOperation.setRequiredBagType(requiredBagType());
   subOperation.parent_ = this;
   subOperation.start();
   subOperation.parent_ = nullptr;

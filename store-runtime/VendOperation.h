@@ -47,7 +47,8 @@ class VendOperation : public std::enable_shared_from_this<VendOperation> {
   [[nodiscard]] std::shared_ptr<VendOperationDelegate> delegate() const;
 
   // Runs `subOperation` within this one, on this thread, and gives its
-  // success and error. This operation's own outcome does not change.
+  // success and error. The sub-operation takes this one's required bag
+  // type. This operation's own outcome does not change.
   bool runSubOperation(VendOperation& subOperation, OptionalError* error);
   // Runs this operation on the calling thread, outside any queue.
   bool runSyncReturningError(OptionalError* error);
@@ -64,6 +65,7 @@ class VendOperation : public std::enable_shared_from_this<VendOperation> {
   // bag cannot be loaded or lacks the key.
   PlistValue valueForURLBagKey(std::string_view key);
 
+  // That of the store client unless set.
   void setRequiredBagType(std::int64_t type) { requiredBagType_.store(type); }
   [[nodiscard]] std::int64_t requiredBagType() const { return requiredBagType_.load(); }
 

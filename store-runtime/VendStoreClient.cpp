@@ -13,6 +13,12 @@ constexpr std::array<std::string_view, 5> kStandardIdentifiers = {
     "com.orvane.quaymart", "com.orvane.books", "com.orvane.outfitter", "com.orvane.lantern",
     "com.orvane.wayfarer"};
 
+// The DMAP protocol versions this build speaks, which the cloud library
+// service reads from every request's headers.
+PlistDictionary standardDAAPSettings() {
+  return {{"Client-DAAP-Version", "3.13"}, {"Client-Cloud-Purchase-Daap-Version", "1"}};
+}
+
 }  // namespace
 
 VendStoreClient::VendStoreClient(std::string identifier, std::int64_t clientType,
@@ -30,7 +36,7 @@ VendStoreClient VendStoreClient::initWithStoreClientType(std::int64_t clientType
   std::string identifier =
       known ? std::string(kStandardIdentifiers[static_cast<std::size_t>(clientType)])
             : "com.orvane.storeclient." + std::to_string(clientType);
-  return {identifier, clientType, kCurrentFrameworkVersion, identifier};
+  return {identifier, clientType, kCurrentFrameworkVersion, identifier, standardDAAPSettings()};
 }
 
 std::optional<VendStoreClient> VendStoreClient::knownClientWithIdentifier(
@@ -59,15 +65,18 @@ VendStoreClient VendStoreClient::fromDictionary(const PlistDictionary& dictionar
     client.agentPreferencesDomain_ = client.identifier_;
   }
   if (const PlistDictionary* daap = wrapped["daap"].dictionary()) client.daap_ = *daap;
+  client.requiredBagType_ = wrapped["requiredBagType"].int64Value();
   return client;
 }
 
 PlistDictionary VendStoreClient::toDictionary() const {
-  return {{"identifier", identifier_},
-          {"clientType", clientType_},
-          {"frameworkVersion", frameworkVersion_},
-          {"agentPreferencesDomain", agentPreferencesDomain_},
-          {"daap", daap_}};
+  PlistDictionary dictionary{{"identifier", identifier_},
+                             {"clientType", clientType_},
+                             {"frameworkVersion", frameworkVersion_},
+                             {"agentPreferencesDomain", agentPreferencesDomain_},
+                             {"daap", daap_}};
+  if (requiredBagType_ != 0) dictionary.emplace("requiredBagType", requiredBagType_);
+  return dictionary;
 }
 
 std::string VendStoreClient::description() const {

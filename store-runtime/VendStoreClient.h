@@ -25,7 +25,8 @@ class VendStoreClient {
   VendStoreClient(std::string identifier, std::int64_t clientType, std::int64_t frameworkVersion,
                   std::string agentPreferencesDomain, PlistDictionary daap = {});
 
-  // The standard client of a type, with the identifier that type uses.
+  // The standard client of a type, with the identifier that type uses and
+  // the DMAP versions of this build in `daap`.
   static VendStoreClient initWithStoreClientType(std::int64_t clientType);
   // Finds a client again from what a notification kept; nullopt for an
   // identifier that names no known client.
@@ -39,9 +40,14 @@ class VendStoreClient {
     return agentPreferencesDomain_;
   }
   [[nodiscard]] const PlistDictionary& daap() const { return daap_; }
+  // The type of URL bag that the client's store requests and settings come
+  // from; 0, the default bag, unless set.
+  [[nodiscard]] std::int64_t requiredBagType() const { return requiredBagType_; }
+  void setRequiredBagType(std::int64_t bagType) { requiredBagType_ = bagType; }
 
   // Wire form: "identifier", "clientType", "frameworkVersion",
-  // "agentPreferencesDomain", "daap". A dictionary without a string
+  // "agentPreferencesDomain", "daap", and "requiredBagType" when it is not
+  // 0. A dictionary without a string
   // identifier gives a client with an empty identifier, which the
   // registries refuse.
   static VendStoreClient fromDictionary(const PlistDictionary& dictionary);
@@ -56,6 +62,7 @@ class VendStoreClient {
   std::int64_t frameworkVersion_ = 0;
   std::string agentPreferencesDomain_;
   PlistDictionary daap_;
+  std::int64_t requiredBagType_ = 0;
 };
 
 }  // namespace larder

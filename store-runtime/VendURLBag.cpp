@@ -49,7 +49,7 @@ VendURLBag::LoadResult VendURLBag::load(std::int64_t bagType, bool force) {
     }
   }
   LoadResult result = fetch(bagType, entry);
-  notifyObservers(result);
+  notifyObservers(bagType, result);
   return result;
 }
 
@@ -136,22 +136,25 @@ bool VendURLBag::regexWithKeyMatchesString(std::int64_t bagType, std::string_vie
   }
 }
 
-void VendURLBag::addObserver(const std::shared_ptr<VendURLBagObserver>& observer) {
+void VendURLBag::addObserver(std::int64_t bagType,
+                             const std::shared_ptr<VendURLBagObserver>& observer) {
   if (!observer) return;
   std::lock_guard lock(observersMutex_);
-  observers_.push_back(observer);
+  observers_.emplace_back(bagType, observer);
 }
 
 void VendURLBag::removeObserver(const std::shared_ptr<VendURLBagObserver>& observer) {
   std::lock_guard lock(observersMutex_);
-  std::erase(observers_, observer);
+  std::erase_if(observers_, [&](const auto& entry) { return entry.second == observer; });
 }
 
-void VendURLBag::notifyObservers(const LoadResult& result) {
+void VendURLBag::notifyObservers(std::int64_t bagType, const LoadResult& result) {
   std::vector<std::shared_ptr<VendURLBagObserver>> observers;
   {
     std::lock_guard lock(observersMutex_);
-    observers = observers_;
+    for (const auto& [observedType, observer] : observers_) {
+      if (observedType == bagType) observers.push_back(observer);
+    }
   }
   for (const auto& observer : observers)
     observer->urlBagDidUpdateWithSuccess(result.success, result.error);

@@ -8,6 +8,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 #include "platform/PlistValue.h"
@@ -16,7 +17,7 @@
 
 namespace larder {
 
-// Told after every load of a bag, whatever its type.
+// Told after every fetch of the bag type it was added for.
 class VendURLBagObserver {
  public:
   virtual ~VendURLBagObserver() = default;
@@ -50,7 +51,11 @@ class VendURLBag {
   // The regular expression under the key matches the whole text.
   bool regexWithKeyMatchesString(std::int64_t bagType, std::string_view key, std::string_view text);
 
-  void addObserver(const std::shared_ptr<VendURLBagObserver>& observer);
+  // Fetches of other bag types are none of the observer's business: a
+  // session kept against one bag must not restart whenever another is
+  // refreshed.
+  void addObserver(std::int64_t bagType, const std::shared_ptr<VendURLBagObserver>& observer);
+  // Removes the observer from every bag type it was added for.
   void removeObserver(const std::shared_ptr<VendURLBagObserver>& observer);
 
   // The URL the bag of a type is fetched from.
@@ -67,13 +72,13 @@ class VendURLBag {
   Entry& entryForType(std::int64_t bagType);
   LoadResult fetch(std::int64_t bagType, Entry& entry);
   std::shared_ptr<const PlistDictionary> cachedBag(std::int64_t bagType, bool loadIfNeeded);
-  void notifyObservers(const LoadResult& result);
+  void notifyObservers(std::int64_t bagType, const LoadResult& result);
 
   VendRuntimeConfiguration configuration_;
   std::mutex mutex_;  // entries_ and the cached bags
   std::map<std::int64_t, std::unique_ptr<Entry>> entries_;
   std::mutex observersMutex_;
-  std::vector<std::shared_ptr<VendURLBagObserver>> observers_;
+  std::vector<std::pair<std::int64_t, std::shared_ptr<VendURLBagObserver>>> observers_;
 };
 
 }  // namespace larder

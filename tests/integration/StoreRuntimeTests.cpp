@@ -370,7 +370,7 @@ TEST_F(StoreRuntimeTest, ConcurrentCallersShareOneBagFetchAndObserversHearOfIt) 
     std::atomic<int> loads{0};
   };
   auto observer = std::make_shared<CountingObserver>();
-  runtime_->urlBag().addObserver(observer);
+  runtime_->urlBag().addObserver(0, observer);
   std::vector<std::thread> callers;
   for (int i = 0; i < 10; ++i) {
     callers.emplace_back(
@@ -381,6 +381,10 @@ TEST_F(StoreRuntimeTest, ConcurrentCallersShareOneBagFetchAndObserversHearOfIt) 
   EXPECT_EQ(observer->loads, 1);
   EXPECT_TRUE(runtime_->urlBag().load(0, true).loaded);
   EXPECT_EQ(store_->requestCount("bag"), 2U);
+  EXPECT_EQ(observer->loads, 2);
+  // A fetch of another bag type is not this observer's.
+  EXPECT_TRUE(runtime_->urlBag().load(1, true).success);
+  EXPECT_EQ(store_->requestCount("bag"), 3U);
   EXPECT_EQ(observer->loads, 2);
 }
 

@@ -113,10 +113,11 @@ class FakeCloudLibrary {
   using Responder = std::function<Answer(const Received&)>;
 
   explicit FakeCloudLibrary(PlistData signingKey) : key_(std::move(signingKey)) {
-    server_.Get("/bag.plist", [this](const httplib::Request&, httplib::Response& response) {
+    server_.Get("/bag.plist", [this](const httplib::Request& request, httplib::Response& response) {
       {
         std::unique_lock lock(mutex_);
         ++bagRequests_;
+        bagTypes_.push_back(request.get_param_value("type"));
         changed_.wait(lock, [&] { return held_ != "bag"; });
       }
       response.set_content(PropertyListSerialization::writeXml(bag()), "application/x-plist");
@@ -181,6 +182,12 @@ class FakeCloudLibrary {
   [[nodiscard]] int bagRequests() const {
     std::lock_guard lock(mutex_);
     return bagRequests_;
+  }
+
+  // The "type" of each bag request, "" for the default bag.
+  [[nodiscard]] std::vector<std::string> bagTypes() const {
+    std::lock_guard lock(mutex_);
+    return bagTypes_;
   }
 
   // Answers of `action` ("bag" included) wait until `release`.
@@ -279,6 +286,7 @@ class FakeCloudLibrary {
   std::optional<std::string> held_;
   std::vector<Received> received_;
   int bagRequests_ = 0;
+  std::vector<std::string> bagTypes_;
 };
 
 // Records what the client tells its owner; hands out the token pairs set.
@@ -432,10 +440,11 @@ class DAAPClientFixture : public ::testing::Test {
   }
 
   std::shared_ptr<DAAPClient> makeClient(
-      const std::shared_ptr<RecordingDelegate>& delegate = nullptr) {
+      const std::shared_ptr<RecordingDelegate>& delegate = nullptr,
+      const VendStoreClient& storeClient = DAAPClientFixture::storeClient()) {
     auto owner = delegate ? delegate : delegate_;
     auto client =
-        DAAPClient::initWithServiceName(kServiceName, storeClient(), owner, runLoop_.loop());
+        DAAPClient::initWithServiceName(kServiceName, storeClient, owner, runLoop_.loop());
     clients_.push_back(client);
     return client;
   }

@@ -519,6 +519,51 @@ TEST_F(DAAPClientTest, BagUpdateDropsTheSessionAndPollsButKeepsRunningTimers) {
   EXPECT_EQ(client->forcedRefreshTimer(), forced);
 }
 
+TEST_F(DAAPClientTest, ClientKeepsToTheBagTypeOfItsStoreClient) {
+  signIn();
+  service_.setRevision(2);
+  VendStoreClient softwareStore = storeClient();
+  softwareStore.setRequiredBagType(1);
+  auto client = makeClient(nullptr, softwareStore);
+  client->startUpdatingWithLocalVersion(2);
+  ASSERT_TRUE(service_.waitForCount("update", 1));
+  ASSERT_TRUE(waitUntil([&] { return client->pollingTimer().has_value(); }));
+  DAAPClient::pollingQueue()->sync([] {});
+  EXPECT_EQ(service_.bagTypes(), std::vector<std::string>{"1"}) << "settings come from its bag";
+  // A refresh of another bag keeps the session; one of its own drops it.
+  runtime_->urlBag().load(0, true);
+  DAAPClient::pollingQueue()->sync([] {});
+  EXPECT_EQ(service_.count("login"), 1U);
+  runtime_->urlBag().load(1, true);
+  DAAPClient::pollingQueue()->sync([] {});
+  EXPECT_EQ(service_.count("login"), 2U);
+}
+
+TEST_F(DAAPClientTest, AClientMadeFromItsTypeAloneSendsTheVersionHeaders) {
+  signIn();
+  service_.setRevision(2);
+  auto client = makeClient(
+      nullptr, VendStoreClient::initWithStoreClientType(VendStoreClient::kBookApplication));
+  ASSERT_TRUE(pollAndWait(*client, false));
+  const Received login = service_.received("login").at(0);
+  EXPECT_FALSE(login.header("Client-DAAP-Version").empty());
+  EXPECT_FALSE(login.header("Client-Cloud-Purchase-Daap-Version").empty());
+}
+
+TEST_F(DAAPClientTest, AClearedDelegateIsToldNothingMore) {
+  signIn();
+  service_.setRevision(2);
+  auto client = startedClient(1);
+  ASSERT_EQ(delegate_->updates().size(), 1U);
+  const std::size_t events = delegate_->events().size();
+  client->setDelegate(nullptr);
+  EXPECT_EQ(client->delegate(), nullptr);
+  ASSERT_TRUE(pollAndWait(*client, true));
+  EXPECT_EQ(service_.count("items"), 2U) << "the poll itself still runs";
+  EXPECT_EQ(delegate_->updates().size(), 1U);
+  EXPECT_EQ(delegate_->events().size(), events);
+}
+
 TEST_F(DAAPClientTest, StoppedClientIgnoresBagUpdatesAndKeepsItsSession) {
   signIn();
   service_.setRevision(2);

@@ -8,7 +8,9 @@
 #include <random>
 
 #include "DAAPTestSupport.h"
+#include "dmap/DAAPDocumentBudget.h"
 #include "dmap/DAAPItem.h"
+#include "platform/PropertyListSerialization.h"
 
 namespace larder {
 namespace {
@@ -167,6 +169,33 @@ TEST(DAAPHostileTest, DeeplyNestedEmbeddedPropertyListIsRefused) {
   EXPECT_EQ(item.item()->itemID(), 4u);
   EXPECT_TRUE(item.item()->objectForKey("com.orvane.sonorel.movie-info-xml").isNull());
   EXPECT_EQ(log.countContaining("Attempting to process XML response"), 1u);
+}
+
+TEST(DAAPHostileTest, EmbeddedListsShareOneBudgetProportionalToTheDocument) {
+  // Each list names one string from many places: 4,000 bytes that decode to
+  // 200,000, and sixteen of them in one document.
+  const std::string shared(4000, 'x');
+  const PlistData list = PropertyListSerialization::writeBinary(
+      PlistDictionary{{"k", PlistArray(50, PlistValue(shared))}});
+  std::vector<Tag> items;
+  for (std::uint32_t id = 1; id <= 16; ++id) {
+    items.push_back(container("mlit", {u32("miid", id), raw("aeMX", list)}));
+  }
+  const PlistData data = document(container("mupd", {container("mlcl", std::move(items))}));
+  const DAAPValue value = DAAPParser::decodeData(data);
+  const DAAPArray* listing = value["dmap.listing"].array();
+  ASSERT_TRUE(listing);
+  ASSERT_EQ(listing->size(), 16U) << "the items stay";
+  std::size_t decoded = 0;
+  std::size_t kept = 0;
+  for (const DAAPValue& item : *listing) {
+    const DAAPValue info = item.item()->objectForKey("com.orvane.sonorel.movie-info-xml");
+    if (info.isNull()) continue;
+    ++kept;
+    decoded += info["k"].array()->size() * shared.size();
+  }
+  EXPECT_GE(kept, 1U) << "a list within the budget is read";
+  EXPECT_LE(decoded, DAAPDocumentBudget::kBytesPerDocumentByte * data.size());
 }
 
 TEST(DAAPHostileTest, ManyNestedContainersOfEveryOtherKindDoNotRecurse) {

@@ -105,8 +105,11 @@ TEST(VendOperation, RunWithoutSuccessFailsAndAnExceptionIsAFailureNotACrash) {
 }
 
 TEST(VendOperation, SubOperationGivesItsOutcomeWithoutChangingTheOuterOne) {
-  auto inner = std::make_shared<ScriptedOperation>(
-      [](ScriptedOperation& self) { self.setError(errorWithCode(11)); });
+  std::int64_t innerBagType = 0;
+  auto inner = std::make_shared<ScriptedOperation>([&](ScriptedOperation& self) {
+    innerBagType = self.requiredBagType();
+    self.setError(errorWithCode(11));
+  });
   bool innerResult = true;
   OptionalError innerError;
   std::thread::id outerThread;
@@ -115,7 +118,9 @@ TEST(VendOperation, SubOperationGivesItsOutcomeWithoutChangingTheOuterOne) {
     innerResult = self.runSubOperation(*inner, &innerError);
     self.setSuccess(true);
   });
+  outer->setRequiredBagType(1);
   EXPECT_TRUE(outer->runSyncReturningError(nullptr));
+  EXPECT_EQ(innerBagType, 1) << "the inner work reads the outer one's bag";
   EXPECT_FALSE(innerResult);
   ASSERT_TRUE(innerError);
   EXPECT_EQ(innerError->code, 11);

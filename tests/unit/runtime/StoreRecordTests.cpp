@@ -18,6 +18,7 @@
 #include "store-runtime/LedgerSoftwareUpdateStatus.h"
 #include "store-runtime/LedgerUpdate.h"
 #include "store-runtime/SysupQuaymartUpdate.h"
+#include "store-runtime/TillLogManager.h"
 #include "store-runtime/TillPurchase.h"
 
 namespace larder {
@@ -182,7 +183,7 @@ TEST(StoreRecordLedgerUpdate, LocalMarksLiveInTheDictionaryAndSurviveMergeAndArc
   EXPECT_EQ(renewed->dictionary().at(std::string(LedgerUpdate::kIsStagedKey)), PlistValue(false));
 }
 
-TEST(StoreRecordLedgerUpdate, MalformedItemsAreRefusedSoThatTheGoodOnesCanBeKept) {
+TEST(StoreRecordLedgerUpdate, ItemsWithoutIdentifierAreRefusedSoThatTheGoodOnesCanBeKept) {
   auto with = [](std::string_view key, PlistValue value) {
     PlistDictionary item = storeItem();
     item.insert_or_assign(std::string(key), std::move(value));
@@ -192,21 +193,11 @@ TEST(StoreRecordLedgerUpdate, MalformedItemsAreRefusedSoThatTheGoodOnesCanBeKept
   withoutWareID.erase("ware-id");
   const std::vector<std::pair<std::string, PlistDictionary>> malformed = {
       {"no ware-id", withoutWareID},
-      {"ware-id as text", with("ware-id", "409183694")},
+      {"ware-id as words", with("ware-id", "not a number")},
       {"negative ware-id", with("ware-id", std::int64_t{-5})},
       {"zero ware-id", with("ware-id", 0)},
       {"ware-id as real", with("ware-id", 5.5)},
       {"ware-id as bool", with("ware-id", true)},
-      {"bundle-id as number", with("bundle-id", 12)},
-      {"title as array", with("title", PlistArray{"Keynote"})},
-      {"version as number", with("version", 13.1)},
-      {"action-params as data", with("action-params", PlistData{1, 2})},
-      {"release-date as text", with("release-date", "2023-11-14")},
-      {"release-date not finite", with("release-date", PlistDate{std::nan("")})},
-      {"staged mark as text", with(LedgerUpdate::kIsStagedKey, "YES")},
-      {"abort code as real", with(LedgerUpdate::kAutoUpdateAbortCodeKey, 3.5)},
-      {"attempt date as dictionary",
-       with(LedgerUpdate::kFirstAutoUpdateAttemptDateKey, PlistDictionary{})},
   };
   std::vector<PlistDictionary> answer{storeItem(1)};
   for (const auto& [why, item] : malformed) {
@@ -236,6 +227,45 @@ TEST(StoreRecordLedgerUpdate, MalformedItemsAreRefusedSoThatTheGoodOnesCanBeKept
       storeItem(),
       [](const PlistDictionary& item) { return LedgerUpdate::initWithDictionary(item); },
       [](const LedgerUpdate& update) { return update.dictionary(); });
+}
+
+TEST(StoreRecordLedgerUpdate, AFieldOfAnotherTypeIsConvertedOrSkippedAndTheItemKept) {
+  struct Case {
+    std::string_view key;
+    PlistValue sent;
+    PlistValue kept;  // null: the field is skipped
+  };
+  const std::vector<Case> cases = {
+      {"ware-id", "409183694", PlistValue(std::uint64_t{409183694})},
+      {"version", 13.1, "13.1"},
+      {"version", 13, "13"},
+      {"bundle-id", 12, "12"},
+      {"release-date", "2023-11-14", PlistDate{1699920000}},
+      {"release-date", "2023-11-14T22:13:20Z", PlistDate{1700000000}},
+      {"release-date", "2023-11-15T00:13:20.5+02:00", PlistDate{1700000000.5}},
+      {LedgerUpdate::kIsStagedKey, "YES", true},
+      {LedgerUpdate::kAutoUpdateAbortCodeKey, 3.0, std::int64_t{3}},
+      {LedgerUpdate::kAutoUpdateAbortCodeKey, "-4", std::int64_t{-4}},
+      {"title", PlistArray{"Keynote"}, {}},
+      {"action-params", PlistData{1, 2}, {}},
+      {"release-date", "soon", {}},
+      {"release-date", "2023-02-30", {}},
+      {"release-date", PlistDate{std::nan("")}, {}},
+      {LedgerUpdate::kAutoUpdateAbortCodeKey, 3.5, {}},
+      {LedgerUpdate::kFirstAutoUpdateAttemptDateKey, PlistDictionary{}, {}},
+  };
+  for (const Case& test : cases) {
+    const std::string why = std::string(test.key) + " = " + describePlistValue(test.sent);
+    PlistDictionary item = storeItem();
+    item.insert_or_assign(std::string(test.key), test.sent);
+    LedgerUpdateRef update = LedgerUpdate::initWithDictionary(item);
+    ASSERT_TRUE(update) << why;
+    EXPECT_EQ(update->bundleID(), test.key == "bundle-id" ? "12" : "com.example.Keynote") << why;
+    const PlistDictionary kept = update->dictionary();
+    const auto found = kept.find(test.key);
+    EXPECT_EQ(found == kept.end() ? PlistValue() : found->second, test.kept) << why;
+    EXPECT_EQ(kept.at("whats-new"), storeItem().at("whats-new")) << why;
+  }
 }
 
 TEST(StoreRecordLedgerUpdate, WireFormUsesFieldNamesAndCarriesTheWholeItem) {

@@ -2,9 +2,11 @@
 #include <gtest/gtest.h>
 #include <sdbus-c++/Error.h>
 #include <sdbus-c++/Message.h>
+#include <sdbus-c++/Types.h>
 
 #include <cstdint>
 #include <limits>
+#include <map>
 #include <string>
 
 #include "AssetService/DBusValueCodec.h"
@@ -80,6 +82,45 @@ TEST(DBusValueCodec, AbsentValuesTravelAsEmptyValues) {
   // converts to, never as a wrong body.
   read = roundTrip("sxa{sv}ay", {42, "17", "not a dictionary", "not data"});
   EXPECT_EQ(read, (PlistArray{"", 17, PlistDictionary{}, PlistData{}}));
+}
+
+// The type each entry of an a{sv} travels as.
+std::map<std::string, std::string> variantTypes(const PlistDictionary& dictionary) {
+  sdbus::PlainMessage message = sdbus::createPlainMessage();
+  DBusValueCodec::write(message, "a{sv}", dictionary);
+  message.seal();
+  std::map<std::string, std::string> types;
+  message.enterContainer("{sv}");
+  for (std::size_t i = 0; i < dictionary.size(); ++i) {
+    message.enterDictEntry("sv");
+    std::string key;
+    message >> key;
+    std::string type;
+    std::string contents;
+    message.peekType(type, contents);
+    sdbus::Variant value;
+    message >> value;
+    message.exitDictEntry();
+    types[key] = contents;
+  }
+  return types;
+}
+
+TEST(DBusValueCodec, UnsignedFieldsOfRecordsTravelAsUInt64) {
+  const auto types = variantTypes({{"itemIdentifier", 5},
+                                   {"accountID", std::uint64_t{7}},
+                                   {"ware-id", 409183694},
+                                   {"versionIdentifier", 5},
+                                   {"itemIdentifierText", 5}});
+  EXPECT_EQ(types.at("itemIdentifier"), "t");
+  EXPECT_EQ(types.at("accountID"), "t");
+  EXPECT_EQ(types.at("ware-id"), "t");
+  EXPECT_EQ(types.at("versionIdentifier"), "x") << "store versions are int64";
+  EXPECT_EQ(types.at("itemIdentifierText"), "x");
+  // The values read back unchanged.
+  const PlistDictionary product{{"itemIdentifier", 5}, {"bundleIdentifier", "com.example.a"}};
+  const PlistArray products{PlistValue(PlistArray{product})};
+  EXPECT_EQ(roundTrip("aa{sv}", products), products);
 }
 
 TEST(DBusValueCodec, VariantsCarryNaturalTypes) {

@@ -13,6 +13,7 @@
 #include "AssetService/AssetServiceInterface.h"
 #include "AssetService/DBusValueCodec.h"
 #include "AssetService/RequestTable.h"
+#include "AssetService/ServiceError.h"
 #include "ServiceTestSupport.h"
 
 #ifndef LARDER_SOURCE_DIR
@@ -379,15 +380,28 @@ TEST_F(AssetServiceInterfaceTest, InstalledSoftwareRequestsAnswerInWireForm) {
   EXPECT_EQ(replies[3], PlistArray{PlistArray{expected}});
 }
 
+// The name of the error that performing `request` answers with, or "".
+std::string refusal(const RequestDescriptor& request, AssetServiceInterface& connection,
+                    const PlistArray& arguments, const ReplyHandler& reply) {
+  try {
+    RequestTable::perform(request, connection, arguments, reply);
+  } catch (const ServiceError& error) {
+    return error.name();
+  }
+  return "";
+}
+
 TEST_F(AssetServiceInterfaceTest, RequestsWithoutTargetBehaveAsTheTableSays) {
   AssetServiceInterface& connection = connect();
   int emptyReplies = 0;
   int unexpectedReplies = 0;
+  int refused = 0;
   for (const RequestDescriptor& request : RequestTable::requests()) {
-    if (request.handler) continue;
+    const bool refuses = request.withoutTarget == WithoutTarget::kErrorReply;
+    if (request.handler && !refuses) continue;
     PlistArray arguments(DBusValueCodec::splitSignature(request.inSignature).size());
     bool replied = false;
-    RequestTable::perform(request, connection, arguments, [&](PlistArray out) {
+    const std::string error = refusal(request, connection, arguments, [&](PlistArray out) {
       replied = true;
       if (request.withoutTarget == WithoutTarget::kEmptyReply && out.empty()) {
         ++emptyReplies;
@@ -396,11 +410,25 @@ TEST_F(AssetServiceInterfaceTest, RequestsWithoutTargetBehaveAsTheTableSays) {
       }
     });
     EXPECT_EQ(replied, request.withoutTarget == WithoutTarget::kEmptyReply) << request.selector;
+    // The reply that belonged to the target is an error, never silence.
+    EXPECT_EQ(error, refuses ? ServiceError::kNotAvailable : "") << request.selector;
+    refused += refuses ? 1 : 0;
     // Requests sent without wanting a reply have no handler to call.
     EXPECT_NO_THROW(RequestTable::perform(request, connection, arguments, {})) << request.selector;
   }
   EXPECT_GT(emptyReplies, 0);
+  EXPECT_GT(refused, 2);
   EXPECT_EQ(unexpectedReplies, 0);
+}
+
+TEST_F(AssetServiceInterfaceTest, AnUpdateCheckWithoutStoreClientIsRefusedAtOnce) {
+  AssetServiceInterface& connection = connect();
+  const RequestDescriptor& check = *RequestTable::find("CheckForUpdatesWithUserHasSeenUpdates");
+  bool replied = false;
+  EXPECT_EQ(refusal(check, connection, {false}, [&](PlistArray) { replied = true; }),
+            ServiceError::kNoStoreClient);
+  EXPECT_FALSE(replied);
+  EXPECT_EQ(refusal(check, connection, {false}, {}), "") << "nobody waits for an answer";
 }
 
 }  // namespace

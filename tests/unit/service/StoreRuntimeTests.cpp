@@ -145,6 +145,21 @@ TEST(TillLogFormat, PercentSignsAndMissingArguments) {
   EXPECT_EQ(Log::formatMessage("", {"unused"}), "");
 }
 
+TEST(TillLogFormat, LongTextIsCutAndSaysItsLength) {
+  const std::string request(10 * 1024 * 1024, 'm');
+  const std::string line = TillLogManager::formatMessage("dialog \"%@\" shown", {request});
+  EXPECT_LT(line.size(), 3 * LogArgument::kMaxTextBytes);
+  EXPECT_TRUE(line.starts_with("dialog \"mmmm")) << line.substr(0, 20);
+  EXPECT_TRUE(line.ends_with("\u2026(10485760 bytes)\" shown")) << line.substr(line.size() - 40);
+  // A cut never splits a character.
+  std::string wide = "x";
+  while (wide.size() <= LogArgument::kMaxTextBytes) wide += "\u00e9";
+  const std::string cut = TillLogManager::formatMessage("%@", {wide});
+  EXPECT_TRUE(cut.starts_with("x\u00e9"));
+  EXPECT_NE(cut.find("\u00e9\u2026("), std::string::npos) << "ends on a whole character";
+  EXPECT_EQ(TillLogManager::formatMessage("%@", {"short"}), "short");
+}
+
 TEST(TillLogFormat, LoggedArgumentsDescribeThemselves) {
   auto& log = TillLogManager::sharedManager();
   int saved = log.level();

@@ -169,18 +169,24 @@ TEST_F(UpdateQueueTest, MalformedItemsAreDroppedAndTheGoodOnesKept) {
       {"items", PlistArray{storeItem(101, "com.example.atlas", "1.1"), PlistValue("not an item"),
                            PlistDictionary{{"bundle-id", "com.example.nowareid"}},
                            PlistDictionary{{"ware-id", 104}, {"version", PlistArray{}}},
+                           PlistDictionary{{"ware-id", 105}, {"version", 3}},
                            storeItem(102, "com.example.birch", "2.1")}}});
   auto queue = makeQueue();
   CheckResult result = check(*queue);
   ASSERT_TRUE(result.success);
-  EXPECT_EQ(identifiersOf(result.available), (std::vector<std::uint64_t>{101, 102}));
+  // An item with an odd field keeps its place, without that field or with
+  // the field converted.
+  EXPECT_EQ(identifiersOf(result.available), (std::vector<std::uint64_t>{101, 104, 105, 102}));
+  ASSERT_EQ(result.available.size(), 4U);
+  EXPECT_EQ(result.available[1]->version(), std::nullopt);
+  EXPECT_EQ(result.available[2]->version(), "3");
   // No "incompatible-items": no list, and an empty one in the file.
   EXPECT_FALSE(result.incompatible);
   EXPECT_EQ(queue->incompatibleUpdates(), nullptr);
   const PlistDictionary cache = cacheContents();
   ASSERT_TRUE(PlistValue(cache)["incompatibleUpdates"].array());
   EXPECT_TRUE(PlistValue(cache)["incompatibleUpdates"].array()->empty());
-  EXPECT_EQ(PlistValue(cache)["updates"].array()->size(), 2U);
+  EXPECT_EQ(PlistValue(cache)["updates"].array()->size(), 4U);
 }
 
 TEST_F(UpdateQueueTest, AFailedCheckLeavesListsFileAndDelegateAlone) {
