@@ -365,7 +365,9 @@ void MetadataBundleIndex::forgetOldVacatedPaths(Clock::time_point now) {
 // the change is the replacement itself. One already told changed by this work is not told twice.
 void MetadataBundleIndex::reportReplacementsAsChanged(
     const std::map<BundleKey, std::shared_ptr<MetadataItem>>& owed, Changes& changes) {
-  for (const auto& [key, item] : owed) {
+  for (const auto& entry : owed) {
+    const BundleKey& key = entry.first;
+    const std::shared_ptr<MetadataItem>& item = entry.second;
     auto due = replacementsOwingChange_.find(key);
     if (due == replacementsOwingChange_.end() || due->second != item) continue;
     replacementsOwingChange_.erase(due);

@@ -95,7 +95,7 @@ void ProductPrinter::printChange(const PlistValue& product, std::int64_t state) 
             << field(product, "bundleVersion") << '\t' << field(product, "bundlePath") << std::endl;
 }
 
-void ProductPrinter::printReply(const RequestDescriptor& request, const PlistArray& reply) const {
+void ProductPrinter::printReply(const PlistArray& reply) const {
   if (json_) {
     nlohmann::json document = nlohmann::json::array();
     for (const PlistValue& value : reply) document.push_back(JsonConversion::toJson(value));

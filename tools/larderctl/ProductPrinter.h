@@ -16,7 +16,7 @@ class ProductPrinter {
   void printProducts(const PlistValue& products) const;
   void printProduct(const PlistValue& product) const;
   void printChange(const PlistValue& product, std::int64_t state) const;
-  void printReply(const RequestDescriptor& request, const PlistArray& reply) const;
+  void printReply(const PlistArray& reply) const;
 
  private:
   bool json_;

@@ -122,7 +122,7 @@ int runCall(const GlobalOptions& options, const std::string& member,
   }
   ServiceClient client = connect(options);
   PlistArray reply = client.call(member, parseArguments(*request, words));
-  ProductPrinter(options.json).printReply(*request, reply);
+  ProductPrinter(options.json).printReply(reply);
   return 0;
 }
 

@@ -119,7 +119,9 @@ TEST(DAAPHostileTest, ZeroLengthValuesOfEveryKnownTagAreHarmless) {
   }
   for (const std::string& code : kTopLevelCodes) {
     const DAAPValue value = decode(container(code, empties));
-    if (code == "mlog" || code == "arsv") EXPECT_TRUE(value.isNull()) << code;
+    if (code == "mlog" || code == "arsv") {
+      EXPECT_TRUE(value.isNull()) << code;
+    }
   }
   const DAAPValue item = decode(container("medc", empties));
   ASSERT_TRUE(item.isItem());
@@ -271,8 +273,12 @@ TEST(DAAPHostileTest, RandomBodiesUnderEveryTopLevelCode) {
       PlistData body(random() % 200);
       for (std::uint8_t& byte : body) byte = static_cast<std::uint8_t>(random());
       const DAAPValue value = decode(raw(code, body));
-      if (code == "cacr" || code == "medc") EXPECT_TRUE(value.isItem());
-      if (code == "arsv") EXPECT_TRUE(value.isNull());
+      if (code == "cacr" || code == "medc") {
+        EXPECT_TRUE(value.isItem());
+      }
+      if (code == "arsv") {
+        EXPECT_TRUE(value.isNull());
+      }
       (void)value.toPlist();
       (void)value.description();
     }

@@ -15,10 +15,6 @@ namespace {
 
 using namespace dmaptest;  // NOLINT(google-build-using-namespace)
 
-DAAPParser& parser() {
-  return DAAPParser::sharedInstance();
-}
-
 // Checks that `dictionary` holds exactly the table's entries as written.
 void expectEveryEntry(const DAAPDictionary& dictionary, const std::vector<PlainTag>& table,
                       std::size_t extraEntries = 0) {

@@ -546,7 +546,7 @@ TEST_F(MetadataQueryTest, ReplacingABundleIsARemovalAndAnAddition) {
 TEST_F(MetadataQueryTest, BundleDeletedAndMadeAgainIsANewItem) {
   landBundle(applications("Notes.app"), storeApp("com.example.Notes"));
   auto [query, recorder] = startQuery();
-  for (const std::string& name : {"Notes.app", "Jotter.app"}) {
+  for (const char* name : {"Notes.app", "Jotter.app"}) {
     const ItemRef old = query->resultAtIndex(0);
     ASSERT_NE(old, nullptr);
     fs::remove_all(old->path());

@@ -71,7 +71,9 @@ TEST(VendPackageEntryPolicy, LinksMayNeverLeadOutOfTheBundle) {
   for (const LinkCase& link : linkCases()) {
     std::string refusal;
     EXPECT_EQ(allowsAll(link.links, &refusal), link.allowed) << link.name << ": " << refusal;
-    if (!link.allowed) EXPECT_NE(refusal.find("the link \"X.app/"), std::string::npos) << refusal;
+    if (!link.allowed) {
+      EXPECT_NE(refusal.find("the link \"X.app/"), std::string::npos) << refusal;
+    }
   }
 }
 
