@@ -31,12 +31,12 @@ AssetServiceInterface::AssetServiceInterface(std::string peer, SoftwareMap& soft
           DispatchQueue::create("AssetServiceInterface " + peer_, DispatchQueue::Kind::Serial)) {}
 
 std::optional<VendStoreClient> AssetServiceInterface::storeClient() const {
-  std::lock_guard lock(storeClientMutex_);
+  MutexLock lock(storeClientMutex_);
   return storeClient_;
 }
 
 void AssetServiceInterface::setStoreClient(VendStoreClient storeClient) {
-  std::lock_guard lock(storeClientMutex_);
+  MutexLock lock(storeClientMutex_);
   storeClient_ = std::move(storeClient);
 }
 
@@ -46,7 +46,7 @@ void AssetServiceInterface::startService() {
 }
 
 void AssetServiceInterface::setStoreClientFromTypeIfNeeded(std::int64_t clientType) {
-  std::lock_guard lock(storeClientMutex_);
+  MutexLock lock(storeClientMutex_);
   if (!storeClient_) storeClient_ = VendStoreClient::initWithStoreClientType(clientType);
 }
 

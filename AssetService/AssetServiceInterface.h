@@ -3,12 +3,12 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 
 #include "AssetService/RemoteObjectFactory.h"
 #include "platform/DispatchQueue.h"
+#include "platform/Mutex.h"
 #include "platform/PlistValue.h"
 #include "store-runtime/VendStoreClient.h"
 
@@ -70,8 +70,8 @@ class AssetServiceInterface {
   SoftwareMap& softwareMap_;
   std::shared_ptr<RemoteObjectFactory> remoteObjects_;
   std::shared_ptr<DispatchQueue> requestQueue_;
-  mutable std::mutex storeClientMutex_;
-  std::optional<VendStoreClient> storeClient_;
+  mutable Mutex storeClientMutex_;
+  std::optional<VendStoreClient> storeClient_ GUARDED_BY(storeClientMutex_);
 };
 
 }  // namespace larder

@@ -198,7 +198,7 @@ const std::shared_ptr<DispatchQueue>& DAAPClient::pollingQueue() {
 
 void DAAPClient::startUpdatingWithLocalVersion(std::optional<std::int64_t> localVersion) {
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     localVersion_ = localVersion.value_or(0);
     updating_ = true;
     bagSeen_ = false;
@@ -225,7 +225,7 @@ void DAAPClient::stopUpdating() {
   Timer polling;
   Timer forcedRefresh;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     updating_ = false;
     polling = std::exchange(pollingTimer_, std::nullopt);
     forcedRefresh = std::exchange(forcedRefreshTimer_, std::nullopt);
@@ -235,7 +235,7 @@ void DAAPClient::stopUpdating() {
 }
 
 void DAAPClient::invalidateSession() {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   sessionID_.reset();
   latestVersion_.reset();
 }
@@ -243,7 +243,7 @@ void DAAPClient::invalidateSession() {
 void DAAPClient::urlBagDidUpdateWithSuccess(bool success, const OptionalError& /*error*/) {
   if (!success) return;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     bagSeen_ = true;
   }
   invalidateSession();
@@ -260,7 +260,7 @@ void DAAPClient::installTimers() {
   bool needsPolling = false;
   bool needsForcedRefresh = false;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (!updating_) return;
     needsPolling = !pollingTimer_;
     needsForcedRefresh = !forcedRefreshTimer_;
@@ -269,7 +269,7 @@ void DAAPClient::installTimers() {
   const double pollingSeconds = needsPolling ? pollingFrequency() : 0;
   const double forcedRefreshSeconds =
       needsForcedRefresh ? forcedRefreshFrequency() * kSecondsPerMinute : 0;
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   if (!updating_) return;
   if (needsPolling && !pollingTimer_) {
     pollingTimer_ = makeTimer(pollingSeconds, &DAAPClient::pollingTimerFired);
@@ -372,12 +372,12 @@ std::optional<DAAPArray> DAAPClient::filteredItems(const std::optional<DAAPArray
 }
 
 void DAAPClient::setMediaKinds(std::vector<std::int64_t> mediaKinds) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   mediaKinds_ = std::move(mediaKinds);
 }
 
 std::vector<std::int64_t> DAAPClient::mediaKinds() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return mediaKinds_;
 }
 
@@ -408,47 +408,47 @@ std::string DAAPClient::nameForEvent(std::int64_t event) {
 // Fields
 
 std::shared_ptr<LedgerDAAPClientDelegate> DAAPClient::delegate() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return delegate_.lock();
 }
 
 void DAAPClient::setDelegate(const std::shared_ptr<LedgerDAAPClientDelegate>& delegate) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   delegate_ = delegate;
 }
 
 std::optional<std::int64_t> DAAPClient::localVersion() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return localVersion_;
 }
 
 std::optional<std::int64_t> DAAPClient::latestVersion() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return latestVersion_;
 }
 
 std::optional<std::int64_t> DAAPClient::sessionID() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return sessionID_;
 }
 
 void DAAPClient::setSessionID(std::optional<std::int64_t> sessionID) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   sessionID_ = sessionID;
 }
 
 void DAAPClient::setLatestVersion(std::optional<std::int64_t> latestVersion) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   latestVersion_ = latestVersion;
 }
 
 void DAAPClient::setLocalVersion(std::optional<std::int64_t> localVersion) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   localVersion_ = localVersion;
 }
 
 DAAPClient::State DAAPClient::state() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   if (!updating_) return State::Stopped;
   if (!bagSeen_) return State::WaitingForBag;
   if (!sessionID_) return State::NoSession;
@@ -457,12 +457,12 @@ DAAPClient::State DAAPClient::state() const {
 }
 
 std::optional<RunLoop::TimerId> DAAPClient::pollingTimer() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return pollingTimer_;
 }
 
 std::optional<RunLoop::TimerId> DAAPClient::forcedRefreshTimer() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return forcedRefreshTimer_;
 }
 

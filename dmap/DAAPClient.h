@@ -4,7 +4,6 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -12,6 +11,7 @@
 
 #include "dmap/DAAPValue.h"
 #include "dmap/LedgerDAAPClientDelegate.h"
+#include "platform/Mutex.h"
 #include "platform/PlistValue.h"
 #include "platform/RunLoop.h"
 #include "store-runtime/VendError.h"
@@ -216,20 +216,20 @@ class DAAPClient : public std::enable_shared_from_this<DAAPClient> {
 
   const std::string serviceName_;
   const VendStoreClient storeClient_;
-  std::weak_ptr<LedgerDAAPClientDelegate> delegate_;  // under mutex_
+  std::weak_ptr<LedgerDAAPClientDelegate> delegate_ GUARDED_BY(mutex_);
   RunLoop& runLoop_;
   VendServiceProxy serviceProxy_;
   std::shared_ptr<VendURLBagObserver> bagObserver_;
 
-  mutable std::mutex mutex_;
-  std::optional<std::int64_t> localVersion_;
-  std::optional<std::int64_t> latestVersion_;
-  std::optional<std::int64_t> sessionID_;
-  std::vector<std::int64_t> mediaKinds_;
-  bool updating_ = false;
-  bool bagSeen_ = false;
-  Timer pollingTimer_;
-  Timer forcedRefreshTimer_;
+  mutable Mutex mutex_;
+  std::optional<std::int64_t> localVersion_ GUARDED_BY(mutex_);
+  std::optional<std::int64_t> latestVersion_ GUARDED_BY(mutex_);
+  std::optional<std::int64_t> sessionID_ GUARDED_BY(mutex_);
+  std::vector<std::int64_t> mediaKinds_ GUARDED_BY(mutex_);
+  bool updating_ GUARDED_BY(mutex_) = false;
+  bool bagSeen_ GUARDED_BY(mutex_) = false;
+  Timer pollingTimer_ GUARDED_BY(mutex_);
+  Timer forcedRefreshTimer_ GUARDED_BY(mutex_);
   std::atomic<bool> pollingTickQueued_{false};
   std::atomic<bool> forcedRefreshTickQueued_{false};
 };

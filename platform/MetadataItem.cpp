@@ -16,13 +16,13 @@ std::string MetadataItem::path() const {
 }
 
 std::shared_ptr<const PlistDictionary> MetadataItem::attributes() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return attributes_;
 }
 
 void MetadataItem::setAttributes(Access /*unused*/,
                                  std::shared_ptr<const PlistDictionary> attributes) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   attributes_ = std::move(attributes);
 }
 

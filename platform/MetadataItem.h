@@ -1,10 +1,10 @@
 #pragma once
 
 #include <memory>
-#include <mutex>
 #include <string>
 #include <string_view>
 
+#include "platform/Mutex.h"
 #include "platform/PlistValue.h"
 
 namespace larder {
@@ -38,8 +38,9 @@ class MetadataItem {
   void setAttributes(Access /*unused*/, std::shared_ptr<const PlistDictionary> attributes);
 
  private:
-  mutable std::mutex mutex_;
-  std::shared_ptr<const PlistDictionary> attributes_ = std::make_shared<const PlistDictionary>();
+  mutable Mutex mutex_;
+  std::shared_ptr<const PlistDictionary> attributes_ GUARDED_BY(mutex_) =
+      std::make_shared<const PlistDictionary>();
 };
 
 }  // namespace larder

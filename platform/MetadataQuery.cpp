@@ -51,7 +51,7 @@ MetadataQuery::~MetadataQuery() {
 }
 
 void MetadataQuery::setQueue(std::shared_ptr<DispatchQueue> queue) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   if (!started_) queue_ = std::move(queue);
 }
 
@@ -60,19 +60,19 @@ void MetadataQuery::setSearchScope(SearchScope /*scope*/) {
 }
 
 void MetadataQuery::setHandlers(Handlers handlers) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   handlers_ = std::move(handlers);
 }
 
 MetadataQuery::Handlers MetadataQuery::handlers() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return handlers_;
 }
 
 // MARK: lifecycle
 
 bool MetadataQuery::start() {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   if (started_ || stopped_) {
     startError_ = "the query was started before";
     return false;
@@ -108,22 +108,22 @@ bool MetadataQuery::start() {
 
 void MetadataQuery::stop() {
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     stopped_ = true;
     if (!started_) return;
   }
   watcher_->wake();
-  std::lock_guard joinLock(engineMutex_);
+  MutexLock joinLock(engineMutex_);
   if (engine_.joinable() && engine_.get_id() != std::this_thread::get_id()) engine_.join();
 }
 
 bool MetadataQuery::isStarted() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return started_;
 }
 
 bool MetadataQuery::isGathering() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return gathering_;
 }
 
@@ -132,7 +132,7 @@ bool MetadataQuery::isStopped() const {
 }
 
 std::string MetadataQuery::startError() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return startError_;
 }
 
@@ -198,7 +198,7 @@ void MetadataQuery::followTheDisk(bool workPending) {
 void MetadataQuery::post(std::function<void(MetadataQuery&)> delivery) {
   std::shared_ptr<DispatchQueue> queue;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     queue = queue_;
   }
   // A barrier keeps events in order on a concurrent queue too.
@@ -224,7 +224,7 @@ void MetadataQuery::deliverChanges(const MetadataBundleIndex::Changes& changes, 
   const Handlers handlers = this->handlers();
   if (finished) {
     {
-      std::lock_guard lock(mutex_);
+      MutexLock lock(mutex_);
       gathering_ = false;
     }
     if (handlers.finished) handlers.finished(*this);
@@ -238,7 +238,7 @@ void MetadataQuery::deliverChanges(const MetadataBundleIndex::Changes& changes, 
 
 void MetadataQuery::deliverServerPortInvalid() {
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     gathering_ = false;
   }
   const Handlers handlers = this->handlers();
@@ -246,7 +246,7 @@ void MetadataQuery::deliverServerPortInvalid() {
 }
 
 void MetadataQuery::publish(const MetadataBundleIndex::Changes& changes) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   for (const std::shared_ptr<MetadataItem>& item : changes.removed) {
     auto found = indexOfItem_.find(item.get());
     if (found == indexOfItem_.end()) continue;
@@ -272,17 +272,17 @@ void MetadataQuery::publish(const MetadataBundleIndex::Changes& changes) {
 // MARK: results
 
 std::size_t MetadataQuery::resultCount() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return results_.size();
 }
 
 std::shared_ptr<const MetadataItem> MetadataQuery::resultAtIndex(std::size_t index) const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return index < results_.size() ? results_[index] : nullptr;
 }
 
 std::optional<std::size_t> MetadataQuery::indexOfResult(const MetadataItem* item) const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   auto found = indexOfItem_.find(item);
   if (found == indexOfItem_.end()) return std::nullopt;
   return found->second;
@@ -298,7 +298,7 @@ PlistValue MetadataQuery::attributeOfItem(const MetadataItem& item, std::string_
 }
 
 void MetadataQuery::simulateQueueOverflowForTesting() {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   if (watcher_) watcher_->injectQueueOverflowForTesting();
 }
 

@@ -5,7 +5,6 @@
 #include <cstddef>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -17,6 +16,7 @@
 #include "platform/MetadataBundleIndex.h"
 #include "platform/MetadataIndexWatcher.h"
 #include "platform/MetadataItem.h"
+#include "platform/Mutex.h"
 #include "platform/PlistValue.h"
 
 namespace larder {
@@ -141,17 +141,17 @@ class MetadataQuery : public std::enable_shared_from_this<MetadataQuery> {
   const std::vector<std::string> valueAttributes_;
   const Options options_;
 
-  mutable std::mutex mutex_;
-  std::shared_ptr<DispatchQueue> queue_;
-  Handlers handlers_;
-  std::string startError_;
-  bool started_ = false;
-  bool gathering_ = false;
-  std::vector<std::shared_ptr<MetadataItem>> results_;
-  std::unordered_map<const MetadataItem*, std::size_t> indexOfItem_;
+  mutable Mutex mutex_;
+  std::shared_ptr<DispatchQueue> queue_ GUARDED_BY(mutex_);
+  Handlers handlers_ GUARDED_BY(mutex_);
+  std::string startError_ GUARDED_BY(mutex_);
+  bool started_ GUARDED_BY(mutex_) = false;
+  bool gathering_ GUARDED_BY(mutex_) = false;
+  std::vector<std::shared_ptr<MetadataItem>> results_ GUARDED_BY(mutex_);
+  std::unordered_map<const MetadataItem*, std::size_t> indexOfItem_ GUARDED_BY(mutex_);
 
   std::atomic<bool> stopped_{false};
-  std::mutex engineMutex_;
+  Mutex engineMutex_;
   // Owned by the engine thread while it runs.
   std::unique_ptr<MetadataIndexWatcher> watcher_;
   std::unique_ptr<MetadataBundleIndex> index_;

@@ -104,33 +104,33 @@ std::string describeOptional(const std::optional<T>& value) {
 }  // namespace
 
 LedgerSoftwareProductFields LedgerSoftwareProduct::snapshot() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return fields_;
 }
 
 void LedgerSoftwareProduct::update(
     const std::function<void(LedgerSoftwareProductFields&)>& change) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   change(fields_);
 }
 
 std::string LedgerSoftwareProduct::bundlePath() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return fields_.bundlePath;
 }
 
 std::optional<std::string> LedgerSoftwareProduct::bundleIdentifier() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return fields_.bundleIdentifier;
 }
 
 std::optional<std::string> LedgerSoftwareProduct::bundleVersion() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return fields_.bundleVersion;
 }
 
 std::optional<std::uint64_t> LedgerSoftwareProduct::itemIdentifier() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return fields_.itemIdentifier;
 }
 

@@ -3,10 +3,10 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 
+#include "platform/Mutex.h"
 #include "platform/PlistValue.h"
 
 namespace larder {
@@ -56,7 +56,7 @@ class LedgerSoftwareProduct {
   // Reads under the record's lock without copying every field.
   template <typename Reader>
   auto read(Reader&& reader) const {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     return reader(static_cast<const LedgerSoftwareProductFields&>(fields_));
   }
   void update(const std::function<void(LedgerSoftwareProductFields&)>& change);
@@ -78,8 +78,8 @@ class LedgerSoftwareProduct {
   [[nodiscard]] std::string description() const;
 
  private:
-  mutable std::mutex mutex_;
-  LedgerSoftwareProductFields fields_;
+  mutable Mutex mutex_;
+  LedgerSoftwareProductFields fields_ GUARDED_BY(mutex_);
 };
 
 using LedgerSoftwareProductRef = std::shared_ptr<LedgerSoftwareProduct>;

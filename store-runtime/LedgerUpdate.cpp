@@ -110,32 +110,32 @@ LedgerUpdate::LedgerUpdate(Validated, PlistDictionary item)
       bundleID_(RecordFieldReader(item_).string(kBundleIDKey)) {}
 
 PlistDictionary LedgerUpdate::dictionary() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return item_;
 }
 
 std::optional<std::string> LedgerUpdate::stringForKey(std::string_view key) const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return RecordFieldReader(item_).string(key);
 }
 
 bool LedgerUpdate::boolForKey(std::string_view key) const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return RecordFieldReader(item_).boolean(key).value_or(false);
 }
 
 std::optional<PlistDate> LedgerUpdate::dateForKey(std::string_view key) const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return RecordFieldReader(item_).date(key);
 }
 
 void LedgerUpdate::setValueForKey(std::string_view key, PlistValue value) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   item_.insert_or_assign(std::string(key), std::move(value));
 }
 
 PlistValue LedgerUpdate::itemIdentifier() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   const auto found = item_.find(kWareIDKey);
   return found == item_.end() ? PlistValue() : found->second;
 }
@@ -169,7 +169,7 @@ void LedgerUpdate::setHasBeenSeenByUser(bool seen) {
 }
 
 std::int64_t LedgerUpdate::autoUpdateAbortCode() const {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return RecordFieldReader(item_).integer(kAutoUpdateAbortCodeKey).value_or(0);
 }
 void LedgerUpdate::setAutoUpdateAbortCode(std::int64_t code) {
@@ -184,7 +184,7 @@ void LedgerUpdate::setFirstAutoUpdateAttemptDate(std::optional<PlistDate> date) 
     setValueForKey(kFirstAutoUpdateAttemptDateKey, *date);
     return;
   }
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   item_.erase(std::string(kFirstAutoUpdateAttemptDateKey));
 }
 

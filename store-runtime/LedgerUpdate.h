@@ -2,11 +2,11 @@
 
 #include <cstdint>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
 
+#include "platform/Mutex.h"
 #include "platform/PlistValue.h"
 
 namespace larder {
@@ -102,8 +102,8 @@ class LedgerUpdate {
   [[nodiscard]] std::optional<PlistDate> dateForKey(std::string_view key) const;
   void setValueForKey(std::string_view key, PlistValue value);
 
-  mutable std::mutex mutex_;
-  PlistDictionary item_;
+  mutable Mutex mutex_;
+  PlistDictionary item_ GUARDED_BY(mutex_);
   // Store keys never change, so the ones that lists are searched by are
   // read once.
   std::uint64_t itemIdentifierValue_;

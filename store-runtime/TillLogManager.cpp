@@ -201,7 +201,7 @@ void TillLogManager::write(int level, std::string_view function, std::string_vie
   std::fwrite(text.data(), 1, text.size(), stderr);
   std::vector<std::shared_ptr<Sink>> sinks;
   {
-    std::lock_guard lock(sinksMutex_);
+    MutexLock lock(sinksMutex_);
     sinks = sinks_;
   }
   for (const auto& sink : sinks) (*sink)(level, message);
@@ -221,11 +221,11 @@ void TillLogManager::logLevelForPlist(int level, std::string_view function, std:
 std::shared_ptr<void> TillLogManager::addSink(Sink sink) {
   auto shared = std::make_shared<Sink>(std::move(sink));
   {
-    std::lock_guard lock(sinksMutex_);
+    MutexLock lock(sinksMutex_);
     sinks_.push_back(shared);
   }
   auto remove = [this, shared](void*) {
-    std::lock_guard lock(sinksMutex_);
+    MutexLock lock(sinksMutex_);
     std::erase(sinks_, shared);
   };
   return {static_cast<void*>(shared.get()), remove};

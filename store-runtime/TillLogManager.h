@@ -4,13 +4,13 @@
 #include <concepts>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <string_view>
 #include <type_traits>
 #include <variant>
 #include <vector>
 
+#include "platform/Mutex.h"
 #include "platform/PlistValue.h"
 
 namespace larder {
@@ -124,8 +124,8 @@ class TillLogManager {
              const std::string& message);
 
   std::atomic<int> level_;
-  std::mutex sinksMutex_;
-  std::vector<std::shared_ptr<Sink>> sinks_;
+  Mutex sinksMutex_;
+  std::vector<std::shared_ptr<Sink>> sinks_ GUARDED_BY(sinksMutex_);
 };
 
 // Non-zero when debug logging is on (LARDER_DEBUG set to a non-zero value).

@@ -162,7 +162,6 @@ bool VendAssetFileWriter::append(std::span<const std::uint8_t> bytes) {
 }
 
 VendAssetFileWriter::Buffer VendAssetFileWriter::takeFreeBuffer() {
-  // Called with the lock held.
   if (free_.empty()) {
     Buffer buffer;
     buffer.reserve(kBufferSize);
@@ -175,17 +174,17 @@ VendAssetFileWriter::Buffer VendAssetFileWriter::takeFreeBuffer() {
 }
 
 void VendAssetFileWriter::handOver() {
-  std::unique_lock lock(mutex_);
-  changed_.wait(lock, [this] { return full_.size() < kMaxWaitingBuffers; });
+  MutexLock lock(mutex_);
+  changed_.wait(lock, [this]() REQUIRES(mutex_) { return full_.size() < kMaxWaitingBuffers; });
   full_.push_back(std::move(filling_));
   filling_ = takeFreeBuffer();
   changed_.notify_all();
 }
 
 void VendAssetFileWriter::consume() {
-  std::unique_lock lock(mutex_);
+  MutexLock lock(mutex_);
   for (;;) {
-    changed_.wait(lock, [this] { return !full_.empty() || closing_; });
+    changed_.wait(lock, [this]() REQUIRES(mutex_) { return !full_.empty() || closing_; });
     if (full_.empty()) return;
     Buffer buffer = std::move(full_.front());
     full_.pop_front();
@@ -200,7 +199,7 @@ void VendAssetFileWriter::consume() {
 }
 
 void VendAssetFileWriter::recordFailure(VendError error) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   if (!failure_) failure_ = std::move(error);
   failed_.store(true, std::memory_order_relaxed);
 }
@@ -210,13 +209,13 @@ OptionalError VendAssetFileWriter::drain() {
     drained_ = true;
     if (!filling_.empty()) handOver();
     {
-      std::lock_guard lock(mutex_);
+      MutexLock lock(mutex_);
       closing_ = true;
     }
     changed_.notify_all();
     consumer_.join();
   }
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return failure_;
 }
 

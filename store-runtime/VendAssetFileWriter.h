@@ -1,16 +1,15 @@
 #pragma once
 
 #include <atomic>
-#include <condition_variable>
 #include <cstdint>
 #include <deque>
 #include <memory>
-#include <mutex>
 #include <span>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include "platform/Mutex.h"
 #include "store-runtime/VendChunkDigestVerifier.h"
 #include "store-runtime/VendError.h"
 
@@ -61,7 +60,7 @@ class VendAssetFileWriter {
   VendAssetFileWriter(int fd, std::string path, VendChunkDigestVerifier verifier,
                       std::uint64_t existingBytes);
   void handOver();
-  Buffer takeFreeBuffer();
+  Buffer takeFreeBuffer() REQUIRES(mutex_);
   void consume();
   void recordFailure(VendError error);
   OptionalError drain();
@@ -74,12 +73,12 @@ class VendAssetFileWriter {
   std::uint64_t written_;       // in the file, the existing bytes included
   Buffer filling_;
 
-  std::mutex mutex_;
-  std::condition_variable changed_;
-  std::deque<Buffer> full_;
-  std::vector<Buffer> free_;
-  bool closing_ = false;
-  OptionalError failure_;
+  Mutex mutex_;
+  ConditionVariable changed_;
+  std::deque<Buffer> full_ GUARDED_BY(mutex_);
+  std::vector<Buffer> free_ GUARDED_BY(mutex_);
+  bool closing_ GUARDED_BY(mutex_) = false;
+  OptionalError failure_ GUARDED_BY(mutex_);
   std::atomic<bool> failed_{false};
   std::thread consumer_;
   bool drained_ = false;

@@ -168,7 +168,7 @@ VendDownloadManager::VendDownloadManager(const VendRuntimeConfiguration& configu
 
 VendDownloadManager::~VendDownloadManager() {
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     stopping_ = true;
     stopRequested_ = true;
   }
@@ -178,7 +178,7 @@ VendDownloadManager::~VendDownloadManager() {
   // the shutdown with its partial file kept.
   std::map<std::string, std::shared_ptr<Job>, std::less<>> unanswered;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     unanswered.swap(jobs_);
   }
   for (auto& [key, job] : unanswered) {
@@ -220,7 +220,7 @@ void VendDownloadManager::performDownload(std::shared_ptr<TillDownload> download
   job->key = storageKey(fields);
   job->itemIdentifier = fields.metadata.itemIdentifier();
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (stopping_ || jobs_.contains(job->key)) {
       const bool duplicate = !stopping_;
       rejectLater(std::move(job->reply),
@@ -245,7 +245,7 @@ void VendDownloadManager::performDownload(std::shared_ptr<TillDownload> download
 }
 
 void VendDownloadManager::ensureWorkers() {
-  // Called with the mutex held. Threads start with the first download, so
+  // Threads start with the first download, so
   // that a runtime that never downloads holds none.
   while (workers_.size() < std::max<std::size_t>(limits_.concurrentDownloads, 1)) {
     workers_.emplace_back([this] { workerLoop(); });
@@ -255,7 +255,7 @@ void VendDownloadManager::ensureWorkers() {
 std::vector<std::shared_ptr<TillDownload>> VendDownloadManager::downloadsWithTypeMask(
     std::int64_t mask) const {
   std::vector<std::shared_ptr<TillDownload>> downloads;
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   for (const auto& [key, job] : jobs_) {
     if ((job->download->downloadType() & mask) != 0) downloads.push_back(job->download);
   }
@@ -263,7 +263,7 @@ std::vector<std::shared_ptr<TillDownload>> VendDownloadManager::downloadsWithTyp
 }
 
 void VendDownloadManager::pauseDownloadWithItemIdentifier(std::uint64_t itemIdentifier) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   for (const auto& [key, job] : jobs_) {
     if (job->itemIdentifier != itemIdentifier) continue;
     if (job->state == Job::State::kQueued) {
@@ -281,7 +281,7 @@ void VendDownloadManager::pauseDownloadWithItemIdentifier(std::uint64_t itemIden
 void VendDownloadManager::resumeDownloadWithItemIdentifier(std::uint64_t itemIdentifier) {
   bool queued = false;
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     for (const auto& [key, job] : jobs_) {
       if (job->itemIdentifier != itemIdentifier) continue;
       if (job->state == Job::State::kPaused) {
@@ -302,9 +302,9 @@ void VendDownloadManager::resumeDownloadWithItemIdentifier(std::uint64_t itemIde
 }
 
 std::shared_ptr<VendDownloadManager::Job> VendDownloadManager::nextJob() {
-  std::unique_lock lock(mutex_);
+  MutexLock lock(mutex_);
   for (;;) {
-    wake_.wait(lock, [this] { return stopping_ || !queue_.empty(); });
+    wake_.wait(lock, [this]() REQUIRES(mutex_) { return stopping_ || !queue_.empty(); });
     if (stopping_) return nullptr;
     std::shared_ptr<Job> job = std::move(queue_.front());
     queue_.pop_front();
@@ -322,7 +322,7 @@ void VendDownloadManager::workerLoop() {
 
 void VendDownloadManager::settle(const std::shared_ptr<Job>& job, Outcome outcome) {
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (outcome.kind == Outcome::Kind::kInterrupted) {
       if (stopping_) return;  // the destructor answers it
       if (job->pauseRequested) {

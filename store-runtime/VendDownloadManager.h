@@ -1,17 +1,16 @@
 #pragma once
 
 #include <atomic>
-#include <condition_variable>
 #include <cstdint>
 #include <deque>
 #include <functional>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include "platform/Mutex.h"
 #include "platform/PlistValue.h"
 #include "store-runtime/TillDownload.h"
 #include "store-runtime/VendApplicationLocks.h"
@@ -81,7 +80,7 @@ class VendDownloadManager {
   struct Job;
   struct Outcome;
 
-  void ensureWorkers();
+  void ensureWorkers() REQUIRES(mutex_);
   void workerLoop();
   std::shared_ptr<Job> nextJob();
   Outcome runJob(Job& job);
@@ -96,13 +95,13 @@ class VendDownloadManager {
   VendApplicationLocks locks_;
   std::shared_ptr<DispatchQueue> replyQueue_;
 
-  mutable std::mutex mutex_;
-  std::condition_variable wake_;
-  std::deque<std::shared_ptr<Job>> queue_;
-  std::map<std::string, std::shared_ptr<Job>, std::less<>> jobs_;
-  bool stopping_ = false;
+  mutable Mutex mutex_;
+  ConditionVariable wake_;
+  std::deque<std::shared_ptr<Job>> queue_ GUARDED_BY(mutex_);
+  std::map<std::string, std::shared_ptr<Job>, std::less<>> jobs_ GUARDED_BY(mutex_);
+  bool stopping_ GUARDED_BY(mutex_) = false;
   std::atomic<bool> stopRequested_{false};
-  std::vector<std::thread> workers_;
+  std::vector<std::thread> workers_ GUARDED_BY(mutex_);
 };
 
 }  // namespace larder

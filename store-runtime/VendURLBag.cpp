@@ -33,7 +33,7 @@ std::string VendURLBag::bagURLForType(std::int64_t bagType) const {
 }
 
 VendURLBag::Entry& VendURLBag::entryForType(std::int64_t bagType) {
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   auto& entry = entries_[bagType];
   if (!entry) entry = std::make_unique<Entry>();
   return *entry;
@@ -41,9 +41,9 @@ VendURLBag::Entry& VendURLBag::entryForType(std::int64_t bagType) {
 
 VendURLBag::LoadResult VendURLBag::load(std::int64_t bagType, bool force) {
   Entry& entry = entryForType(bagType);
-  std::lock_guard fetching(entry.fetchMutex);
+  MutexLock fetching(entry.fetchMutex);
   {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     if (!force && entry.bag && std::chrono::steady_clock::now() < entry.expiry) {
       return {.success = true, .loaded = false, .error = std::nullopt};
     }
@@ -71,7 +71,7 @@ VendURLBag::LoadResult VendURLBag::fetch(std::int64_t bagType, Entry& entry) {
   } else if (!answer.response.isSuccess()) {
     result.error = VendStoreAnswer::failure(answer.response, answer.body);
   } else if (auto bag = VendStoreAnswer::dictionary(answer.body, &result.error)) {
-    std::lock_guard lock(mutex_);
+    MutexLock lock(mutex_);
     entry.expiry = std::chrono::steady_clock::now() + lifetimeOf(*bag);
     entry.bag = std::make_shared<const PlistDictionary>(std::move(*bag));
     result.success = true;
@@ -87,7 +87,7 @@ std::shared_ptr<const PlistDictionary> VendURLBag::cachedBag(std::int64_t bagTyp
                                                              bool loadIfNeeded) {
   if (loadIfNeeded) load(bagType);
   Entry& entry = entryForType(bagType);
-  std::lock_guard lock(mutex_);
+  MutexLock lock(mutex_);
   return entry.bag;
 }
 
@@ -139,19 +139,19 @@ bool VendURLBag::regexWithKeyMatchesString(std::int64_t bagType, std::string_vie
 void VendURLBag::addObserver(std::int64_t bagType,
                              const std::shared_ptr<VendURLBagObserver>& observer) {
   if (!observer) return;
-  std::lock_guard lock(observersMutex_);
+  MutexLock lock(observersMutex_);
   observers_.emplace_back(bagType, observer);
 }
 
 void VendURLBag::removeObserver(const std::shared_ptr<VendURLBagObserver>& observer) {
-  std::lock_guard lock(observersMutex_);
+  MutexLock lock(observersMutex_);
   std::erase_if(observers_, [&](const auto& entry) { return entry.second == observer; });
 }
 
 void VendURLBag::notifyObservers(std::int64_t bagType, const LoadResult& result) {
   std::vector<std::shared_ptr<VendURLBagObserver>> observers;
   {
-    std::lock_guard lock(observersMutex_);
+    MutexLock lock(observersMutex_);
     for (const auto& [observedType, observer] : observers_) {
       if (observedType == bagType) observers.push_back(observer);
     }

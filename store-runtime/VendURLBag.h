@@ -4,13 +4,13 @@
 #include <cstdint>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <utility>
 #include <vector>
 
+#include "platform/Mutex.h"
 #include "platform/PlistValue.h"
 #include "store-runtime/VendError.h"
 #include "store-runtime/VendRuntime.h"
@@ -63,7 +63,7 @@ class VendURLBag {
 
  private:
   struct Entry {
-    std::mutex fetchMutex;  // one fetch at a time for this type
+    Mutex fetchMutex;  // one fetch at a time for this type
     // Immutable once fetched, so a lookup shares it instead of copying.
     std::shared_ptr<const PlistDictionary> bag;
     std::chrono::steady_clock::time_point expiry;
@@ -75,10 +75,11 @@ class VendURLBag {
   void notifyObservers(std::int64_t bagType, const LoadResult& result);
 
   VendRuntimeConfiguration configuration_;
-  std::mutex mutex_;  // entries_ and the cached bags
-  std::map<std::int64_t, std::unique_ptr<Entry>> entries_;
-  std::mutex observersMutex_;
-  std::vector<std::pair<std::int64_t, std::shared_ptr<VendURLBagObserver>>> observers_;
+  Mutex mutex_;  // entries_ and the cached bags
+  std::map<std::int64_t, std::unique_ptr<Entry>> entries_ GUARDED_BY(mutex_);
+  Mutex observersMutex_;
+  std::vector<std::pair<std::int64_t, std::shared_ptr<VendURLBagObserver>>> observers_
+      GUARDED_BY(observersMutex_);
 };
 
 }  // namespace larder
