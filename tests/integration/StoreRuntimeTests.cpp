@@ -276,6 +276,32 @@ TEST_F(StoreRuntimeTest, AnInstallReplacesOnlyStoreSoftwareWithTheBundleBought) 
   EXPECT_EQ(filesBelow(applications), before);
 }
 
+// The store sends a bundle whose links, each harmless by its name, chain out
+// of it: eight folders deep a link climbs back to the bundle, a second walks
+// through it one level further, a third reads a system file through that.
+TEST_F(StoreRuntimeTest, APackageWhoseLinksChainOutOfTheBundleIsNotInstalled) {
+  const std::string bundle = catalogue_.makeBundle("Notes", "com.example.Notes", "3.0", 505, 4096);
+  const fs::path deep = fs::path(bundle) / "a/b/c/d/e/f/g/h";
+  fs::create_directories(deep);
+  std::string eightUp;
+  for (int level = 0; level < 8; ++level) eightUp += "../";
+  fs::create_directory_symlink(eightUp, deep / "up");
+  fs::create_directory_symlink("a/b/c/d/e/f/g/h/up/" + eightUp + "..", fs::path(bundle) / "out");
+  fs::create_symlink("out/etc/passwd", fs::path(bundle) / "passwd");
+  catalogue_.addItem(
+      {.wareID = 505, .bundleID = "com.example.Notes", .title = "Notes", .bundlePath = bundle});
+  startStore();
+  signIn();
+  auto download = purchasedDownload(505);
+  ASSERT_TRUE(download);
+  auto outcome = install(download);
+  EXPECT_EQ(outcome.result, 0);
+  ASSERT_TRUE(outcome.error);
+  EXPECT_NE(outcome.error->description.find("link"), std::string::npos)
+      << outcome.error->description;
+  expectNothingInstalledOrHalfWritten();
+}
+
 TEST_F(StoreRuntimeTest, PurchaseWithoutOptionsStartsTheInstallItself) {
   startStore();
   signIn();
