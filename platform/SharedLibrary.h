@@ -2,6 +2,7 @@
 
 #include <memory>
 #include <optional>
+#include <stdexcept>
 #include <string>
 
 namespace larder {
@@ -22,6 +23,17 @@ class SharedLibrary {
     void* address = symbol(name, error);
     function = reinterpret_cast<Function*>(address);
     return address != nullptr;
+  }
+
+  // The function table `load` fills, loaded by the first caller and kept for
+  // the process; throws with the loader's reason when it cannot be had.
+  // One table type has one loader, so the table is one per type.
+  template <typename Table>
+  static const Table& sharedTable(const char* library, std::optional<Table> (*load)(std::string*)) {
+    static std::string error;
+    static const std::optional<Table> table = load(&error);
+    if (!table) throw std::runtime_error(std::string(library) + " could not be loaded: " + error);
+    return *table;
   }
 
  private:

@@ -1,7 +1,6 @@
 #include "store-runtime/ArchiveLibrary.h"
 
 #include <optional>
-#include <stdexcept>
 #include <string>
 
 #include "platform/SharedLibrary.h"
@@ -44,10 +43,7 @@ std::optional<ArchiveLibrary> load(std::string* error) {
 }  // namespace
 
 const ArchiveLibrary& ArchiveLibrary::shared() {
-  static std::string error;
-  static const std::optional<ArchiveLibrary> archive = load(&error);
-  if (!archive) throw std::runtime_error("libarchive could not be loaded: " + error);
-  return *archive;
+  return SharedLibrary::sharedTable("libarchive", &load);
 }
 
 }  // namespace larder

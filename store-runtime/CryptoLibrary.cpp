@@ -1,7 +1,6 @@
 #include "store-runtime/CryptoLibrary.h"
 
 #include <optional>
-#include <stdexcept>
 #include <string>
 
 #include "platform/SharedLibrary.h"
@@ -31,10 +30,7 @@ std::optional<CryptoLibrary> load(std::string* error) {
 }  // namespace
 
 const CryptoLibrary& CryptoLibrary::shared() {
-  static std::string error;
-  static const std::optional<CryptoLibrary> crypto = load(&error);
-  if (!crypto) throw std::runtime_error("libcrypto could not be loaded: " + error);
-  return *crypto;
+  return SharedLibrary::sharedTable("libcrypto", &load);
 }
 
 }  // namespace larder
