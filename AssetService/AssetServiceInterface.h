@@ -7,10 +7,10 @@
 #include <string>
 
 #include "AssetService/RemoteObjectFactory.h"
-#include "platform/DispatchQueue.h"
-#include "platform/Mutex.h"
-#include "platform/PlistValue.h"
-#include "store-runtime/VendStoreClient.h"
+#include "platform/dispatch/DispatchQueue.h"
+#include "platform/plist/PlistValue.h"
+#include "platform/system/Mutex.h"
+#include "store-runtime/core/VendStoreClient.h"
 
 namespace larder {
 

@@ -6,7 +6,7 @@
 
 #include <sdbus-c++/Message.h>
 
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

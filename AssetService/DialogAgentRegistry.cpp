@@ -6,10 +6,10 @@
 #include <sdbus-c++/IProxy.h>
 
 #include "AssetService/DBusValueCodec.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendRuntime.h"
-#include "store-runtime/VendStoreClient.h"
-#include "store-runtime/VendUIService.h"
+#include "platform/log/TillLogManager.h"
+#include "store-runtime/core/VendStoreClient.h"
+#include "store-runtime/dialogs/VendUIService.h"
+#include "store-runtime/services/VendRuntime.h"
 
 namespace larder {
 

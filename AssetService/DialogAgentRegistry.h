@@ -15,9 +15,9 @@
 #include <sdbus-c++/Message.h>
 
 #include "AssetService/BusMethod.h"
-#include "platform/Mutex.h"
-#include "store-runtime/VendDialogPresenter.h"
-#include "store-runtime/VendElasticQueue.h"
+#include "platform/system/Mutex.h"
+#include "store-runtime/core/VendElasticQueue.h"
+#include "store-runtime/dialogs/VendDialogPresenter.h"
 
 namespace larder {
 

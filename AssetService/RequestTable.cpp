@@ -6,8 +6,8 @@
 #include "AssetService/AssetServiceInterface.h"
 #include "AssetService/DBusValueCodec.h"
 #include "AssetService/ServiceError.h"
+#include "platform/log/TillLogManager.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/TillLogManager.h"
 #include "update-queue/UpdateQueue.h"
 
 namespace larder {

@@ -5,7 +5,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

@@ -6,8 +6,8 @@
 #include "AssetService/DialogAgentRegistry.h"
 #include "AssetService/RequestTable.h"
 #include "AssetService/StoreRuntimeInterface.h"
-#include "platform/Environment.h"
-#include "store-runtime/VendStoreClient.h"
+#include "platform/system/Environment.h"
+#include "store-runtime/core/VendStoreClient.h"
 
 namespace larder {
 

@@ -7,9 +7,9 @@
 #include "AssetService/DialogAgentRegistry.h"
 #include "AssetService/ServiceError.h"
 #include "AssetService/StoreRuntimeInterface.h"
-#include "platform/Environment.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/system/Environment.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/TillLogManager.h"
 
 namespace larder {
 

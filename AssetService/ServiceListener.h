@@ -11,7 +11,7 @@
 #include "AssetService/AssetServiceDelegate.h"
 #include "AssetService/AssetServiceInterface.h"
 #include "AssetService/RequestTable.h"
-#include "platform/Mutex.h"
+#include "platform/system/Mutex.h"
 
 namespace larder {
 

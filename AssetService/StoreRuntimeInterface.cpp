@@ -7,13 +7,13 @@
 #include <sdbus-c++/Error.h>
 
 #include "AssetService/DBusValueCodec.h"
-#include "store-runtime/TillDownload.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/TillPurchase.h"
-#include "store-runtime/VendAccountService.h"
-#include "store-runtime/VendDownloadService.h"
-#include "store-runtime/VendServiceProxy.h"
-#include "store-runtime/VendTransactionService.h"
+#include "platform/log/TillLogManager.h"
+#include "store-runtime/accounts/VendAccountService.h"
+#include "store-runtime/download/TillDownload.h"
+#include "store-runtime/download/VendDownloadService.h"
+#include "store-runtime/purchase/TillPurchase.h"
+#include "store-runtime/purchase/VendTransactionService.h"
+#include "store-runtime/services/VendServiceProxy.h"
 
 namespace larder {
 namespace {

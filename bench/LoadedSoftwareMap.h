@@ -4,8 +4,8 @@
 #include <memory>
 
 #include "ProductStoreFixture.h"
+#include "platform/log/TillLogManager.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/TillLogManager.h"
 
 namespace larder::bench {
 

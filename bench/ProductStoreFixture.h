@@ -7,9 +7,9 @@
 #include <filesystem>
 #include <string>
 
-#include "platform/FileIO.h"
-#include "platform/KeyedArchive.h"
-#include "store-runtime/LedgerSoftwareProduct.h"
+#include "platform/plist/KeyedArchive.h"
+#include "platform/system/FileIO.h"
+#include "store-runtime/records/LedgerSoftwareProduct.h"
 
 namespace larder::bench {
 

@@ -10,8 +10,8 @@
 #include <string>
 #include <thread>
 
-#include "platform/DispatchQueue.h"
-#include "platform/DispatchSemaphore.h"
+#include "platform/dispatch/DispatchQueue.h"
+#include "platform/dispatch/DispatchSemaphore.h"
 
 namespace larder {
 namespace {

@@ -13,11 +13,11 @@
 #include <string>
 #include <vector>
 
-#include "platform/DispatchQueue.h"
-#include "platform/DispatchSemaphore.h"
-#include "platform/MetadataQuery.h"
-#include "platform/MetadataQueryPredicate.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/dispatch/DispatchQueue.h"
+#include "platform/dispatch/DispatchSemaphore.h"
+#include "platform/metadata/MetadataQuery.h"
+#include "platform/metadata/MetadataQueryPredicate.h"
+#include "platform/plist/PropertyListSerialization.h"
 
 namespace larder {
 namespace {

@@ -8,8 +8,8 @@
 #include <optional>
 #include <string>
 
-#include "platform/PlistValue.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/plist/PlistValue.h"
+#include "platform/plist/PropertyListSerialization.h"
 
 namespace {
 

@@ -23,12 +23,12 @@
 #include <string>
 #include <vector>
 
-#include "platform/FileIO.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/TillPurchase.h"
-#include "store-runtime/TillPurchaseResponse.h"
-#include "store-runtime/VendDownloadManager.h"
-#include "store-runtime/VendHTTPTransfer.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/FileIO.h"
+#include "store-runtime/download/VendDownloadManager.h"
+#include "store-runtime/http/VendHTTPTransfer.h"
+#include "store-runtime/purchase/TillPurchase.h"
+#include "store-runtime/purchase/TillPurchaseResponse.h"
 
 extern char** environ;
 

@@ -7,8 +7,8 @@
 
 #include "LoadedSoftwareMap.h"
 #include "ProductStoreFixture.h"
+#include "platform/log/TillLogManager.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/TillLogManager.h"
 
 namespace {
 

@@ -12,10 +12,10 @@
 #include <random>
 #include <thread>
 
-#include "platform/FileIO.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/FileIO.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/TillLogManager.h"
 
 namespace {
 

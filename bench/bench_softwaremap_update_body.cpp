@@ -6,10 +6,10 @@
 #include <string>
 
 #include "LoadedSoftwareMap.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendGzip.h"
+#include "store-runtime/http/VendGzip.h"
 
 namespace {
 

@@ -9,9 +9,9 @@
 #include <string>
 
 #include "LoadedSoftwareMap.h"
-#include "platform/FileIO.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/TillLogManager.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/FileIO.h"
 #include "update-queue/LoadUpdateQueueOperation.h"
 #include "update-queue/UpdateQueue.h"
 

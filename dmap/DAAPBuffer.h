@@ -6,7 +6,7 @@
 #include <string_view>
 #include <utility>
 
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

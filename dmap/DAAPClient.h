@@ -11,13 +11,13 @@
 
 #include "dmap/DAAPValue.h"
 #include "dmap/LedgerDAAPClientDelegate.h"
-#include "platform/Mutex.h"
-#include "platform/PlistValue.h"
-#include "platform/RunLoop.h"
-#include "store-runtime/VendError.h"
-#include "store-runtime/VendServiceProxy.h"
-#include "store-runtime/VendStoreClient.h"
-#include "store-runtime/VendURLRequest.h"
+#include "platform/dispatch/RunLoop.h"
+#include "platform/plist/PlistValue.h"
+#include "platform/system/Mutex.h"
+#include "store-runtime/core/VendError.h"
+#include "store-runtime/core/VendStoreClient.h"
+#include "store-runtime/http/VendURLRequest.h"
+#include "store-runtime/services/VendServiceProxy.h"
 
 namespace larder {
 

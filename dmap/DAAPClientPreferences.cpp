@@ -1,9 +1,9 @@
 #include "dmap/DAAPClientPreferences.h"
 
-#include "platform/Environment.h"
-#include "platform/FileIO.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/DaemonDefaults.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/Environment.h"
+#include "platform/system/FileIO.h"
+#include "store-runtime/core/DaemonDefaults.h"
 
 namespace larder {
 namespace {

@@ -2,7 +2,7 @@
 
 #include <cstddef>
 
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

@@ -2,7 +2,7 @@
 
 #include <cstdio>
 
-#include "platform/KeyedArchive.h"
+#include "platform/plist/KeyedArchive.h"
 
 namespace larder {
 

@@ -7,8 +7,8 @@
 #include "dmap/DAAPBytes.h"
 #include "dmap/DAAPCode.h"
 #include "dmap/DAAPDocumentBudget.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/TillLogManager.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
 
 namespace larder {
 

@@ -1,7 +1,7 @@
 #include "dmap/DAAPTagReader.h"
 
 #include "dmap/DAAPCode.h"
-#include "store-runtime/TillLogManager.h"
+#include "platform/log/TillLogManager.h"
 
 namespace larder {
 

@@ -6,7 +6,7 @@
 #include <sstream>
 
 #include "dmap/DAAPItem.h"
-#include "store-runtime/TillLogManager.h"
+#include "platform/log/TillLogManager.h"
 
 namespace larder {
 

@@ -10,7 +10,7 @@
 #include <vector>
 
 #include "dmap/DAAPKey.h"
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

@@ -5,8 +5,8 @@
 #include <vector>
 
 #include "dmap/DAAPValue.h"
-#include "platform/PlistValue.h"
-#include "store-runtime/VendError.h"
+#include "platform/plist/PlistValue.h"
+#include "store-runtime/core/VendError.h"
 
 namespace larder {
 

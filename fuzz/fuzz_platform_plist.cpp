@@ -8,8 +8,8 @@
 #include <span>
 #include <string>
 
-#include "platform/PlistValue.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/plist/PlistValue.h"
+#include "platform/plist/PropertyListSerialization.h"
 
 namespace {
 
@@ -18,14 +18,17 @@ using larder::PlistDictionary;
 using larder::PlistValue;
 using larder::PropertyListSerialization;
 
-bool sameReal(double a, double b) { return (std::isnan(a) && std::isnan(b)) || a == b; }
+bool sameReal(double a, double b) {
+  return (std::isnan(a) && std::isnan(b)) || a == b;
+}
 
 // Deep equality in which NaN equals NaN: a NaN real or date read from the
 // input is carried faithfully, but never compares equal to itself.
 bool sameValue(const PlistValue& a, const PlistValue& b) {
   if (a.type() != b.type()) return false;
   switch (a.type()) {
-    case PlistValue::Type::Real: return sameReal(a.doubleValue(), b.doubleValue());
+    case PlistValue::Type::Real:
+      return sameReal(a.doubleValue(), b.doubleValue());
     case PlistValue::Type::Date:
       return sameReal(a.date()->secondsSince1970, b.date()->secondsSince1970);
     case PlistValue::Type::Array: {
@@ -46,7 +49,8 @@ bool sameValue(const PlistValue& a, const PlistValue& b) {
       }
       return true;
     }
-    default: return a == b;
+    default:
+      return a == b;
   }
 }
 

@@ -9,8 +9,8 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/MetadataQueryPredicate.h"
-#include "platform/PlistValue.h"
+#include "platform/metadata/MetadataQueryPredicate.h"
+#include "platform/plist/PlistValue.h"
 
 namespace {
 

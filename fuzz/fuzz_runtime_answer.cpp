@@ -5,11 +5,11 @@
 #include <cstdint>
 #include <span>
 
-#include "store-runtime/LedgerUpdate.h"
-#include "store-runtime/TillDownload.h"
-#include "store-runtime/TillPurchase.h"
-#include "store-runtime/TillPurchaseResponse.h"
-#include "store-runtime/VendStoreAnswer.h"
+#include "store-runtime/download/TillDownload.h"
+#include "store-runtime/http/VendStoreAnswer.h"
+#include "store-runtime/purchase/TillPurchase.h"
+#include "store-runtime/purchase/TillPurchaseResponse.h"
+#include "store-runtime/records/LedgerUpdate.h"
 
 namespace {
 

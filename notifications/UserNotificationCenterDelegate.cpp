@@ -1,6 +1,6 @@
 #include "notifications/UserNotificationCenterDelegate.h"
 
-#include "store-runtime/TillLogManager.h"
+#include "platform/log/TillLogManager.h"
 
 namespace larder {
 

@@ -4,15 +4,15 @@
 
 #include <set>
 
-#include "platform/Bundle.h"
-#include "platform/DispatchSemaphore.h"
-#include "platform/Environment.h"
-#include "platform/FileIO.h"
-#include "platform/KeyedArchive.h"
-#include "platform/Uuid.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendFileManager.h"
-#include "store-runtime/VendPurchaseRecord.h"
+#include "platform/dispatch/DispatchSemaphore.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/KeyedArchive.h"
+#include "platform/system/Bundle.h"
+#include "platform/system/Environment.h"
+#include "platform/system/FileIO.h"
+#include "platform/system/Uuid.h"
+#include "store-runtime/download/VendFileManager.h"
+#include "store-runtime/purchase/VendPurchaseRecord.h"
 
 namespace larder {
 

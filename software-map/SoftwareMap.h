@@ -11,13 +11,13 @@
 #include <unordered_map>
 #include <vector>
 
-#include "platform/BackgroundActivityScheduler.h"
-#include "platform/DispatchQueue.h"
-#include "platform/MetadataQuery.h"
-#include "platform/PlistValue.h"
+#include "platform/background/BackgroundActivityScheduler.h"
+#include "platform/dispatch/DispatchQueue.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/metadata/MetadataQuery.h"
+#include "platform/plist/PlistValue.h"
 #include "software-map/VendSoftwareMapObserver.h"
-#include "store-runtime/LedgerSoftwareProduct.h"
-#include "store-runtime/TillLogManager.h"
+#include "store-runtime/records/LedgerSoftwareProduct.h"
 
 namespace larder {
 

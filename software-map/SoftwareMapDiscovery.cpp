@@ -2,13 +2,13 @@
 #include <chrono>
 #include <filesystem>
 
-#include "platform/ApplicationRegistry.h"
-#include "platform/Bundle.h"
-#include "platform/Environment.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/system/ApplicationRegistry.h"
+#include "platform/system/Bundle.h"
+#include "platform/system/Environment.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendFileManager.h"
-#include "store-runtime/VendPurchaseRecord.h"
+#include "store-runtime/download/VendFileManager.h"
+#include "store-runtime/purchase/VendPurchaseRecord.h"
 
 namespace larder {
 

@@ -2,10 +2,10 @@
 #include <chrono>
 #include <cstdlib>
 
-#include "platform/MetadataAttributes.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/metadata/MetadataAttributes.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendFileManager.h"
+#include "store-runtime/download/VendFileManager.h"
 
 namespace larder {
 

@@ -1,9 +1,9 @@
 // Which account owns an installed product: its bundle's purchase record
 // names the account only by an opaque id, which the store turns into a name.
+#include "platform/log/TillLogManager.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendOrvaneIDLookupOperation.h"
-#include "store-runtime/VendPurchaseRecord.h"
+#include "store-runtime/accounts/VendOrvaneIDLookupOperation.h"
+#include "store-runtime/purchase/VendPurchaseRecord.h"
 
 namespace larder {
 

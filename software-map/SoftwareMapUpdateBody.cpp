@@ -4,15 +4,15 @@
 #include <charconv>
 #include <unordered_set>
 
-#include "platform/ApplicationRegistry.h"
-#include "platform/Environment.h"
-#include "platform/FileIO.h"
-#include "platform/Mutex.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/ApplicationRegistry.h"
+#include "platform/system/Environment.h"
+#include "platform/system/FileIO.h"
+#include "platform/system/Mutex.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendFileManager.h"
-#include "store-runtime/VendGzip.h"
+#include "store-runtime/download/VendFileManager.h"
+#include "store-runtime/http/VendGzip.h"
 
 namespace larder {
 

@@ -2,7 +2,7 @@
 
 #include <cstdint>
 
-#include "store-runtime/LedgerSoftwareProduct.h"
+#include "store-runtime/records/LedgerSoftwareProduct.h"
 
 namespace larder {
 

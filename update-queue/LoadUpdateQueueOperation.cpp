@@ -1,9 +1,9 @@
 #include "update-queue/LoadUpdateQueueOperation.h"
 
+#include "platform/log/TillLogManager.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendStoreURLOperation.h"
-#include "store-runtime/VendURLRequest.h"
+#include "store-runtime/http/VendStoreURLOperation.h"
+#include "store-runtime/http/VendURLRequest.h"
 #include "update-queue/SoftwareUpdatesProvider.h"
 
 namespace larder {

@@ -4,9 +4,9 @@
 #include <optional>
 #include <vector>
 
-#include "store-runtime/LedgerUpdate.h"
-#include "store-runtime/VendOperation.h"
-#include "store-runtime/VendOperationDelegate.h"
+#include "store-runtime/core/VendOperation.h"
+#include "store-runtime/core/VendOperationDelegate.h"
+#include "store-runtime/records/LedgerUpdate.h"
 
 namespace larder {
 

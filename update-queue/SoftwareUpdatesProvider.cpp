@@ -1,7 +1,7 @@
 #include "update-queue/SoftwareUpdatesProvider.h"
 
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendPropertyListProvider.h"
+#include "platform/log/TillLogManager.h"
+#include "store-runtime/http/VendPropertyListProvider.h"
 
 namespace larder {
 namespace {

@@ -4,8 +4,8 @@
 #include <optional>
 #include <vector>
 
-#include "store-runtime/LedgerUpdate.h"
-#include "store-runtime/VendDataProvider.h"
+#include "store-runtime/http/VendDataProvider.h"
+#include "store-runtime/records/LedgerUpdate.h"
 
 namespace larder {
 

@@ -7,14 +7,14 @@
 #include <unordered_map>
 #include <unordered_set>
 
-#include "platform/FileIO.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/FileIO.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/DaemonDefaults.h"
-#include "store-runtime/StoreClientRegistry.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendFileManager.h"
-#include "store-runtime/VendOperationQueue.h"
+#include "store-runtime/core/DaemonDefaults.h"
+#include "store-runtime/core/StoreClientRegistry.h"
+#include "store-runtime/core/VendOperationQueue.h"
+#include "store-runtime/download/VendFileManager.h"
 #include "update-queue/LoadUpdateQueueOperation.h"
 
 namespace larder {

@@ -9,11 +9,11 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/DispatchQueue.h"
-#include "platform/Mutex.h"
-#include "store-runtime/LedgerUpdate.h"
-#include "store-runtime/VendError.h"
-#include "store-runtime/VendStoreClient.h"
+#include "platform/dispatch/DispatchQueue.h"
+#include "platform/system/Mutex.h"
+#include "store-runtime/core/VendError.h"
+#include "store-runtime/core/VendStoreClient.h"
+#include "store-runtime/records/LedgerUpdate.h"
 #include "update-queue/UpdateQueueClient.h"
 #include "update-queue/UpdateQueueDelegate.h"
 

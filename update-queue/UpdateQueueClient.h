@@ -5,8 +5,8 @@
 #include <optional>
 #include <vector>
 
-#include "store-runtime/LedgerUpdate.h"
-#include "store-runtime/VendError.h"
+#include "store-runtime/core/VendError.h"
+#include "store-runtime/records/LedgerUpdate.h"
 
 namespace larder {
 

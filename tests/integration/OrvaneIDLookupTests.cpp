@@ -13,13 +13,13 @@
 #include <string>
 #include <vector>
 
-#include "platform/FileIO.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/FileIO.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendOrvaneIDLookupOperation.h"
-#include "store-runtime/VendRuntime.h"
-#include "store-runtime/VendStoreAnswer.h"
+#include "store-runtime/accounts/VendOrvaneIDLookupOperation.h"
+#include "store-runtime/http/VendStoreAnswer.h"
+#include "store-runtime/services/VendRuntime.h"
 #include "tests/integration/ServiceHarness.h"
 #include "tests/integration/StoreCatalogueBuilder.h"
 #include "tests/integration/StoreServerProcess.h"

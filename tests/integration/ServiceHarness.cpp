@@ -14,8 +14,8 @@
 
 #include <sdbus-c++/IProxy.h>
 
-#include "platform/FileIO.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/FileIO.h"
 
 extern char** environ;
 

@@ -10,7 +10,7 @@
 #include <vector>
 
 #include "AssetService/ServiceClient.h"
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder::testing {
 

@@ -13,10 +13,10 @@
 #include <nlohmann/json.hpp>
 
 #include "AssetService/RequestTable.h"
-#include "platform/FileIO.h"
-#include "platform/KeyedArchive.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/VendGzip.h"
+#include "platform/plist/KeyedArchive.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/FileIO.h"
+#include "store-runtime/http/VendGzip.h"
 #include "tests/integration/ServiceHarness.h"
 
 namespace larder::testing {
@@ -177,7 +177,8 @@ TEST_F(ServiceTest, AnIdleServiceMapsNeitherTheTransportNorTheUnpacker) {
   auto service = startService();
   ASSERT_TRUE(service->waitForLog("Software map rebuild took")) << service->log();
   std::ifstream maps("/proc/" + std::to_string(service->process().pid()) + "/maps");
-  const std::string mapped((std::istreambuf_iterator<char>(maps)), std::istreambuf_iterator<char>());
+  const std::string mapped((std::istreambuf_iterator<char>(maps)),
+                           std::istreambuf_iterator<char>());
   ASSERT_NE(mapped.find("libc.so"), std::string::npos);
   for (const char* library : {"libcurl.so", "libcrypto.so", "libarchive.so"}) {
     EXPECT_EQ(mapped.find(library), std::string::npos) << library;

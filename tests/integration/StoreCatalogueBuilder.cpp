@@ -5,8 +5,8 @@
 #include <sstream>
 #include <stdexcept>
 
-#include "platform/FileIO.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/FileIO.h"
 
 namespace larder::testing {
 namespace {

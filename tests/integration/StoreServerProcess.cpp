@@ -8,8 +8,8 @@
 #include <stdexcept>
 #include <thread>
 
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/VendHTTPTransfer.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "store-runtime/http/VendHTTPTransfer.h"
 
 namespace larder::testing {
 namespace {

@@ -13,10 +13,10 @@
 #include <map>
 #include <thread>
 
-#include "platform/FileIO.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/VendHTTPTransfer.h"
-#include "store-runtime/VendRequestSigner.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/FileIO.h"
+#include "store-runtime/http/VendHTTPTransfer.h"
+#include "store-runtime/http/VendRequestSigner.h"
 #include "tests/integration/StoreCatalogueBuilder.h"
 #include "tests/integration/StoreServerProcess.h"
 

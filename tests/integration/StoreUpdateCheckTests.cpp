@@ -9,11 +9,11 @@
 #include <string>
 #include <vector>
 
-#include "platform/PropertyListSerialization.h"
+#include "platform/plist/PropertyListSerialization.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/VendGzip.h"
-#include "store-runtime/VendHTTPTransfer.h"
-#include "store-runtime/VendRequestSigner.h"
+#include "store-runtime/http/VendGzip.h"
+#include "store-runtime/http/VendHTTPTransfer.h"
+#include "store-runtime/http/VendRequestSigner.h"
 #include "tests/integration/ServiceHarness.h"
 #include "tests/integration/StoreCatalogueBuilder.h"
 #include "tests/integration/StoreServerProcess.h"

@@ -8,9 +8,9 @@
 #include <memory>
 #include <thread>
 
-#include "store-runtime/JsonConversion.h"
-#include "store-runtime/LedgerUpdate.h"
-#include "store-runtime/TillLogManager.h"
+#include "platform/log/TillLogManager.h"
+#include "store-runtime/core/JsonConversion.h"
+#include "store-runtime/records/LedgerUpdate.h"
 #include "tests/integration/LarderctlProcess.h"
 #include "tests/integration/ServiceHarness.h"
 #include "tests/integration/StoreCatalogueBuilder.h"

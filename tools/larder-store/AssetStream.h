@@ -9,7 +9,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/FileDescriptor.h"
+#include "platform/system/FileDescriptor.h"
 
 namespace larder {
 

@@ -1,5 +1,5 @@
 #include "larder-store/ByteRange.h"
-#include "store-runtime/VendStringHelpers.h"
+#include "store-runtime/core/VendStringHelpers.h"
 
 #include <algorithm>
 #include <charconv>

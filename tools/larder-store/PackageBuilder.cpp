@@ -13,8 +13,8 @@
 #include <memory>
 #include <vector>
 
-#include "platform/FileDescriptor.h"
-#include "store-runtime/TillLogManager.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/system/FileDescriptor.h"
 
 namespace larder {
 namespace {

@@ -11,7 +11,7 @@
 #include <memory>
 #include <span>
 
-#include "platform/FileDescriptor.h"
+#include "platform/system/FileDescriptor.h"
 
 namespace larder {
 namespace {

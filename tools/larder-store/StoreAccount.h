@@ -3,7 +3,7 @@
 #include <cstdint>
 #include <string>
 
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

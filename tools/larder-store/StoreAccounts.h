@@ -6,7 +6,7 @@
 #include <vector>
 
 #include "larder-store/StoreAccount.h"
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

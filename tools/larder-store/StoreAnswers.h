@@ -4,7 +4,7 @@
 #include <string_view>
 
 #include "larder-store/StoreItem.h"
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

@@ -3,9 +3,9 @@
 #include <algorithm>
 #include <filesystem>
 
-#include "platform/FileIO.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/TillLogManager.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/FileIO.h"
 
 namespace larder {
 namespace {

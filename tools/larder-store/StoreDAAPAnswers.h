@@ -3,7 +3,7 @@
 #include <cstdint>
 
 #include "larder-store/StoreCloudLibrary.h"
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

@@ -11,10 +11,10 @@
 #include "larder-store/StoreCloudLibrary.h"
 #include "larder-store/StoreDAAPAnswers.h"
 #include "larder-store/StoreRequestSignature.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendRequestSigner.h"
-#include "store-runtime/VendStringHelpers.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "store-runtime/core/VendStringHelpers.h"
+#include "store-runtime/http/VendRequestSigner.h"
 
 namespace larder {
 namespace {

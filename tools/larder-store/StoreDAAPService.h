@@ -7,7 +7,7 @@
 #include <string_view>
 
 #include "larder-store/StoreCatalogue.h"
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

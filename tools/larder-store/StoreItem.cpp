@@ -1,5 +1,5 @@
 #include "larder-store/StoreItem.h"
-#include "store-runtime/VendStringHelpers.h"
+#include "store-runtime/core/VendStringHelpers.h"
 
 #include <sys/stat.h>
 

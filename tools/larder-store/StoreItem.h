@@ -5,7 +5,7 @@
 #include <string>
 
 #include "larder-store/PackageDigest.h"
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

@@ -4,7 +4,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

@@ -1,8 +1,8 @@
 #include "larder-store/StoreOrvaneIDLookup.h"
 
 #include "larder-store/StoreAnswers.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendStringHelpers.h"
+#include "platform/log/TillLogManager.h"
+#include "store-runtime/core/VendStringHelpers.h"
 
 namespace larder {
 

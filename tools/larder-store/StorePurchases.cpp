@@ -4,9 +4,9 @@
 
 #include "larder-store/StoreAnswers.h"
 #include "larder-store/StoreRequestSignature.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendStringHelpers.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "store-runtime/core/VendStringHelpers.h"
 
 namespace larder {
 namespace {

@@ -5,7 +5,7 @@
 #include <cstdint>
 
 #include "larder-store/StoreRoute.h"
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

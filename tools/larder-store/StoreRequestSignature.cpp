@@ -2,8 +2,8 @@
 
 #include <span>
 
-#include "store-runtime/VendRequestSigner.h"
-#include "store-runtime/VendStringHelpers.h"
+#include "store-runtime/core/VendStringHelpers.h"
+#include "store-runtime/http/VendRequestSigner.h"
 
 namespace larder {
 

@@ -7,10 +7,10 @@
 #include "larder-store/AssetStream.h"
 #include "larder-store/ByteRange.h"
 #include "larder-store/StoreAnswers.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendRequestSigner.h"
-#include "store-runtime/VendStringHelpers.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "store-runtime/core/VendStringHelpers.h"
+#include "store-runtime/http/VendRequestSigner.h"
 
 namespace larder {
 namespace {

@@ -2,7 +2,7 @@
 
 #include <chrono>
 
-#include "platform/Mutex.h"
+#include "platform/system/Mutex.h"
 
 namespace larder {
 

@@ -4,10 +4,10 @@
 #include <set>
 
 #include "larder-store/StoreAnswers.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendFileManager.h"
-#include "store-runtime/VendStringHelpers.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "store-runtime/core/VendStringHelpers.h"
+#include "store-runtime/download/VendFileManager.h"
 
 namespace larder {
 namespace {

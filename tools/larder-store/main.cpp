@@ -18,7 +18,7 @@
 #include "larder-store/StoreCatalogue.h"
 #include "larder-store/StoreFaults.h"
 #include "larder-store/StoreServer.h"
-#include "platform/StopSignals.h"
+#include "platform/system/StopSignals.h"
 
 namespace {
 

@@ -12,10 +12,10 @@
 #include <sdbus-c++/IObject.h>
 #include <sdbus-c++/Message.h>
 
-#include "platform/FileDescriptor.h"
-#include "platform/Mutex.h"
-#include "platform/PlistValue.h"
-#include "store-runtime/VendDialog.h"
+#include "platform/plist/PlistValue.h"
+#include "platform/system/FileDescriptor.h"
+#include "platform/system/Mutex.h"
+#include "store-runtime/dialogs/VendDialog.h"
 
 namespace larder {
 

@@ -16,7 +16,7 @@
 #include <sdbus-c++/Error.h>
 #include <nlohmann/json.hpp>
 
-#include "platform/StopSignals.h"
+#include "platform/system/StopSignals.h"
 #include "tools/larderctl/DialogAgent.h"
 #include "tools/larderctl/DialogPrompt.h"
 

@@ -2,7 +2,7 @@
 
 #include <iostream>
 
-#include "store-runtime/JsonConversion.h"
+#include "store-runtime/core/JsonConversion.h"
 
 namespace larder {
 

@@ -6,8 +6,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/PlistValue.h"
-#include "store-runtime/VendDialog.h"
+#include "platform/plist/PlistValue.h"
+#include "store-runtime/dialogs/VendDialog.h"
 
 namespace larder {
 

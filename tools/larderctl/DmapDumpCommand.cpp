@@ -5,8 +5,8 @@
 #include <optional>
 
 #include "dmap/DAAPParser.h"
-#include "platform/FileIO.h"
-#include "store-runtime/JsonConversion.h"
+#include "platform/system/FileIO.h"
+#include "store-runtime/core/JsonConversion.h"
 
 namespace larder {
 namespace {

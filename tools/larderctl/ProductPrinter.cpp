@@ -5,7 +5,7 @@
 #include <vector>
 
 #include "AssetService/DBusValueCodec.h"
-#include "store-runtime/JsonConversion.h"
+#include "store-runtime/core/JsonConversion.h"
 
 namespace larder {
 

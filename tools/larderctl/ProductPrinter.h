@@ -3,7 +3,7 @@
 #include <cstdint>
 
 #include "AssetService/RequestTable.h"
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

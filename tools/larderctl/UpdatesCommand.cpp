@@ -4,7 +4,7 @@
 #include <iostream>
 #include <sstream>
 
-#include "store-runtime/JsonConversion.h"
+#include "store-runtime/core/JsonConversion.h"
 
 namespace larder {
 namespace {

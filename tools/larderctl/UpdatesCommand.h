@@ -3,7 +3,7 @@
 #include <cstdint>
 
 #include "AssetService/ServiceClient.h"
-#include "platform/PlistValue.h"
+#include "platform/plist/PlistValue.h"
 
 namespace larder {
 

@@ -13,9 +13,9 @@
 #include "dmap/DAAPClientPreferences.h"
 #include "dmap/DAAPItem.h"
 #include "dmap/DAAPMediaKindQuery.h"
-#include "platform/DispatchQueue.h"
-#include "platform/DispatchSemaphore.h"
-#include "store-runtime/VendURLBag.h"
+#include "platform/dispatch/DispatchQueue.h"
+#include "platform/dispatch/DispatchSemaphore.h"
+#include "store-runtime/http/VendURLBag.h"
 
 namespace larder::dmaptest {
 namespace {

@@ -10,7 +10,7 @@
 #include "DAAPTestSupport.h"
 #include "dmap/DAAPDocumentBudget.h"
 #include "dmap/DAAPItem.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/plist/PropertyListSerialization.h"
 
 namespace larder {
 namespace {

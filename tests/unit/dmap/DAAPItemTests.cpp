@@ -8,7 +8,7 @@
 
 #include "DAAPTestSupport.h"
 #include "dmap/DAAPItem.h"
-#include "platform/KeyedArchive.h"
+#include "platform/plist/KeyedArchive.h"
 
 namespace larder {
 namespace {

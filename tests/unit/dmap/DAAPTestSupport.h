@@ -12,7 +12,7 @@
 #include "dmap/DAAPBuffer.h"
 #include "dmap/DAAPCode.h"
 #include "dmap/DAAPParser.h"
-#include "store-runtime/TillLogManager.h"
+#include "platform/log/TillLogManager.h"
 
 namespace larder {
 

@@ -1,4 +1,4 @@
-#include "platform/BackgroundActivityScheduler.h"
+#include "platform/background/BackgroundActivityScheduler.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -15,7 +15,7 @@
 #include <thread>
 #include <vector>
 
-#include "platform/DispatchSemaphore.h"
+#include "platform/dispatch/DispatchSemaphore.h"
 
 namespace larder {
 namespace {

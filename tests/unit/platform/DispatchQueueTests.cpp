@@ -1,4 +1,4 @@
-#include "platform/DispatchQueue.h"
+#include "platform/dispatch/DispatchQueue.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -17,7 +17,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/DispatchSemaphore.h"
+#include "platform/dispatch/DispatchSemaphore.h"
 
 namespace larder {
 namespace {
@@ -328,9 +328,8 @@ TEST(ConcurrentQueue, BarrierWaitsForEveryReaderQueuedBeforeIt) {
     barrierRan.signal();
   });
   std::atomic<int> finishedWhenSyncBarrierRan{-1};
-  std::thread syncBarrier([&] {
-    queue->barrierSync([&] { finishedWhenSyncBarrierRan = readersFinished.load(); });
-  });
+  std::thread syncBarrier(
+      [&] { queue->barrierSync([&] { finishedWhenSyncBarrierRan = readersFinished.load(); }); });
 
   EXPECT_FALSE(barrierRan.waitFor(kChance)) << "barrier started while readers were inside";
   releaseAsyncReader.signal();
@@ -658,8 +657,8 @@ TEST_P(EveryQueueKind, LastReferenceReleasedWithAFinishedTaskCapture) {
 }
 
 TEST_P(EveryQueueKind, WorkersStartOnDemandAndExitWhenIdle) {
-  auto queue = DispatchQueue::create("idle", GetParam(),
-                                     {.concurrentWorkers = 2, .idleTimeout = 30ms});
+  auto queue =
+      DispatchQueue::create("idle", GetParam(), {.concurrentWorkers = 2, .idleTimeout = 30ms});
   queue->sync([] {});
   queue->barrierSync([] {});
   EXPECT_EQ(queue->workerThreadCount(), 0u) << "synchronous work must not start workers";

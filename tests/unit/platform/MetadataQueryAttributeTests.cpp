@@ -7,8 +7,8 @@
 #include <fstream>
 #include <string>
 
-#include "platform/MetadataAttributes.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/metadata/MetadataAttributes.h"
+#include "platform/plist/PropertyListSerialization.h"
 
 namespace larder {
 namespace {

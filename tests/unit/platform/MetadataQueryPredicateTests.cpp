@@ -1,4 +1,4 @@
-#include "platform/MetadataQueryPredicate.h"
+#include "platform/metadata/MetadataQueryPredicate.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>

@@ -1,4 +1,4 @@
-#include "platform/MetadataQuery.h"
+#include "platform/metadata/MetadataQuery.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -19,10 +19,10 @@
 #include <thread>
 #include <vector>
 
-#include "platform/DispatchQueue.h"
-#include "platform/FileIO.h"
-#include "platform/MetadataAttributes.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/dispatch/DispatchQueue.h"
+#include "platform/metadata/MetadataAttributes.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/FileIO.h"
 
 namespace larder {
 namespace {

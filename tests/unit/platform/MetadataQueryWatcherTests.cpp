@@ -12,8 +12,8 @@
 #include <thread>
 #include <vector>
 
-#include "platform/MetadataIndexWatcher.h"
-#include "platform/MetadataSearchScope.h"
+#include "platform/metadata/MetadataIndexWatcher.h"
+#include "platform/metadata/MetadataSearchScope.h"
 
 namespace larder {
 namespace {

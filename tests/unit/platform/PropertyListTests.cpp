@@ -12,8 +12,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/PlistValue.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/plist/PlistValue.h"
+#include "platform/plist/PropertyListSerialization.h"
 
 namespace larder {
 namespace {

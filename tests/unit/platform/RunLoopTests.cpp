@@ -1,4 +1,4 @@
-#include "platform/RunLoop.h"
+#include "platform/dispatch/RunLoop.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -11,7 +11,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/DispatchSemaphore.h"
+#include "platform/dispatch/DispatchSemaphore.h"
 
 namespace larder {
 namespace {
@@ -256,10 +256,9 @@ TEST(RunLoop, RepeatingTimerSkipsMissedFiresInsteadOfBursting) {
   ASSERT_EQ(firedAt.size(), 6u);
   // One late fire right after the busy spell, then at most one scheduled fire can follow within
   // half an interval; a burst would fire the nine missed ones back to back.
-  const auto firesSoonAfterBlock =
-      std::count_if(firedAt.begin() + 1, firedAt.end(), [&](Clock::time_point at) {
-        return at >= blockEnded && at < blockEnded + kInterval / 2;
-      });
+  const auto firesSoonAfterBlock = std::count_if(
+      firedAt.begin() + 1, firedAt.end(),
+      [&](Clock::time_point at) { return at >= blockEnded && at < blockEnded + kInterval / 2; });
   EXPECT_GE(firesSoonAfterBlock, 1);
   EXPECT_LE(firesSoonAfterBlock, 2);
 }
@@ -269,7 +268,8 @@ TEST(RunLoop, ToleranceLetsATimerFireLaterTogetherWithAnother) {
   Clock::time_point relaxedAt;
   Clock::time_point strictAt;
   const auto added = Clock::now();
-  loop.addTimer(10ms, false, [&] { relaxedAt = Clock::now(); }, 30ms);
+  loop.addTimer(
+      10ms, false, [&] { relaxedAt = Clock::now(); }, 30ms);
   loop.addTimer(25ms, false, [&] {
     strictAt = Clock::now();
     loop.stop();

@@ -15,12 +15,12 @@
 #include <thread>
 #include <vector>
 
-#include "store-runtime/VendCancellingDialogPresenter.h"
-#include "store-runtime/VendDialog.h"
-#include "store-runtime/VendDialogOperation.h"
-#include "store-runtime/VendDialogPresenter.h"
-#include "store-runtime/VendRuntime.h"
-#include "store-runtime/VendUIService.h"
+#include "store-runtime/dialogs/VendCancellingDialogPresenter.h"
+#include "store-runtime/dialogs/VendDialog.h"
+#include "store-runtime/dialogs/VendDialogOperation.h"
+#include "store-runtime/dialogs/VendDialogPresenter.h"
+#include "store-runtime/dialogs/VendUIService.h"
+#include "store-runtime/services/VendRuntime.h"
 
 namespace larder {
 namespace {

@@ -8,8 +8,8 @@
 #include <vector>
 
 #include "DownloadTestSupport.h"
-#include "store-runtime/VendDownloadError.h"
-#include "store-runtime/VendPackageInstaller.h"
+#include "store-runtime/download/VendDownloadError.h"
+#include "store-runtime/download/VendPackageInstaller.h"
 
 namespace larder {
 namespace {

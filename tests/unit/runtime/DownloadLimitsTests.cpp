@@ -8,11 +8,11 @@
 #include <vector>
 
 #include "DownloadTestSupport.h"
-#include "store-runtime/TillDownloadAsset.h"
-#include "store-runtime/VendAssetFetcher.h"
-#include "store-runtime/VendAssetFileWriter.h"
-#include "store-runtime/VendChunkDigestVerifier.h"
-#include "store-runtime/VendDownloadError.h"
+#include "store-runtime/download/TillDownloadAsset.h"
+#include "store-runtime/download/VendAssetFetcher.h"
+#include "store-runtime/download/VendAssetFileWriter.h"
+#include "store-runtime/download/VendChunkDigestVerifier.h"
+#include "store-runtime/download/VendDownloadError.h"
 
 namespace larder {
 namespace {

@@ -9,12 +9,12 @@
 #include <vector>
 
 #include "DownloadTestSupport.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendApplicationLocks.h"
-#include "store-runtime/VendDownloadError.h"
-#include "store-runtime/VendDownloadManager.h"
-#include "store-runtime/VendDownloadService.h"
-#include "store-runtime/VendHTTPTransfer.h"
+#include "platform/log/TillLogManager.h"
+#include "store-runtime/download/VendApplicationLocks.h"
+#include "store-runtime/download/VendDownloadError.h"
+#include "store-runtime/download/VendDownloadManager.h"
+#include "store-runtime/download/VendDownloadService.h"
+#include "store-runtime/http/VendHTTPTransfer.h"
 
 namespace larder {
 namespace {

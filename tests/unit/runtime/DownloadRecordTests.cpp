@@ -7,9 +7,9 @@
 #include <string>
 #include <vector>
 
-#include "platform/KeyedArchive.h"
-#include "store-runtime/TillDownload.h"
-#include "store-runtime/TillPurchaseResponse.h"
+#include "platform/plist/KeyedArchive.h"
+#include "store-runtime/download/TillDownload.h"
+#include "store-runtime/purchase/TillPurchaseResponse.h"
 
 namespace larder {
 namespace {

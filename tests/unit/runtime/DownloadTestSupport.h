@@ -29,11 +29,11 @@
 #include <thread>
 #include <vector>
 
-#include "platform/PlistValue.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/TillDownload.h"
-#include "store-runtime/VendError.h"
-#include "store-runtime/VendRuntime.h"
+#include "platform/plist/PlistValue.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "store-runtime/core/VendError.h"
+#include "store-runtime/download/TillDownload.h"
+#include "store-runtime/services/VendRuntime.h"
 #include "tests/unit/ScopedEnvironment.h"
 
 namespace larder::testing {

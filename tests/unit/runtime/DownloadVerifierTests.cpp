@@ -8,7 +8,7 @@
 #include <vector>
 
 #include "DownloadTestSupport.h"
-#include "store-runtime/VendChunkDigestVerifier.h"
+#include "store-runtime/download/VendChunkDigestVerifier.h"
 
 namespace larder {
 namespace {

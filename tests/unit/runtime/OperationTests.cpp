@@ -6,9 +6,9 @@
 #include <stdexcept>
 #include <thread>
 
-#include "platform/DispatchSemaphore.h"
-#include "store-runtime/VendOperation.h"
-#include "store-runtime/VendOperationQueue.h"
+#include "platform/dispatch/DispatchSemaphore.h"
+#include "store-runtime/core/VendOperation.h"
+#include "store-runtime/core/VendOperationQueue.h"
 
 namespace larder {
 namespace {

@@ -11,13 +11,13 @@
 #include <thread>
 #include <vector>
 
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendOrvaneIDLookupOperation.h"
-#include "store-runtime/VendRequestSigner.h"
-#include "store-runtime/VendRuntime.h"
-#include "store-runtime/VendStoreAnswer.h"
-#include "store-runtime/VendStringHelpers.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "store-runtime/accounts/VendOrvaneIDLookupOperation.h"
+#include "store-runtime/core/VendStringHelpers.h"
+#include "store-runtime/http/VendRequestSigner.h"
+#include "store-runtime/http/VendStoreAnswer.h"
+#include "store-runtime/services/VendRuntime.h"
 
 namespace larder::testing {
 namespace {

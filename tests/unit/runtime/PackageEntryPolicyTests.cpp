@@ -7,7 +7,7 @@
 #include <utility>
 #include <vector>
 
-#include "store-runtime/VendPackageEntryPolicy.h"
+#include "store-runtime/download/VendPackageEntryPolicy.h"
 
 namespace larder {
 namespace {

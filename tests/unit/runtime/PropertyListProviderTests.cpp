@@ -2,9 +2,9 @@
 
 #include <string>
 
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/TillDownload.h"
-#include "store-runtime/VendPropertyListProvider.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "store-runtime/download/TillDownload.h"
+#include "store-runtime/http/VendPropertyListProvider.h"
 
 namespace larder {
 namespace {

@@ -12,14 +12,14 @@
 #include <string>
 #include <vector>
 
-#include "platform/KeyedArchive.h"
-#include "store-runtime/LedgerBook.h"
-#include "store-runtime/LedgerDAAPPurchasedItem.h"
-#include "store-runtime/LedgerSoftwareUpdateStatus.h"
-#include "store-runtime/LedgerUpdate.h"
-#include "store-runtime/SysupQuaymartUpdate.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/TillPurchase.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/KeyedArchive.h"
+#include "store-runtime/purchase/TillPurchase.h"
+#include "store-runtime/records/LedgerBook.h"
+#include "store-runtime/records/LedgerDAAPPurchasedItem.h"
+#include "store-runtime/records/LedgerSoftwareUpdateStatus.h"
+#include "store-runtime/records/LedgerUpdate.h"
+#include "store-runtime/records/SysupQuaymartUpdate.h"
 
 namespace larder {
 namespace {

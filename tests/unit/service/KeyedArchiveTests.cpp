@@ -5,8 +5,8 @@
 #include <set>
 #include <string>
 
-#include "platform/KeyedArchive.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/plist/KeyedArchive.h"
+#include "platform/plist/PropertyListSerialization.h"
 
 namespace larder {
 namespace {
@@ -71,7 +71,8 @@ TEST(KeyedArchive, NestedContainersUnwrapIntoPlainValues) {
 }
 
 TEST(KeyedArchive, EveryClassMustBeAllowedWhereverItAppears) {
-  for (const char* className : {"dictionary", "array", "string", "number", "data", "date", "Record"}) {
+  for (const char* className :
+       {"dictionary", "array", "string", "number", "data", "date", "Record"}) {
     std::string error;
     EXPECT_FALSE(decode(everyClassTree(), without(className), &error))
         << className << " was admitted although not allowed";
@@ -79,9 +80,8 @@ TEST(KeyedArchive, EveryClassMustBeAllowedWhereverItAppears) {
   }
   // Each leaf class alone at the root.
   const std::vector<std::pair<PlistValue, const char*>> roots = {
-      {"text", "string"}, {7, "number"},       {false, "number"},
-      {0.5, "number"},    {PlistData{9}, "data"}, {PlistDate{1}, "date"},
-      {sampleRecord(), "Record"}};
+      {"text", "string"},     {7, "number"},          {false, "number"},         {0.5, "number"},
+      {PlistData{9}, "data"}, {PlistDate{1}, "date"}, {sampleRecord(), "Record"}};
   for (const auto& [root, className] : roots) {
     EXPECT_TRUE(decode(root, Allowed{className})) << className;
     EXPECT_FALSE(decode(root, without(className))) << className;

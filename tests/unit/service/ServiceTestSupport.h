@@ -22,13 +22,13 @@
 #include <utility>
 #include <vector>
 
-#include "platform/KeyedArchive.h"
-#include "platform/PlistValue.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/KeyedArchive.h"
+#include "platform/plist/PlistValue.h"
+#include "platform/plist/PropertyListSerialization.h"
 #include "software-map/SoftwareMap.h"
 #include "software-map/VendSoftwareMapObserver.h"
-#include "store-runtime/LedgerSoftwareProduct.h"
-#include "store-runtime/TillLogManager.h"
+#include "store-runtime/records/LedgerSoftwareProduct.h"
 #include "tests/unit/ScopedEnvironment.h"
 
 namespace larder::testing {

@@ -10,8 +10,8 @@
 #include <vector>
 
 #include "ServiceTestSupport.h"
-#include "platform/FileIO.h"
-#include "platform/KeyedArchive.h"
+#include "platform/plist/KeyedArchive.h"
+#include "platform/system/FileIO.h"
 #include "software-map/SoftwareMap.h"
 
 namespace larder::testing {

@@ -13,11 +13,11 @@
 #include <vector>
 
 #include "ServiceTestSupport.h"
-#include "platform/Environment.h"
-#include "platform/FileIO.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/Environment.h"
+#include "platform/system/FileIO.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/VendGzip.h"
+#include "store-runtime/http/VendGzip.h"
 
 namespace larder::testing {
 namespace {

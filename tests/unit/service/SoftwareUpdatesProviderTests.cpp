@@ -3,7 +3,7 @@
 #include <gtest/gtest.h>
 
 #include "UpdateQueueTestSupport.h"
-#include "platform/PropertyListSerialization.h"
+#include "platform/plist/PropertyListSerialization.h"
 #include "update-queue/SoftwareUpdatesProvider.h"
 
 namespace larder::testing {

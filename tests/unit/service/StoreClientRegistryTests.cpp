@@ -1,4 +1,4 @@
-#include "store-runtime/StoreClientRegistry.h"
+#include "store-runtime/core/StoreClientRegistry.h"
 
 #include <gtest/gtest.h>
 

@@ -8,16 +8,18 @@
 #include <string>
 #include <vector>
 
-#include "platform/KeyedArchive.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/LedgerSoftwareProduct.h"
-#include "store-runtime/TillLogManager.h"
-#include "store-runtime/VendFileManager.h"
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/KeyedArchive.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "store-runtime/download/VendFileManager.h"
+#include "store-runtime/records/LedgerSoftwareProduct.h"
 
 namespace larder {
 namespace {
 
-int sign(int value) { return (value > 0) - (value < 0); }
+int sign(int value) {
+  return (value > 0) - (value < 0);
+}
 
 // Checks a < b in both directions, so that a comparison that ignores its
 // argument order cannot pass.
@@ -74,9 +76,9 @@ TEST(CompareVersionStrings, LettersCompareByCharacter) {
 }
 
 TEST(CompareVersionStrings, OrderIsConsistentAcrossAMixedSet) {
-  const std::vector<std::string> versions = {"",     "0",     "1",      "1.0",  "1.0.0", "1.0a",
-                                             "1.01", "1.1",   "1.9",    "1.10", "1.10a", "2",
-                                             "2.0b", "10",    "10.0.1", "a",    "a1",    "a10"};
+  const std::vector<std::string> versions = {"",     "0",   "1",      "1.0",  "1.0.0", "1.0a",
+                                             "1.01", "1.1", "1.9",    "1.10", "1.10a", "2",
+                                             "2.0b", "10",  "10.0.1", "a",    "a1",    "a10"};
   for (const std::string& a : versions) {
     EXPECT_EQ(compareVersionStrings(a, a), 0) << a;
     for (const std::string& b : versions) {
@@ -91,8 +93,9 @@ TEST(CompareVersionStrings, OrderIsConsistentAcrossAMixedSet) {
     }
   }
   std::vector<std::string> sorted = versions;
-  std::sort(sorted.begin(), sorted.end(),
-            [](const std::string& a, const std::string& b) { return compareVersionStrings(a, b) < 0; });
+  std::sort(sorted.begin(), sorted.end(), [](const std::string& a, const std::string& b) {
+    return compareVersionStrings(a, b) < 0;
+  });
   auto before = [&](const std::string& a, const std::string& b) {
     return std::find(sorted.begin(), sorted.end(), a) < std::find(sorted.begin(), sorted.end(), b);
   };
@@ -103,16 +106,18 @@ TEST(CompareVersionStrings, OrderIsConsistentAcrossAMixedSet) {
 
 // MARK: log formatting
 
-LogArgument num(auto value) { return LogArgument::number(value); }
+LogArgument num(auto value) {
+  return LogArgument::number(value);
+}
 
 TEST(TillLogFormat, ConversionsTakeTheArgumentsInOrder) {
   using Log = TillLogManager;
   EXPECT_EQ(Log::formatMessage("%@: took %.4f seconds for %ld records",
                                {"Map", num(0.5), num(std::int64_t{12})}),
             "Map: took 0.5000 seconds for 12 records");
-  EXPECT_EQ(Log::formatMessage("%s|%d|%lu|%lld|%-4s|%x|%5.1f|%03d",
-                               {"a", num(-7), num(std::size_t{8}), num(9LL), "e", num(255), num(3.14159),
-                                num(4)}),
+  EXPECT_EQ(Log::formatMessage(
+                "%s|%d|%lu|%lld|%-4s|%x|%5.1f|%03d",
+                {"a", num(-7), num(std::size_t{8}), num(9LL), "e", num(255), num(3.14159), num(4)}),
             "a|-7|8|9|e|ff|  3.1|004");
   EXPECT_EQ(Log::formatMessage("(%@)", {"{\n    key = 1;\n}"}), "({\n    key = 1;\n})");
   // Arguments are never scanned for conversions themselves.
@@ -122,7 +127,8 @@ TEST(TillLogFormat, ConversionsTakeTheArgumentsInOrder) {
 TEST(TillLogFormat, NumbersFollowTheConversionTextFollowsItself) {
   using Log = TillLogManager;
   // "%@" and "%s" print a number plainly.
-  EXPECT_EQ(Log::formatMessage("%@ %s %@", {num(42), num(0.25), num(std::uint64_t{18446744073709551615ULL})}),
+  EXPECT_EQ(Log::formatMessage("%@ %s %@",
+                               {num(42), num(0.25), num(std::uint64_t{18446744073709551615ULL})}),
             "42 0.25 18446744073709551615");
   // A number converts as the conversion asks.
   EXPECT_EQ(Log::formatMessage("%d %f %.2e", {num(2.9), num(2), num(1500)}), "2 2.000000 1.50e+03");
@@ -180,11 +186,12 @@ TEST(TillLogFormat, LoggedArgumentsDescribeThemselves) {
                  LedgerSoftwareProductFields{.bundlePath = "/A.app", .bundleIdentifier = "com.a"}));
   }
   log.setLevel(saved);
-  EXPECT_THAT(lines, ::testing::ElementsAre(
-                         "describe: -5 1 text 0.1235 5", "describe: (null) 42 (null)",
-                         "describe: {\n    a = 1;\n    b = \"x\";\n}",
-                         "describe: (\n    1,\n    (\n    )\n)",
-                         ::testing::StartsWith("describe: <LedgerSoftwareProduct: bundleIdentifier=com.a ")));
+  EXPECT_THAT(
+      lines,
+      ::testing::ElementsAre(
+          "describe: -5 1 text 0.1235 5", "describe: (null) 42 (null)",
+          "describe: {\n    a = 1;\n    b = \"x\";\n}", "describe: (\n    1,\n    (\n    )\n)",
+          ::testing::StartsWith("describe: <LedgerSoftwareProduct: bundleIdentifier=com.a ")));
 }
 
 TEST(TillLogFormat, SinksReceiveLinesAtEnabledLevelsOnly) {
@@ -192,7 +199,8 @@ TEST(TillLogFormat, SinksReceiveLinesAtEnabledLevelsOnly) {
   int saved = log.level();
   std::vector<std::pair<int, std::string>> received;
   {
-    auto handle = log.addSink([&](int level, const std::string& line) { received.emplace_back(level, line); });
+    auto handle = log.addSink(
+        [&](int level, const std::string& line) { received.emplace_back(level, line); });
     log.setLevel(2);
     TILL_LOG(1, "%@ one %ld", "sink-test", 1);
     TILL_LOG(3, "%@ three", "sink-test");
@@ -256,9 +264,9 @@ TEST(LedgerSoftwareProduct, AbsentFieldsAreAbsentInBothForms) {
   sparse.bundlePath = "/Applications/Sparse.app";
   LedgerSoftwareProduct product(sparse);
   for (const PlistDictionary& form : {product.toDictionary(), product.encodeWithCoder()}) {
-    for (const char* key : {"bundleIdentifier", "bundleVersion", "itemIdentifier",
-                            "versionIdentifier", "accountOpaqueID", "purchaseDate",
-                            "expectedBundleVersion", "expectedStoreVersion"}) {
+    for (const char* key :
+         {"bundleIdentifier", "bundleVersion", "itemIdentifier", "versionIdentifier",
+          "accountOpaqueID", "purchaseDate", "expectedBundleVersion", "expectedStoreVersion"}) {
       EXPECT_FALSE(form.contains(key)) << key;
     }
     EXPECT_EQ(PlistValue(form)["bundlePath"], PlistValue("/Applications/Sparse.app"));

@@ -14,8 +14,8 @@
 
 #include "ServiceTestSupport.h"
 #include "UpdateStoreStub.h"
-#include "platform/FileIO.h"
-#include "store-runtime/VendRuntime.h"
+#include "platform/system/FileIO.h"
+#include "store-runtime/services/VendRuntime.h"
 #include "update-queue/UpdateQueue.h"
 
 namespace larder::testing {

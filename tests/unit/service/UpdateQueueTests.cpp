@@ -9,9 +9,9 @@
 #include <vector>
 
 #include "UpdateQueueTestSupport.h"
-#include "platform/FileIO.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/VendGzip.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/FileIO.h"
+#include "store-runtime/http/VendGzip.h"
 
 namespace larder::testing {
 namespace {

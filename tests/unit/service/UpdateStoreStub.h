@@ -14,9 +14,9 @@
 #include <thread>
 #include <vector>
 
-#include "platform/PlistValue.h"
-#include "platform/PropertyListSerialization.h"
-#include "store-runtime/VendRuntime.h"
+#include "platform/plist/PlistValue.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "store-runtime/services/VendRuntime.h"
 
 namespace larder::testing {
 

@@ -1,0 +1,17 @@
+#pragma once
+
+#include "store-runtime/dialogs/VendDialogPresenter.h"
+
+namespace larder {
+
+// The presenter of a runtime that has nobody to show dialogs to: every
+// dialog is answered at once as cancelled, so that nothing waits for a user
+// who cannot be asked.
+class VendCancellingDialogPresenter final : public VendDialogPresenter {
+ public:
+  void present(const VendDialog& dialog, Reply reply) override;
+  // Nothing is ever shown, so there is nothing to take down.
+  void dismiss(std::string_view dialogIdentifier, std::int64_t exitCode) override;
+};
+
+}  // namespace larder

@@ -1,0 +1,103 @@
+#include "store-runtime/host/PlatformStateFile.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+
+#include <cerrno>
+#include <filesystem>
+
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/Environment.h"
+#include "platform/system/FileDescriptor.h"
+#include "platform/system/FileIO.h"
+
+namespace larder {
+
+namespace {
+
+constexpr std::string_view kSpeaker = "PlatformStateFile";
+constexpr std::size_t kMaxStateBytes = 16u << 20u;
+
+// Holds an exclusive flock on "<path>.lock" for its lifetime. flock locks
+// belong to the open file description, so two threads of one process that
+// each open the lock file exclude each other as two processes do.
+class ExclusiveFileLock {
+ public:
+  explicit ExclusiveFileLock(const std::string& path) : descriptor_(openLockFile(path + ".lock")) {
+    if (!descriptor_.valid()) return;
+    int result;
+    do {
+      result = ::flock(descriptor_.get(), LOCK_EX);
+    } while (result != 0 && errno == EINTR);
+    locked_ = result == 0;
+  }
+  ~ExclusiveFileLock() {
+    if (locked_) ::flock(descriptor_.get(), LOCK_UN);
+  }
+  ExclusiveFileLock(const ExclusiveFileLock&) = delete;
+  ExclusiveFileLock& operator=(const ExclusiveFileLock&) = delete;
+
+  [[nodiscard]] bool isLocked() const { return locked_; }
+
+ private:
+  static int openLockFile(const std::string& lockPath) {
+    FileIO::createDirectories(std::filesystem::path(lockPath).parent_path().string());
+    return ::open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+  }
+
+  FileDescriptor descriptor_;
+  bool locked_ = false;
+};
+
+}  // namespace
+
+std::string PlatformStateFile::pathForName(std::string_view name) {
+  return Environment::rootedPath("/var/lib/larder-platform/") + std::string(name);
+}
+
+PlistValue PlatformStateFile::read() const {
+  std::optional<PlistData> bytes = FileIO::read(path_, kMaxStateBytes);
+  if (!bytes) return {};
+  std::string error;
+  std::optional<PlistValue> value = PropertyListSerialization::read(*bytes, &error);
+  if (!value) {
+    TILL_LOG(1, "%@: Ignoring damaged state file %@: %@", kSpeaker, path_, error);
+    return {};
+  }
+  return std::move(*value);
+}
+
+PlistDictionary PlatformStateFile::readDictionary() const {
+  PlistValue value = read();
+  if (PlistDictionary* dictionary = value.dictionary()) return std::move(*dictionary);
+  return {};
+}
+
+bool PlatformStateFile::updateValue(const std::function<void(PlistValue&)>& change) const {
+  ExclusiveFileLock lock(path_);
+  if (!lock.isLocked()) {
+    TILL_LOG(1, "%@: Cannot lock state file %@", kSpeaker, path_);
+    return false;
+  }
+  PlistValue value = read();
+  change(value);
+  std::string error;
+  if (!FileIO::writeAtomically(path_, PropertyListSerialization::writeXml(value), &error)) {
+    TILL_LOG(1, "%@: Cannot write state file %@: %@", kSpeaker, path_, error);
+    return false;
+  }
+  return true;
+}
+
+bool PlatformStateFile::updateDictionary(
+    const std::function<void(PlistDictionary&)>& change) const {
+  return updateValue([&](PlistValue& value) {
+    PlistDictionary dictionary;
+    if (PlistDictionary* stored = value.dictionary()) dictionary = std::move(*stored);
+    change(dictionary);
+    value = PlistValue(std::move(dictionary));
+  });
+}
+
+}  // namespace larder
