@@ -2,8 +2,8 @@
 
 #include <utility>
 
-#include "platform/dispatch/ConcurrentDispatchQueue.h"
-#include "platform/dispatch/SerialDispatchQueue.h"
+#include "platform/dispatch/internal/ConcurrentDispatchQueue.h"
+#include "platform/dispatch/internal/SerialDispatchQueue.h"
 
 namespace larder {
 

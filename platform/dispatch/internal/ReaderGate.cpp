@@ -1,4 +1,4 @@
-#include "platform/dispatch/ReaderGate.h"
+#include "platform/dispatch/internal/ReaderGate.h"
 
 namespace larder {
 

@@ -3,7 +3,7 @@
 #include <memory>
 
 #include "platform/dispatch/DispatchQueue.h"
-#include "platform/dispatch/DispatchQueueCore.h"
+#include "platform/dispatch/internal/DispatchQueueCore.h"
 
 namespace larder {
 

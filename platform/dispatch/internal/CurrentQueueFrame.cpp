@@ -1,4 +1,4 @@
-#include "platform/dispatch/CurrentQueueFrame.h"
+#include "platform/dispatch/internal/CurrentQueueFrame.h"
 
 namespace larder {
 

@@ -1,10 +1,10 @@
-#include "platform/dispatch/ConcurrentDispatchQueue.h"
+#include "platform/dispatch/internal/ConcurrentDispatchQueue.h"
 
 #include <stdexcept>
 #include <utility>
 
-#include "platform/dispatch/CurrentQueueFrame.h"
-#include "platform/dispatch/ReaderGate.h"
+#include "platform/dispatch/internal/CurrentQueueFrame.h"
+#include "platform/dispatch/internal/ReaderGate.h"
 
 namespace larder {
 

@@ -1,9 +1,9 @@
-#include "platform/dispatch/SerialDispatchQueue.h"
+#include "platform/dispatch/internal/SerialDispatchQueue.h"
 
 #include <stdexcept>
 #include <utility>
 
-#include "platform/dispatch/CurrentQueueFrame.h"
+#include "platform/dispatch/internal/CurrentQueueFrame.h"
 
 namespace larder {
 

@@ -1,4 +1,4 @@
-#include "platform/dispatch/DispatchQueueCore.h"
+#include "platform/dispatch/internal/DispatchQueueCore.h"
 
 #include <pthread.h>
 
@@ -10,8 +10,8 @@
 #include <thread>
 #include <utility>
 
-#include "platform/dispatch/CurrentQueueFrame.h"
-#include "platform/dispatch/ReaderGate.h"
+#include "platform/dispatch/internal/CurrentQueueFrame.h"
+#include "platform/dispatch/internal/ReaderGate.h"
 #include "platform/log/TillLogManager.h"
 
 namespace larder {
