@@ -8,8 +8,8 @@
 #include "AssetService/DBusValueCodec.h"
 #include "platform/log/TillLogManager.h"
 #include "store-runtime/core/VendStoreClient.h"
-#include "store-runtime/dialogs/VendUIService.h"
-#include "store-runtime/services/VendRuntime.h"
+#include "store-runtime/services/VendUIService.h"
+#include "store-runtime/runtime/VendRuntime.h"
 
 namespace larder {
 

@@ -8,11 +8,11 @@
 
 #include "AssetService/DBusValueCodec.h"
 #include "platform/log/TillLogManager.h"
-#include "store-runtime/accounts/VendAccountService.h"
-#include "store-runtime/download/TillDownload.h"
-#include "store-runtime/download/VendDownloadService.h"
-#include "store-runtime/purchase/TillPurchase.h"
-#include "store-runtime/purchase/VendTransactionService.h"
+#include "store-runtime/services/VendAccountService.h"
+#include "store-runtime/records/TillDownload.h"
+#include "store-runtime/services/VendDownloadService.h"
+#include "store-runtime/records/TillPurchase.h"
+#include "store-runtime/services/VendTransactionService.h"
 #include "store-runtime/services/VendServiceProxy.h"
 
 namespace larder {

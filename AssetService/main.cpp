@@ -20,7 +20,7 @@
 #include "platform/system/Confinement.h"
 #include "platform/system/StopSignals.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/services/VendRuntime.h"
+#include "store-runtime/runtime/VendRuntime.h"
 #include "update-queue/UpdateQueue.h"
 
 namespace {

@@ -27,8 +27,8 @@
 #include "platform/system/FileIO.h"
 #include "store-runtime/download/VendDownloadManager.h"
 #include "store-runtime/http/VendHTTPTransfer.h"
-#include "store-runtime/purchase/TillPurchase.h"
-#include "store-runtime/purchase/TillPurchaseResponse.h"
+#include "store-runtime/records/TillPurchase.h"
+#include "store-runtime/records/TillPurchaseResponse.h"
 
 extern char** environ;
 

@@ -5,10 +5,10 @@
 #include <cstdint>
 #include <span>
 
-#include "store-runtime/download/TillDownload.h"
+#include "store-runtime/records/TillDownload.h"
 #include "store-runtime/http/VendStoreAnswer.h"
-#include "store-runtime/purchase/TillPurchase.h"
-#include "store-runtime/purchase/TillPurchaseResponse.h"
+#include "store-runtime/records/TillPurchase.h"
+#include "store-runtime/records/TillPurchaseResponse.h"
 #include "store-runtime/records/LedgerUpdate.h"
 
 namespace {

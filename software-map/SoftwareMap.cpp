@@ -12,7 +12,7 @@
 #include "platform/system/FileIO.h"
 #include "platform/system/Uuid.h"
 #include "store-runtime/download/VendFileManager.h"
-#include "store-runtime/purchase/VendPurchaseRecord.h"
+#include "store-runtime/records/VendPurchaseRecord.h"
 
 namespace larder {
 

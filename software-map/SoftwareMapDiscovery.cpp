@@ -8,7 +8,7 @@
 #include "platform/system/Environment.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/download/VendFileManager.h"
-#include "store-runtime/purchase/VendPurchaseRecord.h"
+#include "store-runtime/records/VendPurchaseRecord.h"
 
 namespace larder {
 

@@ -1,7 +1,7 @@
 // The update machinery's notices of a bundle replacement.
 #include "platform/log/TillLogManager.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/purchase/VendPurchaseRecord.h"
+#include "store-runtime/records/VendPurchaseRecord.h"
 
 namespace larder {
 

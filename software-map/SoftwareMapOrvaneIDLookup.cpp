@@ -2,8 +2,8 @@
 // names the account only by an opaque id, which the store turns into a name.
 #include "platform/log/TillLogManager.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/accounts/VendOrvaneIDLookupOperation.h"
-#include "store-runtime/purchase/VendPurchaseRecord.h"
+#include "store-runtime/services/VendOrvaneIDLookupOperation.h"
+#include "store-runtime/records/VendPurchaseRecord.h"
 
 namespace larder {
 

@@ -2,7 +2,7 @@
 
 #include "platform/log/TillLogManager.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/http/VendStoreURLOperation.h"
+#include "store-runtime/services/VendStoreURLOperation.h"
 #include "store-runtime/http/VendURLRequest.h"
 #include "update-queue/SoftwareUpdatesProvider.h"
 

@@ -4,8 +4,8 @@
 #include <optional>
 #include <vector>
 
-#include "store-runtime/core/VendOperation.h"
-#include "store-runtime/core/VendOperationDelegate.h"
+#include "store-runtime/services/VendOperation.h"
+#include "store-runtime/services/VendOperationDelegate.h"
 #include "store-runtime/records/LedgerUpdate.h"
 
 namespace larder {

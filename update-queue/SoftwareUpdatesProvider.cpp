@@ -1,7 +1,7 @@
 #include "update-queue/SoftwareUpdatesProvider.h"
 
 #include "platform/log/TillLogManager.h"
-#include "store-runtime/http/VendPropertyListProvider.h"
+#include "store-runtime/services/VendPropertyListProvider.h"
 
 namespace larder {
 namespace {

@@ -4,7 +4,7 @@
 #include <optional>
 #include <vector>
 
-#include "store-runtime/http/VendDataProvider.h"
+#include "store-runtime/services/VendDataProvider.h"
 #include "store-runtime/records/LedgerUpdate.h"
 
 namespace larder {

@@ -13,7 +13,7 @@
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/StoreClientRegistry.h"
-#include "store-runtime/core/VendOperationQueue.h"
+#include "store-runtime/services/VendOperationQueue.h"
 #include "store-runtime/download/VendFileManager.h"
 #include "update-queue/LoadUpdateQueueOperation.h"
 

@@ -7,7 +7,7 @@
 
 #include "platform/system/Mutex.h"
 #include "store-runtime/accounts/VendAccount.h"
-#include "store-runtime/services/VendRuntime.h"
+#include "store-runtime/core/VendRuntimeConfiguration.h"
 
 namespace larder {
 

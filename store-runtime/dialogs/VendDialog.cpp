@@ -5,7 +5,7 @@
 #include "platform/log/TillLogManager.h"
 #include "platform/system/Uuid.h"
 #include "store-runtime/dialogs/VendDialogPresenter.h"
-#include "store-runtime/services/VendRuntime.h"
+#include "store-runtime/runtime/VendRuntime.h"
 
 namespace larder {
 
@@ -102,7 +102,7 @@ void VendDialog::dismissDialogWithDictionary(const PlistDictionary& dictionary) 
                                 ? exitCode->second.int64Value()
                                 : kNoButtonExitCode;
   TILL_LOG(2, "%@: Dismissing dialog %@ with exit code %@", kSpeaker, identifier, code);
-  VendRuntime::shared()->dialogPresenter()->dismiss(identifier, code);
+  if (auto presenter = VendRuntime::shared()->dialogPresenter()) presenter->dismiss(identifier, code);
 }
 
 std::optional<VendDialogButton> VendDialog::okButton() const {

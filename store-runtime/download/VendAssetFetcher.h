@@ -6,7 +6,7 @@
 #include <string>
 
 #include "store-runtime/core/VendError.h"
-#include "store-runtime/download/TillDownloadAsset.h"
+#include "store-runtime/records/TillDownloadAsset.h"
 #include "store-runtime/download/VendChunkDigestVerifier.h"
 
 namespace larder {

@@ -4,13 +4,11 @@
 #include <cstring>
 
 #include "store-runtime/http/CryptoLibrary.h"
+#include "store-runtime/records/VendChunkDigestRules.h"
 
 namespace larder {
 
 namespace {
-
-constexpr std::size_t kSha256Length = 32;
-constexpr std::size_t kMd5Length = 16;
 
 int hexValue(char digit) {
   if (digit >= '0' && digit <= '9') return digit - '0';
@@ -42,8 +40,8 @@ std::string toHex(const std::uint8_t* bytes, std::size_t length) {
 }
 
 const EVP_MD* digestForLength(std::size_t length) {
-  if (length == kSha256Length) return CryptoLibrary::shared().sha256();
-  if (length == kMd5Length) return CryptoLibrary::shared().md5();
+  if (length == VendChunkDigestRules::kSha256Length) return CryptoLibrary::shared().sha256();
+  if (length == VendChunkDigestRules::kMd5Length) return CryptoLibrary::shared().md5();
   return nullptr;
 }
 
@@ -62,41 +60,14 @@ struct VendChunkDigestVerifier::Hasher {
   std::unique_ptr<EVP_MD_CTX, ContextDeleter> context;
 };
 
-std::optional<std::string> VendChunkDigestVerifier::chunkSizeProblem(std::uint64_t chunkSize) {
-  if (chunkSize == 0) return "chunk size is 0";
-  if (chunkSize > kMaxChunkSize) {
-    return "chunk size " + std::to_string(chunkSize) + " is over the limit of " +
-           std::to_string(kMaxChunkSize) + " bytes";
-  }
-  return std::nullopt;
-}
-
-std::optional<std::string> VendChunkDigestVerifier::digestListProblem(
-    const std::vector<std::string>& hexDigests) {
-  if (hexDigests.empty()) return "no digests";
-  const std::size_t hexLength = hexDigests.front().size();
-  if (!digestForLength(hexLength / 2) || hexLength % 2 != 0) {
-    return "digest \"" + hexDigests.front() + "\" is neither SHA-256 nor MD5 hex";
-  }
-  std::vector<std::uint8_t> scratch;
-  for (std::size_t i = 0; i < hexDigests.size(); ++i) {
-    scratch.clear();
-    if (hexDigests[i].size() != hexLength || !appendHex(hexDigests[i], scratch)) {
-      return "digest " + std::to_string(i) + " (\"" + hexDigests[i] + "\") is not " +
-             std::to_string(hexLength) + " hex digits";
-    }
-  }
-  return std::nullopt;
-}
-
 VendChunkDigestVerifier::VendChunkDigestVerifier(std::uint64_t fileSize, std::uint64_t chunkSize,
                                                  const std::vector<std::string>& hexDigests)
     : fileSize_(fileSize), chunkSize_(chunkSize), expectedCount_(hexDigests.size()) {
-  if (std::optional<std::string> problem = chunkSizeProblem(chunkSize_)) {
+  if (std::optional<std::string> problem = VendChunkDigestRules::chunkSizeProblem(chunkSize_)) {
     fail(Failure::kBadManifest, "the manifest's " + *problem);
     return;
   }
-  if (std::optional<std::string> problem = digestListProblem(hexDigests)) {
+  if (std::optional<std::string> problem = VendChunkDigestRules::digestListProblem(hexDigests)) {
     fail(Failure::kBadManifest, "the manifest's " + *problem);
     return;
   }

@@ -7,6 +7,8 @@
 #include <string>
 #include <vector>
 
+#include "store-runtime/records/VendChunkDigestRules.h"
+
 namespace larder {
 
 // Checks a file against its manifest while the bytes arrive: the file is
@@ -34,7 +36,7 @@ class VendChunkDigestVerifier {
   // its last byte arrives, so this bounds what a store can have written
   // before its bytes are caught; one digest for a whole file of any size
   // bounds nothing.
-  static constexpr std::uint64_t kMaxChunkSize = 64u << 20u;
+  static constexpr std::uint64_t kMaxChunkSize = VendChunkDigestRules::kMaxChunkSize;
 
   VendChunkDigestVerifier(std::uint64_t fileSize, std::uint64_t chunkSize,
                           const std::vector<std::string>& hexDigests);
@@ -57,11 +59,6 @@ class VendChunkDigestVerifier {
   [[nodiscard]] const std::string& failureDescription() const { return failureDescription_; }
   [[nodiscard]] std::uint64_t bytesReceived() const { return received_; }
   [[nodiscard]] std::uint64_t fileSize() const { return fileSize_; }
-
-  // Why a chunk size cannot be checked against, or nullopt.
-  static std::optional<std::string> chunkSizeProblem(std::uint64_t chunkSize);
-  // Why a list of hex digests cannot be checked against, or nullopt.
-  static std::optional<std::string> digestListProblem(const std::vector<std::string>& hexDigests);
 
  private:
   struct Hasher;

@@ -12,7 +12,7 @@
 #include "store-runtime/download/VendAssetFetcher.h"
 #include "store-runtime/download/VendDownloadError.h"
 #include "store-runtime/http/CryptoLibrary.h"
-#include "store-runtime/purchase/VendPreflightCheck.h"
+#include "store-runtime/download/VendPreflightCheck.h"
 
 namespace larder {
 

@@ -13,10 +13,10 @@
 #include "platform/plist/PlistValue.h"
 #include "platform/system/Mutex.h"
 #include "store-runtime/core/VendError.h"
-#include "store-runtime/download/TillDownload.h"
+#include "store-runtime/records/TillDownload.h"
 #include "store-runtime/download/VendApplicationLocks.h"
 #include "store-runtime/download/VendPackageInstaller.h"
-#include "store-runtime/services/VendRuntime.h"
+#include "store-runtime/core/VendRuntimeConfiguration.h"
 
 namespace larder {
 

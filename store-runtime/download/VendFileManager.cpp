@@ -9,7 +9,7 @@
 #include "platform/system/Bundle.h"
 #include "platform/system/Environment.h"
 #include "platform/system/FileIO.h"
-#include "store-runtime/purchase/VendPurchaseRecord.h"
+#include "store-runtime/records/VendPurchaseRecord.h"
 
 namespace larder {
 

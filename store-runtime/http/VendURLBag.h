@@ -13,7 +13,7 @@
 #include "platform/plist/PlistValue.h"
 #include "platform/system/Mutex.h"
 #include "store-runtime/core/VendError.h"
-#include "store-runtime/services/VendRuntime.h"
+#include "store-runtime/core/VendRuntimeConfiguration.h"
 
 namespace larder {
 

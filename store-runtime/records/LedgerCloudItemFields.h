@@ -5,7 +5,7 @@
 #include <string>
 
 #include "platform/plist/PlistValue.h"
-#include "store-runtime/purchase/TillPurchase.h"
+#include "store-runtime/records/TillPurchase.h"
 
 namespace larder {
 

@@ -6,7 +6,7 @@
 #include <string_view>
 
 #include "platform/plist/PlistValue.h"
-#include "store-runtime/purchase/TillPurchase.h"
+#include "store-runtime/records/TillPurchase.h"
 #include "store-runtime/records/LedgerCloudItemFields.h"
 
 namespace larder {

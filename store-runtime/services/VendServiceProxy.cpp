@@ -1,10 +1,10 @@
 #include "store-runtime/services/VendServiceProxy.h"
 
-#include "store-runtime/accounts/VendAccountService.h"
-#include "store-runtime/dialogs/VendUIService.h"
-#include "store-runtime/download/VendAssetService.h"
-#include "store-runtime/download/VendDownloadService.h"
-#include "store-runtime/purchase/VendTransactionService.h"
+#include "store-runtime/services/VendAccountService.h"
+#include "store-runtime/services/VendUIService.h"
+#include "store-runtime/services/VendAssetService.h"
+#include "store-runtime/services/VendDownloadService.h"
+#include "store-runtime/services/VendTransactionService.h"
 
 namespace larder {
 

@@ -6,7 +6,7 @@
 #include "platform/dispatch/DispatchSemaphore.h"
 #include "store-runtime/core/VendError.h"
 #include "store-runtime/core/VendStoreClient.h"
-#include "store-runtime/services/VendRuntime.h"
+#include "store-runtime/runtime/VendRuntime.h"
 
 namespace larder {
 

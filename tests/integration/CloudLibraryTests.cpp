@@ -29,11 +29,11 @@
 #include "platform/dispatch/RunLoop.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
-#include "store-runtime/accounts/VendAccountService.h"
+#include "store-runtime/services/VendAccountService.h"
 #include "store-runtime/http/VendHTTPTransfer.h"
 #include "store-runtime/http/VendRequestSigner.h"
 #include "store-runtime/http/VendURLBag.h"
-#include "store-runtime/services/VendRuntime.h"
+#include "store-runtime/runtime/VendRuntime.h"
 #include "store-runtime/services/VendServiceProxy.h"
 
 namespace larder::testing {

@@ -28,7 +28,7 @@
 #include "platform/system/FileIO.h"
 #include "store-runtime/accounts/VendAccountStore.h"
 #include "store-runtime/http/VendRequestSigner.h"
-#include "store-runtime/services/VendRuntime.h"
+#include "store-runtime/runtime/VendRuntime.h"
 #include "tests/unit/ScopedEnvironment.h"
 
 namespace larder::dmaptest {

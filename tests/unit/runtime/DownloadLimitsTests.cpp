@@ -8,7 +8,7 @@
 #include <vector>
 
 #include "DownloadTestSupport.h"
-#include "store-runtime/download/TillDownloadAsset.h"
+#include "store-runtime/records/TillDownloadAsset.h"
 #include "store-runtime/download/VendAssetFetcher.h"
 #include "store-runtime/download/VendAssetFileWriter.h"
 #include "store-runtime/download/VendChunkDigestVerifier.h"

@@ -13,7 +13,7 @@
 #include "store-runtime/download/VendApplicationLocks.h"
 #include "store-runtime/download/VendDownloadError.h"
 #include "store-runtime/download/VendDownloadManager.h"
-#include "store-runtime/download/VendDownloadService.h"
+#include "store-runtime/services/VendDownloadService.h"
 #include "store-runtime/http/VendHTTPTransfer.h"
 
 namespace larder {

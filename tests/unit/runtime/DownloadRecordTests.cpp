@@ -8,8 +8,8 @@
 #include <vector>
 
 #include "platform/plist/KeyedArchive.h"
-#include "store-runtime/download/TillDownload.h"
-#include "store-runtime/purchase/TillPurchaseResponse.h"
+#include "store-runtime/records/TillDownload.h"
+#include "store-runtime/records/TillPurchaseResponse.h"
 
 namespace larder {
 namespace {

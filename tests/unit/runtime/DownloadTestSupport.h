@@ -32,8 +32,8 @@
 #include "platform/plist/PlistValue.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "store-runtime/core/VendError.h"
-#include "store-runtime/download/TillDownload.h"
-#include "store-runtime/services/VendRuntime.h"
+#include "store-runtime/records/TillDownload.h"
+#include "store-runtime/runtime/VendRuntime.h"
 #include "tests/unit/ScopedEnvironment.h"
 
 namespace larder::testing {

@@ -7,8 +7,8 @@
 #include <thread>
 
 #include "platform/dispatch/DispatchSemaphore.h"
-#include "store-runtime/core/VendOperation.h"
-#include "store-runtime/core/VendOperationQueue.h"
+#include "store-runtime/services/VendOperation.h"
+#include "store-runtime/services/VendOperationQueue.h"
 
 namespace larder {
 namespace {

@@ -3,8 +3,8 @@
 #include <string>
 
 #include "platform/plist/PropertyListSerialization.h"
-#include "store-runtime/download/TillDownload.h"
-#include "store-runtime/http/VendPropertyListProvider.h"
+#include "store-runtime/records/TillDownload.h"
+#include "store-runtime/services/VendPropertyListProvider.h"
 
 namespace larder {
 namespace {

@@ -14,7 +14,7 @@
 
 #include "platform/log/TillLogManager.h"
 #include "platform/plist/KeyedArchive.h"
-#include "store-runtime/purchase/TillPurchase.h"
+#include "store-runtime/records/TillPurchase.h"
 #include "store-runtime/records/LedgerBook.h"
 #include "store-runtime/records/LedgerDAAPPurchasedItem.h"
 #include "store-runtime/records/LedgerSoftwareUpdateStatus.h"

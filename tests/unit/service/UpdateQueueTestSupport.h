@@ -15,7 +15,7 @@
 #include "ServiceTestSupport.h"
 #include "UpdateStoreStub.h"
 #include "platform/system/FileIO.h"
-#include "store-runtime/services/VendRuntime.h"
+#include "store-runtime/runtime/VendRuntime.h"
 #include "update-queue/UpdateQueue.h"
 
 namespace larder::testing {

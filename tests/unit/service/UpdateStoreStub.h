@@ -16,7 +16,7 @@
 
 #include "platform/plist/PlistValue.h"
 #include "platform/plist/PropertyListSerialization.h"
-#include "store-runtime/services/VendRuntime.h"
+#include "store-runtime/runtime/VendRuntime.h"
 
 namespace larder::testing {
 
