@@ -1,6 +1,6 @@
 #include "AssetService/AssetServiceInterface.h"
 
-#include "AssetService/ServiceError.h"
+#include "client/ServiceError.h"
 #include "platform/log/TillLogManager.h"
 #include "software-map/SoftwareMap.h"
 #include "update-queue/UpdateQueue.h"

@@ -5,34 +5,18 @@
 #include <sdbus-c++/Error.h>
 #include <sdbus-c++/IProxy.h>
 
-#include "AssetService/DBusValueCodec.h"
+#include "client/DBusValueCodec.h"
+#include "client/DialogAgentProtocol.h"
 #include "platform/log/TillLogManager.h"
 #include "store-runtime/core/VendStoreClient.h"
-#include "store-runtime/services/VendUIService.h"
 #include "store-runtime/runtime/VendRuntime.h"
+#include "store-runtime/services/VendUIService.h"
 
 namespace larder {
 
 namespace {
 
 constexpr std::string_view kSpeaker = "DialogAgentRegistry";
-
-const std::vector<BusMethod>& registryMethodTable() {
-  static const std::vector<BusMethod> table{
-      {"RegisterDialogAgent", "o", {"agent"}, "", {}},
-      {"UnregisterDialogAgent", "o", {"agent"}, "", {}},
-      {"DisplayDialog", "a{sv}", {"dialog"}, "xa{sv}", {"exitCode", "values"}},
-  };
-  return table;
-}
-
-const std::vector<BusMethod>& agentMethodTable() {
-  static const std::vector<BusMethod> table{
-      {"DisplayDialog", "a{sv}", {"dialog"}, "xa{sv}", {"exitCode", "values"}},
-      {"DismissDialog", "sx", {"identifier", "exitCode"}, "", {}, true},
-  };
-  return table;
-}
 
 VendDialogAnswer cancelledAnswer() {
   return VendDialogAnswer{VendDialogButton::kCancel, {}};
@@ -60,20 +44,16 @@ void sendAnswer(sdbus::MethodCall& call, const VendDialogAnswer& answer) {
 
 }  // namespace
 
-std::span<const BusMethod> DialogAgentRegistry::methods() {
-  return registryMethodTable();
-}
-
-std::span<const BusMethod> DialogAgentRegistry::agentMethods() {
-  return agentMethodTable();
-}
-
-const BusMethod* DialogAgentRegistry::findMethod(std::string_view member) {
-  return findBusMethod(registryMethodTable(), member);
-}
+static_assert(DialogAgentProtocol::kSignInKind == VendDialog::kSignIn,
+              "agents recognise the sign-in dialog by its kind");
+static_assert(DialogAgentProtocol::kCancel == VendDialogButton::kCancel &&
+                  DialogAgentProtocol::kOK == VendDialogButton::kOK &&
+                  DialogAgentProtocol::kOther == VendDialogButton::kOther,
+              "an agent's exit code is the role of the chosen button");
 
 DialogAgentRegistry::DialogAgentRegistry()
-    : agentCalls_(std::make_shared<VendElasticQueue>("com.orvane.larderd.DialogAgents")) {}
+    : agentCalls_(std::make_shared<VendElasticQueue>(
+          std::string(DialogAgentProtocol::kRegistryInterfaceName))) {}
 
 DialogAgentRegistry::~DialogAgentRegistry() = default;
 
@@ -83,7 +63,7 @@ void DialogAgentRegistry::exportOn(sdbus::IObject& object, sdbus::IConnection& c
     connection_ = &connection;
   }
   exportBusMethods<DialogAgentRegistry>(
-      object, kInterfaceName, methods(),
+      object, DialogAgentProtocol::kRegistryInterfaceName, DialogAgentProtocol::registryMethods(),
       {{"RegisterDialogAgent", &DialogAgentRegistry::registerAgent},
        {"UnregisterDialogAgent", &DialogAgentRegistry::unregisterAgent},
        {"DisplayDialog", &DialogAgentRegistry::displayDialog}},
@@ -168,8 +148,8 @@ void DialogAgentRegistry::askAgent(const Agent& agent, const VendDialog& dialog,
   }
   try {
     auto proxy = sdbus::createProxy(*connection, agent.peer, agent.objectPath);
-    sdbus::MethodCall call =
-        proxy->createMethodCall(std::string(kAgentInterfaceName), "DisplayDialog");
+    sdbus::MethodCall call = proxy->createMethodCall(
+        std::string(DialogAgentProtocol::kAgentInterfaceName), "DisplayDialog");
     DBusValueCodec::writeAll(call, "a{sv}", {dialog.toDictionary()});
     const auto timeout = std::chrono::duration_cast<std::chrono::microseconds>(kAgentCallTimeout);
     sdbus::MethodReply reply = proxy->callMethod(call, static_cast<std::uint64_t>(timeout.count()));
@@ -246,8 +226,8 @@ void DialogAgentRegistry::tellAgentOfDismissal(const Agent& agent,
   if (!connection) return;
   try {
     auto proxy = sdbus::createProxy(*connection, agent.peer, agent.objectPath);
-    sdbus::MethodCall call =
-        proxy->createMethodCall(std::string(kAgentInterfaceName), "DismissDialog");
+    sdbus::MethodCall call = proxy->createMethodCall(
+        std::string(DialogAgentProtocol::kAgentInterfaceName), "DismissDialog");
     DBusValueCodec::writeAll(call, "sx", {dialogIdentifier, exitCode});
     call.dontExpectReply();
     proxy->callMethod(call);

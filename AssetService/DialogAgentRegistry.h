@@ -14,7 +14,7 @@
 #include <sdbus-c++/IObject.h>
 #include <sdbus-c++/Message.h>
 
-#include "AssetService/BusMethod.h"
+#include "AssetService/BusMethodExport.h"
 #include "platform/system/Mutex.h"
 #include "store-runtime/core/VendElasticQueue.h"
 #include "store-runtime/dialogs/VendDialogPresenter.h"
@@ -35,15 +35,7 @@ namespace larder {
 class DialogAgentRegistry final : public VendDialogPresenter,
                                   public std::enable_shared_from_this<DialogAgentRegistry> {
  public:
-  static constexpr std::string_view kInterfaceName = "com.orvane.larderd.DialogAgents";
-  static constexpr std::string_view kAgentInterfaceName = "com.orvane.larderd.VendDialogAgent";
   static constexpr std::chrono::seconds kAgentCallTimeout = std::chrono::hours(1);
-
-  // com.orvane.larderd.DialogAgents, on the service object.
-  static std::span<const BusMethod> methods();
-  // com.orvane.larderd.VendDialogAgent, on each agent object.
-  static std::span<const BusMethod> agentMethods();
-  static const BusMethod* findMethod(std::string_view member);
 
   DialogAgentRegistry();
   ~DialogAgentRegistry() override;

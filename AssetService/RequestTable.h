@@ -5,6 +5,7 @@
 #include <string>
 #include <string_view>
 
+#include "client/ServiceRequests.h"
 #include "platform/plist/PlistValue.h"
 
 namespace larder {
@@ -24,30 +25,32 @@ enum class WithoutTarget {
   kErrorReply,
 };
 
-// One row of the service's request table.
-struct RequestDescriptor {
-  std::string_view selector;      // keyword name of the request
-  std::string_view member;        // its D-Bus method name
-  std::string_view inSignature;   // D-Bus signature of the arguments
-  std::string_view outSignature;  // D-Bus signature of the reply
-  std::string_view inNames;       // argument names, comma separated
-  std::string_view outNames;      // reply argument names, comma separated
+using RequestHandler = void (*)(AssetServiceInterface&, const PlistArray&, const ReplyHandler&);
+
+// What the service does with one request, keyed by its D-Bus member.
+struct RequestHandling {
+  std::string_view member;
   // Direct requests run on the delivering thread instead of the
   // connection's request queue.
   bool direct = false;
   // Null for requests whose target is not part of this build; they behave
   // as `withoutTarget` says. A handler that does only the part of a request
   // this build has may come with `kErrorReply` for the rest.
-  void (*handler)(AssetServiceInterface&, const PlistArray&, const ReplyHandler&) = nullptr;
+  RequestHandler handler = nullptr;
+  WithoutTarget withoutTarget = WithoutTarget::kNothing;
+};
+
+// One row of the service's request table: the request as clients see it
+// and what the service does with it.
+struct RequestDescriptor : RequestSignature {
+  bool direct = false;
+  RequestHandler handler = nullptr;
   WithoutTarget withoutTarget = WithoutTarget::kNothing;
 };
 
 class RequestTable {
  public:
-  static constexpr std::string_view kInterfaceName = "com.orvane.larderd.AssetService";
-  static constexpr std::string_view kObjectPath = "/com/orvane/larderd";
-  static constexpr std::string_view kCallbackInterfacePrefix = "com.orvane.larderd.";
-
+  // Every request of `ServiceRequests`, in its order, with its handling.
   static std::span<const RequestDescriptor> requests();
   static const RequestDescriptor* find(std::string_view member);
 
@@ -56,10 +59,6 @@ class RequestTable {
   // it cannot have; one sent without wanting a reply never throws it.
   static void perform(const RequestDescriptor& request, AssetServiceInterface& interface,
                       const PlistArray& arguments, const ReplyHandler& reply);
-
-  // Introspection XML of the service interface and the callback
-  // interfaces, as committed in data/dbus.
-  static std::string introspectionXml();
 };
 
 }  // namespace larder

@@ -3,10 +3,10 @@
 #include <sdbus-c++/Error.h>
 #include <sdbus-c++/IProxy.h>
 
-#include "AssetService/DBusValueCodec.h"
 #include "AssetService/DialogAgentRegistry.h"
-#include "AssetService/ServiceError.h"
 #include "AssetService/StoreRuntimeInterface.h"
+#include "client/DBusValueCodec.h"
+#include "client/ServiceError.h"
 #include "platform/log/TillLogManager.h"
 #include "platform/system/Environment.h"
 #include "software-map/SoftwareMap.h"
@@ -34,7 +34,7 @@ class DBusSoftwareMapObserver final : public VendSoftwareMapObserver {
                                    std::int64_t state) override {
     try {
       sdbus::MethodCall call = proxy_->createMethodCall(
-          std::string(RequestTable::kCallbackInterfacePrefix) + "VendSoftwareMapObserver",
+          std::string(ServiceRequests::kCallbackInterfacePrefix) + "VendSoftwareMapObserver",
           "SoftwareProductUpdatedState");
       DBusValueCodec::writeAll(call, "a{sv}x", {product->toDictionary(), state});
       call.dontExpectReply();
@@ -95,10 +95,10 @@ void ServiceListener::setStoreRuntimeInterface(
 void ServiceListener::resume() {
   connection_ = connectToBus();
   remoteObjects_ = std::make_shared<RemoteObjects>(*connection_);
-  object_ = sdbus::createObject(*connection_, std::string(RequestTable::kObjectPath));
+  object_ = sdbus::createObject(*connection_, std::string(ServiceRequests::kObjectPath));
   for (const RequestDescriptor& request : RequestTable::requests()) {
     object_->registerMethod(
-        std::string(RequestTable::kInterfaceName), std::string(request.member),
+        std::string(ServiceRequests::kInterfaceName), std::string(request.member),
         std::string(request.inSignature), std::string(request.outSignature),
         [this, &request](sdbus::MethodCall call) { dispatch(request, std::move(call)); });
   }

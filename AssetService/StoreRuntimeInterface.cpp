@@ -6,34 +6,20 @@
 
 #include <sdbus-c++/Error.h>
 
-#include "AssetService/DBusValueCodec.h"
+#include "client/DBusValueCodec.h"
+#include "client/StoreRuntimeProtocol.h"
 #include "platform/log/TillLogManager.h"
-#include "store-runtime/services/VendAccountService.h"
 #include "store-runtime/records/TillDownload.h"
-#include "store-runtime/services/VendDownloadService.h"
 #include "store-runtime/records/TillPurchase.h"
-#include "store-runtime/services/VendTransactionService.h"
+#include "store-runtime/services/VendAccountService.h"
+#include "store-runtime/services/VendDownloadService.h"
 #include "store-runtime/services/VendServiceProxy.h"
+#include "store-runtime/services/VendTransactionService.h"
 
 namespace larder {
 namespace {
 
 constexpr std::string_view kSpeaker = "StoreRuntimeInterface";
-
-const std::vector<BusMethod>& methodTable() {
-  static const std::vector<BusMethod> table{
-      {"SignIn", "ss", {"accountName", "password"}, "bta{sv}", {"success", "accountID", "error"}},
-      {"SignOut", "", {}, "", {}},
-      {"PrimaryAccount", "", {}, "a{sv}", {"account"}},
-      {"Purchase",
-       "ts",
-       {"itemIdentifier", "buyParameters"},
-       "ba{sv}aa{sv}",
-       {"success", "error", "downloads"}},
-      {"Downloads", "x", {"typeMask"}, "aa{sv}", {"downloads"}},
-  };
-  return table;
-}
 
 VendServiceProxy toolProxy() {
   return VendServiceProxy(
@@ -64,17 +50,9 @@ PlistArray downloadList(const std::vector<std::shared_ptr<TillDownload>>& downlo
 
 }  // namespace
 
-std::span<const BusMethod> StoreRuntimeInterface::methods() {
-  return methodTable();
-}
-
-const BusMethod* StoreRuntimeInterface::findMethod(std::string_view member) {
-  return findBusMethod(methodTable(), member);
-}
-
 void StoreRuntimeInterface::exportOn(sdbus::IObject& object) {
   exportBusMethods<StoreRuntimeInterface>(
-      object, kInterfaceName, methods(),
+      object, StoreRuntimeProtocol::kInterfaceName, StoreRuntimeProtocol::methods(),
       {{"SignIn", &StoreRuntimeInterface::signIn},
        {"SignOut", &StoreRuntimeInterface::signOut},
        {"PrimaryAccount", &StoreRuntimeInterface::primaryAccount},

@@ -15,8 +15,8 @@
 #include <random>
 #include <thread>
 
-#include "AssetService/DBusValueCodec.h"
-#include "AssetService/ServiceClient.h"
+#include "client/DBusValueCodec.h"
+#include "client/ServiceClient.h"
 #include "ProductStoreFixture.h"
 
 extern char** environ;

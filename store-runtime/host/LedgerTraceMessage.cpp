@@ -16,7 +16,7 @@
 #include "platform/system/Environment.h"
 #include "platform/system/FileDescriptor.h"
 #include "platform/system/FileIO.h"
-#include "store-runtime/core/JsonConversion.h"
+#include "platform/plist/JsonConversion.h"
 
 namespace larder {
 

@@ -15,7 +15,7 @@
 #include <sdbus-c++/Error.h>
 #include <sdbus-c++/IProxy.h>
 
-#include "AssetService/DialogAgentRegistry.h"
+#include "client/DialogAgentProtocol.h"
 #include "tests/integration/LarderctlProcess.h"
 #include "tests/integration/ServiceHarness.h"
 
@@ -213,7 +213,7 @@ TEST_F(DialogAgentTest, SignInDialogsCarryTheAccountOverTheBus) {
   auto client = connectClient(bus_);
   PlistArray answer = client->callDialogAgents(
       "DisplayDialog", {PlistDictionary{{"message", "Sign in"},
-                                        {"kind", std::int64_t{VendDialog::kSignIn}},
+                                        {"kind", DialogAgentProtocol::kSignInKind},
                                         {"okButtonString", "Sign In"},
                                         {"cancelButtonString", "Cancel"}}});
   ASSERT_EQ(answer.size(), 2u);
@@ -243,7 +243,7 @@ TEST_F(DialogAgentTest, AnInteractiveAgentReadsTheChoiceAndTheCredentials) {
   auto client = connectClient(bus_);
   PlistArray answer = client->callDialogAgents(
       "DisplayDialog", {PlistDictionary{{"message", "Sign in"},
-                                        {"kind", std::int64_t{VendDialog::kSignIn}},
+                                        {"kind", DialogAgentProtocol::kSignInKind},
                                         {"okButtonString", "Sign In"},
                                         {"cancelButtonString", "Cancel"}}});
   EXPECT_EQ(answer[0].int64Value(), 1) << "an empty line chooses OK";
@@ -272,7 +272,7 @@ TEST_F(DialogAgentTest, AtTheEndOfInputAnInteractiveAgentCancels) {
 TEST_F(DialogAgentTest, TheLiveInterfacesMatchTheCommittedDescriptions) {
   auto connection = bus_.connect();
   const std::string xml = introspect(*connection, "com.orvane.larderd", "/com/orvane/larderd");
-  const std::string registry(DialogAgentRegistry::kInterfaceName);
+  const std::string registry(DialogAgentProtocol::kRegistryInterfaceName);
   std::vector<std::string> committed = describeInterface(
       readFile(sourcePath("data/dbus/com.orvane.larderd.DialogAgents.xml")), registry);
   ASSERT_EQ(committed.size(), 3u);
@@ -284,7 +284,7 @@ TEST_F(DialogAgentTest, TheLiveInterfacesMatchTheCommittedDescriptions) {
   const std::string name = agentName(*agent);
   ASSERT_FALSE(name.empty()) << agent->errors();
   const std::string agentXml = introspect(*connection, name, "/com/orvane/larderctl/DialogAgent");
-  const std::string agentInterface(DialogAgentRegistry::kAgentInterfaceName);
+  const std::string agentInterface(DialogAgentProtocol::kAgentInterfaceName);
   std::vector<std::string> committedAgent = describeInterface(
       readFile(sourcePath("data/dbus/com.orvane.larderd.VendDialogAgent.xml")), agentInterface);
   ASSERT_EQ(committedAgent.size(), 2u);
@@ -295,11 +295,11 @@ TEST_F(DialogAgentTest, MalformedRequestsAreRefusedAndTheRegistryGoesOn) {
   auto connection = bus_.connect();
   auto service = sdbus::createProxy(*connection, "com.orvane.larderd", "/com/orvane/larderd");
   EXPECT_THROW(service->callMethod("RegisterDialogAgent")
-                   .onInterface(std::string(DialogAgentRegistry::kInterfaceName))
+                   .onInterface(std::string(DialogAgentProtocol::kRegistryInterfaceName))
                    .withArguments(std::string("not a path")),
                sdbus::Error);
   EXPECT_THROW(service->callMethod("DisplayDialog")
-                   .onInterface(std::string(DialogAgentRegistry::kInterfaceName))
+                   .onInterface(std::string(DialogAgentProtocol::kRegistryInterfaceName))
                    .withArguments(std::int64_t{1}),
                sdbus::Error);
   auto agent = startAgent({"--answer", "ok", "--count", "1"});

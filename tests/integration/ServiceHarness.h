@@ -9,7 +9,7 @@
 #include <string>
 #include <vector>
 
-#include "AssetService/ServiceClient.h"
+#include "client/ServiceClient.h"
 #include "platform/plist/PlistValue.h"
 
 namespace larder::testing {

@@ -12,7 +12,7 @@
 #include <mutex>
 #include <nlohmann/json.hpp>
 
-#include "AssetService/RequestTable.h"
+#include "client/ServiceRequests.h"
 #include "platform/plist/KeyedArchive.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
@@ -223,7 +223,7 @@ TEST_F(ServiceTest, BadArgumentsGetADBusErrorAndTheServiceGoesOn) {
   auto service = startService();
   auto connection = bus.connect();
   auto proxy = sdbus::createProxy(*connection, "com.orvane.larderd", "/com/orvane/larderd");
-  const std::string interface(RequestTable::kInterfaceName);
+  const std::string interface(ServiceRequests::kInterfaceName);
   EXPECT_THROW(
       proxy->callMethod("ProductForBundleIdentifier").onInterface(interface).withArguments(42),
       sdbus::Error);

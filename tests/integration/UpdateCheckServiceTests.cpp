@@ -9,7 +9,7 @@
 #include <thread>
 
 #include "platform/log/TillLogManager.h"
-#include "store-runtime/core/JsonConversion.h"
+#include "platform/plist/JsonConversion.h"
 #include "store-runtime/records/LedgerUpdate.h"
 #include "tests/integration/LarderctlProcess.h"
 #include "tests/integration/ServiceHarness.h"

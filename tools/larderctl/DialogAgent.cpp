@@ -8,8 +8,8 @@
 
 #include <sdbus-c++/Error.h>
 
-#include "AssetService/DBusValueCodec.h"
-#include "AssetService/DialogAgentRegistry.h"
+#include "client/DBusValueCodec.h"
+#include "client/DialogAgentProtocol.h"
 
 namespace larder {
 
@@ -21,7 +21,7 @@ int makeEventDescriptor() {
   return descriptor;
 }
 
-void sendAnswer(sdbus::MethodCall& call, const VendDialogAnswer& answer) {
+void sendAnswer(sdbus::MethodCall& call, const DialogAgentProtocol::Answer& answer) {
   if (call.doesntExpectReply()) return;
   sdbus::MethodReply reply = call.createReply();
   DBusValueCodec::writeAll(reply, "xa{sv}", {answer.exitCode, answer.values});
@@ -34,8 +34,8 @@ DialogAgent::DialogAgent(sdbus::IConnection& connection, std::string objectPath)
     : objectPath_(std::move(objectPath)),
       wake_(makeEventDescriptor()),
       object_(sdbus::createObject(connection, objectPath_)) {
-  const std::string interface(DialogAgentRegistry::kAgentInterfaceName);
-  for (const BusMethod& method : DialogAgentRegistry::agentMethods()) {
+  const std::string interface(DialogAgentProtocol::kAgentInterfaceName);
+  for (const BusMethod& method : DialogAgentProtocol::agentMethods()) {
     auto handler = method.member == "DisplayDialog" ? &DialogAgent::displayDialog
                                                     : &DialogAgent::dismissDialog;
     sdbus::Flags flags;
@@ -118,7 +118,8 @@ void DialogAgent::dismissDialog(sdbus::MethodCall call) {
     for (const OpenDialog& open : dismissed) dismissals_.push_back({open.dialog, exitCode});
   }
   // The service's call waits for an answer; the dismissal is it.
-  for (OpenDialog& open : dismissed) sendAnswer(open.call, VendDialogAnswer{exitCode, {}});
+  for (OpenDialog& open : dismissed)
+    sendAnswer(open.call, DialogAgentProtocol::Answer{exitCode, {}});
   if (!call.doesntExpectReply()) call.createReply().send();
   if (!dismissed.empty()) wake();
 }
@@ -136,7 +137,7 @@ std::vector<DialogAgent::Dismissal> DialogAgent::takeDismissals() {
   return std::exchange(dismissals_, {});
 }
 
-bool DialogAgent::answer(std::uint64_t ticket, const VendDialogAnswer& answer) {
+bool DialogAgent::answer(std::uint64_t ticket, const DialogAgentProtocol::Answer& answer) {
   std::optional<OpenDialog> open;
   {
     MutexLock lock(mutex_);

@@ -12,10 +12,10 @@
 #include <sdbus-c++/IObject.h>
 #include <sdbus-c++/Message.h>
 
+#include "client/DialogAgentProtocol.h"
 #include "platform/plist/PlistValue.h"
 #include "platform/system/FileDescriptor.h"
 #include "platform/system/Mutex.h"
-#include "store-runtime/dialogs/VendDialog.h"
 
 namespace larder {
 
@@ -60,7 +60,7 @@ class DialogAgent {
   std::vector<Dismissal> takeDismissals();
   // Answers a taken dialog; false when it was dismissed meanwhile and so
   // already answered.
-  bool answer(std::uint64_t ticket, const VendDialogAnswer& answer);
+  bool answer(std::uint64_t ticket, const DialogAgentProtocol::Answer& answer);
 
  private:
   void displayDialog(sdbus::MethodCall call);

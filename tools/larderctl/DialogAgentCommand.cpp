@@ -34,9 +34,9 @@ int terminationSignalDescriptor() {
 }
 
 std::int64_t exitCodeForAnswer(const std::string& answer) {
-  if (answer == "ok") return VendDialogButton::kOK;
-  if (answer == "other") return VendDialogButton::kOther;
-  return VendDialogButton::kCancel;
+  if (answer == "ok") return DialogAgentProtocol::kOK;
+  if (answer == "other") return DialogAgentProtocol::kOther;
+  return DialogAgentProtocol::kCancel;
 }
 
 std::string textField(const PlistDictionary& fields, std::string_view key) {
@@ -47,11 +47,11 @@ std::string textField(const PlistDictionary& fields, std::string_view key) {
 
 std::string buttonTitle(const PlistDictionary& fields, std::int64_t exitCode) {
   switch (exitCode) {
-    case VendDialogButton::kOK:
+    case DialogAgentProtocol::kOK:
       return textField(fields, "okButtonString");
-    case VendDialogButton::kCancel:
+    case DialogAgentProtocol::kCancel:
       return textField(fields, "cancelButtonString");
-    case VendDialogButton::kOther:
+    case DialogAgentProtocol::kOther:
       return textField(fields, "otherButtonString");
     default:
       return {};
@@ -199,10 +199,11 @@ class DialogAgentCommand::Session {
     return static_cast<int>(std::max<std::int64_t>(remaining.count() + 1, 0));
   }
 
-  [[nodiscard]] VendDialogAnswer fixedAnswer() const {
-    VendDialogAnswer answer{exitCodeForAnswer(options_.answer), {}};
-    const bool signIn = current_ && current_->fields.contains("kind") &&
-                        current_->fields.at("kind").int64Value() == VendDialog::kSignIn;
+  [[nodiscard]] DialogAgentProtocol::Answer fixedAnswer() const {
+    DialogAgentProtocol::Answer answer{exitCodeForAnswer(options_.answer), {}};
+    const bool signIn =
+        current_ && current_->fields.contains("kind") &&
+        current_->fields.at("kind").int64Value() == DialogAgentProtocol::kSignInKind;
     if (signIn && !options_.accountName.empty()) {
       answer.values = {{"accountName", options_.accountName}, {"password", options_.password}};
     }
@@ -223,7 +224,7 @@ class DialogAgentCommand::Session {
     while (current_ && prompt_) {
       std::optional<std::string> line = input_.nextLine();
       if (!line) return;
-      std::optional<VendDialogAnswer> answer = prompt_->take(*line);
+      std::optional<DialogAgentProtocol::Answer> answer = prompt_->take(*line);
       if (answer) {
         answerCurrent(*answer);
         return;
@@ -232,7 +233,7 @@ class DialogAgentCommand::Session {
     }
   }
 
-  void answerCurrent(const VendDialogAnswer& answer) {
+  void answerCurrent(const DialogAgentProtocol::Answer& answer) {
     DialogAgent::Dialog dialog = std::move(*current_);
     endCurrent();
     // A dismissal got there first; it is reported as such.

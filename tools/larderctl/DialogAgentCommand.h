@@ -3,7 +3,7 @@
 #include <cstddef>
 #include <string>
 
-#include "AssetService/ServiceClient.h"
+#include "client/ServiceClient.h"
 
 namespace larder {
 

@@ -2,7 +2,7 @@
 
 #include <iostream>
 
-#include "store-runtime/core/JsonConversion.h"
+#include "platform/plist/JsonConversion.h"
 
 namespace larder {
 

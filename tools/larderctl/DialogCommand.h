@@ -4,7 +4,7 @@
 #include <optional>
 #include <string>
 
-#include "AssetService/ServiceClient.h"
+#include "client/ServiceClient.h"
 
 namespace larder {
 

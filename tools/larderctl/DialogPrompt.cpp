@@ -28,9 +28,9 @@ std::string textField(const PlistDictionary& fields, std::string_view key) {
 
 std::string_view roleWord(std::int64_t exitCode) {
   switch (exitCode) {
-    case VendDialogButton::kOK:
+    case DialogAgentProtocol::kOK:
       return "ok";
-    case VendDialogButton::kOther:
+    case DialogAgentProtocol::kOther:
       return "other";
     default:
       return "cancel";
@@ -42,18 +42,18 @@ std::string_view roleWord(std::int64_t exitCode) {
 DialogPrompt::DialogPrompt(const PlistDictionary& fields, std::ostream& out)
     : fields_(fields), out_(out) {
   const std::pair<std::string_view, std::int64_t> keys[] = {
-      {"okButtonString", VendDialogButton::kOK},
-      {"cancelButtonString", VendDialogButton::kCancel},
-      {"otherButtonString", VendDialogButton::kOther}};
+      {"okButtonString", DialogAgentProtocol::kOK},
+      {"cancelButtonString", DialogAgentProtocol::kCancel},
+      {"otherButtonString", DialogAgentProtocol::kOther}};
   for (const auto& [key, exitCode] : keys) {
     auto found = fields_.find(key);
     if (found != fields_.end() && found->second.string()) {
       buttons_.push_back({exitCode, *found->second.string()});
     }
   }
-  if (buttons_.empty()) buttons_.push_back({VendDialogButton::kOK, "OK"});
+  if (buttons_.empty()) buttons_.push_back({DialogAgentProtocol::kOK, "OK"});
   auto kind = fields_.find("kind");
-  signIn_ = kind != fields_.end() && kind->second.int64Value() == VendDialog::kSignIn;
+  signIn_ = kind != fields_.end() && kind->second.int64Value() == DialogAgentProtocol::kSignInKind;
 }
 
 void DialogPrompt::show() {
@@ -78,7 +78,7 @@ void DialogPrompt::askForChoice() {
 std::optional<std::int64_t> DialogPrompt::choiceFor(const std::string& line) const {
   const std::string typed = lowercase(trimmed(line));
   for (const Button& button : buttons_) {
-    if (typed.empty() && button.exitCode == VendDialogButton::kOK) return button.exitCode;
+    if (typed.empty() && button.exitCode == DialogAgentProtocol::kOK) return button.exitCode;
     if (typed == std::to_string(button.exitCode) || typed == roleWord(button.exitCode) ||
         typed == lowercase(button.title)) {
       return button.exitCode;
@@ -87,7 +87,7 @@ std::optional<std::int64_t> DialogPrompt::choiceFor(const std::string& line) con
   return std::nullopt;
 }
 
-std::optional<VendDialogAnswer> DialogPrompt::take(const std::string& line) {
+std::optional<DialogAgentProtocol::Answer> DialogPrompt::take(const std::string& line) {
   switch (step_) {
     case Step::kChoice: {
       std::optional<std::int64_t> choice = choiceFor(line);
@@ -96,7 +96,8 @@ std::optional<VendDialogAnswer> DialogPrompt::take(const std::string& line) {
         askForChoice();
         return std::nullopt;
       }
-      if (!signIn_ || *choice != VendDialogButton::kOK) return VendDialogAnswer{*choice, {}};
+      if (!signIn_ || *choice != DialogAgentProtocol::kOK)
+        return DialogAgentProtocol::Answer{*choice, {}};
       chosen_ = *choice;
       step_ = Step::kAccountName;
       const std::string suggested = textField(fields_, "accountName");
@@ -113,13 +114,14 @@ std::optional<VendDialogAnswer> DialogPrompt::take(const std::string& line) {
     }
     case Step::kPassword:
       out_ << "\n";
-      return VendDialogAnswer{chosen_, {{"accountName", accountName_}, {"password", line}}};
+      return DialogAgentProtocol::Answer{chosen_,
+                                         {{"accountName", accountName_}, {"password", line}}};
   }
   return std::nullopt;
 }
 
-VendDialogAnswer DialogPrompt::endOfInputAnswer() {
-  return VendDialogAnswer{VendDialogButton::kCancel, {}};
+DialogAgentProtocol::Answer DialogPrompt::endOfInputAnswer() {
+  return DialogAgentProtocol::Answer{DialogAgentProtocol::kCancel, {}};
 }
 
 }  // namespace larder

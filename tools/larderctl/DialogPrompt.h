@@ -6,8 +6,8 @@
 #include <string>
 #include <vector>
 
+#include "client/DialogAgentProtocol.h"
 #include "platform/plist/PlistValue.h"
-#include "store-runtime/dialogs/VendDialog.h"
 
 namespace larder {
 
@@ -25,9 +25,9 @@ class DialogPrompt {
   // Prints the dialog and the first question.
   void show();
   // Takes one typed line; the answer once nothing more is needed.
-  std::optional<VendDialogAnswer> take(const std::string& line);
+  std::optional<DialogAgentProtocol::Answer> take(const std::string& line);
   // The answer when the input ends before the dialog is complete.
-  static VendDialogAnswer endOfInputAnswer();
+  static DialogAgentProtocol::Answer endOfInputAnswer();
   // The next line is a password, which should not be echoed.
   [[nodiscard]] bool wantsSecret() const { return step_ == Step::kPassword; }
 
@@ -46,7 +46,7 @@ class DialogPrompt {
   std::vector<Button> buttons_;
   bool signIn_ = false;
   Step step_ = Step::kChoice;
-  std::int64_t chosen_ = VendDialogButton::kCancel;
+  std::int64_t chosen_ = DialogAgentProtocol::kCancel;
   std::string accountName_;
 };
 

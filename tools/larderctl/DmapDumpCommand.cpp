@@ -5,8 +5,8 @@
 #include <optional>
 
 #include "dmap/DAAPParser.h"
+#include "platform/plist/JsonConversion.h"
 #include "platform/system/FileIO.h"
-#include "store-runtime/core/JsonConversion.h"
 
 namespace larder {
 namespace {

@@ -4,8 +4,8 @@
 #include <iostream>
 #include <vector>
 
-#include "AssetService/DBusValueCodec.h"
-#include "store-runtime/core/JsonConversion.h"
+#include "client/DBusValueCodec.h"
+#include "platform/plist/JsonConversion.h"
 
 namespace larder {
 

@@ -2,7 +2,7 @@
 
 #include <cstdint>
 
-#include "AssetService/RequestTable.h"
+#include "client/ServiceRequests.h"
 #include "platform/plist/PlistValue.h"
 
 namespace larder {

@@ -5,7 +5,7 @@
 #include <map>
 #include <thread>
 
-#include "store-runtime/core/JsonConversion.h"
+#include "platform/plist/JsonConversion.h"
 #include "tools/larderctl/ProgressBar.h"
 
 namespace larder {

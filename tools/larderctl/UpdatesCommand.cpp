@@ -4,7 +4,7 @@
 #include <iostream>
 #include <sstream>
 
-#include "store-runtime/core/JsonConversion.h"
+#include "platform/plist/JsonConversion.h"
 
 namespace larder {
 namespace {

@@ -2,7 +2,7 @@
 
 #include <cstdint>
 
-#include "AssetService/ServiceClient.h"
+#include "client/ServiceClient.h"
 #include "platform/plist/PlistValue.h"
 
 namespace larder {

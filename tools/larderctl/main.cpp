@@ -6,11 +6,11 @@
 #include <cstdio>
 #include <iostream>
 
-#include "AssetService/DBusValueCodec.h"
-#include "AssetService/RequestTable.h"
-#include "AssetService/ServiceClient.h"
+#include "client/DBusValueCodec.h"
+#include "client/ServiceClient.h"
+#include "client/ServiceRequests.h"
+#include "platform/plist/JsonConversion.h"
 #include "platform/system/StopSignals.h"
-#include "store-runtime/core/JsonConversion.h"
 #include "tools/larderctl/DialogAgentCommand.h"
 #include "tools/larderctl/DialogCommand.h"
 #include "tools/larderctl/DmapDumpCommand.h"
@@ -40,7 +40,7 @@ ServiceClient connect(const GlobalOptions& options) {
 
 // Arguments of `call`, read by the request's signature: scalars as
 // written, containers as JSON.
-PlistArray parseArguments(const RequestDescriptor& request, const std::vector<std::string>& words) {
+PlistArray parseArguments(const RequestSignature& request, const std::vector<std::string>& words) {
   std::vector<std::string> types = DBusValueCodec::splitSignature(request.inSignature);
   if (types.size() != words.size()) {
     throw CLI::ValidationError(std::string(request.member) + " takes " +
@@ -115,7 +115,7 @@ int runWatch(const GlobalOptions& options) {
 
 int runCall(const GlobalOptions& options, const std::string& member,
             const std::vector<std::string>& words) {
-  const RequestDescriptor* request = RequestTable::find(member);
+  const RequestSignature* request = ServiceRequests::find(member);
   if (!request) {
     std::cerr << "larderctl: no request named " << member << std::endl;
     return 2;

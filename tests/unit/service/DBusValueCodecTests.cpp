@@ -9,7 +9,7 @@
 #include <map>
 #include <string>
 
-#include "AssetService/DBusValueCodec.h"
+#include "client/DBusValueCodec.h"
 
 // sdbus-c++ 1.2 builds its own variants on a message made without any bus
 // connection; the function is exported but not declared in its headers.

@@ -11,9 +11,9 @@
 #include <vector>
 
 #include "AssetService/AssetServiceInterface.h"
-#include "AssetService/DBusValueCodec.h"
+#include "client/DBusValueCodec.h"
 #include "AssetService/RequestTable.h"
-#include "AssetService/ServiceError.h"
+#include "client/ServiceError.h"
 #include "ServiceTestSupport.h"
 
 #ifndef LARDER_SOURCE_DIR
@@ -216,7 +216,7 @@ TEST(RequestTable, IntrospectionMatchesTheCommittedInterfaceFile) {
   ASSERT_TRUE(file) << committedPath << " is missing";
   std::stringstream committed;
   committed << file.rdbuf();
-  std::string generated = RequestTable::introspectionXml();
+  std::string generated = ServiceRequests::introspectionXml();
   EXPECT_EQ(generated, committed.str()) << "regenerate " << committedPath;
 
   // Whatever is committed, it must describe the table.

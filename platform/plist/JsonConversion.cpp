@@ -1,4 +1,4 @@
-#include "store-runtime/core/JsonConversion.h"
+#include "platform/plist/JsonConversion.h"
 
 #include <array>
 #include <cmath>

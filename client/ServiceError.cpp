@@ -1,4 +1,4 @@
-#include "AssetService/ServiceError.h"
+#include "client/ServiceError.h"
 
 namespace larder {
 

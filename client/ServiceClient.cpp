@@ -1,11 +1,11 @@
-#include "AssetService/ServiceClient.h"
+#include "client/ServiceClient.h"
 
 #include <stdexcept>
 
-#include "AssetService/DBusValueCodec.h"
-#include "AssetService/DialogAgentRegistry.h"
-#include "AssetService/RequestTable.h"
-#include "AssetService/StoreRuntimeInterface.h"
+#include "client/DBusValueCodec.h"
+#include "client/DialogAgentProtocol.h"
+#include "client/ServiceRequests.h"
+#include "client/StoreRuntimeProtocol.h"
 #include "platform/system/Environment.h"
 #include "store-runtime/core/VendStoreClient.h"
 
@@ -21,7 +21,8 @@ ServiceClient::ServiceClient(std::unique_ptr<sdbus::IConnection> connection,
                              const std::string& serviceName, std::uint64_t timeoutMicroseconds)
     : connection_(std::move(connection)),
       serviceName_(serviceName),
-      proxy_(sdbus::createProxy(*connection_, serviceName, std::string(RequestTable::kObjectPath))),
+      proxy_(
+          sdbus::createProxy(*connection_, serviceName, std::string(ServiceRequests::kObjectPath))),
       timeout_(timeoutMicroseconds) {
   connection_->enterEventLoopAsync();
 }
@@ -33,10 +34,10 @@ void ServiceClient::presentStoreClient(std::int64_t clientType) {
 
 PlistArray ServiceClient::call(const std::string& member, const PlistArray& arguments,
                                std::uint64_t timeoutMicroseconds) {
-  const RequestDescriptor* request = RequestTable::find(member);
+  const RequestSignature* request = ServiceRequests::find(member);
   if (!request) throw std::invalid_argument("unknown request " + member);
   sdbus::MethodCall message =
-      proxy_->createMethodCall(std::string(RequestTable::kInterfaceName), member);
+      proxy_->createMethodCall(std::string(ServiceRequests::kInterfaceName), member);
   DBusValueCodec::writeAll(message, request->inSignature, arguments);
   sdbus::MethodReply reply =
       proxy_->callMethod(message, timeoutMicroseconds != 0 ? timeoutMicroseconds : timeout_);
@@ -45,16 +46,17 @@ PlistArray ServiceClient::call(const std::string& member, const PlistArray& argu
 
 PlistArray ServiceClient::callDialogAgents(const std::string& member, const PlistArray& arguments,
                                            std::uint64_t timeoutMicroseconds) {
-  const BusMethod* method = DialogAgentRegistry::findMethod(member);
+  const BusMethod* method = DialogAgentProtocol::findRegistryMethod(member);
   if (!method) throw std::invalid_argument("unknown dialog agent request " + member);
-  return callMethod(DialogAgentRegistry::kInterfaceName, *method, arguments, timeoutMicroseconds);
+  return callMethod(DialogAgentProtocol::kRegistryInterfaceName, *method, arguments,
+                    timeoutMicroseconds);
 }
 
 PlistArray ServiceClient::callStoreRuntime(const std::string& member, const PlistArray& arguments,
                                            std::uint64_t timeoutMicroseconds) {
-  const BusMethod* method = StoreRuntimeInterface::findMethod(member);
+  const BusMethod* method = StoreRuntimeProtocol::findMethod(member);
   if (!method) throw std::invalid_argument("unknown store runtime request " + member);
-  return callMethod(StoreRuntimeInterface::kInterfaceName, *method, arguments, timeoutMicroseconds);
+  return callMethod(StoreRuntimeProtocol::kInterfaceName, *method, arguments, timeoutMicroseconds);
 }
 
 PlistArray ServiceClient::callMethod(std::string_view interfaceName, const BusMethod& method,
@@ -72,7 +74,7 @@ void ServiceClient::exportSoftwareMapObserver(
     const std::string& objectPath, std::function<void(const PlistValue&, std::int64_t)> onChange) {
   observer_ = sdbus::createObject(*connection_, objectPath);
   observer_->registerMethod(
-      std::string(RequestTable::kCallbackInterfacePrefix) + "VendSoftwareMapObserver",
+      std::string(ServiceRequests::kCallbackInterfacePrefix) + "VendSoftwareMapObserver",
       "SoftwareProductUpdatedState", "a{sv}x", "",
       [onChange = std::move(onChange)](sdbus::MethodCall call) {
         PlistArray arguments = DBusValueCodec::readAll(call, "a{sv}x");

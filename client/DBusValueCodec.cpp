@@ -1,4 +1,4 @@
-#include "AssetService/DBusValueCodec.h"
+#include "client/DBusValueCodec.h"
 
 #include <algorithm>
 #include <array>

@@ -5,7 +5,7 @@
 
 #include <memory>
 #include <string>
-#include "AssetService/BusMethod.h"
+#include "client/BusMethod.h"
 
 #include <sdbus-c++/IConnection.h>
 #include <sdbus-c++/IObject.h>

@@ -5,35 +5,15 @@
 #include <span>
 #include <string>
 #include <string_view>
-#include <vector>
 
 #include <sdbus-c++/Error.h>
 #include <sdbus-c++/IObject.h>
 #include <sdbus-c++/Message.h>
 
-#include "AssetService/ServiceError.h"
+#include "client/BusMethod.h"
+#include "client/ServiceError.h"
 
 namespace larder {
-
-// One method of an interface the service exports beside its request
-// table, as the bus describes it.
-struct BusMethod {
-  std::string_view member;
-  std::string_view inSignature;
-  std::vector<std::string> inNames;
-  std::string_view outSignature;
-  std::vector<std::string> outNames;
-  // Sent without waiting for an answer.
-  bool noReply = false;
-};
-
-// The method of `methods` named `member`, or null.
-inline const BusMethod* findBusMethod(std::span<const BusMethod> methods, std::string_view member) {
-  for (const BusMethod& method : methods) {
-    if (method.member == member) return &method;
-  }
-  return nullptr;
-}
 
 // Adds `methods` of `interfaceName` to the object, each handled by the
 // target's member function of the same name. A D-Bus error thrown by a
