@@ -44,6 +44,7 @@
 #include "store-runtime/http/VendGzip.h"
 #include "store-runtime/http/VendHTTPTransfer.h"
 #include "tests/unit/ScopedEnvironment.h"
+#include "tests/unit/runtime/UnprivilegedUser.h"
 
 namespace larder {
 namespace {
@@ -884,10 +885,11 @@ TEST_F(RuntimeFacilityTest, InstallableMeansAReplaceableBundleInAnApplicationFol
 }
 
 TEST_F(RuntimeFacilityTest, BundleInAFolderWeCannotWriteIsNotInstallable) {
-  if (::geteuid() == 0) GTEST_SKIP() << "permissions do not bind the superuser";
   std::string locked = rooted("/Applications/Locked");
   std::string lockedBundle =
       makeBundle(locked + "/Held.app", {{"HostBundleIdentifier", "com.example.app"}});
+  testing::UnprivilegedUser user(temporary_);
+  ASSERT_EQ(user.failure(), "");
   ASSERT_TRUE(VendFileManager::isInstallableAtPath(lockedBundle));
   ASSERT_EQ(::chmod(locked.c_str(), 0555), 0);
   lockedFolders_.push_back(locked);

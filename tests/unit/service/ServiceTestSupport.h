@@ -79,6 +79,14 @@ class LogCapture {
     }));
   }
 
+  // Exactly one line equal to `text` (at `level`, any when 0); on failure
+  // the message shows the whole log.
+  [[nodiscard]] ::testing::AssertionResult hasOnce(std::string_view text, int level = 0) const {
+    const std::size_t count = countExactly(text, level);
+    if (count == 1) return ::testing::AssertionSuccess();
+    return ::testing::AssertionFailure() << count << " lines \"" << text << "\" in:\n" << dump();
+  }
+
   [[nodiscard]] std::size_t countContaining(std::string_view fragment, int level = 0) const {
     std::lock_guard lock(mutex_);
     return static_cast<std::size_t>(std::count_if(lines_.begin(), lines_.end(), [&](const Line& l) {

@@ -97,12 +97,11 @@ TEST_F(SoftwareMapExpectedChangesTest, UpdateThatDidNotHappenOnlyClearsTheExpect
   expectNoExpectation(fields);
   EXPECT_EQ(fields.bundleVersion, "1.0");
   EXPECT_TRUE(observer_->calls().empty());
-  EXPECT_EQ(log.countExactly("SoftwareMap: Update did not happen, removed expectations of a product "
-                             "change at path: " +
-                                 path_,
-                             3),
-            1U)
-      << log.dump();
+  EXPECT_TRUE(
+      log.hasOnce("SoftwareMap: Update did not happen, removed expectations of a product "
+                  "change at path: " +
+                      path_,
+                  3));
 }
 
 TEST_F(SoftwareMapExpectedChangesTest, ReportsAboutUnknownPathsAreLoggedAndIgnored) {
@@ -111,18 +110,14 @@ TEST_F(SoftwareMapExpectedChangesTest, ReportsAboutUnknownPathsAreLoggedAndIgnor
   map_->productAtPathWillBeUpdatedToBundleVersionStoreVersion(unknown, "2.0", 1);
   map_->productAtPathWasUpdatedToBundleVersionStoreVersion(unknown, true, "2.0", 1);
   map_->waitUntilIdle();
-  EXPECT_EQ(log.countExactly(
-                "SoftwareMap: ERROR: No software product was found for update reported at path: " +
-                    unknown,
-                3),
-            1U)
-      << log.dump();
-  EXPECT_EQ(log.countExactly("SoftwareMap: ERROR: No software product was found for completed "
-                             "update reported at path: " +
-                                 unknown,
-                             3),
-            1U)
-      << log.dump();
+  EXPECT_TRUE(log.hasOnce(
+      "SoftwareMap: ERROR: No software product was found for update reported at path: " + unknown,
+      3));
+  EXPECT_TRUE(
+      log.hasOnce("SoftwareMap: ERROR: No software product was found for completed "
+                  "update reported at path: " +
+                      unknown,
+                  3));
   expectNoExpectation(record_->snapshot());
   EXPECT_TRUE(observer_->calls().empty());
 }
@@ -133,16 +128,14 @@ TEST_F(SoftwareMapExpectedChangesTest, VersionsOtherThanExpectedAreReported) {
   replaceBundleWith("2.5", 625);
   map_->productAtPathWasUpdatedToBundleVersionStoreVersion(path_, true, "3.0", 630);
   map_->waitUntilIdle();
-  EXPECT_EQ(log.countExactly("SoftwareMap: Changed product bundle version (2.5) does not match "
-                             "expected value (3.0)",
-                             1),
-            1U)
-      << log.dump();
-  EXPECT_EQ(log.countExactly("SoftwareMap: Changed product bundle version (625) does not match "
-                             "expected value (630)",
-                             1),
-            1U)
-      << log.dump();
+  EXPECT_TRUE(
+      log.hasOnce("SoftwareMap: Changed product bundle version (2.5) does not match "
+                  "expected value (3.0)",
+                  1));
+  EXPECT_TRUE(
+      log.hasOnce("SoftwareMap: Changed product bundle version (625) does not match "
+                  "expected value (630)",
+                  1));
   LedgerSoftwareProductFields fields = record_->snapshot();
   EXPECT_EQ(fields.bundleVersion, "2.5");
   expectNoExpectation(fields);

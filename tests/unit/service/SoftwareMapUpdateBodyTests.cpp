@@ -101,9 +101,17 @@ class SoftwareMapUpdateBodyTest : public ServiceTest {
     return entries;
   }
 
-  static LedgerSoftwareProductFields storedRecord(const std::string& path) {
+  static LedgerSoftwareProductFields storedRecord(
+      const std::string& path, std::optional<std::string> identifier = std::nullopt,
+      std::optional<std::string> version = std::nullopt,
+      std::optional<std::uint64_t> item = std::nullopt,
+      std::optional<std::int64_t> versionIdentifier = std::nullopt) {
     LedgerSoftwareProductFields fields;
     fields.bundlePath = path;
+    fields.bundleIdentifier = std::move(identifier);
+    fields.bundleVersion = std::move(version);
+    fields.itemIdentifier = item;
+    fields.versionIdentifier = versionIdentifier;
     fields.installed = true;
     fields.source = LedgerSoftwareProduct::kSourceRegistryOrPurchaseRecord;
     return fields;
@@ -155,23 +163,17 @@ class SoftwareMapUpdateBodyTest : public ServiceTest {
 // MARK: installed software
 
 TEST_F(SoftwareMapUpdateBodyTest, InstalledEntriesCarryTheRecordsValuesAndLeaveOutAbsentOnes) {
-  LedgerSoftwareProductFields full = storedRecord(rootApplications() + "/Full.app");
-  full.bundleIdentifier = "com.example.full";
-  full.bundleVersion = "2.4.1";
-  full.itemIdentifier = 7001;
-  full.versionIdentifier = 101;
+  LedgerSoftwareProductFields full =
+      storedRecord(rootApplications() + "/Full.app", "com.example.full", "2.4.1", 7001, 101);
   full.accountOpaqueID = "not sent";
-  LedgerSoftwareProductFields sparse = storedRecord(rootApplications() + "/Sparse.app");
-  sparse.bundleIdentifier = "com.example.sparse";
-  sparse.itemIdentifier = 7002;
-  LedgerSoftwareProductFields nameless = storedRecord(homeApplications() + "/Nameless.app");
-  nameless.itemIdentifier = std::numeric_limits<std::uint64_t>::max();
-  nameless.versionIdentifier = -5;
-  nameless.bundleVersion = "0";
+  LedgerSoftwareProductFields sparse =
+      storedRecord(rootApplications() + "/Sparse.app", "com.example.sparse", std::nullopt, 7002);
+  LedgerSoftwareProductFields nameless =
+      storedRecord(homeApplications() + "/Nameless.app", std::nullopt, "0",
+                   std::numeric_limits<std::uint64_t>::max(), -5);
   // The OS installer has no item identifier and is not sent.
-  LedgerSoftwareProductFields installer = storedRecord(rootApplications() + "/Setup.app");
-  installer.bundleIdentifier = "com.example.setup";
-  installer.bundleVersion = "5.0";
+  LedgerSoftwareProductFields installer =
+      storedRecord(rootApplications() + "/Setup.app", "com.example.setup", "5.0");
   auto map = mapWithRecords({full, sparse, nameless, installer});
 
   LogCapture log;
@@ -194,8 +196,7 @@ TEST_F(SoftwareMapUpdateBodyTest, InstalledEntriesCarryTheRecordsValuesAndLeaveO
   };
   EXPECT_EQ(entries, expected);
 
-  EXPECT_EQ(log.countExactly("SoftwareMap: installed: 1; bundled: 0; conditional: 0", 2), 1U)
-      << log.dump();
+  EXPECT_TRUE(log.hasOnce("SoftwareMap: installed: 1; bundled: 0; conditional: 0", 2));
   // The same dictionary goes to the side file at level 3.
   std::optional<PlistData> side = FileIO::read(stateFolder() + "/UpdateQueueRequstBody.plist");
   ASSERT_TRUE(side.has_value());
@@ -266,11 +267,7 @@ TEST_F(SoftwareMapUpdateBodyTest, TextThatLooksLikeMarkupSurvivesTheTrip) {
   hostile.bundleIdentifier = "com.example.<dict>&amp;</string>]]>\"'";
   hostile.bundleVersion = "ü€😀 \t1.0\n ";
   hostile.itemIdentifier = 1;
-  LedgerSoftwareProductFields empty = storedRecord(rootApplications() + "/Empty.app");
-  empty.bundleIdentifier = "";
-  empty.bundleVersion = "";
-  empty.itemIdentifier = 2;
-  empty.versionIdentifier = 0;
+  LedgerSoftwareProductFields empty = storedRecord(rootApplications() + "/Empty.app", "", "", 2, 0);
   auto map = mapWithRecords({hostile, empty});
 
   std::map<std::string, PlistValue> entries =
@@ -304,12 +301,11 @@ TEST_F(SoftwareMapUpdateBodyTest, BundledEntriesFollowTheManifestInItsOrder) {
   expected.emplace_back(PlistDictionary{});
   EXPECT_EQ(parsedBody(body), (PlistDictionary{{"bundled-software", expected}}));
   EXPECT_TRUE(body.hadBundledApps);
-  EXPECT_EQ(log.countExactly("SoftwareMap: Bundled applications manifest row 1 is not a "
-                             "dictionary, skipping it",
-                             1),
-            1U)
-      << log.dump();
-  EXPECT_EQ(log.countExactly("SoftwareMap: installed: 0; bundled: 1; conditional: 0", 2), 1U);
+  EXPECT_TRUE(
+      log.hasOnce("SoftwareMap: Bundled applications manifest row 1 is not a "
+                  "dictionary, skipping it",
+                  1));
+  EXPECT_TRUE(log.hasOnce("SoftwareMap: installed: 0; bundled: 1; conditional: 0", 2));
 }
 
 TEST_F(SoftwareMapUpdateBodyTest, TheManifestIsReadOnceForTheWholeProcess) {
@@ -421,9 +417,8 @@ TEST_F(SoftwareMapUpdateBodyTest, ThreadsThatMeetAtTheFirstReadAllSeeTheWholeLis
 
 TEST_F(SoftwareMapUpdateBodyTest, TheConditionAloneAlsoBringsTheBundledList) {
   writeManifest(manifestRows());
-  LedgerSoftwareProductFields record = storedRecord(rootApplications() + "/Only.app");
-  record.bundleIdentifier = "com.example.only";
-  record.itemIdentifier = 42;
+  LedgerSoftwareProductFields record =
+      storedRecord(rootApplications() + "/Only.app", "com.example.only", std::nullopt, 42);
   auto map = mapWithRecords({record});
   const PlistArray local{
       PlistDictionary{{"ware-id", "42"}, {"HostBundleIdentifier", "com.example.only"}}};
@@ -468,7 +463,7 @@ TEST_F(SoftwareMapUpdateBodyTest, TheConditionAloneAlsoBringsTheBundledList) {
     EXPECT_EQ(parsedBody(body), c.expected);
     EXPECT_EQ(body.hadBundledApps, c.touchesHadBundledApps)
         << "set to true when the list is made, and only then";
-    EXPECT_EQ(log.countExactly("SoftwareMap: " + c.logLine, 2), 1U) << log.dump();
+    EXPECT_TRUE(log.hasOnce("SoftwareMap: " + c.logLine, 2));
   }
 }
 
@@ -502,7 +497,7 @@ TEST_F(SoftwareMapUpdateBodyTest, ACompressedBodyIsTheGzipOfTheSameXml) {
   std::optional<PlistData> unzipped = VendCopyGunzippedDataForData(*zipped.data);
   ASSERT_TRUE(unzipped.has_value());
   EXPECT_EQ(*unzipped, *plain.data);
-  EXPECT_EQ(log.countExactly("SoftwareMap: Compressed the request body", 2), 1U) << log.dump();
+  EXPECT_TRUE(log.hasOnce("SoftwareMap: Compressed the request body", 2));
   EXPECT_EQ(log.countContaining("Could not zip"), 0U);
 
   // Out arguments may be absent.
@@ -525,21 +520,15 @@ class SoftwareMapUpgradePathTest : public SoftwareMapUpdateBodyTest {
 TEST_F(SoftwareMapUpgradePathTest, AMappedCopyIsTheAnswerWhateverTheVersion) {
   std::string mapped =
       makeStoreBundle(rootApplications(), "Mapped", "com.example.mapped", "5.0", 1);
-  LedgerSoftwareProductFields record = storedRecord(mapped);
-  record.bundleIdentifier = "com.example.mapped";
-  record.bundleVersion = "5.0";
-  record.itemIdentifier = 1;
+  LedgerSoftwareProductFields record = storedRecord(mapped, "com.example.mapped", "5.0", 1);
   auto map = mapWithRecords({record});
 
   for (const std::string version : {"0.1", "5.0", "6.0", ""}) {
     SCOPED_TRACE(version);
     LogCapture log;
     EXPECT_EQ(upgradePath(*map, "com.example.mapped", version), mapped);
-    EXPECT_EQ(log.countExactly("SoftwareMap: Found app at " + mapped +
-                                   " using SoftwareMap to upgrade to " + version,
-                               1),
-              1U)
-        << log.dump();
+    EXPECT_TRUE(log.hasOnce(
+        "SoftwareMap: Found app at " + mapped + " using SoftwareMap to upgrade to " + version, 1));
   }
 }
 
@@ -548,20 +537,16 @@ TEST_F(SoftwareMapUpgradePathTest, AMappedCopyThatCannotBeReplacedEndsTheSearch)
   // with the same identifier is not looked for.
   std::string gone = rootApplications() + "/Gone.app";
   std::string onDisk = makeStoreBundle(homeApplications(), "Gone", "com.example.gone", "1.0", 2);
-  LedgerSoftwareProductFields record = storedRecord(gone);
-  record.bundleIdentifier = "com.example.gone";
-  record.bundleVersion = "1.0";
+  LedgerSoftwareProductFields record = storedRecord(gone, "com.example.gone", "1.0");
   auto map = mapWithRecords({record});
 
   LogCapture log;
   EXPECT_EQ(upgradePath(*map, "com.example.gone", "2.0"), std::nullopt) << onDisk;
-  EXPECT_EQ(log.countExactly("SoftwareMap: Found app at " + gone +
-                                 " using SoftwareMap but it is not upgradable, "
-                                 "productPathToUpgradeForBundleIdentifier:versionNumber will "
-                                 "return nil",
-                             1),
-            1U)
-      << log.dump();
+  EXPECT_TRUE(log.hasOnce("SoftwareMap: Found app at " + gone +
+                              " using SoftwareMap but it is not upgradable, "
+                              "productPathToUpgradeForBundleIdentifier:versionNumber will "
+                              "return nil",
+                          1));
   EXPECT_EQ(log.countContaining("AppRegistry"), 0U);
   EXPECT_EQ(log.countContaining("No app was found"), 0U);
 }
@@ -581,21 +566,18 @@ TEST_F(SoftwareMapUpgradePathTest, AnUnmappedStoreCopyIsTheAnswerOnlyForANewerVe
     std::optional<std::string> path = upgradePath(*map, "com.example.loose", c.requested);
     if (c.replaces) {
       EXPECT_EQ(path, loose);
-      EXPECT_EQ(log.countExactly("SoftwareMap: Found app at " + loose +
-                                     " with bundle ID com.example.loose using AppRegistry to "
-                                     "upgrade to " +
-                                     c.requested,
-                                 1),
-                1U)
-          << log.dump();
+      EXPECT_TRUE(log.hasOnce("SoftwareMap: Found app at " + loose +
+                                  " with bundle ID com.example.loose using AppRegistry to "
+                                  "upgrade to " +
+                                  c.requested,
+                              1));
     } else {
       EXPECT_EQ(path, std::nullopt);
-      EXPECT_EQ(log.countExactly("SoftwareMap: No app was found with bundle ID com.example.loose "
-                                 "to upgrade to " +
-                                     c.requested,
-                                 1),
-                1U)
-          << log.dump();
+      EXPECT_TRUE(
+          log.hasOnce("SoftwareMap: No app was found with bundle ID com.example.loose "
+                      "to upgrade to " +
+                          c.requested,
+                      1));
     }
   }
 }
@@ -610,31 +592,23 @@ TEST_F(SoftwareMapUpgradePathTest,
 
   LogCapture log;
   EXPECT_EQ(upgradePath(*map, "com.example.plain", "2.0"), std::nullopt);
-  EXPECT_EQ(
-      log.countExactly(
-          "SoftwareMap: isQuaymartAppAtPath or isUpdatableAtPath failed for app at " + plain, 3),
-      1U)
-      << log.dump();
-  EXPECT_EQ(
-      log.countExactly(
-          "SoftwareMap: No app was found with bundle ID com.example.plain to upgrade to 2.0", 1),
-      1U);
+  EXPECT_TRUE(log.hasOnce(
+      "SoftwareMap: isQuaymartAppAtPath or isUpdatableAtPath failed for app at " + plain, 3));
+  EXPECT_TRUE(log.hasOnce(
+      "SoftwareMap: No app was found with bundle ID com.example.plain to upgrade to 2.0", 1));
 
   log.clear();
   EXPECT_EQ(upgradePath(*map, "com.example.unversioned", "2.0"), std::nullopt) << unversioned;
   EXPECT_EQ(log.countContaining("isQuaymartAppAtPath or isUpdatableAtPath failed"), 0U);
-  EXPECT_EQ(log.countExactly("SoftwareMap: No app was found with bundle ID "
-                             "com.example.unversioned to upgrade to 2.0",
-                             1),
-            1U);
+  EXPECT_TRUE(
+      log.hasOnce("SoftwareMap: No app was found with bundle ID "
+                  "com.example.unversioned to upgrade to 2.0",
+                  1));
 
   log.clear();
   EXPECT_EQ(upgradePath(*map, "com.example.nowhere", "1.0"), std::nullopt);
-  EXPECT_EQ(
-      log.countExactly(
-          "SoftwareMap: No app was found with bundle ID com.example.nowhere to upgrade to 1.0", 1),
-      1U)
-      << log.dump();
+  EXPECT_TRUE(log.hasOnce(
+      "SoftwareMap: No app was found with bundle ID com.example.nowhere to upgrade to 1.0", 1));
 }
 
 // MARK: pushed installs
@@ -643,21 +617,16 @@ TEST_F(SoftwareMapUpgradePathTest, APushIsAllowedWhereItReplacesAStoreCopyOrFind
   // In the map, a store copy in an application folder.
   std::string mapped =
       makeStoreBundle(rootApplications(), "Mapped", "com.example.mapped", "5.0", 1);
-  LedgerSoftwareProductFields mappedRecord = storedRecord(mapped);
-  mappedRecord.bundleIdentifier = "com.example.mapped";
-  mappedRecord.bundleVersion = "5.0";
-  mappedRecord.itemIdentifier = 1;
+  LedgerSoftwareProductFields mappedRecord = storedRecord(mapped, "com.example.mapped", "5.0", 1);
   // In the map, a store copy outside the application folders: the path to
   // replace is found but may not be installed over, and no other copy
   // stands in the way.
   std::string aside =
       makeStoreBundle(temporary() + "/root/Elsewhere", "Aside", "com.example.aside", "1.0", 5);
-  LedgerSoftwareProductFields asideRecord = storedRecord(aside);
-  asideRecord.bundleIdentifier = "com.example.aside";
-  asideRecord.bundleVersion = "1.0";
+  LedgerSoftwareProductFields asideRecord = storedRecord(aside, "com.example.aside", "1.0");
   // In the map, a bundle that is gone.
-  LedgerSoftwareProductFields goneRecord = storedRecord(rootApplications() + "/Gone.app");
-  goneRecord.bundleIdentifier = "com.example.gone";
+  LedgerSoftwareProductFields goneRecord =
+      storedRecord(rootApplications() + "/Gone.app", "com.example.gone");
   auto map = mapWithRecords({mappedRecord, asideRecord, goneRecord});
   // Not in the map: a store copy that only a newer version replaces.
   makeStoreBundle(homeApplications(), "Loose", "com.example.loose", "3.0", 6);
@@ -679,13 +648,8 @@ TEST_F(SoftwareMapUpgradePathTest, AStoreCopyThatThePushCannotReplaceRefusesIt) 
   std::string plain =
       makeBundle(rootApplications(), "Dual", "com.example.dual", "2.0", std::nullopt);
   std::string store = makeStoreBundle(homeApplications(), "Dual", "com.example.dual", "1.0", 7);
-  LedgerSoftwareProductFields plainRecord = storedRecord(plain);
-  plainRecord.bundleIdentifier = "com.example.dual";
-  plainRecord.bundleVersion = "2.0";
-  LedgerSoftwareProductFields storeRecord = storedRecord(store);
-  storeRecord.bundleIdentifier = "com.example.dual";
-  storeRecord.bundleVersion = "1.0";
-  storeRecord.itemIdentifier = 7;
+  LedgerSoftwareProductFields plainRecord = storedRecord(plain, "com.example.dual", "2.0");
+  LedgerSoftwareProductFields storeRecord = storedRecord(store, "com.example.dual", "1.0", 7);
   auto map = mapWithRecords({plainRecord, storeRecord});
 
   ASSERT_EQ(upgradePath(*map, "com.example.dual", "3.0"), plain);

@@ -116,6 +116,13 @@ class UpdateQueueTest : public ServiceTest {
     return future.get();
   }
 
+  // Every change queued so far has been made and every delegate call it
+  // queued has been delivered: a count of calls taken after this is final.
+  static void settle() {
+    UpdateQueue::finishPendingWritesOfAllQueues();
+    DispatchQueue::globalQueue().barrierSync([] {});
+  }
+
   static std::string cacheFile() { return UpdateQueue::cachePath().value_or(""); }
 
   static PlistDictionary cacheContents() {

@@ -217,7 +217,7 @@ TEST_F(UpdateQueueTest, AFailedCheckLeavesListsFileAndDelegateAlone) {
   const FileStamp after = stampOf(cacheFile());
   EXPECT_EQ(after.bytes, stamp.bytes);
   EXPECT_EQ(after.modifiedNanoseconds, stamp.modifiedNanoseconds);
-  std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  settle();
   EXPECT_EQ(delegate->calls(), 1U);
 }
 
@@ -367,8 +367,7 @@ TEST_F(CachedUpdateQueueTest, LookupsAndMarksFollowTheListOrder) {
   EXPECT_EQ(identifiersOf(*makeQueue()->availableUpdates()), (std::vector<std::uint64_t>{102, 103}))
       << "the removal is saved";
   // Staging tells nobody; two abort codes and the removal do.
-  EXPECT_EQ(delegate->waitForCalls(3), 3U);
-  std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  settle();
   EXPECT_EQ(delegate->calls(), 3U);
   // A snapshot taken before stays as it was.
   EXPECT_EQ(list->size(), 4U);
