@@ -26,19 +26,18 @@ void exportBusMethods(
     const std::shared_ptr<Target>& target) {
   for (const BusMethod& method : methods) {
     auto handler = handlers.at(method.member);
-    object.registerMethod(
-        std::string(interfaceName), std::string(method.member), std::string(method.inSignature),
-        method.inNames, std::string(method.outSignature), method.outNames,
-        [target, handler](sdbus::MethodCall call) {
-          try {
-            ((*target).*handler)(call);
-          } catch (const sdbus::Error& error) {
-            call.createErrorReply(error).send();
-          } catch (const std::exception& failure) {
-            call.createErrorReply(sdbus::Error(std::string(ServiceError::kFailed), failure.what()))
-                .send();
-          }
-        });
+    object.registerMethod(std::string(interfaceName), std::string(method.member),
+                          std::string(method.inSignature), method.inNames,
+                          std::string(method.outSignature), method.outNames,
+                          [target, handler](sdbus::MethodCall call) {
+                            try {
+                              ((*target).*handler)(call);
+                            } catch (const sdbus::Error& error) {
+                              call.createErrorReply(error).send();
+                            } catch (const std::exception& failure) {
+                              call.createErrorReply(ServiceError::failed(failure.what())).send();
+                            }
+                          });
   }
 }
 

@@ -48,15 +48,6 @@ class DBusSoftwareMapObserver final : public VendSoftwareMapObserver {
   std::unique_ptr<sdbus::IProxy> proxy_;
 };
 
-void sendError(sdbus::MethodCall& call, const ServiceError& error) {
-  try {
-    call.createErrorReply(sdbus::Error(error.name(), error.what())).send();
-  } catch (const sdbus::Error& failure) {
-    TILL_LOG(2, "%@: Error answer to %@ not delivered: %@", kSpeaker, call.getSender(),
-             failure.getMessage());
-  }
-}
-
 }  // namespace
 
 class ServiceListener::RemoteObjects final : public RemoteObjectFactory {
@@ -117,6 +108,7 @@ void ServiceListener::resume() {
 
 void ServiceListener::stopServing() {
   if (!connection_) return;
+  answerPendingCallsStopping();
   try {
     connection_->releaseName(serviceName_);
   } catch (const sdbus::Error& error) {
@@ -153,21 +145,24 @@ void ServiceListener::peerDidChangeOwner(sdbus::Message& signal) {
 }
 
 void ServiceListener::dispatch(const RequestDescriptor& request, sdbus::MethodCall call) {
+  auto pending = std::make_shared<PendingCall>(std::move(call), request.member);
   PlistArray arguments;
   try {
-    arguments = DBusValueCodec::readAll(call, request.inSignature);
+    arguments = pending->readArguments(request.inSignature);
   } catch (const sdbus::Error& error) {
-    call.createErrorReply(error).send();
+    pending->fail(error);
     return;
   }
-  std::shared_ptr<AssetServiceInterface> interface = interfaceForPeer(call.getSender());
-  auto pending = std::make_shared<sdbus::MethodCall>(std::move(call));
+  // Only now may a stop answer the call from another thread.
+  if (!track(pending)) {
+    pending->fail(ServiceError::stopping(request.member));
+    return;
+  }
+  std::shared_ptr<AssetServiceInterface> interface = interfaceForPeer(pending->sender());
   ReplyHandler reply;
-  if (!pending->doesntExpectReply()) {
+  if (pending->expectsReply()) {
     reply = [pending, signature = request.outSignature](const PlistArray& outArguments) {
-      sdbus::MethodReply message = pending->createReply();
-      DBusValueCodec::writeAll(message, signature, outArguments);
-      message.send();
+      pending->reply(signature, outArguments);
     };
   }
   auto work = [&request, interface, arguments = std::move(arguments), reply, pending] {
@@ -175,11 +170,11 @@ void ServiceListener::dispatch(const RequestDescriptor& request, sdbus::MethodCa
       RequestTable::perform(request, *interface, arguments, reply);
       if (request.outSignature.empty() && reply) reply({});
     } catch (const ServiceError& error) {
-      TILL_LOG(2, "%@: %@ refused: %@", kSpeaker, request.selector, error.what());
-      if (reply) sendError(*pending, error);
+      TILL_LOG(2, "%@: %@ refused: %@", kSpeaker, request.selector, error.getMessage());
+      pending->fail(error);
     } catch (const std::exception& exception) {
       TILL_LOG(1, "%@: %@ failed: %@", kSpeaker, request.selector, exception.what());
-      if (reply) sendError(*pending, ServiceError::failed(exception.what()));
+      pending->fail(ServiceError::failed(exception.what()));
     }
   };
   if (request.direct) {
@@ -187,6 +182,33 @@ void ServiceListener::dispatch(const RequestDescriptor& request, sdbus::MethodCa
   } else {
     interface->requestQueue()->async(std::move(work));
   }
+}
+
+bool ServiceListener::track(const std::shared_ptr<PendingCall>& call) {
+  MutexLock lock(pendingMutex_);
+  if (stopping_) return false;
+  if (!call->expectsReply()) return true;
+  std::erase_if(pending_, [](const std::weak_ptr<PendingCall>& entry) {
+    auto open = entry.lock();
+    return !open || open->isAnswered();
+  });
+  pending_.push_back(call);
+  return true;
+}
+
+void ServiceListener::answerPendingCallsStopping() {
+  std::vector<std::weak_ptr<PendingCall>> open;
+  {
+    MutexLock lock(pendingMutex_);
+    stopping_ = true;
+    open.swap(pending_);
+  }
+  std::size_t answered = 0;
+  for (const auto& entry : open) {
+    auto call = entry.lock();
+    if (call && call->fail(ServiceError::stopping(call->member()))) ++answered;
+  }
+  if (answered > 0) TILL_LOG(2, "%@: %@ open requests answered as stopping", kSpeaker, answered);
 }
 
 }  // namespace larder

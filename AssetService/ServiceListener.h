@@ -3,6 +3,7 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <vector>
 
 #include <sdbus-c++/IConnection.h>
 #include <sdbus-c++/IObject.h>
@@ -10,6 +11,7 @@
 
 #include "AssetService/AssetServiceDelegate.h"
 #include "AssetService/AssetServiceInterface.h"
+#include "AssetService/PendingCall.h"
 #include "AssetService/RequestTable.h"
 #include "platform/system/Mutex.h"
 
@@ -39,8 +41,8 @@ class ServiceListener {
   // Connects, exports the object, takes the name and starts delivering
   // requests on the bus thread. Throws sdbus::Error when the bus refuses.
   void resume();
-  // Gives up the name and stops reading the bus: no request is taken after
-  // it. Replies to requests already taken are still sent.
+  // Answers every call still open with the Stopping error, gives up the
+  // name and stops reading the bus: no request is taken after it.
   void stopServing();
 
   [[nodiscard]] std::size_t connectionCount() const;
@@ -51,6 +53,10 @@ class ServiceListener {
   void dispatch(const RequestDescriptor& request, sdbus::MethodCall call);
   std::shared_ptr<AssetServiceInterface> interfaceForPeer(const std::string& peer);
   void peerDidChangeOwner(sdbus::Message& signal);
+  // Keeps a call that wants a reply until it is answered; false once the
+  // service is stopping.
+  bool track(const std::shared_ptr<PendingCall>& call) EXCLUDES(pendingMutex_);
+  void answerPendingCallsStopping() EXCLUDES(pendingMutex_);
 
   std::string serviceName_;
   SoftwareMap& softwareMap_;
@@ -64,6 +70,10 @@ class ServiceListener {
   mutable Mutex peersMutex_;
   std::map<std::string, std::shared_ptr<AssetServiceInterface>, std::less<>> peers_
       GUARDED_BY(peersMutex_);
+
+  Mutex pendingMutex_;
+  std::vector<std::weak_ptr<PendingCall>> pending_ GUARDED_BY(pendingMutex_);
+  bool stopping_ GUARDED_BY(pendingMutex_) = false;
 };
 
 }  // namespace larder

@@ -6,12 +6,14 @@
 #include <sdbus-c++/Error.h>
 #include <sdbus-c++/Types.h>
 
+#include "client/ServiceError.h"
+
 namespace larder {
 
 namespace {
 
 [[noreturn]] void refuse(const std::string& why) {
-  throw sdbus::Error("org.freedesktop.DBus.Error.InvalidArgs", why);
+  throw ServiceError::invalidArguments(why);
 }
 
 // Length of the complete type that starts at `signature[0]`.

@@ -4,6 +4,7 @@
 
 #include "client/DBusValueCodec.h"
 #include "client/DialogAgentProtocol.h"
+#include "client/ServiceError.h"
 #include "client/ServiceRequests.h"
 #include "client/StoreRuntimeProtocol.h"
 #include "platform/system/Environment.h"
@@ -35,7 +36,7 @@ void ServiceClient::presentStoreClient(std::int64_t clientType) {
 PlistArray ServiceClient::call(const std::string& member, const PlistArray& arguments,
                                std::uint64_t timeoutMicroseconds) {
   const RequestSignature* request = ServiceRequests::find(member);
-  if (!request) throw std::invalid_argument("unknown request " + member);
+  if (!request) throw ServiceError::unknownRequest(ServiceRequests::kInterfaceName, member);
   sdbus::MethodCall message =
       proxy_->createMethodCall(std::string(ServiceRequests::kInterfaceName), member);
   DBusValueCodec::writeAll(message, request->inSignature, arguments);
@@ -47,7 +48,8 @@ PlistArray ServiceClient::call(const std::string& member, const PlistArray& argu
 PlistArray ServiceClient::callDialogAgents(const std::string& member, const PlistArray& arguments,
                                            std::uint64_t timeoutMicroseconds) {
   const BusMethod* method = DialogAgentProtocol::findRegistryMethod(member);
-  if (!method) throw std::invalid_argument("unknown dialog agent request " + member);
+  if (!method)
+    throw ServiceError::unknownRequest(DialogAgentProtocol::kRegistryInterfaceName, member);
   return callMethod(DialogAgentProtocol::kRegistryInterfaceName, *method, arguments,
                     timeoutMicroseconds);
 }
@@ -55,7 +57,7 @@ PlistArray ServiceClient::callDialogAgents(const std::string& member, const Plis
 PlistArray ServiceClient::callStoreRuntime(const std::string& member, const PlistArray& arguments,
                                            std::uint64_t timeoutMicroseconds) {
   const BusMethod* method = StoreRuntimeProtocol::findMethod(member);
-  if (!method) throw std::invalid_argument("unknown store runtime request " + member);
+  if (!method) throw ServiceError::unknownRequest(StoreRuntimeProtocol::kInterfaceName, member);
   return callMethod(StoreRuntimeProtocol::kInterfaceName, *method, arguments, timeoutMicroseconds);
 }
 

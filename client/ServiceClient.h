@@ -28,7 +28,8 @@ class ServiceClient {
   void presentStoreClient(std::int64_t clientType);
 
   // Calls `member`; the reply's arguments in order. Throws sdbus::Error on
-  // a D-Bus error and std::invalid_argument for an unknown request.
+  // a D-Bus error, and ServiceError (UnknownRequest) for a member the
+  // client does not know, without sending anything.
   // A timeout of 0 is the client's.
   PlistArray call(const std::string& member, const PlistArray& arguments,
                   std::uint64_t timeoutMicroseconds = 0);

@@ -10,6 +10,7 @@
 #include <string>
 
 #include "client/DBusValueCodec.h"
+#include "client/ServiceError.h"
 
 // sdbus-c++ 1.2 builds its own variants on a message made without any bus
 // connection; the function is exported but not declared in its headers.
@@ -167,7 +168,7 @@ TEST(DBusValueCodec, DeepNestingIsRefused) {
   sdbus::PlainMessage message = sdbus::createPlainMessage();
   DBusValueCodec::writeAll(message, "a{sv}", {nestedDictionaries(20)});
   message.seal();
-  EXPECT_THROW(DBusValueCodec::readAll(message, "a{sv}"), sdbus::Error);
+  EXPECT_THROW(DBusValueCodec::readAll(message, "a{sv}"), ServiceError);
 
   // Arrays of variants count as well.
   PlistValue arrays = "leaf";
@@ -175,7 +176,7 @@ TEST(DBusValueCodec, DeepNestingIsRefused) {
   sdbus::PlainMessage arrayMessage = sdbus::createPlainMessage();
   DBusValueCodec::writeAll(arrayMessage, "av", {arrays});
   arrayMessage.seal();
-  EXPECT_THROW(DBusValueCodec::readAll(arrayMessage, "av"), sdbus::Error);
+  EXPECT_THROW(DBusValueCodec::readAll(arrayMessage, "av"), ServiceError);
 }
 
 TEST(DBusValueCodec, BodiesThatDoNotMatchTheSignatureAreRefused) {

@@ -484,7 +484,7 @@ std::string refusal(const RequestDescriptor& request, AssetServiceInterface& con
   try {
     RequestTable::perform(request, connection, arguments, reply);
   } catch (const ServiceError& error) {
-    return error.name();
+    return error.getName();
   }
   return "";
 }
