@@ -1,51 +1,39 @@
 #include "dmap/DAAPResponseKind.h"
 
+#include <algorithm>
+#include <utility>
+
 #include "dmap/DAAPCode.h"
 
 namespace larder {
 
+namespace {
+
+using Kind = DAAPResponseKind;
+
+constexpr std::pair<std::uint32_t, DAAPResponseKind> kResponseCodes[] = {
+    {"abro"_dmap, Kind::ListingHeader},  {"adbs"_dmap, Kind::ListingHeader},
+    {"aeBR"_dmap, Kind::ListingHeader},  {"agal"_dmap, Kind::ListingHeader},
+    {"agar"_dmap, Kind::ListingHeader},  {"aply"_dmap, Kind::ListingHeader},
+    {"apso"_dmap, Kind::ListingHeader},  {"avdb"_dmap, Kind::ListingHeader},
+    {"caci"_dmap, Kind::ListingHeader},  {"cmbu"_dmap, Kind::ListingHeader},
+    {"cprp"_dmap, Kind::ListingHeader},  {"mctl"_dmap, Kind::ListingHeader},
+    {"mscr"_dmap, Kind::ListingHeader},  {"mupd"_dmap, Kind::ListingHeader},
+    {"cacr"_dmap, Kind::ListingItem},    {"medc"_dmap, Kind::ListingItem},
+    {"casp"_dmap, Kind::Speakers},       {"ceGI"_dmap, Kind::ListingCollection},
+    {"cmcp"_dmap, Kind::ControlPrompts}, {"cmgt"_dmap, Kind::Properties},
+    {"cmst"_dmap, Kind::Properties},     {"mccr"_dmap, Kind::ContentCodes},
+    {"merr"_dmap, Kind::Error},          {"mlog"_dmap, Kind::Login},
+    {"msrv"_dmap, Kind::ServerInfo},     {"arsv"_dmap, Kind::Acknowledgement},
+};
+
+}  // namespace
+
 std::optional<DAAPResponseKind> daapResponseKind(std::uint32_t code) {
-  switch (code) {
-    case "abro"_dmap:
-    case "adbs"_dmap:
-    case "aeBR"_dmap:
-    case "agal"_dmap:
-    case "agar"_dmap:
-    case "aply"_dmap:
-    case "apso"_dmap:
-    case "avdb"_dmap:
-    case "caci"_dmap:
-    case "cmbu"_dmap:
-    case "cprp"_dmap:
-    case "mctl"_dmap:
-    case "mscr"_dmap:
-    case "mupd"_dmap:
-      return DAAPResponseKind::ListingHeader;
-    case "cacr"_dmap:
-    case "medc"_dmap:
-      return DAAPResponseKind::ListingItem;
-    case "casp"_dmap:
-      return DAAPResponseKind::Speakers;
-    case "ceGI"_dmap:
-      return DAAPResponseKind::ListingCollection;
-    case "cmcp"_dmap:
-      return DAAPResponseKind::ControlPrompts;
-    case "cmgt"_dmap:
-    case "cmst"_dmap:
-      return DAAPResponseKind::Properties;
-    case "mccr"_dmap:
-      return DAAPResponseKind::ContentCodes;
-    case "merr"_dmap:
-      return DAAPResponseKind::Error;
-    case "mlog"_dmap:
-      return DAAPResponseKind::Login;
-    case "msrv"_dmap:
-      return DAAPResponseKind::ServerInfo;
-    case "arsv"_dmap:
-      return DAAPResponseKind::Acknowledgement;
-    default:
-      return std::nullopt;
-  }
+  const auto* found =
+      std::ranges::find(kResponseCodes, code, &std::pair<std::uint32_t, Kind>::first);
+  if (found == std::end(kResponseCodes)) return std::nullopt;
+  return found->second;
 }
 
 }  // namespace larder
