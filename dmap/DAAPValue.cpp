@@ -66,10 +66,6 @@ void describeInto(std::ostringstream& out, const DAAPValue& value, int indent) {
   out << describePlistValue(value.toPlist());
 }
 
-}  // namespace
-
-namespace {
-
 // `type()` passes a scalar's type on as it is: the two lists agree up to
 // Date.
 constexpr bool sameScalarTypes() {
