@@ -2,13 +2,15 @@
 
 #include <algorithm>
 #include <chrono>
-#include <cstring>
 
 #include "dmap/DAAPBytes.h"
 #include "dmap/DAAPCode.h"
 #include "dmap/DAAPDocumentBudget.h"
+#include "dmap/DAAPResponseKind.h"
 #include "platform/log/TillLogManager.h"
 #include "platform/plist/PropertyListSerialization.h"
+#include "platform/plist/Utf8.h"
+#include "store-runtime/core/VendStringHelpers.h"
 
 namespace larder {
 
@@ -28,71 +30,10 @@ DAAPKey key(std::string_view literal) {
   return DAAPKey::literal(literal);
 }
 
-// Strict UTF-8: no overlong forms, no surrogates, nothing above U+10FFFF.
-bool isValidUTF8(Bytes bytes) {
-  const std::uint8_t* text = bytes.data();
-  const std::size_t size = bytes.size();
-  std::size_t index = 0;
-  while (index < size) {
-    while (index + 8 <= size) {  // ASCII runs, eight bytes at a time
-      std::uint64_t chunk;
-      std::memcpy(&chunk, text + index, 8);
-      if ((chunk & 0x8080808080808080ULL) != 0) break;
-      index += 8;
-    }
-    if (index >= size) break;
-    const std::uint8_t lead = text[index];
-    if (lead < 0x80) {
-      ++index;
-      continue;
-    }
-    std::size_t length = 0;
-    std::uint32_t codePoint = 0;
-    if (lead >= 0xC2 && lead <= 0xDF) {
-      length = 2;
-      codePoint = lead & 0x1Fu;
-    } else if (lead >= 0xE0 && lead <= 0xEF) {
-      length = 3;
-      codePoint = lead & 0x0Fu;
-    } else if (lead >= 0xF0 && lead <= 0xF4) {
-      length = 4;
-      codePoint = lead & 0x07u;
-    } else {
-      return false;
-    }
-    if (size - index < length) return false;
-    for (std::size_t offset = 1; offset < length; ++offset) {
-      const std::uint8_t continuation = text[index + offset];
-      if ((continuation & 0xC0) != 0x80) return false;
-      codePoint = (codePoint << 6) | (continuation & 0x3Fu);
-    }
-    if (length == 3 && (codePoint < 0x800 || (codePoint >= 0xD800 && codePoint <= 0xDFFF))) {
-      return false;
-    }
-    if (length == 4 && (codePoint < 0x10000 || codePoint > 0x10FFFF)) return false;
-    index += length;
-  }
-  return true;
-}
-
 std::optional<std::string> decodedUTF8(Bytes bytes) {
-  if (!isValidUTF8(bytes)) return std::nullopt;
-  return std::string(reinterpret_cast<const char*>(bytes.data()), bytes.size());
-}
-
-std::string encodedUTF8(std::uint32_t codePoint) {
-  std::string text;
-  if (codePoint < 0x80) {
-    text += static_cast<char>(codePoint);
-  } else if (codePoint < 0x800) {
-    text += static_cast<char>(0xC0 | (codePoint >> 6));
-    text += static_cast<char>(0x80 | (codePoint & 0x3F));
-  } else {
-    text += static_cast<char>(0xE0 | (codePoint >> 12));
-    text += static_cast<char>(0x80 | ((codePoint >> 6) & 0x3F));
-    text += static_cast<char>(0x80 | (codePoint & 0x3F));
-  }
-  return text;
+  const std::string_view text(reinterpret_cast<const char*>(bytes.data()), bytes.size());
+  if (!isWellFormedUtf8(text)) return std::nullopt;
+  return std::string(text);
 }
 
 // The value of an unknown tag as log text: up to its first zero byte, and
@@ -113,22 +54,15 @@ std::uint32_t leadingCode(Bytes bytes) {
                                     << (8 * (4 - width)));
 }
 
+// Four bytes to a group, as a data value is shown.
 std::string hexDescription(const PlistData& data) {
-  static constexpr char kDigits[] = "0123456789abcdef";
+  const std::span<const std::uint8_t> bytes(data);
   std::string text = "<";
-  for (std::size_t index = 0; index < data.size(); ++index) {
-    if (index > 0 && index % 4 == 0) text += ' ';
-    text += kDigits[data[index] >> 4];
-    text += kDigits[data[index] & 0x0F];
+  for (std::size_t index = 0; index < bytes.size(); index += 4) {
+    if (index > 0) text += ' ';
+    text += hexString(bytes.subspan(index, std::min<std::size_t>(4, bytes.size() - index)));
   }
   return text + ">";
-}
-
-int hexDigitValue(char c) {
-  if (c >= '0' && c <= '9') return c - '0';
-  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-  return -1;
 }
 
 // A pair read as base 16 up to its first non-digit, as the C library reads
@@ -244,52 +178,40 @@ std::string_view DAAPParser::typeForDRCPValueType(std::uint32_t type) {
 }
 
 DAAPValue DAAPParser::processResponseCode(std::uint32_t code, Bytes bytes) const {
-  switch (code) {
-    case "abro"_dmap:
-    case "adbs"_dmap:
-    case "aeBR"_dmap:
-    case "agal"_dmap:
-    case "agar"_dmap:
-    case "aply"_dmap:
-    case "apso"_dmap:
-    case "avdb"_dmap:
-    case "caci"_dmap:
-    case "cmbu"_dmap:
-    case "cprp"_dmap:
-    case "mctl"_dmap:
-    case "mscr"_dmap:
-    case "mupd"_dmap:
+  const std::optional<DAAPResponseKind> kind = daapResponseKind(code);
+  if (!kind) {
+    unknownCode(code, bytes);
+    return {};
+  }
+  switch (*kind) {
+    case DAAPResponseKind::ListingHeader:
       return parseListingHeader(bytes);
-    case "cacr"_dmap:
-    case "medc"_dmap:
+    case DAAPResponseKind::ListingItem:
       return parseListingItem(bytes);
-    case "casp"_dmap:
+    case DAAPResponseKind::Speakers:
       return parseGetSpeakersResponse(bytes);
-    case "ceGI"_dmap:
+    case DAAPResponseKind::ListingCollection:
       return parseListingCollection(bytes, 0);
-    case "cmcp"_dmap:
+    case DAAPResponseKind::ControlPrompts:
       return parseControlPromptResponse(bytes);
-    case "cmgt"_dmap:
-    case "cmst"_dmap:
+    case DAAPResponseKind::Properties:
       return parseDACPPropertyResponse(bytes);
-    case "mccr"_dmap:
+    case DAAPResponseKind::ContentCodes:
       return parseContentCodes(bytes);
-    case "merr"_dmap: {
+    case DAAPResponseKind::Error: {
       std::optional<DAAPDictionary> error = parseError(bytes);
       return error ? DAAPValue(std::move(*error)) : DAAPValue();
     }
-    case "mlog"_dmap: {
+    case DAAPResponseKind::Login: {
       const std::optional<std::int32_t> session = parseLogin(bytes);
       return session ? DAAPValue(std::int64_t{*session}) : DAAPValue();
     }
-    case "msrv"_dmap:
+    case DAAPResponseKind::ServerInfo:
       return parseServerInfo(bytes);
-    case "arsv"_dmap:
-      return {};
-    default:
-      unknownCode(code, bytes);
+    case DAAPResponseKind::Acknowledgement:
       return {};
   }
+  return {};
 }
 
 void DAAPParser::unknownCode(std::uint32_t code, Bytes bytes) const {
@@ -331,7 +253,9 @@ std::optional<std::string> DAAPParser::parseUnicodeCharacter(Bytes bytes) const 
   if (bytes.size() != 2) return std::nullopt;
   const std::uint16_t unit = *DAAPBytes::uint16At(bytes, 0);
   if (unit >= 0xD800 && unit <= 0xDFFF) return std::nullopt;  // half a pair is no character
-  return encodedUTF8(unit);
+  std::string text;
+  appendUtf8(text, unit);
+  return text;
 }
 
 DAAPValue DAAPParser::processXMLContent(Bytes bytes) const {

@@ -4,6 +4,7 @@
 #include <ctime>
 #include <limits>
 #include <sstream>
+#include <utility>
 
 #include "dmap/DAAPItem.h"
 #include "platform/log/TillLogManager.h"
@@ -65,15 +66,24 @@ void describeInto(std::ostringstream& out, const DAAPValue& value, int indent) {
   out << describePlistValue(value.toPlist());
 }
 
-}  // namespace
-
-DAAPValue::DAAPValue(std::uint64_t value) {
-  if (value <= static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max())) {
-    storage_ = static_cast<std::int64_t>(value);
-  } else {
-    storage_ = value;
+// `type()` passes a scalar's type on as it is: the two lists agree up to
+// Date.
+constexpr bool sameScalarTypes() {
+  using D = DAAPValue::Type;
+  using P = PlistValue::Type;
+  const std::pair<D, P> pairs[] = {
+      {D::Null, P::Null},       {D::Boolean, P::Boolean},
+      {D::Integer, P::Integer}, {D::UnsignedInteger, P::UnsignedInteger},
+      {D::Real, P::Real},       {D::String, P::String},
+      {D::Data, P::Data},       {D::Date, P::Date}};
+  for (const auto& [daap, plist] : pairs) {
+    if (static_cast<int>(daap) != static_cast<int>(plist)) return false;
   }
+  return true;
 }
+static_assert(sameScalarTypes());
+
+}  // namespace
 
 DAAPValue::DAAPValue(DAAPItemRef value) {
   if (value) storage_ = std::move(value);
@@ -84,38 +94,17 @@ DAAPItemRef DAAPValue::item() const {
   return item ? *item : nullptr;
 }
 
-PlistValue DAAPValue::scalarAsPlist() const {
-  switch (type()) {
-    case Type::Boolean:
-      return std::get<bool>(storage_);
-    case Type::Integer:
-      return std::get<std::int64_t>(storage_);
-    case Type::UnsignedInteger:
-      return std::get<std::uint64_t>(storage_);
-    case Type::Real:
-      return std::get<double>(storage_);
-    case Type::String:
-      return std::get<std::string>(storage_);
-    case Type::Data:
-      return std::get<PlistData>(storage_);
-    case Type::Date:
-      return std::get<PlistDate>(storage_);
-    default:
-      return {};
-  }
-}
-
 std::int64_t DAAPValue::int64Value() const {
-  return scalarAsPlist().int64Value();
+  return scalar() ? scalar()->int64Value() : 0;
 }
 std::uint64_t DAAPValue::uint64Value() const {
-  return scalarAsPlist().uint64Value();
+  return scalar() ? scalar()->uint64Value() : 0;
 }
 double DAAPValue::doubleValue() const {
-  return scalarAsPlist().doubleValue();
+  return scalar() ? scalar()->doubleValue() : 0.0;
 }
 bool DAAPValue::boolValue() const {
-  return scalarAsPlist().boolValue();
+  return scalar() ? scalar()->boolValue() : false;
 }
 
 const DAAPValue& DAAPValue::null() {
@@ -134,34 +123,15 @@ const DAAPValue& lookup(const DAAPDictionary& dictionary, std::string_view key) 
 }
 
 DAAPValue DAAPValue::fromPlist(const PlistValue& value) {
-  switch (value.type()) {
-    case PlistValue::Type::Null:
-    case PlistValue::Type::Uid:
-      return {};
-    case PlistValue::Type::Boolean:
-      return value.boolValue();
-    case PlistValue::Type::Integer:
-      return value.int64Value();
-    case PlistValue::Type::UnsignedInteger:
-      return value.uint64Value();
-    case PlistValue::Type::Real:
-      return value.doubleValue();
-    case PlistValue::Type::String:
-      return *value.string();
-    case PlistValue::Type::Data:
-      return *value.data();
-    case PlistValue::Type::Date:
-      return *value.date();
-    case PlistValue::Type::Dictionary:
-      return fromPlistDictionary(*value.dictionary());
-    case PlistValue::Type::Array: {
-      DAAPArray array;
-      array.reserve(value.array()->size());
-      for (const PlistValue& element : *value.array()) array.push_back(fromPlist(element));
-      return array;
-    }
+  if (const PlistDictionary* entries = value.dictionary()) return fromPlistDictionary(*entries);
+  if (const PlistArray* elements = value.array()) {
+    DAAPArray array;
+    array.reserve(elements->size());
+    for (const PlistValue& element : *elements) array.push_back(fromPlist(element));
+    return array;
   }
-  return {};
+  if (value.isUid()) return {};
+  return DAAPValue(value);
 }
 
 PlistValue DAAPValue::toPlist() const {
@@ -173,7 +143,7 @@ PlistValue DAAPValue::toPlist() const {
   }
   if (const DAAPDictionary* entries = dictionary()) return toPlistDictionary(*entries);
   if (DAAPItemRef record = item()) return toPlistDictionary(record->dictionaryRepresentation());
-  return scalarAsPlist();
+  return *scalar();
 }
 
 PlistDictionary toPlistDictionary(const DAAPDictionary& dictionary) {

@@ -23,9 +23,11 @@ using DAAPDictionary = std::map<DAAPKey, DAAPValue, std::less<>>;
 
 // What the DMAP parsers produce: the values of a property list plus
 // `DAAPItem` records, which a listing holds in its arrays and dictionaries.
-// `PlistValue` has no room for records, so this type mirrors it and adds
-// one; `toPlist()` turns a tree into a property list, each record becoming
-// its `dictionaryRepresentation`. A default-constructed value is "nothing".
+// `PlistValue` has no room for records, and its containers hold property
+// lists only, so this type keeps its own containers (with keys that borrow
+// their text) and holds every other value as a `PlistValue`; `toPlist()`
+// turns a tree into a property list, each record becoming its
+// `dictionaryRepresentation`. A default-constructed value is "nothing".
 class DAAPValue {
  public:
   enum class Type {
@@ -43,21 +45,25 @@ class DAAPValue {
   };
 
   DAAPValue() = default;
-  DAAPValue(bool value) : storage_(value) {}               // NOLINT(google-explicit-constructor)
-  DAAPValue(int value) : storage_(std::int64_t{value}) {}  // NOLINT(google-explicit-constructor)
-  DAAPValue(std::int64_t value) : storage_(value) {}       // NOLINT(google-explicit-constructor)
-  DAAPValue(std::uint64_t value);                          // NOLINT(google-explicit-constructor)
-  DAAPValue(double value) : storage_(value) {}             // NOLINT(google-explicit-constructor)
-  DAAPValue(const char* value) : storage_(std::string(value)) {}       // NOLINT
-  DAAPValue(std::string value) : storage_(std::move(value)) {}         // NOLINT
-  DAAPValue(std::string_view value) : storage_(std::string(value)) {}  // NOLINT
-  DAAPValue(PlistData value) : storage_(std::move(value)) {}           // NOLINT
-  DAAPValue(PlistDate value) : storage_(value) {}                      // NOLINT
-  DAAPValue(DAAPArray value) : storage_(std::move(value)) {}           // NOLINT
-  DAAPValue(DAAPDictionary value) : storage_(std::move(value)) {}      // NOLINT
-  DAAPValue(DAAPItemRef value);                                        // NOLINT
+  DAAPValue(bool value) : storage_(PlistValue(value)) {}  // NOLINT(google-explicit-constructor)
+  DAAPValue(int value) : storage_(PlistValue(value)) {}   // NOLINT(google-explicit-constructor)
+  DAAPValue(std::int64_t value) : storage_(PlistValue(value)) {}            // NOLINT
+  DAAPValue(std::uint64_t value) : storage_(PlistValue(value)) {}           // NOLINT
+  DAAPValue(double value) : storage_(PlistValue(value)) {}                  // NOLINT
+  DAAPValue(const char* value) : storage_(PlistValue(value)) {}             // NOLINT
+  DAAPValue(std::string value) : storage_(PlistValue(std::move(value))) {}  // NOLINT
+  DAAPValue(std::string_view value) : storage_(PlistValue(value)) {}        // NOLINT
+  DAAPValue(PlistData value) : storage_(PlistValue(std::move(value))) {}    // NOLINT
+  DAAPValue(PlistDate value) : storage_(PlistValue(value)) {}               // NOLINT
+  DAAPValue(DAAPArray value) : storage_(std::move(value)) {}                // NOLINT
+  DAAPValue(DAAPDictionary value) : storage_(std::move(value)) {}           // NOLINT
+  DAAPValue(DAAPItemRef value);                                             // NOLINT
 
-  [[nodiscard]] Type type() const { return static_cast<Type>(storage_.index()); }
+  [[nodiscard]] Type type() const {
+    if (const PlistValue* value = scalar()) return static_cast<Type>(value->type());
+    if (std::holds_alternative<DAAPArray>(storage_)) return Type::Array;
+    return std::holds_alternative<DAAPDictionary>(storage_) ? Type::Dictionary : Type::Item;
+  }
   [[nodiscard]] bool isNull() const { return type() == Type::Null; }
   [[nodiscard]] bool isBoolean() const { return type() == Type::Boolean; }
   [[nodiscard]] bool isInteger() const {
@@ -75,9 +81,11 @@ class DAAPValue {
   [[nodiscard]] bool isItem() const { return type() == Type::Item; }
 
   // Typed access; nullptr for a value of another type.
-  [[nodiscard]] const std::string* string() const { return std::get_if<std::string>(&storage_); }
-  [[nodiscard]] const PlistData* data() const { return std::get_if<PlistData>(&storage_); }
-  [[nodiscard]] const PlistDate* date() const { return std::get_if<PlistDate>(&storage_); }
+  [[nodiscard]] const std::string* string() const {
+    return scalar() ? scalar()->string() : nullptr;
+  }
+  [[nodiscard]] const PlistData* data() const { return scalar() ? scalar()->data() : nullptr; }
+  [[nodiscard]] const PlistDate* date() const { return scalar() ? scalar()->date() : nullptr; }
   [[nodiscard]] const DAAPArray* array() const { return std::get_if<DAAPArray>(&storage_); }
   [[nodiscard]] DAAPArray* array() { return std::get_if<DAAPArray>(&storage_); }
   [[nodiscard]] const DAAPDictionary* dictionary() const {
@@ -109,11 +117,13 @@ class DAAPValue {
   friend bool operator==(const DAAPValue& a, const DAAPValue& b);
 
  private:
-  [[nodiscard]] PlistValue scalarAsPlist() const;
+  // Every value but a container or a record is a property-list value as
+  // it stands, so that conversions and comparisons are the property list's
+  // own. It never holds an array, a dictionary or a UID.
+  explicit DAAPValue(PlistValue scalar) : storage_(std::move(scalar)) {}
+  [[nodiscard]] const PlistValue* scalar() const { return std::get_if<PlistValue>(&storage_); }
 
-  std::variant<std::monostate, bool, std::int64_t, std::uint64_t, double, std::string, PlistData,
-               PlistDate, DAAPArray, DAAPDictionary, DAAPItemRef>
-      storage_;
+  std::variant<PlistValue, DAAPArray, DAAPDictionary, DAAPItemRef> storage_;
 };
 
 // Lookup without building a key.

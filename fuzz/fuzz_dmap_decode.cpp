@@ -6,19 +6,20 @@
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
+#include <optional>
 #include <span>
 
-#include "dmap/DAAPCode.h"
 #include "dmap/DAAPItem.h"
 #include "dmap/DAAPParser.h"
+#include "dmap/DAAPResponseKind.h"
 
 namespace {
 
 using larder::DAAPArray;
 using larder::DAAPDictionary;
 using larder::DAAPItemRef;
+using larder::DAAPResponseKind;
 using larder::DAAPValue;
-using larder::operator""_dmap;
 
 [[noreturn]] void failWith(const char* message) {
   std::fprintf(stderr, "%s\n", message);
@@ -52,40 +53,28 @@ void checkTree(const DAAPValue& value, int depth) {
 enum class Promise { Dictionary, Item, Array, NumberOrNothing, DictionaryOrNothing, Nothing };
 
 Promise promiseOf(std::uint32_t code) {
-  switch (code) {
-    case "cacr"_dmap:
-    case "medc"_dmap:
+  const std::optional<DAAPResponseKind> kind = larder::daapResponseKind(code);
+  if (!kind) return Promise::Nothing;
+  switch (*kind) {
+    case DAAPResponseKind::ListingItem:
       return Promise::Item;
-    case "casp"_dmap:
-    case "ceGI"_dmap:
-    case "mccr"_dmap:
+    case DAAPResponseKind::Speakers:
+    case DAAPResponseKind::ListingCollection:
+    case DAAPResponseKind::ContentCodes:
       return Promise::Array;
-    case "mlog"_dmap:
+    case DAAPResponseKind::Login:
       return Promise::NumberOrNothing;
-    case "merr"_dmap:
+    case DAAPResponseKind::Error:
       return Promise::DictionaryOrNothing;
-    case "abro"_dmap:
-    case "adbs"_dmap:
-    case "aeBR"_dmap:
-    case "agal"_dmap:
-    case "agar"_dmap:
-    case "aply"_dmap:
-    case "apso"_dmap:
-    case "avdb"_dmap:
-    case "caci"_dmap:
-    case "cmbu"_dmap:
-    case "cprp"_dmap:
-    case "mctl"_dmap:
-    case "mscr"_dmap:
-    case "mupd"_dmap:
-    case "cmcp"_dmap:
-    case "cmgt"_dmap:
-    case "cmst"_dmap:
-    case "msrv"_dmap:
+    case DAAPResponseKind::ListingHeader:
+    case DAAPResponseKind::ControlPrompts:
+    case DAAPResponseKind::Properties:
+    case DAAPResponseKind::ServerInfo:
       return Promise::Dictionary;
-    default:
+    case DAAPResponseKind::Acknowledgement:
       return Promise::Nothing;
   }
+  return Promise::Nothing;
 }
 
 bool keeps(Promise promise, const DAAPValue& value) {

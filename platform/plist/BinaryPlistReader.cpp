@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "platform/plist/BinaryPlistWriter.h"
+#include "platform/plist/Utf8.h"
 
 namespace larder {
 
@@ -14,7 +15,6 @@ namespace {
 constexpr std::size_t kHeaderSize = 8;
 constexpr std::size_t kTrailerSize = 32;
 constexpr std::string_view kMagic = "bplist00";
-constexpr char32_t kReplacementCharacter = 0xFFFD;
 
 std::uint64_t readBigEndian(const std::uint8_t* bytes, unsigned width) {
   std::uint64_t value = 0;
@@ -279,7 +279,7 @@ class BinaryDecoder {
         const char16_t low = unitAt(++index);
         appendUtf8(text, 0x10000 + ((char32_t{unit} - 0xD800) << 10) + (char32_t{low} - 0xDC00));
       } else if (isHighSurrogate(unit) || isLowSurrogate(unit)) {
-        appendUtf8(text, kReplacementCharacter);
+        appendUtf8(text, kUnicodeReplacementCharacter);
       } else {
         appendUtf8(text, unit);
       }

@@ -1,8 +1,6 @@
 #pragma once
 
 #include <cstdint>
-#include <string>
-#include <string_view>
 
 #include "platform/plist/PlistValue.h"
 
@@ -22,18 +20,5 @@ class BinaryPlistWriter {
  public:
   static PlistData write(const PlistValue& root);
 };
-
-// Text in property-list values is UTF-8. Bytes that do not form well-formed
-// UTF-8 are each replaced by U+FFFD, by the writer when it converts text to
-// UTF-16 and by the readers when they take text in, so that any text a
-// reader hands out survives a write and a second read unchanged.
-[[nodiscard]] bool isWellFormedUtf8(std::string_view text);
-[[nodiscard]] std::string toWellFormedUtf8(std::string_view text);
-
-// Decodes one code point starting at text[position] and advances position.
-// Returns U+FFFD and advances by one byte when the bytes there are not
-// well-formed UTF-8.
-[[nodiscard]] char32_t decodeUtf8(std::string_view text, std::size_t& position);
-void appendUtf8(std::string& out, char32_t codePoint);
 
 }  // namespace larder

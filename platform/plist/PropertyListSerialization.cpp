@@ -10,6 +10,7 @@
 
 #include "platform/plist/BinaryPlistReader.h"
 #include "platform/plist/BinaryPlistWriter.h"
+#include "platform/plist/Utf8.h"
 
 namespace larder {
 

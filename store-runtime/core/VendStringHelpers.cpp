@@ -93,6 +93,24 @@ std::string percentEncodedQueryComponent(std::string_view text) {
   return encoded;
 }
 
+std::string hexString(std::span<const std::uint8_t> bytes) {
+  static constexpr char kDigits[] = "0123456789abcdef";
+  std::string text;
+  text.reserve(bytes.size() * 2);
+  for (const std::uint8_t byte : bytes) {
+    text.push_back(kDigits[byte >> 4U]);
+    text.push_back(kDigits[byte & 0xFU]);
+  }
+  return text;
+}
+
+int hexDigitValue(char digit) {
+  if (digit >= '0' && digit <= '9') return digit - '0';
+  if (digit >= 'a' && digit <= 'f') return digit - 'a' + 10;
+  if (digit >= 'A' && digit <= 'F') return digit - 'A' + 10;
+  return -1;
+}
+
 std::optional<std::uint64_t> unsignedDecimalNumber(std::string_view text) {
   if (text.empty()) return std::nullopt;
   std::uint64_t value = 0;

@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 
@@ -22,6 +23,13 @@ std::string urlByAddingStringToQueryString(std::string_view url, std::string_vie
 // `text` as one name or value of a URL query: every byte but letters,
 // digits and "-._~" percent-encoded.
 std::string percentEncodedQueryComponent(std::string_view text);
+
+// Bytes as lower-case hexadecimal, two digits a byte: how digests and
+// signatures are written.
+std::string hexString(std::span<const std::uint8_t> bytes);
+
+// The value of one hexadecimal digit of either case, or -1.
+int hexDigitValue(char digit);
 
 // The whole text as an unsigned decimal number: no sign, no spaces, no
 // trailing characters, no overflow; nullopt otherwise.

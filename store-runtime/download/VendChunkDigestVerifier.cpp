@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cstring>
 
+#include "store-runtime/core/VendStringHelpers.h"
 #include "store-runtime/http/CryptoLibrary.h"
 #include "store-runtime/records/VendChunkDigestRules.h"
 
@@ -10,33 +11,15 @@ namespace larder {
 
 namespace {
 
-int hexValue(char digit) {
-  if (digit >= '0' && digit <= '9') return digit - '0';
-  if (digit >= 'a' && digit <= 'f') return digit - 'a' + 10;
-  if (digit >= 'A' && digit <= 'F') return digit - 'A' + 10;
-  return -1;
-}
-
 bool appendHex(std::string_view hex, std::vector<std::uint8_t>& out) {
   if (hex.size() % 2 != 0) return false;
   for (std::size_t i = 0; i < hex.size(); i += 2) {
-    const int high = hexValue(hex[i]);
-    const int low = hexValue(hex[i + 1]);
+    const int high = hexDigitValue(hex[i]);
+    const int low = hexDigitValue(hex[i + 1]);
     if (high < 0 || low < 0) return false;
     out.push_back(static_cast<std::uint8_t>(high * 16 + low));
   }
   return true;
-}
-
-std::string toHex(const std::uint8_t* bytes, std::size_t length) {
-  static constexpr char kDigits[] = "0123456789abcdef";
-  std::string text;
-  text.reserve(length * 2);
-  for (std::size_t i = 0; i < length; ++i) {
-    text += kDigits[bytes[i] >> 4u];
-    text += kDigits[bytes[i] & 0xfu];
-  }
-  return text;
 }
 
 const EVP_MD* digestForLength(std::size_t length) {
@@ -106,8 +89,8 @@ void VendChunkDigestVerifier::completeChunk() {
   if (length != digestLength_ || std::memcmp(digest, expected, digestLength_) != 0) {
     fail(Failure::kDigestMismatch,
          "chunk " + std::to_string(chunkIndex_) + " (bytes " + std::to_string(chunkOffset) + "-" +
-             std::to_string(received_ - 1) + ") has digest " + toHex(digest, length) +
-             ", the manifest lists " + toHex(expected, digestLength_));
+             std::to_string(received_ - 1) + ") has digest " + hexString({digest, length}) +
+             ", the manifest lists " + hexString({expected, digestLength_}));
     return;
   }
   ++chunkIndex_;

@@ -9,10 +9,11 @@
 #include "platform/dispatch/DispatchQueue.h"
 #include "platform/log/TillLogManager.h"
 #include "platform/system/Environment.h"
+#include "store-runtime/core/VendStringHelpers.h"
 #include "store-runtime/download/VendAssetFetcher.h"
 #include "store-runtime/download/VendDownloadError.h"
-#include "store-runtime/http/CryptoLibrary.h"
 #include "store-runtime/download/VendPreflightCheck.h"
+#include "store-runtime/http/CryptoLibrary.h"
 
 namespace larder {
 
@@ -27,13 +28,7 @@ std::string hexPrefixOfSha256(std::string_view text, std::size_t bytes) {
   unsigned int length = 0;
   const CryptoLibrary& crypto = CryptoLibrary::shared();
   crypto.digest(text.data(), text.size(), digest, &length, crypto.sha256(), nullptr);
-  static constexpr char kDigits[] = "0123456789abcdef";
-  std::string hex;
-  for (std::size_t i = 0; i < std::min<std::size_t>(bytes, length); ++i) {
-    hex += kDigits[digest[i] >> 4u];
-    hex += kDigits[digest[i] & 0xfu];
-  }
-  return hex;
+  return hexString({digest, std::min<std::size_t>(bytes, length)});
 }
 
 // A download's files live under its item identifier. A download that has

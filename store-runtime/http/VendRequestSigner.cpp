@@ -2,21 +2,11 @@
 
 #include <array>
 
+#include "store-runtime/core/VendStringHelpers.h"
 #include "store-runtime/http/CryptoLibrary.h"
 
 namespace larder {
 namespace {
-
-std::string hexString(std::span<const std::uint8_t> bytes) {
-  static constexpr char kDigits[] = "0123456789abcdef";
-  std::string text;
-  text.reserve(bytes.size() * 2);
-  for (std::uint8_t byte : bytes) {
-    text.push_back(kDigits[byte >> 4U]);
-    text.push_back(kDigits[byte & 0xFU]);
-  }
-  return text;
-}
 
 PlistData message(std::string_view head, std::span<const std::uint8_t> body) {
   PlistData bytes(head.begin(), head.end());

@@ -6,6 +6,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/plist/KeyedArchive.h"
 #include "platform/plist/PlistValue.h"
 
 namespace larder {
@@ -30,6 +31,24 @@ class RecordFieldReader {
   // A value that is not a dictionary reads as an empty, failed record.
   explicit RecordFieldReader(const PlistValue& source);
 
+  // The record `readFields` makes of a wire form; nullopt when a field has
+  // the wrong type.
+  template <typename Record>
+  static std::optional<Record> read(const PlistDictionary& source,
+                                    Record (*readFields)(RecordFieldReader&)) {
+    RecordFieldReader reader(source);
+    return reader.finish(readFields(reader));
+  }
+  // The same of a keyed-archive form; nullopt also when its "$class" is
+  // not `className`.
+  template <typename Record>
+  static std::optional<Record> unarchive(const PlistValue& encoded, std::string_view className,
+                                         Record (*readFields)(RecordFieldReader&)) {
+    if (KeyedArchive::classNameOf(encoded) != className) return std::nullopt;
+    RecordFieldReader reader(encoded);
+    return reader.finish(readFields(reader));
+  }
+
   std::optional<std::string> string(std::string_view key);
   // Integers only: a real or a string is not a count or a code.
   std::optional<std::int64_t> integer(std::string_view key);
@@ -53,6 +72,11 @@ class RecordFieldReader {
   void fail() { ok_ = false; }
 
  private:
+  template <typename Record>
+  std::optional<Record> finish(Record record) const {
+    if (!ok_) return std::nullopt;
+    return record;
+  }
   template <typename T>
   std::optional<T> refuse() {
     ok_ = false;

@@ -5,6 +5,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/plist/KeyedArchive.h"
 #include "platform/plist/PlistValue.h"
 
 namespace larder {
@@ -15,6 +16,25 @@ namespace larder {
 class RecordFieldWriter {
  public:
   explicit RecordFieldWriter(PlistDictionary& target) : target_(target) {}
+
+  // A record's wire form: the fields `putFields` writes.
+  template <typename Record>
+  static PlistDictionary dictionary(const Record& record,
+                                    void (*putFields)(RecordFieldWriter&, const Record&)) {
+    PlistDictionary target;
+    RecordFieldWriter writer(target);
+    putFields(writer, record);
+    return target;
+  }
+  // Its keyed-archive form: the same fields plus "$class".
+  template <typename Record>
+  static PlistDictionary archive(std::string_view className, const Record& record,
+                                 void (*putFields)(RecordFieldWriter&, const Record&)) {
+    PlistDictionary target = KeyedArchive::record(className);
+    RecordFieldWriter writer(target);
+    putFields(writer, record);
+    return target;
+  }
 
   template <typename T>
   void put(std::string_view key, T value) {

@@ -2,10 +2,9 @@
 
 #include <algorithm>
 
-#include "platform/plist/KeyedArchive.h"
-#include "store-runtime/records/VendChunkDigestRules.h"
 #include "store-runtime/records/RecordFieldReader.h"
 #include "store-runtime/records/RecordFieldWriter.h"
+#include "store-runtime/records/VendChunkDigestRules.h"
 
 namespace larder {
 
@@ -15,8 +14,7 @@ bool isPlainFetch(const VendURLRequest& request) {
   return request == VendURLRequest(request.url());
 }
 
-void putFields(PlistDictionary& dictionary, const TillDownloadAsset& asset) {
-  RecordFieldWriter writer(dictionary);
+void putFields(RecordFieldWriter& writer, const TillDownloadAsset& asset) {
   writer.put("type", asset.type());
   writer.put("external", asset.external());
   writer.put("URL", asset.URLRequest().url());
@@ -27,7 +25,7 @@ void putFields(PlistDictionary& dictionary, const TillDownloadAsset& asset) {
   writer.put("hashes", asset.hashes());
 }
 
-std::optional<TillDownloadAsset> readFields(RecordFieldReader& reader) {
+TillDownloadAsset readFields(RecordFieldReader& reader) {
   TillDownloadAsset asset;
   asset.setType(reader.integer("type").value_or(TillDownloadAsset::kTypeSoftwarePackage));
   asset.setExternal(reader.boolean("external").value_or(false));
@@ -40,7 +38,6 @@ std::optional<TillDownloadAsset> readFields(RecordFieldReader& reader) {
   asset.setFileSize(reader.integer("fileSize").value_or(0));
   asset.setNumberOfBytesToHash(reader.integer("numberOfBytesToHash").value_or(0));
   asset.setHashes(reader.strings("hashes").value_or(std::vector<std::string>{}));
-  if (!reader.ok()) return std::nullopt;
   return asset;
 }
 
@@ -72,27 +69,20 @@ std::optional<std::string> TillDownloadAsset::unusableReason() const {
 }
 
 PlistDictionary TillDownloadAsset::encodeWithCoder() const {
-  PlistDictionary encoded = KeyedArchive::record(kClassName);
-  putFields(encoded, *this);
-  return encoded;
+  return RecordFieldWriter::archive(kClassName, *this, putFields);
 }
 
 std::optional<TillDownloadAsset> TillDownloadAsset::initWithCoder(const PlistValue& encoded) {
-  if (KeyedArchive::classNameOf(encoded) != kClassName) return std::nullopt;
-  RecordFieldReader reader(encoded);
-  return readFields(reader);
+  return RecordFieldReader::unarchive(encoded, kClassName, readFields);
 }
 
 PlistDictionary TillDownloadAsset::toDictionary() const {
-  PlistDictionary dictionary;
-  putFields(dictionary, *this);
-  return dictionary;
+  return RecordFieldWriter::dictionary(*this, putFields);
 }
 
 std::optional<TillDownloadAsset> TillDownloadAsset::fromDictionary(
     const PlistDictionary& dictionary) {
-  RecordFieldReader reader(dictionary);
-  std::optional<TillDownloadAsset> asset = readFields(reader);
+  std::optional<TillDownloadAsset> asset = RecordFieldReader::read(dictionary, readFields);
   if (!asset || asset->unusableReason()) return std::nullopt;
   return asset;
 }

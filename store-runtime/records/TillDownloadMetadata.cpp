@@ -1,6 +1,5 @@
 #include "store-runtime/records/TillDownloadMetadata.h"
 
-#include "platform/plist/KeyedArchive.h"
 #include "store-runtime/records/RecordFieldReader.h"
 #include "store-runtime/records/RecordFieldWriter.h"
 
@@ -8,8 +7,7 @@ namespace larder {
 
 namespace {
 
-void putFields(PlistDictionary& dictionary, const TillDownloadMetadata& metadata) {
-  RecordFieldWriter writer(dictionary);
+void putFields(RecordFieldWriter& writer, const TillDownloadMetadata& metadata) {
   writer.put("itemIdentifier", metadata.itemIdentifier());
   writer.put("bundleIdentifier", metadata.bundleIdentifier());
   writer.put("bundleVersion", metadata.bundleVersion());
@@ -20,7 +18,7 @@ void putFields(PlistDictionary& dictionary, const TillDownloadMetadata& metadata
   writer.put("isMDMProvided", metadata.isMDMProvided());
 }
 
-std::optional<TillDownloadMetadata> readFields(RecordFieldReader& reader) {
+TillDownloadMetadata readFields(RecordFieldReader& reader) {
   TillDownloadMetadata metadata;
   metadata.setItemIdentifier(reader.unsignedInteger("itemIdentifier").value_or(0));
   metadata.setBundleIdentifier(reader.string("bundleIdentifier").value_or(""));
@@ -32,34 +30,26 @@ std::optional<TillDownloadMetadata> readFields(RecordFieldReader& reader) {
     metadata.setAuxInfo(std::move(*info));
   }
   metadata.setIsMDMProvided(reader.boolean("isMDMProvided").value_or(false));
-  if (!reader.ok()) return std::nullopt;
   return metadata;
 }
 
 }  // namespace
 
 PlistDictionary TillDownloadMetadata::encodeWithCoder() const {
-  PlistDictionary encoded = KeyedArchive::record(kClassName);
-  putFields(encoded, *this);
-  return encoded;
+  return RecordFieldWriter::archive(kClassName, *this, putFields);
 }
 
 std::optional<TillDownloadMetadata> TillDownloadMetadata::initWithCoder(const PlistValue& encoded) {
-  if (KeyedArchive::classNameOf(encoded) != kClassName) return std::nullopt;
-  RecordFieldReader reader(encoded);
-  return readFields(reader);
+  return RecordFieldReader::unarchive(encoded, kClassName, readFields);
 }
 
 PlistDictionary TillDownloadMetadata::toDictionary() const {
-  PlistDictionary dictionary;
-  putFields(dictionary, *this);
-  return dictionary;
+  return RecordFieldWriter::dictionary(*this, putFields);
 }
 
 std::optional<TillDownloadMetadata> TillDownloadMetadata::fromDictionary(
     const PlistDictionary& dictionary) {
-  RecordFieldReader reader(dictionary);
-  return readFields(reader);
+  return RecordFieldReader::read(dictionary, readFields);
 }
 
 std::string TillDownloadMetadata::description() const {

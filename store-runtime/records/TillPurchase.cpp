@@ -2,7 +2,6 @@
 
 #include <charconv>
 
-#include "platform/plist/KeyedArchive.h"
 #include "store-runtime/core/VendStringHelpers.h"
 #include "store-runtime/records/RecordFieldReader.h"
 #include "store-runtime/records/RecordFieldWriter.h"
@@ -51,8 +50,7 @@ std::optional<std::uint64_t> numericParameter(std::string_view query, std::strin
   return text ? unsignedDecimalNumber(*text) : std::nullopt;
 }
 
-void putFields(PlistDictionary& target, const TillPurchase& purchase) {
-  RecordFieldWriter writer(target);
+void putFields(RecordFieldWriter& writer, const TillPurchase& purchase) {
   writer.put(kBuyParamsKey, purchase.buyParameters());
   writer.put(kItemIdentifierKey, purchase.itemIdentifier());
   writer.put(kPurchaseTypeKey, purchase.purchaseType());
@@ -67,7 +65,7 @@ void putFields(PlistDictionary& target, const TillPurchase& purchase) {
   writer.put(kAccountIdentifierKey, purchase.accountIdentifier());
 }
 
-std::optional<TillPurchase> readFields(RecordFieldReader& reader) {
+TillPurchase readFields(RecordFieldReader& reader) {
   TillPurchase purchase;
   purchase.setBuyParameters(reader.string(kBuyParamsKey).value_or(""));
   purchase.setItemIdentifier(reader.unsignedInteger(kItemIdentifierKey).value_or(0));
@@ -85,7 +83,6 @@ std::optional<TillPurchase> readFields(RecordFieldReader& reader) {
   }
   purchase.setOrvaneID(reader.string(kOrvaneIDKey));
   purchase.setAccountIdentifier(reader.unsignedInteger(kAccountIdentifierKey).value_or(0));
-  if (!reader.ok()) return std::nullopt;
   return purchase;
 }
 
@@ -122,26 +119,19 @@ bool TillPurchase::accountLessOption(const std::optional<PlistDictionary>& optio
 }
 
 PlistDictionary TillPurchase::encodeWithCoder() const {
-  PlistDictionary encoded = KeyedArchive::record(kClassName);
-  putFields(encoded, *this);
-  return encoded;
+  return RecordFieldWriter::archive(kClassName, *this, putFields);
 }
 
 std::optional<TillPurchase> TillPurchase::initWithCoder(const PlistValue& encoded) {
-  if (KeyedArchive::classNameOf(encoded) != kClassName) return std::nullopt;
-  RecordFieldReader reader(encoded);
-  return readFields(reader);
+  return RecordFieldReader::unarchive(encoded, kClassName, readFields);
 }
 
 PlistDictionary TillPurchase::toDictionary() const {
-  PlistDictionary dictionary;
-  putFields(dictionary, *this);
-  return dictionary;
+  return RecordFieldWriter::dictionary(*this, putFields);
 }
 
 std::optional<TillPurchase> TillPurchase::fromDictionary(const PlistDictionary& dictionary) {
-  RecordFieldReader reader(dictionary);
-  return readFields(reader);
+  return RecordFieldReader::read(dictionary, readFields);
 }
 
 std::string TillPurchase::description() const {

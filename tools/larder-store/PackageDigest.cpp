@@ -12,6 +12,7 @@
 #include <span>
 
 #include "platform/system/FileDescriptor.h"
+#include "store-runtime/core/VendStringHelpers.h"
 
 namespace larder {
 namespace {
@@ -22,17 +23,6 @@ struct DigestContextDeleter {
   void operator()(EVP_MD_CTX* context) const { EVP_MD_CTX_free(context); }
 };
 using DigestContext = std::unique_ptr<EVP_MD_CTX, DigestContextDeleter>;
-
-std::string hexString(std::span<const unsigned char> bytes) {
-  static constexpr char kDigits[] = "0123456789abcdef";
-  std::string text;
-  text.reserve(bytes.size() * 2);
-  for (unsigned char byte : bytes) {
-    text.push_back(kDigits[byte >> 4U]);
-    text.push_back(kDigits[byte & 0xFU]);
-  }
-  return text;
-}
 
 // Feeds bytes to SHA-256 and closes a chunk every `chunkSize` bytes.
 class ChunkHasher {

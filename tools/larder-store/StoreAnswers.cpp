@@ -1,6 +1,6 @@
 #include "larder-store/StoreAnswers.h"
 
-#include <cctype>
+#include "store-runtime/core/VendStringHelpers.h"
 
 namespace larder {
 namespace {
@@ -43,8 +43,10 @@ PlistDictionary StoreAnswers::bag(std::string_view baseURL, const PlistDictionar
 
 std::string StoreAnswers::assetURL(std::string_view baseURL, const StoreItem& item,
                                    std::string_view fileName) {
+  // One path segment: the same unreserved characters stay as a query
+  // component keeps them.
   return joined(baseURL, kAssetsPrefix) + std::to_string(item.wareID) + "/" +
-         percentEncoded(fileName);
+         percentEncodedQueryComponent(fileName);
 }
 
 PlistDictionary StoreAnswers::download(const StoreItem& item, std::string_view baseURL) {
@@ -90,23 +92,6 @@ PlistDictionary StoreAnswers::preflight(const StoreItem& item) {
 PlistDictionary StoreAnswers::failure(std::string_view failureType,
                                       std::string_view customerMessage) {
   return {{"failureType", failureType}, {"customerMessage", customerMessage}};
-}
-
-std::string StoreAnswers::percentEncoded(std::string_view text) {
-  static constexpr char kDigits[] = "0123456789ABCDEF";
-  std::string encoded;
-  for (const char character : text) {
-    const auto byte = static_cast<unsigned char>(character);
-    if (std::isalnum(byte) || character == '-' || character == '.' || character == '_' ||
-        character == '~') {
-      encoded.push_back(character);
-    } else {
-      encoded.push_back('%');
-      encoded.push_back(kDigits[byte >> 4U]);
-      encoded.push_back(kDigits[byte & 0xFU]);
-    }
-  }
-  return encoded;
 }
 
 std::string StoreAnswers::regexEscaped(std::string_view text) {

@@ -37,8 +37,6 @@ class StoreAnswers {
 
   static std::string assetURL(std::string_view baseURL, const StoreItem& item,
                               std::string_view fileName);
-  // `text` with everything but unreserved characters percent-encoded.
-  static std::string percentEncoded(std::string_view text);
   // `text` with the characters that mean something in a regular expression
   // escaped.
   static std::string regexEscaped(std::string_view text);
