@@ -145,10 +145,6 @@ TEST(DAAPFrameTest, DecodeHexStringOfTooFewBytesGivesNothing) {
   EXPECT_TRUE(DAAPParser::decodeHexString("").isNull());
 }
 
-TEST(DAAPFrameTest, SharedInstanceIsOneObject) {
-  EXPECT_EQ(&DAAPParser::sharedInstance(), &DAAPParser::sharedInstance());
-}
-
 // ------------------------------------------------------- unknown tags
 
 class DAAPUnknownCodeTest : public ::testing::Test {
