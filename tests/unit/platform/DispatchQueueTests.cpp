@@ -543,11 +543,6 @@ class EveryQueueKind : public ::testing::TestWithParam<Kind> {};
 INSTANTIATE_TEST_SUITE_P(DispatchQueue, EveryQueueKind,
                          ::testing::Values(Kind::Serial, Kind::Concurrent), kindName);
 
-TEST_P(EveryQueueKind, LabelIsKept) {
-  auto queue = makeQueue(GetParam(), "com.example.label");
-  EXPECT_EQ(queue->label(), "com.example.label");
-}
-
 TEST_P(EveryQueueKind, SyncFromATaskOfAnotherQueueWorks) {
   auto outer = makeQueue(Kind::Serial, "outer");
   auto queue = makeQueue(GetParam(), "inner");
