@@ -637,10 +637,14 @@ TEST_P(EveryQueueKind, WorkersStartOnDemandAndExitWhenIdle) {
 TEST_P(EveryQueueKind, IdleTimeoutWithoutLimitKeepsTheWorker) {
   auto queue = DispatchQueue::create("keeper", GetParam(),
                                      {.idleTimeout = std::chrono::milliseconds::max()});
+  // A queue with a short timeout losing its worker shows an idle worker has had its chance to go.
+  auto yardstick = DispatchQueue::create("yardstick", GetParam(), {.idleTimeout = 1ms});
   DispatchSemaphore ran;
   queue->async([&] { ran.signal(); });
   ASSERT_TRUE(ran.waitFor(kGenerous));
-  std::this_thread::sleep_for(kChance);
+  yardstick->async([&] { ran.signal(); });
+  ASSERT_TRUE(ran.waitFor(kGenerous));
+  ASSERT_TRUE(eventually([&] { return yardstick->workerThreadCount() == 0; }));
   EXPECT_EQ(queue->workerThreadCount(), 1u);
   queue->async([&] { ran.signal(); });
   EXPECT_TRUE(ran.waitFor(kGenerous));
