@@ -112,6 +112,26 @@ void BM_EncodeCatalogue(benchmark::State& state) {
 }
 BENCHMARK(BM_EncodeCatalogue)->Unit(benchmark::kMillisecond);
 
+// The encoder at two catalogue sizes, so that work growing faster than the
+// number of records shows in the fitted complexity.
+void BM_EncodeCatalogueBySize(benchmark::State& state) {
+  const auto count = static_cast<int>(state.range(0));
+  PlistArray records;
+  records.reserve(static_cast<std::size_t>(count));
+  for (int index = 0; index < count; ++index) records.push_back(productRecord(index));
+  const PlistValue value(std::move(records));
+  for (auto _ : state) {
+    const PlistData encoded = PropertyListSerialization::writeBinary(value);
+    benchmark::DoNotOptimize(encoded.data());
+  }
+  state.SetComplexityN(state.range(0));
+}
+BENCHMARK(BM_EncodeCatalogueBySize)
+    ->Arg(10'000)
+    ->Arg(40'000)
+    ->Complexity(benchmark::oN)
+    ->Unit(benchmark::kMillisecond);
+
 // Decoding alone: releasing the tree of the previous iteration is kept out
 // of the timed region, since it costs as much as building it.
 void BM_DecodeCatalogue(benchmark::State& state) {

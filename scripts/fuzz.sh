@@ -12,6 +12,10 @@ cmake -S . -B "$build" -G Ninja -DCMAKE_CXX_COMPILER=clang++ -DCMAKE_BUILD_TYPE=
 # clang also checks the lock annotations here (-Wthread-safety is an error),
 # so the tools are built too: everything with a lock is compiled by clang.
 cmake --build "$build" -j"$(nproc)" --target larder_fuzzers larderctl larder-store
+# The DMAP seeds as the current document builder writes them, beside the
+# committed ones.
+fresh_dmap_seeds="$build/fuzz/seeds/dmap"
+"$build/fuzz/dmap_seed_writer" "$fresh_dmap_seeds"
 for target in "$build"/fuzz/fuzz_*; do
   [ -x "$target" ] || continue
   name=$(basename "$target")
@@ -22,6 +26,7 @@ for target in "$build"/fuzz/fuzz_*; do
   work=$(mktemp -d)
   seeds=()
   [ -d "$corpus" ] && seeds=("$corpus")
+  [ "$corpus" = fuzz/corpus/dmap ] && seeds+=("$fresh_dmap_seeds")
   echo "== $name for ${seconds}s (seeds: ${seeds[*]:-none})"
   "$target" -max_total_time="$seconds" -timeout=10 -rss_limit_mb=4096 -print_final_stats=1 \
     "$work" "${seeds[@]}" 2>&1 | tail -n 12

@@ -146,7 +146,6 @@ TEST(DAAPItemKeyTest, PropertiesAreReachableByKeyOthersGoToTheDictionary) {
   EXPECT_EQ(item->valueForKey("itemID").int64Value(), 77);
   EXPECT_EQ(item->valueForKey("songalbum"), DAAPValue("Album"));
   EXPECT_EQ(item->valueForKey("isFrozen"), DAAPValue(false));
-  EXPECT_EQ(item->valueForKey("isFrozen"), DAAPValue(false));
   EXPECT_EQ(item->valueForUndefinedKey("isFrozen"), DAAPValue("yes"));
   item->setValue({}, key("itemID"));
   EXPECT_EQ(item->itemID(), 0u);

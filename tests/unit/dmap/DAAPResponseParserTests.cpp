@@ -4,9 +4,9 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
 
-#include "DAAPProtocolTables.h"
 #include "DAAPTestSupport.h"
 #include "dmap/DAAPItem.h"
 
@@ -163,6 +163,47 @@ TEST(DAAPDispatchTest, EveryTopLevelCodeGivesItsKindOfResult) {
   EXPECT_TRUE(decode(container("msrv", {})).isDictionary());
   EXPECT_EQ(decode(container("mlog", {u32("mstt", 200), u32("mlid", 9)})),
             DAAPValue(std::int64_t{9}));
+}
+
+// Each seed document (the fuzz targets' starting points) is a non-empty
+// result of its code's shape, so that fuzzing starts from documents that
+// reach the parsers' insides.
+TEST(DAAPDispatchTest, EverySeedDocumentDecodesToSomethingOfItsCodesShape) {
+  const std::vector<std::pair<std::string, Tag>> seeds = seedDocuments();
+  ASSERT_EQ(seeds.size(), kTopLevelCodes.size());
+  for (const TopLevelCode& top : kTopLevelCodes) {
+    SCOPED_TRACE(top.code);
+    const auto seed = std::find_if(seeds.begin(), seeds.end(),
+                                   [&](const auto& entry) { return entry.first == top.code; });
+    ASSERT_NE(seed, seeds.end());
+    const DAAPValue value = decode(seed->second);
+    EXPECT_TRUE(hasShape(value, top.shape)) << value.description();
+    if (const DAAPDictionary* dictionary = value.dictionary()) {
+      EXPECT_FALSE(dictionary->empty());
+    }
+    if (const DAAPArray* array = value.array()) {
+      EXPECT_FALSE(array->empty());
+    }
+  }
+  EXPECT_EQ(decode(seeds.at(0).second)["dmap.listing"].array()->size(), 2u);
+  const auto login = std::find_if(seeds.begin(), seeds.end(),
+                                  [](const auto& entry) { return entry.first == "mlog"; });
+  EXPECT_EQ(decode(login->second).int64Value(), 1234);
+}
+
+TEST(DAAPDispatchTest, SeedBookItemKeepsEveryFieldTheLibraryReads) {
+  const DAAPValue item = decode(container("medc", bookItem(6).children));
+  const DAAPDictionary fields = item.item()->dictionaryRepresentation();
+  for (const char* key :
+       {"com.orvane.sonorel.orms-songid", "daap.songgenre", "daap.sortname",
+        "daap.songdatepurchased", "com.orvane.sonorel.item-flavor-listing",
+        "com.orvane.sonorel.publication-version", "com.orvane.sonorel.display-publication-version",
+        "com.orvane.sonorel.store.expected-release-date",
+        "com.orvane.sonorel.cloud-purchased-token", "dmap.itemid",
+        "com.orvane.sonorel.cloud-artwork-url", "com.orvane.sonorel.extended-media-kind"}) {
+    EXPECT_FALSE(lookup(fields, key).isNull()) << key;
+  }
+  EXPECT_EQ(lookup(fields, "dmap.itemid").int64Value(), 6);
 }
 
 // --------------------------------------------------- listing header rules

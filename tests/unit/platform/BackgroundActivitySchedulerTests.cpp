@@ -360,67 +360,72 @@ TEST_F(BackgroundActivitySchedulerTest, HandlerThatThrowsEndsItsRunAllTheSame) {
   EXPECT_EQ(runs.load(), 3);
 }
 
+struct Supply {
+  std::string name;
+  std::string type;
+  std::optional<int> online;
+};
+
 class BackgroundActivityPowerSourceTest : public ::testing::Test {
  protected:
   void SetUp() override {
     std::string pattern = (fs::temp_directory_path() / "larder-power-XXXXXX").string();
     ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
     root_ = pattern;
-    supplies_ = root_ + "/sys/class/power_supply";
-    fs::create_directories(supplies_);
   }
   void TearDown() override {
     std::error_code ignored;
     fs::remove_all(root_, ignored);
   }
 
-  void supply(const std::string& name, const std::string& type, std::optional<int> online) const {
-    fs::create_directories(supplies_ + "/" + name);
-    std::ofstream(supplies_ + "/" + name + "/type") << type << "\n";
-    if (online) std::ofstream(supplies_ + "/" + name + "/online") << *online << "\n";
-  }
-
-  [[nodiscard]] bool onMains() const {
-    return BackgroundActivityPowerSource::mainsPowerInSupplyFolder(supplies_);
+  // Writes the supplies into `folder`, below the test's root, and gives its path.
+  std::string supplies(const std::string& folder, const std::vector<Supply>& list) const {
+    const std::string path = root_ + "/" + folder;
+    fs::create_directories(path);
+    for (const Supply& supply : list) {
+      fs::create_directories(path + "/" + supply.name);
+      std::ofstream(path + "/" + supply.name + "/type") << supply.type << "\n";
+      if (supply.online)
+        std::ofstream(path + "/" + supply.name + "/online") << *supply.online << "\n";
+    }
+    return path;
   }
 
   std::string root_;
-  std::string supplies_;
 };
 
-TEST_F(BackgroundActivityPowerSourceTest, NoSuppliesIsADesktopOnMains) {
-  EXPECT_TRUE(onMains());
+TEST_F(BackgroundActivityPowerSourceTest, ReadsMainsFromTheSupplyFolder) {
+  const Supply battery{"BAT0", "Battery", std::nullopt};
+  struct Case {
+    const char* name;
+    std::vector<Supply> supplies;
+    bool onMains;
+  };
+  const std::vector<Case> cases{
+      {"no supplies: a desktop", {}, true},
+      {"laptop plugged in", {{"AC", "Mains", 1}, battery}, true},
+      {"laptop unplugged", {{"AC", "Mains", 0}, battery}, false},
+      {"offline usb source", {battery, {"ucsi-source-psy-1", "USB", 0}}, false},
+      {"usb-c charger counts as mains",
+       {battery, {"ucsi-source-psy-1", "USB", 0}, {"ucsi-source-psy-2", "USB_C", 1}},
+       true},
+      {"offline mains without battery still means battery", {{"AC", "Mains", 0}}, false},
+  };
+  for (std::size_t index = 0; index < cases.size(); ++index) {
+    SCOPED_TRACE(cases[index].name);
+    const std::string folder = supplies(std::to_string(index), cases[index].supplies);
+    EXPECT_EQ(BackgroundActivityPowerSource::mainsPowerInSupplyFolder(folder),
+              cases[index].onMains);
+  }
   EXPECT_TRUE(BackgroundActivityPowerSource::mainsPowerInSupplyFolder(root_ + "/missing"));
-}
-
-TEST_F(BackgroundActivityPowerSourceTest, LaptopPluggedInAndUnplugged) {
-  supply("AC", "Mains", 1);
-  supply("BAT0", "Battery", std::nullopt);
-  EXPECT_TRUE(onMains());
-  supply("AC", "Mains", 0);
-  EXPECT_FALSE(onMains());
-}
-
-TEST_F(BackgroundActivityPowerSourceTest, UsbChargerCountsAsMains) {
-  supply("BAT0", "Battery", std::nullopt);
-  supply("ucsi-source-psy-1", "USB", 0);
-  EXPECT_FALSE(onMains());
-  supply("ucsi-source-psy-2", "USB_C", 1);
-  EXPECT_TRUE(onMains());
-}
-
-TEST_F(BackgroundActivityPowerSourceTest, OfflineMainsWithoutBatteryStillMeansBattery) {
-  supply("AC", "Mains", 0);
-  EXPECT_FALSE(onMains());
 }
 
 TEST_F(BackgroundActivityPowerSourceTest, SystemSourceReadsBelowThePlatformRoot) {
   ::setenv("LARDER_ROOT", root_.c_str(), 1);
   const auto source = BackgroundActivityPowerSource::system();
-  supply("AC", "Mains", 0);
-  supply("BAT0", "Battery", std::nullopt);
+  supplies("sys/class/power_supply", {{"AC", "Mains", 0}, {"BAT0", "Battery", std::nullopt}});
   EXPECT_FALSE(source->isOnMainsPower());
-  supply("AC", "Mains", 1);
+  supplies("sys/class/power_supply", {{"AC", "Mains", 1}});
   EXPECT_TRUE(source->isOnMainsPower()) << "read afresh at every question";
 }
 

@@ -5,6 +5,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <string>
 
 #include "platform/metadata/MetadataAttributes.h"
@@ -128,70 +129,79 @@ class MetadataQueryBundleReading : public ::testing::Test {
     std::string pattern = (fs::temp_directory_path() / "larder-mdattr-XXXXXX").string();
     ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
     folder_ = pattern;
-    bundle_ = folder_ + "/Notes.app";
-    fs::create_directories(bundle_);
   }
   void TearDown() override {
     std::error_code ignored;
     fs::remove_all(folder_, ignored);
   }
 
-  void writeFile(const std::string& name, std::string_view contents) const {
-    std::ofstream(bundle_ + "/" + name, std::ios::binary) << contents;
-  }
-  void writePlist(const std::string& name, const PlistDictionary& dictionary) const {
-    writeFile(name, PropertyListSerialization::writeXml(PlistValue(dictionary)));
-  }
-  PlistDictionary read() const {
-    std::optional<Attributes::Reading> reading = Attributes::readBundle(bundle_);
-    EXPECT_TRUE(reading.has_value());
-    return reading ? reading->attributes : PlistDictionary{};
+  static void writeFile(const std::string& path, std::string_view contents) {
+    std::ofstream(path, std::ios::binary) << contents;
   }
 
   std::string folder_;
-  std::string bundle_;
 };
 
 TEST_F(MetadataQueryBundleReading, ReadsBothPropertyListsFromDisk) {
-  writePlist("bundle.plist", bundleInfo());
+  const std::string bundle = folder_ + "/Notes.app";
+  fs::create_directories(bundle);
+  writeFile(bundle + "/bundle.plist", PropertyListSerialization::writeXml(bundleInfo()));
   const PlistData binary = PropertyListSerialization::writeBinary(PlistValue(purchaseRecord()));
-  writeFile("purchase.plist", std::string(binary.begin(), binary.end()));
-  const std::optional<Attributes::Reading> reading = Attributes::readBundle(bundle_);
+  writeFile(bundle + "/purchase.plist", std::string(binary.begin(), binary.end()));
+  const std::optional<Attributes::Reading> reading = Attributes::readBundle(bundle);
   ASSERT_TRUE(reading.has_value());
   EXPECT_TRUE(reading->hasInformationPropertyList);
   EXPECT_EQ(reading->attributes,
-            Attributes::fromPropertyLists(bundle_, bundleInfo(), purchaseRecord()));
+            Attributes::fromPropertyLists(bundle, bundleInfo(), purchaseRecord()));
 }
 
+// Every kind of damage, tried on each of the two files: the damaged one
+// counts as absent, the other is read all the same, and nothing blocks.
 TEST_F(MetadataQueryBundleReading, DamagedFilesCountAsAbsent) {
-  writeFile("bundle.plist", "<?xml version=\"1.0\"?><plist><dict><key>");
-  writeFile("purchase.plist", "");
-  const std::optional<Attributes::Reading> reading = Attributes::readBundle(bundle_);
-  ASSERT_TRUE(reading.has_value());
-  EXPECT_FALSE(reading->hasInformationPropertyList);
-  EXPECT_EQ(valueOf(reading->attributes, Attributes::kHasPurchaseRecord), PlistValue(0));
-  EXPECT_EQ(valueOf(reading->attributes, Attributes::kPath), PlistValue(bundle_));
-}
-
-TEST_F(MetadataQueryBundleReading, PipeInPlaceOfAPlistDoesNotBlock) {
-  ASSERT_EQ(::mkfifo((bundle_ + "/purchase.plist").c_str(), 0644), 0);
-  writePlist("bundle.plist", bundleInfo());
-  EXPECT_EQ(valueOf(read(), Attributes::kHasPurchaseRecord), PlistValue(0));
-}
-
-TEST_F(MetadataQueryBundleReading, FolderOrDanglingLinkInPlaceOfAPlist) {
-  fs::create_directories(bundle_ + "/purchase.plist");
-  fs::create_symlink(bundle_ + "/nowhere.plist", bundle_ + "/bundle.plist");
-  const PlistDictionary attributes = read();
-  EXPECT_EQ(valueOf(attributes, Attributes::kHasPurchaseRecord), PlistValue(0));
-  EXPECT_TRUE(valueOf(attributes, Attributes::kBundleIdentifier).isNull());
-}
-
-TEST_F(MetadataQueryBundleReading, OversizedPlistIsNotRead) {
-  PlistDictionary huge = purchaseRecord();
-  huge["padding"] = std::string(Attributes::kMaxSourceFileBytes, 'x');
-  writePlist("purchase.plist", huge);
-  EXPECT_EQ(valueOf(read(), Attributes::kHasPurchaseRecord), PlistValue(0));
+  using Damage = std::function<void(const std::string& path, const PlistDictionary& contents)>;
+  const std::vector<std::pair<const char*, Damage>> damages{
+      {"truncated",
+       [](const std::string& path, const PlistDictionary&) {
+         writeFile(path, "<?xml version=\"1.0\"?><plist><dict><key>");
+       }},
+      {"empty", [](const std::string& path, const PlistDictionary&) { writeFile(path, ""); }},
+      {"pipe", [](const std::string& path,
+                  const PlistDictionary&) { ASSERT_EQ(::mkfifo(path.c_str(), 0644), 0); }},
+      {"folder",
+       [](const std::string& path, const PlistDictionary&) { fs::create_directories(path); }},
+      {"dangling link",
+       [](const std::string& path, const PlistDictionary&) {
+         fs::create_symlink(path + ".nowhere", path);
+       }},
+      {"oversized",
+       [](const std::string& path, const PlistDictionary& contents) {
+         PlistDictionary huge = contents;
+         huge["padding"] = std::string(Attributes::kMaxSourceFileBytes, 'x');
+         writeFile(path, PropertyListSerialization::writeXml(huge));
+       }},
+  };
+  int count = 0;
+  for (const auto& [name, damage] : damages) {
+    for (const bool damageInformation : {true, false}) {
+      SCOPED_TRACE(std::string(name) + (damageInformation ? " bundle.plist" : " purchase.plist"));
+      const std::string bundle = folder_ + "/" + std::to_string(++count) + ".app";
+      fs::create_directories(bundle);
+      // What reading should see: nothing in place of the damaged file.
+      const PlistValue info = damageInformation ? PlistValue() : PlistValue(bundleInfo());
+      const PlistValue purchase = damageInformation ? PlistValue(purchaseRecord()) : PlistValue();
+      if (damageInformation) {
+        damage(bundle + "/bundle.plist", bundleInfo());
+        writeFile(bundle + "/purchase.plist", PropertyListSerialization::writeXml(purchase));
+      } else {
+        writeFile(bundle + "/bundle.plist", PropertyListSerialization::writeXml(info));
+        damage(bundle + "/purchase.plist", purchaseRecord());
+      }
+      const std::optional<Attributes::Reading> reading = Attributes::readBundle(bundle);
+      ASSERT_TRUE(reading.has_value());
+      EXPECT_EQ(reading->hasInformationPropertyList, !damageInformation);
+      EXPECT_EQ(reading->attributes, Attributes::fromPropertyLists(bundle, info, purchase));
+    }
+  }
 }
 
 TEST_F(MetadataQueryBundleReading, NotAFolderIsNoBundle) {

@@ -5,6 +5,7 @@
 
 #include <cstdint>
 #include <string>
+#include <vector>
 
 namespace larder {
 namespace {
@@ -84,113 +85,101 @@ TEST(MetadataQueryPredicate, LegacyQueryTakesListedBundlesWithoutPurchaseOrSigna
   EXPECT_FALSE(matches(kLegacyQuery, notABundle));
 }
 
-TEST(MetadataQueryPredicate, AndBindsTighterThanOr) {
-  const PlistDictionary attributes{{"a", std::int64_t{1}}, {"b", std::int64_t{0}}};
-  EXPECT_TRUE(matches("a == 1 || b == 1 && a == 0", attributes));
-  EXPECT_FALSE(matches("(a == 1 || b == 1) && a == 0", attributes));
-}
-
-TEST(MetadataQueryPredicate, EveryComparisonOperatorOnNumbers) {
-  const PlistDictionary attributes{{"n", std::int64_t{5}}};
-  EXPECT_TRUE(matches("n == 5", attributes));
-  EXPECT_TRUE(matches("n = 5", attributes));
-  EXPECT_FALSE(matches("n != 5", attributes));
-  EXPECT_TRUE(matches("n < 6", attributes));
-  EXPECT_FALSE(matches("n < 5", attributes));
-  EXPECT_TRUE(matches("n > 4.5", attributes));
-  EXPECT_TRUE(matches("n <= 5", attributes));
-  EXPECT_FALSE(matches("n >= 5.01", attributes));
-  EXPECT_TRUE(matches("n == 5.0", attributes));
-  EXPECT_TRUE(matches("n == '5'", attributes)) << "a quoted number is still a number";
-  EXPECT_TRUE(matches("n > -3", attributes));
-  EXPECT_TRUE(matches("n == +5", attributes));
-}
-
-TEST(MetadataQueryPredicate, NumbersCompareNumericallyNotAsText) {
-  EXPECT_TRUE(matches("n > 9", {{"n", std::int64_t{10}}}));
-  EXPECT_TRUE(matches("v > 9", {{"v", "10"}})) << "both texts read as numbers";
-  EXPECT_FALSE(matches("v > 9", {{"v", "10.1.2"}})) << "not a number: byte order, '1' < '9'";
-}
-
-TEST(MetadataQueryPredicate, LargeIdentifiersCompareExactly) {
-  const PlistDictionary attributes{{"id", std::int64_t{9007199254740993}}};
-  EXPECT_TRUE(matches("id == 9007199254740993", attributes));
-  EXPECT_FALSE(matches("id == 9007199254740992", attributes));
-}
-
-TEST(MetadataQueryPredicate, RealsBooleansAndDatesAreNumbers) {
-  EXPECT_TRUE(matches("w == 401000001", {{"w", 401000001.0}}));
-  EXPECT_TRUE(matches("flag == 1", {{"flag", true}}));
-  EXPECT_TRUE(matches("flag != 1", {{"flag", false}}));
-  EXPECT_TRUE(matches("d > 1000", {{"d", PlistDate{1500.5}}}));
-  EXPECT_FALSE(matches("d > 2000", {{"d", PlistDate{1500.5}}}));
-}
-
-TEST(MetadataQueryPredicate, StringsCompareByteByByte) {
-  const PlistDictionary attributes{{"s", "beta"}};
-  EXPECT_TRUE(matches("s == beta", attributes));
-  EXPECT_TRUE(matches("s == \"beta\"", attributes));
-  EXPECT_FALSE(matches("s == Beta", attributes)) << "case matters";
-  EXPECT_TRUE(matches("s > alpha", attributes));
-  EXPECT_TRUE(matches("s < gamma", attributes));
-  EXPECT_TRUE(matches("s >= beta && s <= beta", attributes));
-  EXPECT_TRUE(matches("s != alpha", attributes));
-}
-
-TEST(MetadataQueryPredicate, TrailingStarIsAPrefixWildcard) {
-  const PlistDictionary attributes{{"id", "com.orvane.SetupHerald"}};
-  EXPECT_TRUE(matches("id == 'com.orvane.SetupHerald*'", attributes));
-  EXPECT_TRUE(matches("id == com.orvane.*", attributes)) << "bare words take it too";
-  EXPECT_TRUE(matches("id == *", attributes)) << "an empty prefix matches every string";
-  EXPECT_FALSE(matches("id == 'com.orvane.SetupHeraldX*'", attributes));
-  EXPECT_TRUE(matches("id != 'org.*'", attributes));
-  EXPECT_FALSE(matches("id != 'com.*'", attributes));
-  EXPECT_FALSE(matches("id == 'com.*.SetupHerald'", attributes)) << "only a trailing star";
-}
-
-TEST(MetadataQueryPredicate, EscapedStarIsACharacter) {
-  EXPECT_TRUE(matches(R"(s == 'a\*')", {{"s", "a*"}}));
-  EXPECT_FALSE(matches(R"(s == 'a\*')", {{"s", "ab"}}));
-  EXPECT_TRUE(matches(R"(s == 'it\'s')", {{"s", "it's"}}));
-  EXPECT_TRUE(matches(R"(s == "say \"hi\"")", {{"s", "say \"hi\""}}));
-  EXPECT_TRUE(matches(R"(s == 'back\\*')", {{"s", "back\\slash"}})) << "escaped backslash, star";
-}
-
-TEST(MetadataQueryPredicate, WildcardIsAPlainStarForOrdering) {
-  EXPECT_TRUE(matches("s > 'a*'", {{"s", "ab"}}));
-  EXPECT_FALSE(matches("s < 'a*'", {{"s", "ab"}}));
-}
-
-TEST(MetadataQueryPredicate, AbsentAttributeEqualsNothing) {
-  const PlistDictionary none;
-  EXPECT_FALSE(matches("missing == 1", none));
-  EXPECT_FALSE(matches("missing == *", none));
-  EXPECT_TRUE(matches("missing != 1", none));
-  EXPECT_TRUE(matches("missing != *", none));
-  EXPECT_FALSE(matches("missing < 1", none));
-  EXPECT_FALSE(matches("missing >= 1", none));
-}
-
-TEST(MetadataQueryPredicate, MismatchedTypesAreUnequalAndUnordered) {
-  EXPECT_FALSE(matches("n == abc", {{"n", std::int64_t{1}}}));
-  EXPECT_TRUE(matches("n != abc", {{"n", std::int64_t{1}}}));
-  EXPECT_FALSE(matches("n < abc", {{"n", std::int64_t{1}}}));
-  EXPECT_FALSE(matches("n == 12*", {{"n", std::int64_t{123}}})) << "no wildcard on numbers";
-  EXPECT_FALSE(matches("list == 1", {{"list", PlistArray{1}}}));
-  EXPECT_TRUE(matches("list != 1", {{"list", PlistArray{1}}}));
-  EXPECT_FALSE(matches("s == 1", {{"s", "one"}}));
-}
-
-TEST(MetadataQueryPredicate, InfAndNanAreWordsNotNumbers) {
-  EXPECT_TRUE(matches("s == inf", {{"s", "inf"}}));
-  EXPECT_FALSE(matches("n == nan", {{"n", 0.0}}));
-  EXPECT_TRUE(matches("s == -inf", {{"s", "-inf"}}));
-  EXPECT_TRUE(matches("n != -nan", {{"n", 0.0}}));
-  EXPECT_FALSE(matches("n < -nan", {{"n", 0.0}}));
-}
-
-TEST(MetadataQueryPredicate, WhitespaceIsFree) {
-  EXPECT_TRUE(matches("  (\ta==1)\n&&b=='x'  ", {{"a", std::int64_t{1}}, {"b", "x"}}));
+// Each row: a query, the attributes it is asked about, and whether it matches.
+TEST(MetadataQueryPredicate, MatchesAsTheQuerySays) {
+  const PlistDictionary five{{"n", std::int64_t{5}}};
+  const PlistDictionary beta{{"s", "beta"}};
+  const PlistDictionary installer{{"id", "com.orvane.SetupHerald"}};
+  const PlistDictionary one{{"n", std::int64_t{1}}};
+  const PlistDictionary zero{{"n", 0.0}};
+  struct Case {
+    const char* query;
+    PlistDictionary attributes;
+    bool matches;
+  };
+  const std::vector<Case> cases{
+      // && binds tighter than ||.
+      {"a == 1 || b == 1 && a == 0", {{"a", std::int64_t{1}}, {"b", std::int64_t{0}}}, true},
+      {"(a == 1 || b == 1) && a == 0", {{"a", std::int64_t{1}}, {"b", std::int64_t{0}}}, false},
+      // Every operator on numbers; a quoted number is still a number.
+      {"n == 5", five, true},
+      {"n = 5", five, true},
+      {"n != 5", five, false},
+      {"n < 6", five, true},
+      {"n < 5", five, false},
+      {"n > 4.5", five, true},
+      {"n <= 5", five, true},
+      {"n >= 5.01", five, false},
+      {"n == 5.0", five, true},
+      {"n == '5'", five, true},
+      {"n > -3", five, true},
+      {"n == +5", five, true},
+      // Numbers compare numerically; text that is no number compares byte by byte.
+      {"n > 9", {{"n", std::int64_t{10}}}, true},
+      {"v > 9", {{"v", "10"}}, true},
+      {"v > 9", {{"v", "10.1.2"}}, false},
+      // Large identifiers compare exactly.
+      {"id == 9007199254740993", {{"id", std::int64_t{9007199254740993}}}, true},
+      {"id == 9007199254740992", {{"id", std::int64_t{9007199254740993}}}, false},
+      // Reals, flags and dates are numbers.
+      {"w == 401000001", {{"w", 401000001.0}}, true},
+      {"flag == 1", {{"flag", true}}, true},
+      {"flag != 1", {{"flag", false}}, true},
+      {"d > 1000", {{"d", PlistDate{1500.5}}}, true},
+      {"d > 2000", {{"d", PlistDate{1500.5}}}, false},
+      // Strings compare byte by byte, case included.
+      {"s == beta", beta, true},
+      {"s == \"beta\"", beta, true},
+      {"s == Beta", beta, false},
+      {"s > alpha", beta, true},
+      {"s < gamma", beta, true},
+      {"s >= beta && s <= beta", beta, true},
+      {"s != alpha", beta, true},
+      // Only a trailing star is a prefix wildcard, quoted or bare; an empty prefix takes all.
+      {"id == 'com.orvane.SetupHerald*'", installer, true},
+      {"id == com.orvane.*", installer, true},
+      {"id == *", installer, true},
+      {"id == 'com.orvane.SetupHeraldX*'", installer, false},
+      {"id != 'org.*'", installer, true},
+      {"id != 'com.*'", installer, false},
+      {"id == 'com.*.SetupHerald'", installer, false},
+      // Escapes: an escaped star is a character, an escaped backslash is not an escape.
+      {R"(s == 'a\*')", {{"s", "a*"}}, true},
+      {R"(s == 'a\*')", {{"s", "ab"}}, false},
+      {R"(s == 'it\'s')", {{"s", "it's"}}, true},
+      {R"(s == "say \"hi\"")", {{"s", "say \"hi\""}}, true},
+      {R"(s == 'back\\*')", {{"s", "back\\slash"}}, true},
+      // For ordering the wildcard is a plain star.
+      {"s > 'a*'", {{"s", "ab"}}, true},
+      {"s < 'a*'", {{"s", "ab"}}, false},
+      // An absent attribute equals nothing and is unordered.
+      {"missing == 1", {}, false},
+      {"missing == *", {}, false},
+      {"missing != 1", {}, true},
+      {"missing != *", {}, true},
+      {"missing < 1", {}, false},
+      {"missing >= 1", {}, false},
+      // Mismatched types are unequal and unordered; no wildcard on numbers.
+      {"n == abc", one, false},
+      {"n != abc", one, true},
+      {"n < abc", one, false},
+      {"n == 12*", {{"n", std::int64_t{123}}}, false},
+      {"list == 1", {{"list", PlistArray{1}}}, false},
+      {"list != 1", {{"list", PlistArray{1}}}, true},
+      {"s == 1", {{"s", "one"}}, false},
+      // inf and nan are words, not numbers.
+      {"s == inf", {{"s", "inf"}}, true},
+      {"n == nan", zero, false},
+      {"s == -inf", {{"s", "-inf"}}, true},
+      {"n != -nan", zero, true},
+      {"n < -nan", zero, false},
+      // Whitespace is free.
+      {"  (\ta==1)\n&&b=='x'  ", {{"a", std::int64_t{1}}, {"b", "x"}}, true},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.query);
+    EXPECT_EQ(matches(c.query, c.attributes), c.matches);
+  }
 }
 
 TEST(MetadataQueryPredicate, NamesTheAttributesItReads) {

@@ -13,6 +13,7 @@
 #include <deque>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <mutex>
 #include <set>
 #include <string>
@@ -47,8 +48,6 @@ constexpr const char* kLegacyQuery =
 // Far above the query's own delays (50 ms quiet, 150 ms longest), so that a slow sanitizer
 // build still passes; a passing test returns as soon as its event has come.
 constexpr auto kEventTimeout = 1500ms;
-// How long a test listens to be sure that nothing comes.
-constexpr auto kQuietWindow = 300ms;
 
 std::vector<std::string> valueAttributes() {
   return {"kHostItemQuaymartWareID",       "kHostItemQuaymartInstallerVersionID",
@@ -114,24 +113,38 @@ class QueryRecorder {
     return update;
   }
 
-  // Updates until one has an added, changed or removed item at `path`, merged in order.
-  RecordedUpdate updatesUntilPath(const std::string& path) {
+  // Updates merged in order until `done` holds for the one just come (or none comes).
+  RecordedUpdate updatesUntil(const std::function<bool(const RecordedUpdate&)>& done) {
     RecordedUpdate merged;
     while (std::optional<RecordedUpdate> update = nextUpdate()) {
       append(merged.added, update->added);
       append(merged.changed, update->changed);
       append(merged.removed, update->removed);
-      auto mentions = [&](const std::vector<RecordedItem>& items) {
-        return std::any_of(items.begin(), items.end(),
-                           [&](const RecordedItem& item) { return item.path() == path; });
-      };
-      if (mentions(update->added) || mentions(update->changed) || mentions(update->removed)) break;
+      if (done(*update)) break;
     }
     return merged;
   }
 
-  bool staysQuiet(std::chrono::milliseconds window = kQuietWindow) {
-    return !nextUpdate(window).has_value();
+  // Updates until one has an added, changed or removed item at `path`.
+  RecordedUpdate updatesUntilPath(const std::string& path) {
+    return updatesUntil([&](const RecordedUpdate& update) {
+      auto mentions = [&](const std::vector<RecordedItem>& items) {
+        return std::any_of(items.begin(), items.end(),
+                           [&](const RecordedItem& item) { return item.path() == path; });
+      };
+      return mentions(update.added) || mentions(update.changed) || mentions(update.removed);
+    });
+  }
+
+  RecordedUpdate updatesUntilAnAddition() {
+    return updatesUntil([](const RecordedUpdate& update) { return !update.added.empty(); });
+  }
+
+  // Nothing more has been told so far; call it once the query has shown,
+  // by a later event, that it has taken up what came before.
+  bool nothingPending() {
+    drain();
+    return !nextUpdate(0ms).has_value();
   }
 
   bool waitForPortInvalid() {
@@ -289,6 +302,18 @@ class MetadataQueryTest : public ::testing::Test {
     return root_ + "/Applications/" + name;
   }
 
+  // Lands a bundle of its own and waits for it to be told. Events are taken
+  // up in order, so by then whatever the test did before has been seen, and
+  // the marker must be all that was told since.
+  void expectOnlyAMarkerNext(QueryRecorder& recorder) {
+    const std::string marker = applications("Marker" + std::to_string(++markers_) + ".app");
+    landBundle(marker, storeApp("com.example.Marker", 900000 + markers_));
+    const RecordedUpdate merged = recorder.updatesUntilPath(marker);
+    EXPECT_EQ(pathsOf(merged.added), std::vector<std::string>{marker});
+    EXPECT_THAT(pathsOf(merged.changed), IsEmpty());
+    EXPECT_THAT(pathsOf(merged.removed), IsEmpty());
+  }
+
   static BundleContents storeApp(std::string identifier, std::int64_t wareID = 401000001) {
     return {std::move(identifier), "1.0", wareID};
   }
@@ -297,6 +322,7 @@ class MetadataQueryTest : public ::testing::Test {
   std::string root_;
   std::string home_;
   std::string staging_;
+  int markers_ = 0;
   std::vector<std::pair<std::shared_ptr<MetadataQuery>, std::unique_ptr<QueryRecorder>>> queries_;
 };
 
@@ -361,17 +387,20 @@ TEST_F(MetadataQueryTest, BundleLandingIsOneAddedWithItsAttributes) {
             PlistValue("com.example.Notes"));
   EXPECT_EQ(query->resultCount(), 1u);
   EXPECT_LT(latency, kEventTimeout);
-  EXPECT_TRUE(recorder->staysQuiet());
+  expectOnlyAMarkerNext(*recorder);
 }
 
 TEST_F(MetadataQueryTest, BundleCopiedFileByFileIsOneAddedWithFinalAttributes) {
-  auto [query, recorder] = startQuery();
+  MetadataQuery::Options patient = fastOptions();
+  patient.settleLimit = kEventTimeout;
+  auto [query, recorder] = startQuery(kStoreQuery, patient);
   const std::string path = applications("Notes.app");
   const BundleContents contents = storeApp("com.example.Notes");
-  // The purchase record first and the information list a while later, as a slow copy might.
+  // The purchase record first and the information list a while later, as a slow copy might:
+  // the half-copied bundle is held back while another one lands.
   fs::create_directories(path);
   writePlist(path + "/purchase.plist", purchaseFor(contents));
-  std::this_thread::sleep_for(120ms);
+  expectOnlyAMarkerNext(*recorder);
   writePlist(path + "/bundle.plist", {{"HostBundleIdentifier", contents.identifier},
                                       {"HostBundleShortVersionString", contents.version}});
   std::optional<RecordedUpdate> update = recorder->nextUpdate();
@@ -380,7 +409,7 @@ TEST_F(MetadataQueryTest, BundleCopiedFileByFileIsOneAddedWithFinalAttributes) {
   EXPECT_EQ(update->added[0].attributes.at("kHostItemHostBundleIdentifier"),
             PlistValue("com.example.Notes"));
   EXPECT_EQ(update->added[0].attributes.at("kHostItemVersion"), PlistValue("1.0"));
-  EXPECT_TRUE(recorder->staysQuiet());
+  expectOnlyAMarkerNext(*recorder);
 }
 
 TEST_F(MetadataQueryTest, BundleThatNeverGetsItsInformationListArrivesAfterTheLimit) {
@@ -441,7 +470,7 @@ TEST_F(MetadataQueryTest, UnrelatedFilesInsideABundleAreNoChange) {
   fs::create_directories(applications("Notes.app/bin"));
   // Rewriting the record with the same contents changes no attribute either.
   writePlist(applications("Notes.app/purchase.plist"), purchaseFor(storeApp("com.example.Notes")));
-  EXPECT_TRUE(recorder->staysQuiet());
+  expectOnlyAMarkerNext(*recorder);
 }
 
 TEST_F(MetadataQueryTest, DeletingABundleRemovesItsItem) {
@@ -518,14 +547,8 @@ TEST_F(MetadataQueryTest, ReplacingABundleIsARemovalAndAnAddition) {
   writeBundle(staging_ + "/Notes.app", newer);
   fs::rename(applications("Notes.app"), staging_ + "/Old.app");
   fs::rename(staging_ + "/Notes.app", applications("Notes.app"));
-  RecordedUpdate merged;
-  while (merged.added.empty()) {
-    std::optional<RecordedUpdate> update = recorder->nextUpdate();
-    ASSERT_TRUE(update.has_value());
-    merged.removed.insert(merged.removed.end(), update->removed.begin(), update->removed.end());
-    merged.added.insert(merged.added.end(), update->added.begin(), update->added.end());
-    EXPECT_THAT(update->changed, IsEmpty());
-  }
+  const RecordedUpdate merged = recorder->updatesUntilAnAddition();
+  EXPECT_THAT(merged.changed, IsEmpty());
   ASSERT_EQ(merged.removed.size(), 1u);
   EXPECT_EQ(merged.removed[0].item, old);
   ASSERT_EQ(merged.added.size(), 1u);
@@ -553,14 +576,8 @@ TEST_F(MetadataQueryTest, BundleDeletedAndMadeAgainIsANewItem) {
     BundleContents again = storeApp("com.example.Notes");
     again.version = name;
     writeBundle(applications(name), again);
-    RecordedUpdate merged;
-    while (merged.added.empty()) {
-      std::optional<RecordedUpdate> update = recorder->nextUpdate();
-      ASSERT_TRUE(update.has_value()) << name;
-      merged.removed.insert(merged.removed.end(), update->removed.begin(), update->removed.end());
-      merged.added.insert(merged.added.end(), update->added.begin(), update->added.end());
-      EXPECT_THAT(update->changed, IsEmpty()) << name;
-    }
+    const RecordedUpdate merged = recorder->updatesUntilAnAddition();
+    EXPECT_THAT(merged.changed, IsEmpty()) << name;
     ASSERT_EQ(merged.removed.size(), 1u) << name;
     EXPECT_EQ(merged.removed[0].item, old) << name;
     ASSERT_EQ(merged.added.size(), 1u) << name;
@@ -676,7 +693,7 @@ TEST_F(MetadataQueryTest, BundleVanishingDuringTheGatheringIsLeftOut) {
   };
   auto [query, recorder] = startQuery(kStoreQuery, options);
   EXPECT_THAT(recorder->initialPaths(), ElementsAre(applications("Staying.app")));
-  EXPECT_TRUE(recorder->staysQuiet()) << "never reported, so never removed";
+  expectOnlyAMarkerNext(*recorder);  // never reported, so never removed
 }
 
 TEST_F(MetadataQueryTest, FolderVanishingDuringAnUpdateIsSurvived) {
@@ -693,12 +710,8 @@ TEST_F(MetadataQueryTest, FolderVanishingDuringAnUpdateIsSurvived) {
   writeBundle(staging_ + "/Games/Go.app", storeApp("com.example.Go", 2));
   fs::rename(staging_ + "/Games", applications("Games"));
   // The whole folder went while its first bundle was being read: nothing stays.
-  EXPECT_TRUE(recorder->staysQuiet());
-  EXPECT_EQ(query->resultCount(), 0u);
-  landBundle(applications("Next.app"), storeApp("com.example.Next", 3));
-  std::optional<RecordedUpdate> update = recorder->nextUpdate();
-  ASSERT_TRUE(update.has_value());
-  EXPECT_EQ(pathsOf(update->added), std::vector<std::string>{applications("Next.app")});
+  expectOnlyAMarkerNext(*recorder);
+  EXPECT_EQ(query->resultCount(), 1u);
 }
 
 TEST_F(MetadataQueryTest, NewVolumesAndFoldersAreWatched) {
@@ -717,10 +730,11 @@ TEST_F(MetadataQueryTest, NewVolumesAndFoldersAreWatched) {
   EXPECT_EQ(pathsOf(merged.added),
             std::vector<std::string>{root_ + "/Volumes/Two/Applications/Near.app"});
 
+  // Each step is seen before the next is taken.
   fs::create_directories(root_ + "/Volumes/Three");
-  std::this_thread::sleep_for(100ms);
+  expectOnlyAMarkerNext(*recorder);
   fs::create_directories(root_ + "/Volumes/Three/Applications");
-  std::this_thread::sleep_for(100ms);
+  expectOnlyAMarkerNext(*recorder);
   landBundle(root_ + "/Volumes/Three/Applications/Mid.app", storeApp("com.example.Mid", 3));
   merged = recorder->updatesUntilPath(root_ + "/Volumes/Three/Applications/Mid.app");
   EXPECT_EQ(pathsOf(merged.added),
@@ -731,7 +745,7 @@ TEST_F(MetadataQueryTest, NewVolumesAndFoldersAreWatched) {
   merged = recorder->updatesUntilPath(root_ + "/Volumes/Two/Applications/Near.app");
   EXPECT_EQ(pathsOf(merged.removed),
             std::vector<std::string>{root_ + "/Volumes/Two/Applications/Near.app"});
-  EXPECT_EQ(query->resultCount(), 2u);
+  EXPECT_EQ(query->resultCount(), 4u) << "Far, Mid and the two markers";
 }
 
 TEST_F(MetadataQueryTest, HomeApplicationsFolderAppearingLater) {
@@ -756,8 +770,13 @@ TEST_F(MetadataQueryTest, BurstOfWritesIsCoalesced) {
   }
   const auto writing = std::chrono::steady_clock::now() - start;
   std::vector<RecordedUpdate> updates;
-  while (std::optional<RecordedUpdate> update = recorder->nextUpdate(kQuietWindow)) {
+  const auto isLast = [](const RecordedUpdate& update) {
+    return !update.changed.empty() && update.changed.back().attributes.at(
+                                          "kHostItemQuaymartInstallerVersionID") == PlistValue(30);
+  };
+  while (std::optional<RecordedUpdate> update = recorder->nextUpdate()) {
     updates.push_back(std::move(*update));
+    if (isLast(updates.back())) break;
   }
   ASSERT_FALSE(updates.empty());
   // At most one update per longest delay (150 ms) while the writes went on, and one after.
@@ -774,13 +793,10 @@ TEST_F(MetadataQueryTest, OverflowInvalidatesTheQueryAndARestartRecovers) {
   ASSERT_TRUE(recorder->waitForPortInvalid());
   EXPECT_EQ(recorder->portInvalidCount(), 1);
 
-  // What happens now goes unseen by the old query...
+  // What happens now goes unseen by the old query, while the owner's new query finds it in
+  // its gathering and then follows the disk again; once that one has told of a later bundle,
+  // the old one has had its chance to tell of either.
   landBundle(applications("Missed.app"), storeApp("com.example.Missed", 2));
-  EXPECT_TRUE(recorder->staysQuiet());
-  EXPECT_EQ(query->resultCount(), 1u);
-
-  // ...and the owner's new query finds it in its gathering, then follows the disk again.
-  query->stop();
   auto [again, againRecorder] = startQuery();
   EXPECT_THAT(againRecorder->initialPaths(),
               ElementsAre(applications("Missed.app"), applications("Notes.app")));
@@ -788,6 +804,8 @@ TEST_F(MetadataQueryTest, OverflowInvalidatesTheQueryAndARestartRecovers) {
   std::optional<RecordedUpdate> update = againRecorder->nextUpdate();
   ASSERT_TRUE(update.has_value());
   EXPECT_EQ(pathsOf(update->added), std::vector<std::string>{applications("Later.app")});
+  EXPECT_TRUE(recorder->nothingPending());
+  EXPECT_EQ(query->resultCount(), 1u);
 }
 
 TEST_F(MetadataQueryTest, MalformedQueryDoesNotStart) {
@@ -808,11 +826,15 @@ TEST_F(MetadataQueryTest, StartsOnlyOnce) {
 
 TEST_F(MetadataQueryTest, StopEndsTheEvents) {
   auto [query, recorder] = startQuery();
+  auto [witness, witnessRecorder] = startQuery();
   query->stop();
   query->stop();
   EXPECT_TRUE(query->isStopped());
   landBundle(applications("Notes.app"), storeApp("com.example.Notes"));
-  EXPECT_TRUE(recorder->staysQuiet());
+  // The query still running tells of it: the stopped one has had its chance.
+  const RecordedUpdate seen = witnessRecorder->updatesUntilPath(applications("Notes.app"));
+  EXPECT_EQ(pathsOf(seen.added), std::vector<std::string>{applications("Notes.app")});
+  EXPECT_TRUE(recorder->nothingPending());
 }
 
 TEST_F(MetadataQueryTest, ReleasingAStartedQueryEndsIt) {
