@@ -3,7 +3,6 @@
 // refused as a whole.
 #include <gtest/gtest.h>
 
-#include <functional>
 #include <string>
 #include <vector>
 
@@ -141,11 +140,6 @@ TEST(TillDownloadRecord, ArchiveRefusesNestedRecordsOfTheWrongClass) {
   EXPECT_EQ(TillDownload::initWithCoder(otherClass), nullptr);
 }
 
-struct Malformation {
-  std::string name;
-  std::function<void(PlistDictionary&)> apply;
-};
-
 PlistDictionary& metadataOf(PlistDictionary& download) {
   return *download["metadata"].dictionary();
 }
@@ -154,64 +148,51 @@ PlistDictionary& firstAsset(PlistDictionary& download) {
 }
 
 TEST(TillDownloadRecord, MalformedDownloadsAreRefusedAsAWhole) {
-  const std::vector<Malformation> malformations = {
-      {"no metadata", [](PlistDictionary& d) { d.erase("metadata"); }},
-      {"metadata is a string", [](PlistDictionary& d) { d["metadata"] = "thing"; }},
-      {"item identifier is text",
-       [](PlistDictionary& d) { metadataOf(d)["itemIdentifier"] = "42"; }},
-      {"item identifier is negative",
-       [](PlistDictionary& d) { metadataOf(d)["itemIdentifier"] = -1; }},
-      {"title is a number", [](PlistDictionary& d) { metadataOf(d)["title"] = 5; }},
-      {"auxInfo is an array", [](PlistDictionary& d) { metadataOf(d)["auxInfo"] = PlistArray{}; }},
-      {"no assets", [](PlistDictionary& d) { d.erase("assets"); }},
-      {"empty assets", [](PlistDictionary& d) { d["assets"] = PlistArray{}; }},
-      {"assets is a dictionary", [](PlistDictionary& d) { d["assets"] = storeAsset(); }},
-      {"an asset is a string",
-       [](PlistDictionary& d) {
-         d["assets"] = PlistArray{storeAsset(), "x"};
-       }},
-      {"no URL", [](PlistDictionary& d) { firstAsset(d).erase("URL"); }},
-      {"URL is a number", [](PlistDictionary& d) { firstAsset(d)["URL"] = 3; }},
-      {"file size is text", [](PlistDictionary& d) { firstAsset(d)["fileSize"] = "1500"; }},
-      {"file size is zero", [](PlistDictionary& d) { firstAsset(d)["fileSize"] = 0; }},
-      {"file size is negative", [](PlistDictionary& d) { firstAsset(d)["fileSize"] = -1500; }},
-      {"chunk size is zero", [](PlistDictionary& d) { firstAsset(d)["numberOfBytesToHash"] = 0; }},
-      {"chunk size is a real",
-       [](PlistDictionary& d) { firstAsset(d)["numberOfBytesToHash"] = 1000.0; }},
-      {"one digest short",
-       [](PlistDictionary& d) { firstAsset(d)["hashes"] = PlistArray{kDigestA}; }},
-      {"one digest too many",
-       [](PlistDictionary& d) {
-         firstAsset(d)["hashes"] = PlistArray{kDigestA, kDigestB, kDigestA};
-       }},
-      {"digest is not hex",
-       [](PlistDictionary& d) {
-         firstAsset(d)["hashes"] = PlistArray{kDigestA, std::string(64, 'g')};
-       }},
-      {"digest of odd length",
-       [](PlistDictionary& d) {
-         firstAsset(d)["hashes"] = PlistArray{kDigestA, std::string(63, 'a')};
-       }},
-      {"digests of two lengths",
-       [](PlistDictionary& d) {
-         firstAsset(d)["hashes"] = PlistArray{kDigestA, std::string(32, 'a')};
-       }},
-      {"digest is a number",
-       [](PlistDictionary& d) {
-         firstAsset(d)["hashes"] = PlistArray{kDigestA, 7};
-       }},
-      {"type is not a package", [](PlistDictionary& d) { firstAsset(d)["type"] = 11; }},
-      {"download type is text", [](PlistDictionary& d) { d["downloadType"] = "1"; }},
-      {"status is a bool", [](PlistDictionary& d) { d["status"] = true; }},
-      {"isPaused is text",
-       [](PlistDictionary& d) {
-         d["status"] = PlistDictionary{{"isPaused", "yes"}};
-       }},
-      {"progress beyond 1", [](PlistDictionary& d) { d["progress"] = 1.5; }},
+  enum Part { kDownload, kMetadata, kAsset };
+  const struct {
+    const char* name;
+    Part part;
+    const char* key;
+    PlistValue value;  // null: the key is removed
+  } malformations[] = {
+      {"no metadata", kDownload, "metadata", {}},
+      {"metadata is a string", kDownload, "metadata", "thing"},
+      {"item identifier is text", kMetadata, "itemIdentifier", "42"},
+      {"item identifier is negative", kMetadata, "itemIdentifier", -1},
+      {"title is a number", kMetadata, "title", 5},
+      {"auxInfo is an array", kMetadata, "auxInfo", PlistArray{}},
+      {"no assets", kDownload, "assets", {}},
+      {"empty assets", kDownload, "assets", PlistArray{}},
+      {"assets is a dictionary", kDownload, "assets", storeAsset()},
+      {"an asset is a string", kDownload, "assets", PlistArray{storeAsset(), "x"}},
+      {"no URL", kAsset, "URL", {}},
+      {"URL is a number", kAsset, "URL", 3},
+      {"file size is text", kAsset, "fileSize", "1500"},
+      {"file size is zero", kAsset, "fileSize", 0},
+      {"file size is negative", kAsset, "fileSize", -1500},
+      {"chunk size is zero", kAsset, "numberOfBytesToHash", 0},
+      {"chunk size is a real", kAsset, "numberOfBytesToHash", 1000.0},
+      {"one digest short", kAsset, "hashes", PlistArray{kDigestA}},
+      {"one digest too many", kAsset, "hashes", PlistArray{kDigestA, kDigestB, kDigestA}},
+      {"digest is not hex", kAsset, "hashes", PlistArray{kDigestA, std::string(64, 'g')}},
+      {"digest of odd length", kAsset, "hashes", PlistArray{kDigestA, std::string(63, 'a')}},
+      {"digests of two lengths", kAsset, "hashes", PlistArray{kDigestA, std::string(32, 'a')}},
+      {"digest is a number", kAsset, "hashes", PlistArray{kDigestA, 7}},
+      {"type is not a package", kAsset, "type", 11},
+      {"download type is text", kDownload, "downloadType", "1"},
+      {"status is a bool", kDownload, "status", true},
+      {"isPaused is text", kDownload, "status", PlistDictionary{{"isPaused", "yes"}}},
+      {"progress beyond 1", kDownload, "progress", 1.5},
   };
-  for (const Malformation& malformation : malformations) {
+  for (const auto& malformation : malformations) {
     PlistDictionary download = storeDownload();
-    malformation.apply(download);
+    PlistDictionary& target = malformation.part == kMetadata ? metadataOf(download)
+                              : malformation.part == kAsset  ? firstAsset(download)
+                                                             : download;
+    if (malformation.value.isNull())
+      target.erase(malformation.key);
+    else
+      target[malformation.key] = malformation.value;
     EXPECT_EQ(TillDownload::fromDictionary(download), nullptr) << malformation.name;
   }
   // The unchanged dictionary, and one with MD5 digests, are accepted: the

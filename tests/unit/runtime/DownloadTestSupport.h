@@ -40,30 +40,21 @@ namespace larder::testing {
 
 namespace fs = std::filesystem;
 
-inline std::string hexOf(const unsigned char* bytes, std::size_t length) {
-  static constexpr char kDigits[] = "0123456789abcdef";
-  std::string text;
-  for (std::size_t i = 0; i < length; ++i) {
-    text += kDigits[bytes[i] >> 4u];
-    text += kDigits[bytes[i] & 0xfu];
-  }
-  return text;
-}
-
-inline std::string digestHex(std::string_view bytes, const EVP_MD* algorithm = EVP_sha256()) {
-  unsigned char digest[EVP_MAX_MD_SIZE];
-  unsigned int length = 0;
-  EVP_Digest(bytes.data(), bytes.size(), digest, &length, algorithm, nullptr);
-  return hexOf(digest, length);
-}
-
-// The manifest digests of `bytes`, computed here independently of the code
-// under test.
-inline std::vector<std::string> chunkDigests(std::string_view bytes, std::size_t chunkSize,
-                                             const EVP_MD* algorithm = EVP_sha256()) {
+// The manifest digests of `bytes`, SHA-256 per chunk in lower-case hex,
+// computed here independently of the code under test.
+inline std::vector<std::string> chunkDigests(std::string_view bytes, std::size_t chunkSize) {
   std::vector<std::string> digests;
   for (std::size_t offset = 0; offset < bytes.size(); offset += chunkSize) {
-    digests.push_back(digestHex(bytes.substr(offset, chunkSize), algorithm));
+    const std::string_view chunk = bytes.substr(offset, chunkSize);
+    unsigned char digest[EVP_MAX_MD_SIZE];
+    unsigned int length = 0;
+    EVP_Digest(chunk.data(), chunk.size(), digest, &length, EVP_sha256(), nullptr);
+    std::string hex;
+    for (unsigned int i = 0; i < length; ++i) {
+      hex += "0123456789abcdef"[digest[i] >> 4u];
+      hex += "0123456789abcdef"[digest[i] & 0xfu];
+    }
+    digests.push_back(std::move(hex));
   }
   return digests;
 }
@@ -387,18 +378,14 @@ class PackageServer {
   }
 
   // The whole body from a provider that httplib does not cut to ranges.
-  void serveWhole(std::string bytes, httplib::Response& response) {
+  static void serveWhole(std::string bytes, httplib::Response& response) {
     auto shared = std::make_shared<std::string>(std::move(bytes));
-    response.status = 200;
     response.set_chunked_content_provider(
-        "application/octet-stream",
-        [shared, sent = false](size_t, httplib::DataSink& sink) mutable {
-          if (!sent) {
-            sink.write(shared->data(), shared->size());
-            sent = true;
-            return true;
-          }
-          sink.done();
+        "application/octet-stream", [shared](size_t offset, httplib::DataSink& sink) {
+          if (offset < shared->size())
+            sink.write(shared->data() + offset, shared->size() - offset);
+          else
+            sink.done();
           return true;
         });
   }

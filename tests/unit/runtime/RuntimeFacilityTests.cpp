@@ -287,47 +287,41 @@ TEST_F(RuntimeFacilityTest, ErrorConstructorsPreferTheMessageAndTakeAnyDomain) {
 
 // ---------------------------------------------------------------- restrictions
 
+// Each state of the file in turn, read at every call: whether it requires
+// an administrator and whether it silences update notifications.
 TEST_F(RuntimeFacilityTest, RestrictionsFollowTheFileAtEveryCall) {
   const std::string path = rooted("/etc/larder/restrictions.plist");
   EXPECT_EQ(VendManagedRestrictions::restrictionsFilePath(), path);
-  EXPECT_FALSE(VendManagedRestrictions::isRestrictedTo(
-      LedgerRestrictStoreToDisableSoftwareUpdateNotifications));
-
-  writePlist(path, PlistValue(PlistDictionary{
-                       {std::string(LedgerRestrictStoreToDisableSoftwareUpdateNotifications), true},
-                       {std::string(LedgerRestrictStoreToRequireAdminForSoftwareInstall), false}}));
-  EXPECT_TRUE(VendManagedRestrictions::isRestrictedTo(
-      LedgerRestrictStoreToDisableSoftwareUpdateNotifications));
-  EXPECT_FALSE(
-      VendManagedRestrictions::isRestrictedTo(LedgerRestrictStoreToRequireAdminForSoftwareInstall));
-  EXPECT_FALSE(VendManagedRestrictions::isRestrictedTo("SomethingElse"));
-
-  // A change applies at once, numbers count, other types do not.
-  writePlist(path,
-             PlistValue(PlistDictionary{
-                 {std::string(LedgerRestrictStoreToRequireAdminForSoftwareInstall),
-                  PlistValue(std::int64_t{1})},
-                 {std::string(LedgerRestrictStoreToDisableSoftwareUpdateNotifications), "YES"}}));
-  EXPECT_TRUE(
-      VendManagedRestrictions::isRestrictedTo(LedgerRestrictStoreToRequireAdminForSoftwareInstall));
-  EXPECT_FALSE(VendManagedRestrictions::isRestrictedTo(
-      LedgerRestrictStoreToDisableSoftwareUpdateNotifications));
-}
-
-TEST_F(RuntimeFacilityTest, DamagedOrMisshapenRestrictionsRestrictNothing) {
-  const std::string path = rooted("/etc/larder/restrictions.plist");
-  writeText(path, "<?xml version=\"1.0\"?><plist><dict><key>RequireAdmin");
-  EXPECT_FALSE(
-      VendManagedRestrictions::isRestrictedTo(LedgerRestrictStoreToRequireAdminForSoftwareInstall));
-  writePlist(path, PlistValue(PlistArray{
-                       PlistValue(std::string(LedgerRestrictStoreToRequireAdminForSoftwareInstall)),
-                       true}));
-  EXPECT_FALSE(
-      VendManagedRestrictions::isRestrictedTo(LedgerRestrictStoreToRequireAdminForSoftwareInstall));
-  fs::remove(path);
-  fs::create_directories(path);  // a folder where the file should be
-  EXPECT_FALSE(
-      VendManagedRestrictions::isRestrictedTo(LedgerRestrictStoreToRequireAdminForSoftwareInstall));
+  const std::string admin(LedgerRestrictStoreToRequireAdminForSoftwareInstall);
+  const std::string silent(LedgerRestrictStoreToDisableSoftwareUpdateNotifications);
+  const struct {
+    const char* what;
+    std::optional<std::string> text;  // nullopt: a folder where the file should be
+    bool admin, silent;
+  } states[] = {
+      {"no file", "", false, false},
+      {"booleans",
+       PropertyListSerialization::writeXml(PlistDictionary{{silent, true}, {admin, false}}), false,
+       true},
+      // Numbers count, other types do not.
+      {"number and text",
+       PropertyListSerialization::writeXml(
+           PlistDictionary{{admin, PlistValue(std::int64_t{1})}, {silent, "YES"}}),
+       true, false},
+      {"damaged", "<?xml version=\"1.0\"?><plist><dict><key>RequireAdmin", false, false},
+      {"a list", PropertyListSerialization::writeXml(PlistArray{PlistValue(admin), true}), false,
+       false},
+      {"a folder", std::nullopt, false, false},
+  };
+  for (const auto& state : states) {
+    SCOPED_TRACE(state.what);
+    fs::remove_all(path);
+    if (!state.text) fs::create_directories(path);
+    if (state.text && !state.text->empty()) writeText(path, *state.text);
+    EXPECT_EQ(VendManagedRestrictions::isRestrictedTo(admin), state.admin);
+    EXPECT_EQ(VendManagedRestrictions::isRestrictedTo(silent), state.silent);
+    EXPECT_FALSE(VendManagedRestrictions::isRestrictedTo("SomethingElse"));
+  }
 }
 
 // ---------------------------------------------------------------- deferred-install agent
@@ -597,12 +591,14 @@ TEST_F(RuntimeFacilityTest, LockedApplicationsMayNotLaunch) {
   EXPECT_TRUE(LedgerIsClientAppAllowedToLaunch("com.orvane.Quaymart.helper"));
   EXPECT_TRUE(LedgerIsClientAppAllowedToLaunch("com.orvane.quaymart"));
 
-  writePlist(path, PlistValue(PlistArray{}));
-  EXPECT_TRUE(LedgerIsClientAppAllowedToLaunch("com.orvane.Quaymart"));
-  writePlist(path, PlistValue(PlistDictionary{{"com.orvane.Quaymart", true}}));
-  EXPECT_TRUE(LedgerIsClientAppAllowedToLaunch("com.orvane.Quaymart"));
-  writeText(path, "garbage");
-  EXPECT_TRUE(LedgerIsClientAppAllowedToLaunch("com.orvane.Quaymart"));
+  // An empty list, a dictionary or a damaged file locks nothing.
+  for (const std::string& text :
+       {PropertyListSerialization::writeXml(PlistArray{}),
+        PropertyListSerialization::writeXml(PlistDictionary{{"com.orvane.Quaymart", true}}),
+        std::string("garbage")}) {
+    writeText(path, text);
+    EXPECT_TRUE(LedgerIsClientAppAllowedToLaunch("com.orvane.Quaymart")) << text;
+  }
 }
 
 TEST_F(RuntimeFacilityTest, DimWakeGuestAndRecoveryComeFromTheirSources) {
@@ -616,25 +612,23 @@ TEST_F(RuntimeFacilityTest, DimWakeGuestAndRecoveryComeFromTheirSources) {
   EXPECT_FALSE(LedgerIsDimWake());
   EXPECT_FALSE(LedgerCurrentUserIsGuestUser());
 
-  EXPECT_TRUE(LedgerIsGuestUserName("guest"));
-  EXPECT_TRUE(LedgerIsGuestUserName("guest-a1b2c3"));
-  EXPECT_FALSE(LedgerIsGuestUserName("guest-"));
-  EXPECT_FALSE(LedgerIsGuestUserName("guesthouse"));
-  EXPECT_FALSE(LedgerIsGuestUserName("root"));
-  EXPECT_FALSE(LedgerIsGuestUserName(""));
+  for (const auto& [name, guest] : {std::pair{"guest", true},
+                                    {"guest-a1b2c3", true},
+                                    {"guest-", false},
+                                    {"guesthouse", false},
+                                    {"root", false},
+                                    {"", false}}) {
+    EXPECT_EQ(LedgerIsGuestUserName(name), guest) << name;
+  }
 
   // Being set is what counts, whatever the value.
-  struct RecoveryCase {
-    const char* value;  // nullptr: unset
-    bool recovery;
-  };
-  for (const RecoveryCase& c :
-       {RecoveryCase{nullptr, false}, RecoveryCase{"", true}, RecoveryCase{"1", true}}) {
-    if (c.value)
-      ::setenv("__OSINSTALL_ENVIRONMENT", c.value, 1);
+  for (const auto& [value, recovery] :
+       {std::pair<const char*, bool>{nullptr, false}, {"", true}, {"1", true}}) {
+    if (value)
+      ::setenv("__OSINSTALL_ENVIRONMENT", value, 1);
     else
       ::unsetenv("__OSINSTALL_ENVIRONMENT");
-    EXPECT_EQ(LedgerOnRecoveryPartition(), c.recovery) << (c.value ? c.value : "(unset)");
+    EXPECT_EQ(LedgerOnRecoveryPartition(), recovery) << (value ? value : "(unset)");
   }
 }
 
@@ -655,23 +649,27 @@ TEST_F(RuntimeFacilityTest, CriticalUpdateTimeStampIsKeptPerUser) {
 // ---------------------------------------------------------------- device
 
 TEST_F(RuntimeFacilityTest, OSMajorVersionComesFromOSReleaseElseTheKernel) {
-  writeText(rooted("/etc/os-release"),
-            "NAME=\"Debian GNU/Linux\"\nVERSION_ID=\"13.2\"\nID=debian\n");
-  EXPECT_EQ(VendDevice::osMajorVersionString(), "13");
-  writeText(rooted("/etc/os-release"), "NAME=Ubuntu\n  VERSION_ID=22.04  \n");
-  EXPECT_EQ(VendDevice::osMajorVersionString(), "22");
-
-  // No version in /etc: the second place, then the kernel.
-  writeText(rooted("/etc/os-release"), "NAME=rolling\n");
-  writeText(rooted("/usr/lib/os-release"), "VERSION_ID='7'\n");
-  EXPECT_EQ(VendDevice::osMajorVersionString(), "7");
-  fs::remove(rooted("/usr/lib/os-release"));
   utsname name{};
   ASSERT_EQ(::uname(&name), 0);
-  std::string release = name.release;
-  std::string kernelMajor = release.substr(0, release.find_first_not_of("0123456789"));
-  EXPECT_EQ(VendDevice::osMajorVersionString(), kernelMajor);
-
+  const std::string release = name.release;
+  const std::string kernelMajor = release.substr(0, release.find_first_not_of("0123456789"));
+  const struct {
+    const char* etc;
+    const char* usr;  // nullptr: no such file
+    std::string expected;
+  } cases[] = {
+      {"NAME=\"Debian GNU/Linux\"\nVERSION_ID=\"13.2\"\nID=debian\n", "VERSION_ID=9\n", "13"},
+      {"NAME=Ubuntu\n  VERSION_ID=22.04  \n", nullptr, "22"},
+      // No version in /etc: the second place, then the kernel.
+      {"NAME=rolling\n", "VERSION_ID='7'\n", "7"},
+      {"NAME=rolling\n", nullptr, kernelMajor},
+  };
+  for (const auto& c : cases) {
+    writeText(rooted("/etc/os-release"), c.etc);
+    fs::remove(rooted("/usr/lib/os-release"));
+    if (c.usr) writeText(rooted("/usr/lib/os-release"), c.usr);
+    EXPECT_EQ(VendDevice::osMajorVersionString(), c.expected) << c.etc;
+  }
   EXPECT_EQ(VendDevice::majorVersionOf("\"12\""), "12");
   EXPECT_EQ(VendDevice::majorVersionOf("bookworm"), "");
 }
@@ -839,49 +837,42 @@ TEST_F(RuntimeFacilityTest, StoreApplicationLaunchIsRecordedAndStarted) {
 // ---------------------------------------------------------------- file manager
 
 TEST_F(RuntimeFacilityTest, StoreSoftwareIsTheBundleWithAPurchaseRecord) {
+  const PlistDictionary info{{"HostBundleIdentifier", "com.example.store"}};
   std::string store =
-      makeBundle(rooted("/Applications/Store.app"), {{"HostBundleIdentifier", "com.example.store"}},
-                 purchaseRecordText("com.example.store"));
-  std::string plain = makeBundle(rooted("/Applications/Plain.app"),
-                                 {{"HostBundleIdentifier", "com.example.plain"}});
-  std::string damaged = makeBundle(rooted("/Applications/Damaged.app"),
-                                   {{"HostBundleIdentifier", "com.example.damaged"}},
-                                   std::string("<plist><dict><key>wareID"));
-  std::string notDictionary =
-      makeBundle(rooted("/Applications/Array.app"), {},
-                 PropertyListSerialization::writeXml(PlistValue(PlistArray{"a"})));
+      makeBundle(rooted("/Applications/Store.app"), info, purchaseRecordText("com.example.store"));
   EXPECT_TRUE(VendFileManager::isQuaymartAppAtPath(store));
-  EXPECT_FALSE(VendFileManager::isQuaymartAppAtPath(plain));
-  EXPECT_FALSE(VendFileManager::isQuaymartAppAtPath(damaged));
-  EXPECT_FALSE(VendFileManager::isQuaymartAppAtPath(notDictionary));
-  EXPECT_FALSE(VendFileManager::isQuaymartAppAtPath(rooted("/Applications/Missing.app")));
-  EXPECT_FALSE(VendFileManager::isQuaymartAppAtPath(store + "/purchase.plist"));
+  for (const std::string& path :
+       {makeBundle(rooted("/Applications/Plain.app"), info),
+        makeBundle(rooted("/Applications/Damaged.app"), info,
+                   std::string("<plist><dict><key>wareID")),
+        makeBundle(rooted("/Applications/Array.app"), {},
+                   PropertyListSerialization::writeXml(PlistValue(PlistArray{"a"}))),
+        rooted("/Applications/Missing.app"), store + "/purchase.plist"}) {
+    EXPECT_FALSE(VendFileManager::isQuaymartAppAtPath(path)) << path;
+  }
 }
 
 TEST_F(RuntimeFacilityTest, InstallableMeansAReplaceableBundleInAnApplicationFolder) {
   PlistDictionary info{{"HostBundleIdentifier", "com.example.app"}};
   std::string top = makeBundle(rooted("/Applications/App.app"), info);
-  std::string sub = makeBundle(rooted("/Applications/Utilities/Tool.app"), info);
-  std::string inHome = makeBundle(home_ + "/Applications/Mine.app", info);
-  std::string onVolume = makeBundle(rooted("/Volumes/Disk/Applications/There.app"), info);
-  std::string outside = makeBundle(rooted("/opt/Elsewhere.app"), info);
-  std::string nested = makeBundle(top + "/helpers/Helper.app", info);
-  std::string notBundle = rooted("/Applications/Folder");
-  fs::create_directories(notBundle);
-  std::string link = rooted("/Applications/Link.app");
-  fs::create_directory_symlink(top, link);
-
-  EXPECT_TRUE(VendFileManager::isInstallableAtPath(top));
-  EXPECT_TRUE(VendFileManager::isInstallableAtPath(top + "/"));
-  EXPECT_TRUE(VendFileManager::isInstallableAtPath(sub));
-  EXPECT_TRUE(VendFileManager::isInstallableAtPath(inHome));
-  EXPECT_TRUE(VendFileManager::isInstallableAtPath(onVolume));
-  EXPECT_FALSE(VendFileManager::isInstallableAtPath(outside));
-  EXPECT_FALSE(VendFileManager::isInstallableAtPath(nested));
-  EXPECT_FALSE(VendFileManager::isInstallableAtPath(notBundle));
-  EXPECT_FALSE(VendFileManager::isInstallableAtPath(link));
-  EXPECT_FALSE(VendFileManager::isInstallableAtPath(rooted("/Applications/Missing.app")));
-  EXPECT_FALSE(VendFileManager::isInstallableAtPath(rooted("/Applications/../opt/Elsewhere.app")));
+  fs::create_directories(rooted("/Applications/Folder"));
+  fs::create_directory_symlink(top, rooted("/Applications/Link.app"));
+  const std::pair<std::string, bool> cases[] = {
+      {top, true},
+      {top + "/", true},
+      {makeBundle(rooted("/Applications/Utilities/Tool.app"), info), true},
+      {makeBundle(home_ + "/Applications/Mine.app", info), true},
+      {makeBundle(rooted("/Volumes/Disk/Applications/There.app"), info), true},
+      {makeBundle(rooted("/opt/Elsewhere.app"), info), false},
+      {makeBundle(top + "/helpers/Helper.app", info), false},
+      {rooted("/Applications/Folder"), false},
+      {rooted("/Applications/Link.app"), false},
+      {rooted("/Applications/Missing.app"), false},
+      {rooted("/Applications/../opt/Elsewhere.app"), false},
+  };
+  for (const auto& [path, installable] : cases) {
+    EXPECT_EQ(VendFileManager::isInstallableAtPath(path), installable) << path;
+  }
 }
 
 TEST_F(RuntimeFacilityTest, BundleInAFolderWeCannotWriteIsNotInstallable) {
@@ -897,18 +888,19 @@ TEST_F(RuntimeFacilityTest, BundleInAFolderWeCannotWriteIsNotInstallable) {
 }
 
 TEST_F(RuntimeFacilityTest, DisplayNamePrefersTheBundlesOwnNames) {
-  std::string both =
-      makeBundle(rooted("/Applications/Both.app"),
-                 {{"HostBundleDisplayName", "Shown Name"}, {"HostBundleName", "Name"}});
-  std::string nameOnly =
-      makeBundle(rooted("/Applications/NameOnly.app"),
-                 {{"HostBundleDisplayName", ""}, {"HostBundleName", "Plain Name"}});
   std::string bare = makeBundle(rooted("/Applications/Bare Folder.app"), {});
-  EXPECT_EQ(VendFileManager::displayNameAtPath(both), "Shown Name");
-  EXPECT_EQ(VendFileManager::displayNameAtPath(nameOnly), "Plain Name");
-  EXPECT_EQ(VendFileManager::displayNameAtPath(bare), "Bare Folder");
-  EXPECT_EQ(VendFileManager::displayNameAtPath(bare + "/"), "Bare Folder");
-  EXPECT_EQ(VendFileManager::displayNameAtPath(rooted("/Applications/Gone.app")), "Gone");
+  const std::pair<std::string, std::string> cases[] = {
+      {makeBundle(rooted("/Applications/Both.app"),
+                  {{"HostBundleDisplayName", "Shown Name"}, {"HostBundleName", "Name"}}),
+       "Shown Name"},
+      {makeBundle(rooted("/Applications/NameOnly.app"),
+                  {{"HostBundleDisplayName", ""}, {"HostBundleName", "Plain Name"}}),
+       "Plain Name"},
+      {bare, "Bare Folder"},
+      {bare + "/", "Bare Folder"},
+      {rooted("/Applications/Gone.app"), "Gone"},
+  };
+  for (const auto& [path, name] : cases) EXPECT_EQ(VendFileManager::displayNameAtPath(path), name);
 }
 
 TEST(VendHTTPTransfer, RedirectsNeverDowngradeAndLeaveTheAccountAtItsOrigin) {
