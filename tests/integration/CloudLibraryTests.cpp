@@ -4,37 +4,27 @@
 // pre-orders, a store that stalls; and `larderctl dmap-dump`.
 #include <gtest/gtest.h>
 
-#include <atomic>
 #include <chrono>
-#include <condition_variable>
-#include <cstdlib>
 #include <memory>
 #include <mutex>
 #include <nlohmann/json.hpp>
 #include <optional>
 #include <thread>
 
-#include "LarderctlProcess.h"
-#include "ServiceHarness.h"
-#include "StoreCatalogueBuilder.h"
-#include "StoreServerProcess.h"
 #include "dmap/DAAPBuffer.h"
 #include "dmap/DAAPClient.h"
 #include "dmap/DAAPCode.h"
 #include "dmap/DAAPContainerScope.h"
 #include "dmap/DAAPItem.h"
-#include "dmap/DAAPItemsRequest.h"
 #include "platform/dispatch/DispatchQueue.h"
-#include "platform/dispatch/DispatchSemaphore.h"
 #include "platform/dispatch/RunLoop.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
-#include "store-runtime/services/VendAccountService.h"
-#include "store-runtime/http/VendHTTPTransfer.h"
+#include "store-runtime/accounts/VendAccountStore.h"
 #include "store-runtime/http/VendRequestSigner.h"
 #include "store-runtime/http/VendURLBag.h"
-#include "store-runtime/runtime/VendRuntime.h"
-#include "store-runtime/services/VendServiceProxy.h"
+#include "tests/integration/InProcessRuntime.h"
+#include "tests/integration/LarderctlProcess.h"
 
 namespace larder::testing {
 namespace {
@@ -44,28 +34,6 @@ using namespace std::chrono_literals;
 constexpr std::uint64_t kAccountID = 8101;
 constexpr char kAccountName[] = "listener@example.org";
 constexpr char kPassword[] = "open sesame";
-
-// Sets variables for the span of a test and puts the old values back.
-class EnvironmentOverride {
- public:
-  void set(const std::string& name, const std::string& value) {
-    const char* old = std::getenv(name.c_str());
-    saved_.emplace_back(name, old ? std::optional<std::string>(old) : std::nullopt);
-    ::setenv(name.c_str(), value.c_str(), 1);
-  }
-  ~EnvironmentOverride() {
-    for (auto it = saved_.rbegin(); it != saved_.rend(); ++it) {
-      if (it->second) {
-        ::setenv(it->first.c_str(), it->second->c_str(), 1);
-      } else {
-        ::unsetenv(it->first.c_str());
-      }
-    }
-  }
-
- private:
-  std::vector<std::pair<std::string, std::optional<std::string>>> saved_;
-};
 
 class RecordingOwner : public LedgerDAAPClientDelegate {
  public:
@@ -148,13 +116,11 @@ PlistDictionary revision(std::int64_t number, PlistArray items, PlistArray delet
   return {{"revision", number}, {"items", std::move(items)}, {"deleted", std::move(deleted)}};
 }
 
-class CloudLibraryTest : public ::testing::Test {
+class CloudLibraryTest : public InProcessRuntimeTest {
  protected:
   void SetUp() override {
     catalogue_.addAccount(
         {.accountID = kAccountID, .orvaneID = kAccountName, .password = kPassword});
-    environment_.set("LARDER_ROOT", platform_.root());
-    environment_.set("XDG_CONFIG_HOME", platform_.home() + "/.config");
   }
 
   void TearDown() override {
@@ -163,7 +129,7 @@ class CloudLibraryTest : public ::testing::Test {
     if (store_) store_->stop();
     DAAPClient::pollingQueue()->sync([] {});
     clients_.clear();
-    VendRuntime::setShared(nullptr);
+    InProcessRuntimeTest::TearDown();
   }
 
   void writeLibrary(const PlistArray& revisions, const PlistDictionary& bag = {}) {
@@ -171,29 +137,9 @@ class CloudLibraryTest : public ::testing::Test {
                                               {"bag", bag}, {"revisions", revisions}}));
   }
 
-  void startStore(const std::vector<std::string>& faults = {}, double timeout = 10) {
-    store_ = std::make_unique<StoreServerProcess>(catalogue_.directory(), faults);
-    VendRuntimeConfiguration configuration;
-    configuration.bagURL = store_->bagURL();
-    configuration.stateDirectory = platform_.stateHome() + "/larder";
-    configuration.downloadsDirectory = platform_.cacheHome() + "/downloads";
-    configuration.connectTimeout = 2s;
-    configuration.requestTimeout = timeout;
-    runtime_ = std::make_shared<VendRuntime>(configuration);
-    VendRuntime::setShared(runtime_);
-  }
-
   void signIn() {
-    bool signedIn = false;
     VendServiceProxy proxy(VendStoreClient::initWithStoreClientType(1), runtime_);
-    proxy.accountServiceSynchronousBlock([&](VendAccountService& service, DispatchSemaphore& done) {
-      service.signIn(kAccountName, kPassword,
-                     [&](bool success, std::uint64_t, const OptionalError&) {
-                       signedIn = success;
-                       done.signal();
-                     });
-    });
-    ASSERT_TRUE(signedIn);
+    ASSERT_TRUE(signInThrough(proxy, kAccountName, kPassword));
   }
 
   std::shared_ptr<DAAPClient> makeClient() {
@@ -221,13 +167,6 @@ class CloudLibraryTest : public ::testing::Test {
     return poll;
   }
 
-  std::uint64_t requests(const std::string& route) const { return store_->requestCount(route); }
-
-  TemporaryPlatform platform_;
-  EnvironmentOverride environment_;
-  StoreCatalogueBuilder catalogue_;
-  std::unique_ptr<StoreServerProcess> store_;
-  std::shared_ptr<VendRuntime> runtime_;
   RunLoop runLoop_;
   std::thread runLoopThread_{[this] { runLoop_.run(); }};
   std::shared_ptr<RecordingOwner> owner_ = std::make_shared<RecordingOwner>();
@@ -241,11 +180,12 @@ class CloudLibraryTest : public ::testing::Test {
 };
 
 TEST_F(CloudLibraryTest, NewRevisionBringsChangesAndDeletedIdsAndAnUnchangedOneNoItemsRequest) {
-  writeLibrary(
-      {revision(1, {libraryItem(1001, "Atlas"), libraryItem(1002, "Bestiary"),
-                    libraryItem(1003, "Cookbook")}),
-       revision(2, {libraryItem(1002, "Bestiary, second edition"), libraryItem(1004, "Dictionary")},
-                {1003})});
+  PlistArray revisions{
+      revision(1, {libraryItem(1001, "Atlas"), libraryItem(1002, "Bestiary"),
+                   libraryItem(1003, "Cookbook")}),
+      revision(2, {libraryItem(1002, "Bestiary, second edition"), libraryItem(1004, "Dictionary")},
+               {1003})};
+  writeLibrary(revisions);
   startStore();
   signIn();
   auto client = makeClient();
@@ -277,12 +217,8 @@ TEST_F(CloudLibraryTest, NewRevisionBringsChangesAndDeletedIdsAndAnUnchangedOneN
   EXPECT_EQ(requests("daap-items"), 1U);
 
   // A revision published while the store runs.
-  writeLibrary(
-      {revision(1, {libraryItem(1001, "Atlas"), libraryItem(1002, "Bestiary"),
-                    libraryItem(1003, "Cookbook")}),
-       revision(2, {libraryItem(1002, "Bestiary, second edition"), libraryItem(1004, "Dictionary")},
-                {1003}),
-       revision(3, {libraryItem(1005, "Encyclopedia")}, {1001})});
+  revisions.push_back(revision(3, {libraryItem(1005, "Encyclopedia")}, {1001}));
+  writeLibrary(revisions);
   const Poll changedAgain = pollAndWait(*client, false);
   EXPECT_TRUE(changedAgain.success);
   EXPECT_EQ(itemIDs(changedAgain.items), (std::vector<std::uint64_t>{1005}));
@@ -408,22 +344,8 @@ PlistData sampleDocument() {
 
 class DmapDumpTest : public ::testing::Test {
  protected:
-  struct Run {
-    int status = -1;
-    std::string output;
-    std::string errors;
-  };
-  Run larderctl(const std::vector<std::string>& arguments) {
-    std::vector<std::string> argv{LARDERCTL_PATH};
-    argv.insert(argv.end(), arguments.begin(), arguments.end());
-    const std::string out = platform_.directory() + "/dump.out";
-    const std::string err = platform_.directory() + "/dump.err";
-    ChildProcess process(argv, {{"HOME", platform_.home()}}, out, err);
-    Run run;
-    run.status = process.wait();
-    run.output = readFile(out);
-    run.errors = readFile(err);
-    return run;
+  LarderctlRun larderctl(const std::vector<std::string>& arguments) {
+    return runLarderctl(platform_.directory() + "/dump", arguments, {{"HOME", platform_.home()}});
   }
   std::string writeDocument(const std::string& name, const PlistData& bytes) {
     const std::string path = platform_.directory() + "/" + name;
@@ -436,7 +358,7 @@ class DmapDumpTest : public ::testing::Test {
 
 TEST_F(DmapDumpTest, PrintsTheDecodedDocumentAsJson) {
   const std::string path = writeDocument("update.dmap", sampleDocument());
-  const Run run = larderctl({"dmap-dump", path});
+  const LarderctlRun run = larderctl({"dmap-dump", path});
   ASSERT_EQ(run.status, 0) << run.errors;
   EXPECT_NE(run.output.find("\n  \"dmap.serverrevision\": 12"), std::string::npos)
       << "indented for people: " << run.output;
@@ -450,7 +372,7 @@ TEST_F(DmapDumpTest, PrintsTheDecodedDocumentAsJson) {
   EXPECT_EQ(item["com.orvane.sonorel.extended-media-kind"], 2);
   EXPECT_EQ(item["daap.songdatepurchased"], "2023-11-14T22:13:20Z");
 
-  const Run line = larderctl({"--json", "dmap-dump", path});
+  const LarderctlRun line = larderctl({"--json", "dmap-dump", path});
   ASSERT_EQ(line.status, 0) << line.errors;
   EXPECT_EQ(line.output.find('\n'), line.output.size() - 1) << "one line: " << line.output;
   const auto compact = nlohmann::json::parse(line.output);
@@ -458,14 +380,14 @@ TEST_F(DmapDumpTest, PrintsTheDecodedDocumentAsJson) {
 }
 
 TEST_F(DmapDumpTest, RefusesWhatItCannotReadOrDecode) {
-  const Run missing = larderctl({"dmap-dump", platform_.directory() + "/absent.dmap"});
+  const LarderctlRun missing = larderctl({"dmap-dump", platform_.directory() + "/absent.dmap"});
   EXPECT_EQ(missing.status, 1);
   EXPECT_NE(missing.errors.find("cannot read"), std::string::npos) << missing.errors;
   EXPECT_TRUE(missing.output.empty());
 
   PlistData truncated = sampleDocument();
   truncated.resize(truncated.size() - 3);
-  const Run cut = larderctl({"dmap-dump", writeDocument("cut.dmap", truncated)});
+  const LarderctlRun cut = larderctl({"dmap-dump", writeDocument("cut.dmap", truncated)});
   EXPECT_EQ(cut.status, 1);
   EXPECT_NE(cut.errors.find("is not a DMAP document"), std::string::npos) << cut.errors;
   EXPECT_TRUE(cut.output.empty());

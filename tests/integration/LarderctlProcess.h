@@ -1,8 +1,7 @@
 #pragma once
 
 #include <chrono>
-#include <fstream>
-#include <sstream>
+#include <map>
 #include <string>
 #include <vector>
 
@@ -10,36 +9,27 @@
 
 namespace larder::testing {
 
-inline std::string readFile(const std::string& path) {
-  std::ifstream file(path);
-  std::stringstream text;
-  text << file.rdbuf();
-  return text.str();
-}
-
-// A larderctl process with its output in files.
+// A larderctl process with its output in files "<filesPrefix>.out" and ".err".
 class Larderctl {
  public:
+  Larderctl(const std::string& filesPrefix, std::vector<std::string> argv,
+            const std::map<std::string, std::string>& environment)
+      : outputPath_(filesPrefix + ".out"),
+        errorPath_(filesPrefix + ".err"),
+        process_(argv, environment, outputPath_, errorPath_) {}
+
   Larderctl(const TemporaryPlatform& platform, const PrivateBus& bus,
             const std::vector<std::string>& arguments, const std::string& name)
-      : outputPath_(platform.directory() + "/" + name + ".out"),
-        errorPath_(platform.directory() + "/" + name + ".err"),
-        process_(
-            [&] {
-              std::vector<std::string> argv{LARDERCTL_PATH};
-              argv.insert(argv.end(), arguments.begin(), arguments.end());
-              return argv;
-            }(),
-            platform.environment(bus), outputPath_, errorPath_) {}
+      : Larderctl(platform.directory() + "/" + name, withProgram(arguments),
+                  platform.environment(bus)) {}
 
   // Through the shell, to give the process a standard input.
   Larderctl(const TemporaryPlatform& platform, const PrivateBus& bus, const std::string& arguments,
             const std::string& inputPath, const std::string& name)
-      : outputPath_(platform.directory() + "/" + name + ".out"),
-        errorPath_(platform.directory() + "/" + name + ".err"),
-        process_({"/bin/sh", "-c",
-                  std::string("exec ") + LARDERCTL_PATH + " " + arguments + " < " + inputPath},
-                 platform.environment(bus), outputPath_, errorPath_) {}
+      : Larderctl(platform.directory() + "/" + name,
+                  {"/bin/sh", "-c",
+                   std::string("exec ") + LARDERCTL_PATH + " " + arguments + " < " + inputPath},
+                  platform.environment(bus)) {}
 
   [[nodiscard]] std::string output() const { return readFile(outputPath_); }
   [[nodiscard]] std::string errors() const { return readFile(errorPath_); }
@@ -52,6 +42,12 @@ class Larderctl {
     return eventually([&] { return !process_.isRunning(); }, timeout);
   }
   ChildProcess& process() { return process_; }
+
+  static std::vector<std::string> withProgram(const std::vector<std::string>& arguments) {
+    std::vector<std::string> argv{LARDERCTL_PATH};
+    argv.insert(argv.end(), arguments.begin(), arguments.end());
+    return argv;
+  }
 
  private:
   std::string outputPath_;
@@ -66,16 +62,25 @@ struct LarderctlRun {
   std::string errors;
 };
 
-// Runs larderctl to its end, at most `timeout`; `name` names its files.
-inline LarderctlRun runLarderctl(const TemporaryPlatform& platform, const PrivateBus& bus,
-                                 const std::vector<std::string>& arguments, const std::string& name,
+// Runs larderctl to its end, at most `timeout`.
+inline LarderctlRun runLarderctl(const std::string& filesPrefix,
+                                 const std::vector<std::string>& arguments,
+                                 const std::map<std::string, std::string>& environment,
                                  std::chrono::milliseconds timeout = std::chrono::seconds(90)) {
-  Larderctl larderctl(platform, bus, arguments, name);
+  Larderctl larderctl(filesPrefix, Larderctl::withProgram(arguments), environment);
   LarderctlRun run;
   if (larderctl.waitForExit(timeout)) run.status = larderctl.process().wait();
   run.output = larderctl.output();
   run.errors = larderctl.errors();
   return run;
+}
+
+// The same against the service on `bus`; `name` names its files.
+inline LarderctlRun runLarderctl(const TemporaryPlatform& platform, const PrivateBus& bus,
+                                 const std::vector<std::string>& arguments, const std::string& name,
+                                 std::chrono::milliseconds timeout = std::chrono::seconds(90)) {
+  return runLarderctl(platform.directory() + "/" + name, arguments, platform.environment(bus),
+                      timeout);
 }
 
 }  // namespace larder::testing

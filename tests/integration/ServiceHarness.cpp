@@ -6,6 +6,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
@@ -45,13 +46,6 @@ std::vector<char*> pointers(std::vector<std::string>& strings) {
   return result;
 }
 
-std::string readText(const std::string& path) {
-  std::ifstream file(path);
-  std::stringstream text;
-  text << file.rdbuf();
-  return text.str();
-}
-
 void writePlist(const std::string& path, const PlistValue& value) {
   if (!FileIO::writeAtomically(path, PropertyListSerialization::writeXml(value))) {
     throw std::runtime_error("cannot write " + path);
@@ -59,6 +53,31 @@ void writePlist(const std::string& path, const PlistValue& value) {
 }
 
 }  // namespace
+
+std::string readFile(const std::string& path) {
+  std::ifstream file(path);
+  std::stringstream text;
+  text << file.rdbuf();
+  return text.str();
+}
+
+ScopedEnvironment::ScopedEnvironment(const std::map<std::string, std::string>& values) {
+  for (const auto& [name, value] : values) {
+    const char* old = std::getenv(name.c_str());
+    saved_.emplace(name, old ? std::optional<std::string>(old) : std::nullopt);
+    ::setenv(name.c_str(), value.c_str(), 1);
+  }
+}
+
+ScopedEnvironment::~ScopedEnvironment() {
+  for (const auto& [name, value] : saved_) {
+    if (value) {
+      ::setenv(name.c_str(), value->c_str(), 1);
+    } else {
+      ::unsetenv(name.c_str());
+    }
+  }
+}
 
 bool eventually(const std::function<bool()>& condition, std::chrono::milliseconds timeout) {
   auto deadline = std::chrono::steady_clock::now() + timeout;
@@ -249,7 +268,7 @@ bool ServiceProcess::waitUntilServing(const std::string& busName,
 }
 
 std::string ServiceProcess::log() const {
-  return readText(logPath_);
+  return readFile(logPath_);
 }
 
 std::vector<std::string> ServiceProcess::logLines(const std::string& text) const {

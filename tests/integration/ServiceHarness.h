@@ -3,6 +3,7 @@
 #include <sys/types.h>
 
 #include <chrono>
+#include <functional>
 #include <map>
 #include <memory>
 #include <optional>
@@ -117,5 +118,21 @@ std::unique_ptr<ServiceClient> connectClient(const PrivateBus& bus,
 
 bool eventually(const std::function<bool()>& condition,
                 std::chrono::milliseconds timeout = std::chrono::seconds(10));
+
+// The whole file; empty when it cannot be read.
+std::string readFile(const std::string& path);
+
+// Environment variables set for the span of a test; the old values are put
+// back afterwards.
+class ScopedEnvironment {
+ public:
+  explicit ScopedEnvironment(const std::map<std::string, std::string>& values);
+  ~ScopedEnvironment();
+  ScopedEnvironment(const ScopedEnvironment&) = delete;
+  ScopedEnvironment& operator=(const ScopedEnvironment&) = delete;
+
+ private:
+  std::map<std::string, std::optional<std::string>> saved_;
+};
 
 }  // namespace larder::testing

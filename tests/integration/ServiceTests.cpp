@@ -46,10 +46,11 @@ class ServiceTest : public ::testing::Test {
   PrivateBus bus;
 };
 
-const PlistDictionary& dictionaryAt(const PlistArray& reply, std::size_t index) {
-  static const PlistDictionary kEmpty;
-  const PlistDictionary* dictionary = reply.at(index).dictionary();
-  return dictionary ? *dictionary : kEmpty;
+// The dictionary the request answers with; empty when it answers none.
+PlistDictionary ask(ServiceClient& client, const std::string& request, PlistArray arguments) {
+  const PlistArray reply = client.call(request, std::move(arguments));
+  const PlistDictionary* dictionary = reply.empty() ? nullptr : reply.at(0).dictionary();
+  return dictionary ? *dictionary : PlistDictionary{};
 }
 
 std::string field(const PlistDictionary& record, const std::string& key) {
@@ -72,8 +73,7 @@ TEST_F(ServiceTest, AnswersLookupsForDiscoveredStoreSoftware) {
   ASSERT_TRUE(all.at(0).array());
   EXPECT_EQ(all.at(0).array()->size(), 2u) << "software without purchase record is not in the map";
 
-  PlistDictionary byBundle =
-      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.example.foo"}), 0);
+  PlistDictionary byBundle = ask(*client, "ProductForBundleIdentifier", {"com.example.foo"});
   EXPECT_EQ(field(byBundle, "bundlePath"), foo);
   EXPECT_EQ(field(byBundle, "bundleVersion"), "2.1");
   EXPECT_EQ(field(byBundle, "itemIdentifier"), "1001");
@@ -81,23 +81,17 @@ TEST_F(ServiceTest, AnswersLookupsForDiscoveredStoreSoftware) {
   EXPECT_EQ(field(byBundle, "source"), "2") << "the live query has taken the record over";
   EXPECT_EQ(field(byBundle, "installed"), "1");
 
-  PlistDictionary byItem =
-      dictionaryAt(client->call("ProductForItemIdentifier", {std::uint64_t{1002}}), 0);
+  PlistDictionary byItem = ask(*client, "ProductForItemIdentifier", {std::uint64_t{1002}});
   EXPECT_EQ(field(byItem, "bundleIdentifier"), "com.example.bar");
-  EXPECT_TRUE(
-      dictionaryAt(client->call("ProductForItemIdentifier", {std::uint64_t{0}}), 0).empty());
-  EXPECT_TRUE(
-      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.example.none"}), 0).empty());
+  EXPECT_TRUE(ask(*client, "ProductForItemIdentifier", {std::uint64_t{0}}).empty());
+  EXPECT_TRUE(ask(*client, "ProductForBundleIdentifier", {"com.example.none"}).empty());
 
-  PlistDictionary created =
-      dictionaryAt(client->call("CreateSoftwareProductForAppAtPath", {plain}), 0);
+  PlistDictionary created = ask(*client, "CreateSoftwareProductForAppAtPath", {plain});
   EXPECT_EQ(field(created, "bundleIdentifier"), "com.example.plain");
   EXPECT_EQ(field(created, "itemIdentifier"), "<absent>");
-  EXPECT_TRUE(
-      dictionaryAt(client->call("CreateSoftwareProductForAppAtPath", {plain + "/missing"}), 0)
-          .empty());
+  EXPECT_TRUE(ask(*client, "CreateSoftwareProductForAppAtPath", {plain + "/missing"}).empty());
 
-  PlistDictionary info = dictionaryAt(client->call("BundleInfoFromBundleAtPath", {foo}), 0);
+  PlistDictionary info = ask(*client, "BundleInfoFromBundleAtPath", {foo});
   EXPECT_EQ(field(info, "HostBundleIdentifier"), "com.example.foo");
   PlistArray icon = client->call("IconForApplicationWithBundeID", {"com.example.foo"});
   ASSERT_TRUE(icon.at(0).data());
@@ -110,11 +104,9 @@ TEST_F(ServiceTest, PrefersTheCopyInTheApplicationsFolder) {
   auto service = startService();
   ASSERT_TRUE(service->waitForLog("Software map rebuild took"));
   auto client = connectClient(bus);
-  PlistDictionary product =
-      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.example.twin"}), 0);
+  PlistDictionary product = ask(*client, "ProductForBundleIdentifier", {"com.example.twin"});
   EXPECT_EQ(field(product, "bundlePath"), preferred);
-  EXPECT_EQ(field(dictionaryAt(client->call("ProductForItemIdentifier", {std::uint64_t{77}}), 0),
-                  "bundlePath"),
+  EXPECT_EQ(field(ask(*client, "ProductForItemIdentifier", {std::uint64_t{77}}), "bundlePath"),
             preferred);
   EXPECT_FALSE(service->logLines("Preferring (in /Applications)").empty());
 }
@@ -132,8 +124,7 @@ TEST_F(ServiceTest, RecoveryModeAnswersFromThePersistedStoreAndNeverChangesIt) {
 
   auto service = startService({}, {{"__OSINSTALL_ENVIRONMENT", "1"}});
   auto client = connectClient(bus);
-  PlistDictionary product =
-      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.example.foo"}), 0);
+  PlistDictionary product = ask(*client, "ProductForBundleIdentifier", {"com.example.foo"});
   EXPECT_EQ(field(product, "bundlePath"), foo) << "the persisted record answers";
   EXPECT_EQ(
       service->logLines("Running in recovery mode (1) - Disabling all software map sources").size(),
@@ -159,9 +150,8 @@ TEST_F(ServiceTest, AStopSignalFinishesTheQueuedWritesAndExitsZero) {
     const std::string late = installStoreApp(applications(), "Late" + std::to_string(signal),
                                              identifier, "1.0", static_cast<std::uint64_t>(signal));
     auto client = connectClient(bus);
-    ASSERT_TRUE(eventually([&] {
-      return !dictionaryAt(client->call("ProductForBundleIdentifier", {identifier}), 0).empty();
-    }));
+    ASSERT_TRUE(eventually(
+        [&] { return !ask(*client, "ProductForBundleIdentifier", {identifier}).empty(); }));
     EXPECT_EQ(service->process().stop(signal), 0) << service->log();
     EXPECT_EQ(service->logLines("larderd: stopped").size(), 1u) << service->log();
     const auto stored = FileIO::read(platform.persistedStorePath());
@@ -239,9 +229,9 @@ TEST_F(ServiceTest, BadArgumentsGetADBusErrorAndTheServiceGoesOn) {
 
   auto client = connectClient(bus);
   ASSERT_TRUE(service->waitForLog("Software map rebuild took"));
-  EXPECT_EQ(field(dictionaryAt(client->call("ProductForBundleIdentifier", {"com.example.foo"}), 0),
-                  "itemIdentifier"),
-            "5");
+  EXPECT_EQ(
+      field(ask(*client, "ProductForBundleIdentifier", {"com.example.foo"}), "itemIdentifier"),
+      "5");
   EXPECT_TRUE(service->process().isRunning());
 }
 
@@ -318,13 +308,22 @@ TEST_F(ServiceTest, ModeFollowsTheArguments) {
   }
 }
 
-// Records the callbacks a client's observer object receives.
-struct ObserverRecord {
+// The callbacks a client's observer object receives: (a text field of the
+// product, state).
+struct Heard {
   std::mutex mutex;
-  std::vector<std::pair<std::string, std::int64_t>> calls;  // (bundleVersion, state)
-  std::size_t size() {
+  std::vector<std::pair<std::string, std::int64_t>> calls;
+  std::vector<std::pair<std::string, std::int64_t>> snapshot() {
     std::lock_guard lock(mutex);
-    return calls.size();
+    return calls;
+  }
+  std::size_t size() { return snapshot().size(); }
+  // An observer that records `key` of each product it hears of.
+  std::function<void(const PlistValue&, std::int64_t)> recording(const std::string& key) {
+    return [this, key](const PlistValue& product, std::int64_t state) {
+      std::lock_guard lock(mutex);
+      calls.emplace_back(product[key].string() ? *product[key].string() : "", state);
+    };
   }
 };
 
@@ -334,13 +333,8 @@ TEST_F(ServiceTest, ObserversHearChangesAndAGoneClientCostsNothing) {
   ASSERT_TRUE(service->waitForLog("Software map rebuild took"));
 
   auto staying = connectClient(bus);
-  ObserverRecord heard;
-  staying->exportSoftwareMapObserver(
-      "/test/Observer", [&](const PlistValue& product, std::int64_t state) {
-        std::lock_guard lock(heard.mutex);
-        heard.calls.emplace_back(
-            product["bundleVersion"].string() ? *product["bundleVersion"].string() : "", state);
-      });
+  Heard heard;
+  staying->exportSoftwareMapObserver("/test/Observer", heard.recording("bundleVersion"));
   std::string token = *staying->call("AddSoftwareMapObserver", {"/test/Observer"}).at(0).string();
   {
     auto leaving = connectClient(bus);
@@ -358,14 +352,10 @@ TEST_F(ServiceTest, ObserversHearChangesAndAGoneClientCostsNothing) {
                 {foo, true, "2.0", std::int64_t{9}});
 
   ASSERT_TRUE(eventually([&] { return heard.size() >= 1; })) << service->log();
-  {
-    std::lock_guard lock(heard.mutex);
-    ASSERT_EQ(heard.calls.size(), 1u);
-    EXPECT_EQ(heard.calls[0], std::make_pair(std::string("2.0"), std::int64_t{2}));
-  }
-  EXPECT_EQ(field(dictionaryAt(updater->call("ProductForBundleIdentifier", {"com.example.foo"}), 0),
-                  "bundleVersion"),
-            "2.0");
+  EXPECT_EQ(heard.snapshot(), (std::vector{std::make_pair(std::string("2.0"), std::int64_t{2})}));
+  EXPECT_EQ(
+      field(ask(*updater, "ProductForBundleIdentifier", {"com.example.foo"}), "bundleVersion"),
+      "2.0");
   EXPECT_TRUE(service->logLines("does not match expected value").empty());
 
   staying->call("RemoveSoftwareMapObserver", {token});
@@ -377,20 +367,6 @@ TEST_F(ServiceTest, ObserversHearChangesAndAGoneClientCostsNothing) {
   EXPECT_TRUE(service->process().isRunning());
 }
 
-// Records the callbacks a client's observer object receives, with paths.
-struct ChangeRecord {
-  std::mutex mutex;
-  std::vector<std::pair<std::string, std::int64_t>> calls;  // (bundlePath, state)
-  std::size_t size() {
-    std::lock_guard lock(mutex);
-    return calls.size();
-  }
-  std::vector<std::pair<std::string, std::int64_t>> snapshot() {
-    std::lock_guard lock(mutex);
-    return calls;
-  }
-};
-
 TEST_F(ServiceTest, TheMapFollowsTheDiskAndAnnouncedUpdatesStayQuiet) {
   std::string staged = platform.directory() + "/staging";
   fs::create_directories(staged);
@@ -399,12 +375,8 @@ TEST_F(ServiceTest, TheMapFollowsTheDiskAndAnnouncedUpdatesStayQuiet) {
   ASSERT_TRUE(service->waitForLog("MetadataQuery initial load took")) << service->log();
 
   auto client = connectClient(bus);
-  ChangeRecord heard;
-  client->exportSoftwareMapObserver(
-      "/test/Changes", [&](const PlistValue& product, std::int64_t state) {
-        std::lock_guard lock(heard.mutex);
-        heard.calls.emplace_back(*product["bundlePath"].string(), state);
-      });
+  Heard heard;
+  client->exportSoftwareMapObserver("/test/Changes", heard.recording("bundlePath"));
   client->call("AddSoftwareMapObserver", {"/test/Changes"});
 
   // A bundle copied in: one Added.
@@ -413,8 +385,7 @@ TEST_F(ServiceTest, TheMapFollowsTheDiskAndAnnouncedUpdatesStayQuiet) {
   fs::rename(prepared, fresh);
   ASSERT_TRUE(eventually([&] { return heard.size() >= 1; })) << service->log();
   EXPECT_EQ(heard.snapshot().at(0), std::make_pair(fresh, std::int64_t{0}));
-  EXPECT_EQ(field(dictionaryAt(client->call("ProductForItemIdentifier", {std::uint64_t{12}}), 0),
-                  "bundlePath"),
+  EXPECT_EQ(field(ask(*client, "ProductForItemIdentifier", {std::uint64_t{12}}), "bundlePath"),
             fresh);
 
   // Its purchase record edited: Changed.
@@ -434,8 +405,7 @@ TEST_F(ServiceTest, TheMapFollowsTheDiskAndAnnouncedUpdatesStayQuiet) {
       << service->log();
   client->call("ProductAtPathWasUpdatedToBundleVersionStoreVersion",
                {kept, true, "2.0", std::int64_t{2}});
-  EXPECT_EQ(field(dictionaryAt(client->call("ProductForBundleIdentifier", {"com.example.kept"}), 0),
-                  "bundlePath"),
+  EXPECT_EQ(field(ask(*client, "ProductForBundleIdentifier", {"com.example.kept"}), "bundlePath"),
             kept);
 
   // Deleted: Removed.
@@ -449,8 +419,7 @@ TEST_F(ServiceTest, TheMapFollowsTheDiskAndAnnouncedUpdatesStayQuiet) {
     EXPECT_FALSE(path == kept && (state == 0 || state == 1))
         << "the announced update was told as " << state;
   }
-  EXPECT_TRUE(
-      dictionaryAt(client->call("ProductForItemIdentifier", {std::uint64_t{12}}), 0).empty());
+  EXPECT_TRUE(ask(*client, "ProductForItemIdentifier", {std::uint64_t{12}}).empty());
 }
 
 TEST_F(ServiceTest, OlderSoftwareOfTheMakerIsFoundFromItsMinimumVersionOn) {
@@ -463,21 +432,15 @@ TEST_F(ServiceTest, OlderSoftwareOfTheMakerIsFoundFromItsMinimumVersionOn) {
     return service->logLines("MetadataQuery initial load took").size() >= 2;
   })) << service->log();
   auto client = connectClient(bus);
-  PlistDictionary snapbox =
-      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.orvane.Snapbox"}), 0);
+  PlistDictionary snapbox = ask(*client, "ProductForBundleIdentifier", {"com.orvane.Snapbox"});
   EXPECT_EQ(field(snapbox, "itemIdentifier"), "400000101");
   EXPECT_EQ(field(snapbox, "versionIdentifier"), "0");
   EXPECT_EQ(field(snapbox, "isLegacyApp"), "1");
   EXPECT_EQ(field(snapbox, "source"), "3");
-  EXPECT_FALSE(
-      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.orvane.Anvil.Quire"}), 0)
-          .empty())
+  EXPECT_FALSE(ask(*client, "ProductForBundleIdentifier", {"com.orvane.Anvil.Quire"}).empty())
       << "exactly the minimum version is enough";
-  EXPECT_TRUE(
-      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.orvane.Anvil.Tally"}), 0)
-          .empty());
-  EXPECT_TRUE(
-      dictionaryAt(client->call("ProductForBundleIdentifier", {"com.orvane.Unlisted"}), 0).empty());
+  EXPECT_TRUE(ask(*client, "ProductForBundleIdentifier", {"com.orvane.Anvil.Tally"}).empty());
+  EXPECT_TRUE(ask(*client, "ProductForBundleIdentifier", {"com.orvane.Unlisted"}).empty());
 }
 
 TEST_F(ServiceTest, LarderctlWatchPrintsObserverCallbacks) {

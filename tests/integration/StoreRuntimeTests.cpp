@@ -5,38 +5,24 @@
 
 #include <sys/stat.h>
 
-#include <algorithm>
 #include <chrono>
 #include <condition_variable>
-#include <cstdlib>
 #include <filesystem>
-#include <fstream>
 #include <map>
-#include <memory>
-#include <mutex>
-#include <optional>
-#include <thread>
+#include <tuple>
 
-#include "ServiceHarness.h"
-#include "StoreCatalogueBuilder.h"
-#include "StoreServerProcess.h"
-#include "platform/dispatch/DispatchSemaphore.h"
-#include "platform/log/TillLogManager.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
-#include "store-runtime/services/VendAccountService.h"
 #include "store-runtime/accounts/VendAccountStore.h"
 #include "store-runtime/dialogs/VendDialogPresenter.h"
-#include "store-runtime/records/TillDownload.h"
-#include "store-runtime/services/VendDownloadService.h"
-#include "store-runtime/http/VendHTTPTransfer.h"
 #include "store-runtime/http/VendRequestSigner.h"
 #include "store-runtime/http/VendStoreAnswer.h"
 #include "store-runtime/http/VendURLBag.h"
+#include "store-runtime/records/TillDownload.h"
 #include "store-runtime/records/TillPurchase.h"
+#include "store-runtime/services/VendDownloadService.h"
 #include "store-runtime/services/VendTransactionService.h"
-#include "store-runtime/runtime/VendRuntime.h"
-#include "store-runtime/services/VendServiceProxy.h"
+#include "tests/integration/InProcessRuntime.h"
 
 namespace larder::testing {
 namespace {
@@ -68,28 +54,7 @@ class ScriptedPresenter : public VendDialogPresenter {
   PlistDictionary values_;
 };
 
-// Points LARDER_ROOT at a private root for the span of a test.
-class RootOverride {
- public:
-  explicit RootOverride(const std::string& root) {
-    if (const char* value = std::getenv("LARDER_ROOT")) saved_ = value;
-    ::setenv("LARDER_ROOT", root.c_str(), 1);
-  }
-  ~RootOverride() {
-    if (saved_) {
-      ::setenv("LARDER_ROOT", saved_->c_str(), 1);
-    } else {
-      ::unsetenv("LARDER_ROOT");
-    }
-  }
-  RootOverride(const RootOverride&) = delete;
-  RootOverride& operator=(const RootOverride&) = delete;
-
- private:
-  std::optional<std::string> saved_;
-};
-
-class StoreRuntimeTest : public ::testing::Test {
+class StoreRuntimeTest : public InProcessRuntimeTest {
  protected:
   void SetUp() override {
     catalogue_.addAccount(
@@ -101,42 +66,15 @@ class StoreRuntimeTest : public ::testing::Test {
                         .payloadBytes = 3 * 1024 * 1024});
     // Small chunks, so that the package has several digests to check.
     catalogue_.setStoreSettings({}, 256 * 1024);
-    fs::create_directories(platform_.root() + "/Applications");
-    root_ = std::make_unique<RootOverride>(platform_.root());
   }
 
-  void TearDown() override {
-    VendRuntime::setShared(nullptr);
-    root_.reset();
-  }
-
-  // Starts the store with these faults and a runtime that talks to it.
   void startStore(const std::vector<std::string>& faults = {}, double timeout = 10) {
-    store_ = std::make_unique<StoreServerProcess>(catalogue_.directory(), faults);
-    VendRuntimeConfiguration configuration;
-    configuration.bagURL = store_->bagURL();
-    configuration.stateDirectory = platform_.stateHome() + "/larder";
-    configuration.downloadsDirectory = platform_.cacheHome() + "/com.orvane.larderd/Downloads";
-    configuration.connectTimeout = 2s;
-    configuration.requestTimeout = timeout;
-    runtime_ = std::make_shared<VendRuntime>(configuration);
-    VendRuntime::setShared(runtime_);
+    InProcessRuntimeTest::startStore(faults, timeout);
     proxy_ =
         std::make_unique<VendServiceProxy>(VendStoreClient::initWithStoreClientType(0), runtime_);
   }
 
-  void signIn() {
-    bool signedIn = false;
-    proxy_->accountServiceSynchronousBlock(
-        [&](VendAccountService& service, DispatchSemaphore& done) {
-          service.signIn(kAccountName, kPassword,
-                         [&](bool success, std::uint64_t, const OptionalError&) {
-                           signedIn = success;
-                           done.signal();
-                         });
-        });
-    ASSERT_TRUE(signedIn);
-  }
+  void signIn() { ASSERT_TRUE(signInThrough(*proxy_, kAccountName, kPassword)); }
 
   struct PurchaseResult {
     std::optional<TillPurchaseResponse> response;
@@ -206,11 +144,6 @@ class StoreRuntimeTest : public ::testing::Test {
     }
   }
 
-  StoreCatalogueBuilder catalogue_;
-  TemporaryPlatform platform_;
-  std::unique_ptr<RootOverride> root_;
-  std::unique_ptr<StoreServerProcess> store_;
-  std::shared_ptr<VendRuntime> runtime_;
   std::unique_ptr<VendServiceProxy> proxy_;
 };
 
@@ -307,86 +240,113 @@ TEST_F(StoreRuntimeTest, PurchaseWithoutOptionsStartsTheInstallItself) {
   signIn();
   auto result = purchase(kNotesItem, 0);
   ASSERT_TRUE(result.success) << (result.error ? result.error->descriptionText() : "");
-  const auto deadline = std::chrono::steady_clock::now() + 20s;
-  while (!fs::exists(installedBundle() + "/bundle.plist") &&
-         std::chrono::steady_clock::now() < deadline) {
-    std::this_thread::sleep_for(20ms);
-  }
-  EXPECT_TRUE(fs::exists(installedBundle() + "/bundle.plist"));
+  EXPECT_TRUE(eventually([&] { return fs::exists(installedBundle() + "/bundle.plist"); }, 20s));
 }
 
-TEST_F(StoreRuntimeTest, BrokenTransfersEndInClearErrorsWithNothingInstalled) {
-  for (const std::string fault : {"assets=corrupt", "assets=truncate", "assets=500"}) {
-    SCOPED_TRACE(fault);
-    startStore({fault});
+// Every way a store can break a purchase: where it stops, how it says so,
+// what reached the store; never anything installed, never a hang.
+struct BrokenStore {
+  const char* name;
+  std::vector<std::string> faults;
+  enum Stage { kBag, kPurchase, kInstall } failsAt;
+  double timeout = 10;
+  std::optional<std::int64_t> code;
+  std::string phrase;  // in the error's description
+  std::optional<std::uint64_t> buyRequests;
+  std::optional<std::uint64_t> signedBuyRequests;
+};
+
+void PrintTo(const BrokenStore& broken, std::ostream* out) {
+  *out << broken.name;
+}
+
+class BrokenStoreTest : public StoreRuntimeTest,
+                        public ::testing::WithParamInterface<BrokenStore> {};
+
+TEST_P(BrokenStoreTest, EndsInAClearErrorWithNothingInstalled) {
+  const BrokenStore& broken = GetParam();
+  startStore(broken.faults, broken.timeout);
+  OptionalError error;
+  const auto started = std::chrono::steady_clock::now();
+  if (broken.failsAt == BrokenStore::kBag) {
+    const auto load = runtime_->urlBag().load(0);
+    EXPECT_FALSE(load.success);
+    ASSERT_TRUE(load.error);
+    EXPECT_FALSE(load.error->description.empty());
+    EXPECT_FALSE(runtime_->urlBag().urlForKey(0, "buy-product", &error));
+    EXPECT_TRUE(error);
+    EXPECT_FALSE(purchase(kNotesItem, 0).success);
+  } else if (broken.failsAt == BrokenStore::kPurchase) {
+    signIn();
+    // Left to itself, a purchase would go on to download what it was sent.
+    auto result = purchase(kNotesItem, 0);
+    EXPECT_FALSE(result.success);
+    EXPECT_FALSE(result.response);
+    error = result.error;
+    EXPECT_EQ(requests("assets"), 0U);
+  } else {
     signIn();
     auto download = purchasedDownload();
     ASSERT_TRUE(download);
     auto outcome = install(download);
     EXPECT_EQ(outcome.result, 0);
-    ASSERT_TRUE(outcome.error);
-    EXPECT_FALSE(outcome.error->description.empty());
-    expectNothingInstalledOrHalfWritten();
+    error = outcome.error;
   }
-}
-
-TEST_F(StoreRuntimeTest, AStoreThatDoesNotAnswerEndsInAnErrorWithinTheTimeLimit) {
-  startStore({"assets=stall", "buy-product=stall"}, 2);
-  signIn();
-  const auto started = std::chrono::steady_clock::now();
-  auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
-  EXPECT_FALSE(result.success);
-  ASSERT_TRUE(result.error);
   EXPECT_LT(std::chrono::steady_clock::now() - started, 15s);
+  ASSERT_TRUE(error);
+  EXPECT_FALSE(error->description.empty());
+  if (broken.code) {
+    EXPECT_EQ(error->code, *broken.code) << error->descriptionText();
+  }
+  EXPECT_NE(error->descriptionText().find(broken.phrase), std::string::npos)
+      << error->descriptionText();
+  if (broken.buyRequests) {
+    EXPECT_EQ(requests("buy-product"), *broken.buyRequests);
+  }
+  if (broken.signedBuyRequests) {
+    EXPECT_EQ(store_->signedRequestCount("buy-product"), *broken.signedBuyRequests);
+  }
   expectNothingInstalledOrHalfWritten();
 }
 
-TEST_F(StoreRuntimeTest, StalledAssetTransferFailsAndLeavesNothing) {
-  startStore({"assets=stall"}, 2);
-  signIn();
-  auto download = purchasedDownload();
-  ASSERT_TRUE(download);
-  const auto started = std::chrono::steady_clock::now();
-  auto outcome = install(download);
-  EXPECT_EQ(outcome.result, 0);
-  EXPECT_TRUE(outcome.error);
-  EXPECT_LT(std::chrono::steady_clock::now() - started, 15s);
-  expectNothingInstalledOrHalfWritten();
-}
+INSTANTIATE_TEST_SUITE_P(
+    , BrokenStoreTest,
+    ::testing::Values(
+        BrokenStore{"BagNotAPropertyList", {"bag=not-plist"}, BrokenStore::kBag, 10, {}, "", 0},
+        BrokenStore{"BagOfTheWrongShape", {"bag=wrong-shape"}, BrokenStore::kBag, 10, {}, "", 0},
+        BrokenStore{"BagServerError", {"bag=500"}, BrokenStore::kBag, 10, {}, "", 0},
+        BrokenStore{"PurchaseNotAPropertyList", {"buy-product=not-plist"}, BrokenStore::kPurchase},
+        BrokenStore{"PurchaseOfTheWrongShape", {"buy-product=wrong-shape"}, BrokenStore::kPurchase},
+        BrokenStore{"PurchaseServerError", {"buy-product=500"}, BrokenStore::kPurchase},
+        BrokenStore{"PurchaseAnswerForAnotherItem",
+                    {"buy-product=other-item"},
+                    BrokenStore::kPurchase,
+                    10,
+                    VendStoreAnswer::kWrongItem,
+                    "not the item bought (501)",
+                    1},
+        // The store sends the signed purchase from 127.0.0.1 to localhost:
+        // the request arrives there without the account and its signature
+        // (and so is refused as unsigned).
+        BrokenStore{"CrossHostRedirectLeavesTheAccountHeadersBehind",
+                    {"buy-product=redirect-host"},
+                    BrokenStore::kPurchase,
+                    10,
+                    401,
+                    "",
+                    2,
+                    1},
+        BrokenStore{"StoreThatDoesNotAnswer",
+                    {"assets=stall", "buy-product=stall"},
+                    BrokenStore::kPurchase,
+                    2},
+        BrokenStore{"CorruptAsset", {"assets=corrupt"}, BrokenStore::kInstall},
+        BrokenStore{"TruncatedAsset", {"assets=truncate"}, BrokenStore::kInstall},
+        BrokenStore{"AssetServerError", {"assets=500"}, BrokenStore::kInstall},
+        BrokenStore{"StalledAsset", {"assets=stall"}, BrokenStore::kInstall, 2}),
+    [](const auto& info) { return std::string(info.param.name); });
 
-TEST_F(StoreRuntimeTest, AnswersThatAreNotPropertyListsOrOfTheWrongShapeGiveErrors) {
-  for (const std::string fault :
-       {"buy-product=not-plist", "buy-product=wrong-shape", "buy-product=500"}) {
-    SCOPED_TRACE(fault);
-    startStore({fault});
-    signIn();
-    auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
-    EXPECT_FALSE(result.success);
-    EXPECT_FALSE(result.response);
-    ASSERT_TRUE(result.error);
-    EXPECT_FALSE(result.error->description.empty());
-  }
-}
-
-TEST_F(StoreRuntimeTest, ABagThatIsNotAPropertyListFailsEveryRequestCleanly) {
-  for (const std::string fault : {"bag=not-plist", "bag=wrong-shape", "bag=500"}) {
-    SCOPED_TRACE(fault);
-    startStore({fault});
-    auto load = runtime_->urlBag().load(0);
-    EXPECT_FALSE(load.success);
-    ASSERT_TRUE(load.error);
-    EXPECT_FALSE(load.error->description.empty());
-    OptionalError error;
-    EXPECT_FALSE(runtime_->urlBag().urlForKey(0, "buy-product", &error));
-    EXPECT_TRUE(error);
-    auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
-    EXPECT_FALSE(result.success);
-    EXPECT_TRUE(result.error);
-    EXPECT_EQ(store_->requestCount("buy-product"), 0U);
-  }
-}
-
-TEST_F(StoreRuntimeTest, ConcurrentCallersShareOneBagFetchAndObserversHearOfIt) {
+TEST_F(StoreRuntimeTest, ConcurrentCallersShareOneBagFetchObserversHearOfItAndAMissingKeyIs30) {
   startStore();
   class CountingObserver : public VendURLBagObserver {
    public:
@@ -412,15 +372,11 @@ TEST_F(StoreRuntimeTest, ConcurrentCallersShareOneBagFetchAndObserversHearOfIt) 
   EXPECT_TRUE(runtime_->urlBag().load(1, true).success);
   EXPECT_EQ(store_->requestCount("bag"), 3U);
   EXPECT_EQ(observer->loads, 2);
-}
 
-TEST_F(StoreRuntimeTest, AMissingBagKeyIsCode30) {
-  startStore();
   OptionalError error;
   EXPECT_FALSE(runtime_->urlBag().urlForKey(0, "no-such-request", &error));
   ASSERT_TRUE(error);
-  EXPECT_EQ(error->code, 30);
-  EXPECT_TRUE(runtime_->urlBag().urlForKey(0, "buy-product", &error).has_value());
+  EXPECT_EQ(error->code, 30) << "a missing key";
 }
 
 TEST_F(StoreRuntimeTest, APurchaseWithoutAccountAsksTheUserAndRemembersTheAccount) {
@@ -448,29 +404,29 @@ TEST_F(StoreRuntimeTest, APurchaseWithoutAccountAsksTheUserAndRemembersTheAccoun
   EXPECT_EQ(presenter->shown, 1);
 }
 
-TEST_F(StoreRuntimeTest, CancelledOrWrongSignInFailsThePurchase) {
+TEST_F(StoreRuntimeTest, ASignInThatDoesNotSucceedFailsThePurchase) {
   startStore();
-  runtime_->setDialogPresenter(
-      std::make_shared<ScriptedPresenter>(VendDialogButton::kCancel, PlistDictionary{}));
-  auto cancelled = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
-  ASSERT_TRUE(cancelled.error);
-  EXPECT_EQ(cancelled.error->code, VendError::kCancelledCode);
-  EXPECT_EQ(store_->requestCount("buy-product"), 0U);
-
-  runtime_->setDialogPresenter(std::make_shared<ScriptedPresenter>(
-      VendDialogButton::kOK,
-      PlistDictionary{{"accountName", kAccountName}, {"password", "wrong"}}));
-  auto refused = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
-  ASSERT_TRUE(refused.error);
-  EXPECT_EQ(refused.error->code, 401);
-  EXPECT_FALSE(runtime_->accountStore().primaryAccount());
-}
-
-TEST_F(StoreRuntimeTest, NoDialogAgentMeansTheSignInCountsAsCancelled) {
-  startStore();
-  auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
-  ASSERT_TRUE(result.error);
-  EXPECT_EQ(result.error->code, VendError::kCancelledCode);
+  const std::vector<std::tuple<const char*, std::shared_ptr<VendDialogPresenter>, std::int64_t>>
+      cases{
+          {"no dialog agent", nullptr, VendError::kCancelledCode},
+          {"cancelled",
+           std::make_shared<ScriptedPresenter>(VendDialogButton::kCancel, PlistDictionary{}),
+           VendError::kCancelledCode},
+          {"wrong password",
+           std::make_shared<ScriptedPresenter>(
+               VendDialogButton::kOK,
+               PlistDictionary{{"accountName", kAccountName}, {"password", "wrong"}}),
+           401},
+      };
+  for (const auto& [what, presenter, code] : cases) {
+    SCOPED_TRACE(what);
+    if (presenter) runtime_->setDialogPresenter(presenter);
+    auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
+    ASSERT_TRUE(result.error);
+    EXPECT_EQ(result.error->code, code);
+    EXPECT_FALSE(runtime_->accountStore().primaryAccount());
+  }
+  EXPECT_EQ(requests("buy-product"), 0U);
 }
 
 TEST_F(StoreRuntimeTest, SignaturesRoundTripAndAForgedAnswerIsRefused) {
@@ -599,9 +555,7 @@ TEST_F(StoreRuntimeTest, PurchasesWaitingForSignInNeverStarveOtherServiceCalls) 
       return answered->waitFor(limit);
     };
     if (holdDialogs) {
-      const auto deadline = std::chrono::steady_clock::now() + 30s;
-      while (holding->heldCount() < kPurchases && std::chrono::steady_clock::now() < deadline)
-        std::this_thread::sleep_for(20ms);
+      eventually([&] { return holding->heldCount() >= kPurchases; }, 30s);
       ASSERT_EQ(holding->heldCount(), static_cast<std::size_t>(kPurchases));
       EXPECT_TRUE(answersWithin(1s)) << "a held dialog held up the account service";
       holding->cancelAll();
@@ -618,12 +572,7 @@ TEST_F(StoreRuntimeTest, PurchasesWaitingForSignInNeverStarveOtherServiceCalls) 
 
 TEST_F(StoreRuntimeTest, ASignInAnswerThatCarriesDownloadsInstallsNothing) {
   startStore({"authenticate=with-downloads"});
-  std::mutex mutex;
-  std::vector<std::string> errors;
-  auto sink = TillLogManager::sharedManager().addSink([&](int level, const std::string& line) {
-    std::lock_guard lock(mutex);
-    if (level == 1) errors.push_back(line);
-  });
+  const LogLines log;
   signIn();
   // A purchase through the same service after the sign-in has ended: by
   // then a download the sign-in had started would be under way.
@@ -639,40 +588,7 @@ TEST_F(StoreRuntimeTest, ASignInAnswerThatCarriesDownloadsInstallsNothing) {
   EXPECT_EQ(downloads, 0U);
   EXPECT_EQ(store_->requestCount("assets"), 0U);
   EXPECT_FALSE(fs::exists(installedBundle()));
-  std::lock_guard lock(mutex);
-  EXPECT_EQ(std::ranges::count_if(errors,
-                                  [](const std::string& line) {
-                                    return line.find(
-                                               "sign-in answer carries 1 download(s); they "
-                                               "are ignored") != std::string::npos;
-                                  }),
-            1);
-}
-
-TEST_F(StoreRuntimeTest, APurchaseAnswerForAnotherItemIsRefused) {
-  startStore({"buy-product=other-item"});
-  signIn();
-  const auto result = purchase(kNotesItem, 0);
-  EXPECT_FALSE(result.success);
-  EXPECT_FALSE(result.response);
-  ASSERT_TRUE(result.error);
-  EXPECT_EQ(result.error->code, VendStoreAnswer::kWrongItem);
-  EXPECT_NE(result.error->descriptionText().find("not the item bought (501)"), std::string::npos)
-      << result.error->descriptionText();
-  EXPECT_EQ(store_->requestCount("assets"), 0U);
-}
-
-// The store sends the signed purchase from 127.0.0.1 to localhost: the
-// request arrives there without the account and its signature (and so is
-// refused as unsigned).
-TEST_F(StoreRuntimeTest, ACrossHostRedirectLeavesTheAccountHeadersBehind) {
-  startStore({"buy-product=redirect-host"});
-  signIn();
-  const auto result = purchase(kNotesItem, VendTransactionService::kLeaveDownloadsToCaller);
-  ASSERT_TRUE(result.error);
-  EXPECT_EQ(result.error->code, 401);
-  EXPECT_EQ(store_->requestCount("buy-product"), 2U);
-  EXPECT_EQ(store_->signedRequestCount("buy-product"), 1U);
+  EXPECT_EQ(log.at(1, "sign-in answer carries 1 download(s); they are ignored", false).size(), 1U);
 }
 
 TEST_F(StoreRuntimeTest, ATricklingTransferEndsWithinItsTimeBound) {

@@ -3,8 +3,6 @@
 #include <signal.h>
 
 #include <filesystem>
-#include <fstream>
-#include <sstream>
 #include <stdexcept>
 #include <thread>
 
@@ -28,13 +26,6 @@ std::vector<std::string> storeArguments(const std::string& catalogueDirectory,
     arguments.push_back(fault);
   }
   return arguments;
-}
-
-std::string fileText(const std::string& path) {
-  std::ifstream file(path);
-  std::stringstream text;
-  text << file.rdbuf();
-  return text.str();
 }
 
 }  // namespace
@@ -63,7 +54,7 @@ StoreServerProcess::~StoreServerProcess() {
 void StoreServerProcess::awaitListeningLine(std::chrono::milliseconds timeout) {
   const bool listening = eventually(
       [&] {
-        const std::string output = fileText(logDirectory_ + "/stdout");
+        const std::string output = readFile(logDirectory_ + "/stdout");
         const auto start = output.find(kListeningPrefix);
         const auto end = output.find('\n', start);
         if (start == std::string::npos || end == std::string::npos) return !process_.isRunning();
@@ -89,9 +80,7 @@ std::uint64_t StoreServerProcess::signedRequestCount(const std::string& route) c
 }
 
 std::uint64_t StoreServerProcess::countAt(const std::string& path, const std::string& route) const {
-  VendURLRequest request(baseURL_ + path);
-  request.setTimeoutInterval(10);
-  const auto result = VendHTTPTransfer::perform(request);
+  const auto result = get(baseURL_ + path);
   const auto counts = result.error ? std::nullopt : PropertyListSerialization::read(result.body);
   if (!counts || !(*counts)[route].isInteger()) {
     throw std::runtime_error("larder-store gave no request count for " + route);
@@ -100,7 +89,7 @@ std::uint64_t StoreServerProcess::countAt(const std::string& path, const std::st
 }
 
 std::string StoreServerProcess::errorOutput() const {
-  return fileText(logDirectory_ + "/stderr");
+  return readFile(logDirectory_ + "/stderr");
 }
 
 int StoreServerProcess::stop(std::chrono::milliseconds grace) {

@@ -5,6 +5,8 @@
 #include <string>
 #include <vector>
 
+#include "platform/plist/PropertyListSerialization.h"
+#include "store-runtime/http/VendHTTPTransfer.h"
 #include "tests/integration/ServiceHarness.h"
 
 namespace larder::testing {
@@ -55,5 +57,32 @@ class StoreServerProcess {
   std::string baseURL_;
   int port_ = 0;
 };
+
+// Speaking to the store over HTTP with the runtime's own transport.
+inline std::string text(const PlistValue& value) {
+  return value.string() ? *value.string() : "<absent>";
+}
+inline PlistData dataOf(std::string_view text) {
+  return {text.begin(), text.end()};
+}
+inline PlistValue plistOf(const VendHTTPTransfer::Result& result) {
+  return PropertyListSerialization::read(result.body).value_or(PlistValue());
+}
+inline std::string failureTypeOf(const VendHTTPTransfer::Result& result) {
+  return text(plistOf(result)["failureType"]);
+}
+inline VendHTTPTransfer::Result get(const std::string& url, double timeout = 10) {
+  VendURLRequest request(url);
+  request.setTimeoutInterval(timeout);
+  return VendHTTPTransfer::perform(request);
+}
+inline VendURLRequest postRequest(const std::string& url, const PlistValue& body) {
+  VendURLRequest request(url);
+  request.setMethod("POST");
+  request.setValue("application/x-plist", "Content-Type");
+  request.setBody(dataOf(PropertyListSerialization::writeXml(body)));
+  request.setTimeoutInterval(10);
+  return request;
+}
 
 }  // namespace larder::testing

@@ -1,0 +1,298 @@
+// The running service against larder-store, used the way a person at a
+// terminal and the store application use it: larder-store with a
+// catalogue, larderd on a private bus with installed bundles, larderctl
+// and clients on the bus.
+#include <gtest/gtest.h>
+
+#include <barrier>
+#include <filesystem>
+#include <memory>
+#include <thread>
+
+#include "platform/log/TillLogManager.h"
+#include "platform/plist/JsonConversion.h"
+#include "store-runtime/records/LedgerUpdate.h"
+#include "tests/integration/LarderctlProcess.h"
+#include "tests/integration/ServiceHarness.h"
+#include "tests/integration/StoreCatalogueBuilder.h"
+#include "tests/integration/StoreServerProcess.h"
+
+namespace larder::testing {
+namespace {
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+
+constexpr char kUpdateRoute[] = "available-software-updates";
+constexpr std::uint64_t kCheckTimeout = 60'000'000;
+
+std::vector<std::uint64_t> identifiersOf(const PlistValue& updates) {
+  std::vector<std::uint64_t> identifiers;
+  if (const PlistArray* list = updates.array()) {
+    for (const PlistValue& update : *list)
+      identifiers.push_back(update["itemIdentifier"].uint64Value());
+  }
+  return identifiers;
+}
+
+class ServiceWithStoreTest : public ::testing::Test {
+ protected:
+  // Starts the store of the catalogue with `faults`, then the service.
+  void start(const std::vector<std::string>& faults = {}) {
+    store_ = std::make_unique<StoreServerProcess>(catalogue_.directory(), faults);
+    startService();
+  }
+
+  void startService() {
+    service_.reset();
+    service_ = std::make_unique<ServiceProcess>(
+        platform_, bus_, std::vector<std::string>{},
+        std::map<std::string, std::string>{{"LARDER_STORE_URL", store_->bagURL()},
+                                           {"LARDER_STORE_TIMEOUT", "5"}});
+    ASSERT_TRUE(service_->waitUntilServing()) << service_->log();
+    ASSERT_TRUE(service_->waitForLog("MetadataQuery initial load took", 20s)) << service_->log();
+  }
+
+  std::unique_ptr<ServiceClient> client() {
+    auto made = connectClient(bus_);
+    made->presentStoreClient(0);
+    return made;
+  }
+
+  LarderctlRun run(const std::vector<std::string>& arguments) {
+    return runLarderctl(platform_, bus_, arguments, "larderctl-" + std::to_string(++runs_));
+  }
+
+  StoreCatalogueBuilder catalogue_;
+  std::unique_ptr<StoreServerProcess> store_;
+  TemporaryPlatform platform_;
+  PrivateBus bus_;
+  std::unique_ptr<ServiceProcess> service_;
+  int runs_ = 0;
+};
+
+// MARK: purchases
+
+constexpr char kShopper[] = "shopper@example.org";
+constexpr char kPassword[] = "open sesame";
+
+class StorePurchaseServiceTest : public ServiceWithStoreTest {
+ protected:
+  void SetUp() override {
+    catalogue_.addAccount({.accountID = 8123, .orvaneID = kShopper, .password = kPassword});
+    catalogue_.addItem(
+        {.wareID = 901, .bundleID = "com.example.Atlas", .title = "Atlas", .version = "3.1"});
+  }
+
+  [[nodiscard]] std::string bundlePath() const {
+    return platform_.root() + "/Applications/Atlas.app";
+  }
+};
+
+TEST_F(StorePurchaseServiceTest, SignedInPurchaseInstallsTheBundleAndTheMapSeesIt) {
+  start();
+  LarderctlRun ran = run({"signin", kShopper, "--password", kPassword});
+  ASSERT_EQ(ran.status, 0) << ran.errors << service_->log();
+  EXPECT_NE(ran.output.find("account 8123"), std::string::npos) << ran.output;
+  ran = run({"account"});
+  ASSERT_EQ(ran.status, 0);
+  EXPECT_NE(ran.output.find(kShopper), std::string::npos);
+
+  ran = run({"purchase", "901"});
+  ASSERT_EQ(ran.status, 0) << ran.errors << service_->log();
+  EXPECT_NE(ran.output.find("com.example.Atlas"), std::string::npos) << ran.output;
+  // larderctl follows the install to its end.
+  EXPECT_NE(ran.output.find("installed Atlas at " + bundlePath()), std::string::npos) << ran.output;
+  ASSERT_TRUE(fs::exists(bundlePath() + "/purchase.plist")) << service_->log();
+  EXPECT_TRUE(eventually(
+      [&] {
+        return (ran = run({"product", "--bundle-id", "com.example.Atlas"})).status == 0;
+      },
+      20s))
+      << service_->log();
+  EXPECT_NE(ran.output.find("3.1"), std::string::npos) << ran.output;
+}
+
+TEST_F(StorePurchaseServiceTest, ADialogAgentSignsTheAccountInWhenAPurchaseNeedsIt) {
+  start();
+  Larderctl agent(platform_, bus_,
+                  {"agent", "--answer", "ok", "--account", kShopper, "--password", kPassword},
+                  "agent");
+  ASSERT_TRUE(agent.waitForError("registered")) << agent.errors();
+  LarderctlRun ran = run({"purchase", "901"});
+  ASSERT_EQ(ran.status, 0) << ran.errors << service_->log();
+  ran = run({"--json", "account"});
+  ASSERT_EQ(ran.status, 0);
+  EXPECT_NE(ran.output.find("8123"), std::string::npos) << ran.output;
+  EXPECT_TRUE(eventually([&] { return fs::exists(bundlePath() + "/bundle.plist"); }, 20s));
+}
+
+TEST_F(StorePurchaseServiceTest, WithoutAgentOrAccountThePurchaseFailsAsCancelled) {
+  start();
+  LarderctlRun ran = run({"purchase", "901"});
+  EXPECT_EQ(ran.status, 1);
+  EXPECT_NE(ran.errors.find("code -128"), std::string::npos) << ran.errors;
+  EXPECT_EQ(store_->requestCount("buy-product"), 0U);
+  EXPECT_FALSE(fs::exists(bundlePath()));
+  ran = run({"signin", kShopper, "--password", "wrong"});
+  EXPECT_EQ(ran.status, 1);
+  EXPECT_NE(ran.errors.find("code 401"), std::string::npos) << ran.errors;
+}
+
+// Every package the store sends fails its digests.
+TEST_F(StorePurchaseServiceTest, LarderctlSaysWhenThePurchasedDownloadIsNotInstalled) {
+  start({"assets=corrupt"});
+  ASSERT_EQ(run({"signin", kShopper, "--password", kPassword}).status, 0) << service_->log();
+  LarderctlRun ran = run({"purchase", "901"});
+  EXPECT_EQ(ran.status, 1) << ran.output << ran.errors;
+  EXPECT_NE(ran.errors.find("the download of Atlas (901) ended without an installed application"),
+            std::string::npos)
+      << ran.errors;
+  EXPECT_EQ(ran.output.find("installed Atlas"), std::string::npos) << ran.output;
+  EXPECT_FALSE(fs::exists(bundlePath()));
+  // Without waiting, larderctl returns once the store has answered.
+  ran = run({"purchase", "901", "--no-wait"});
+  EXPECT_EQ(ran.status, 0) << ran.errors;
+  EXPECT_NE(ran.output.find("downloading 901"), std::string::npos) << ran.output;
+}
+
+// MARK: update checks
+
+class UpdateCheckServiceTest : public ServiceWithStoreTest {
+ protected:
+  void SetUp() override {
+    // The installed bundles' purchase records name the opaque id "account-1".
+    catalogue_.addAccount({.accountID = 4711,
+                           .orvaneID = "owner@example.org",
+                           .password = "secret",
+                           .opaqueID = "account-1"});
+    catalogue_.addItem(
+        {.wareID = 101, .bundleID = "com.example.atlas", .title = "Atlas", .version = "2.0"});
+    catalogue_.addItem({.wareID = 102,
+                        .bundleID = "com.example.birch",
+                        .title = "Birch",
+                        .version = "3.0",
+                        .extraEntries = {{"incompatible", true}}});
+    catalogue_.addItem(
+        {.wareID = 103, .bundleID = "com.example.cedar", .title = "Cedar", .version = "1.0"});
+    const std::string applications = platform_.root() + "/Applications";
+    platform_.installBundle({applications, "Atlas", "com.example.atlas", "1.0", 101});
+    platform_.installBundle({applications, "Birch", "com.example.birch", "1.0", 102});
+    platform_.installBundle({applications, "Cedar", "com.example.cedar", "1.0", 103});
+  }
+};
+
+// The store takes a second over every update check, so that all callers
+// arrive while the first check is in flight, however slow the machine.
+TEST_F(UpdateCheckServiceTest, TenClientsCheckingAtOnceCauseOneStoreRequestAndShareTheAnswer) {
+  start({std::string(kUpdateRoute) + "=slow"});
+  constexpr int kClients = 10;
+  std::vector<std::unique_ptr<ServiceClient>> clients;
+  for (int i = 0; i < kClients; ++i) clients.push_back(client());
+  std::vector<PlistArray> replies(kClients);
+  std::barrier begin(kClients);
+  std::vector<std::thread> callers;
+  for (int i = 0; i < kClients; ++i) {
+    callers.emplace_back([&, i] {
+      begin.arrive_and_wait();
+      replies[i] =
+          clients[i]->call("CheckForUpdatesWithUserHasSeenUpdates", {false}, kCheckTimeout);
+    });
+  }
+  for (std::thread& caller : callers) caller.join();
+  for (const PlistArray& reply : replies) {
+    ASSERT_EQ(reply.size(), 3U);
+    EXPECT_TRUE(reply[0].boolValue()) << describePlistValue(reply[2]) << service_->log();
+    EXPECT_EQ(identifiersOf(reply[1]), (std::vector<std::uint64_t>{101}));
+    EXPECT_EQ(reply[1], replies.front()[1]) << "every caller gets the same records";
+  }
+  EXPECT_EQ(store_->requestCount(kUpdateRoute), 1U) << service_->log();
+
+  const PlistArray incompatible = clients[0]->call("IncompatibleUpdates", {});
+  EXPECT_EQ(identifiersOf(incompatible.at(0)), (std::vector<std::uint64_t>{102}));
+  const PlistArray one =
+      clients[0]->call("AvailableUpdateWithItemIdentifier", {std::uint64_t{101}});
+  EXPECT_EQ(*one.at(0)["version"].string(), "2.0");
+  EXPECT_EQ(*one.at(0)["bundleID"].string(), "com.example.atlas");
+}
+
+// The store's answer carries, after its own items, entries that make no
+// update record and one that does.
+TEST_F(UpdateCheckServiceTest, TheGoodItemsOfAnAnswerAreKeptAndTheOthersDropped) {
+  catalogue_.writeStoreSettings(PlistDictionary{
+      {"extraUpdateItems", PlistArray{"not an item", PlistDictionary{{"ware-id", "not a number"}},
+                                      PlistDictionary{{"bundle-id", "com.example.nowareid"}},
+                                      PlistDictionary{{"ware-id", 104},
+                                                      {"bundle-id", "com.example.dune"},
+                                                      {"title", "Dune"},
+                                                      {"version", "4.0"}}}}});
+  start();
+  auto asking = client();
+  const PlistArray reply =
+      asking->call("CheckForUpdatesWithUserHasSeenUpdates", {false}, kCheckTimeout);
+  ASSERT_TRUE(reply.at(0).boolValue()) << service_->log();
+  EXPECT_EQ(identifiersOf(reply.at(1)), (std::vector<std::uint64_t>{101, 104}));
+  EXPECT_EQ(identifiersOf(asking->call("AvailableUpdates", {}).at(0)),
+            (std::vector<std::uint64_t>{101, 104}));
+}
+
+TEST_F(UpdateCheckServiceTest, LarderctlListsTheUpdatesAndTheyOutliveARestartOfTheService) {
+  start();
+  LarderctlRun ran = run({"updates", "--check"});
+  ASSERT_EQ(ran.status, 0) << ran.errors << service_->log();
+  EXPECT_NE(ran.output.find("com.example.atlas"), std::string::npos) << ran.output;
+  EXPECT_NE(ran.output.find("2.0"), std::string::npos) << ran.output;
+  EXPECT_EQ(ran.output.find("com.example.cedar"), std::string::npos) << "Cedar is up to date";
+  const auto incompatibleAt = ran.output.find("Incompatible");
+  ASSERT_NE(incompatibleAt, std::string::npos) << ran.output;
+  EXPECT_GT(ran.output.find("com.example.birch"), incompatibleAt) << ran.output;
+  EXPECT_TRUE(fs::exists(platform_.cacheHome() + "/com.orvane.larderd/updates.plist"));
+
+  service_->stop();
+  startService();
+  ran = run({"--json", "updates"});
+  ASSERT_EQ(ran.status, 0) << ran.errors;
+  const PlistValue listed = JsonConversion::fromJson(nlohmann::json::parse(ran.output));
+  EXPECT_EQ(identifiersOf(listed["updates"]), (std::vector<std::uint64_t>{101}));
+  EXPECT_EQ(identifiersOf(listed["incompatibleUpdates"]), (std::vector<std::uint64_t>{102}));
+  EXPECT_EQ(store_->requestCount(kUpdateRoute), 1U) << "the list came from the cache";
+}
+
+TEST_F(UpdateCheckServiceTest, SeenUpdatesStayMarkedAndAFailedCheckKeepsTheCachedList) {
+  start();
+  PlistArray reply = client()->call("CheckForUpdatesWithUserHasSeenUpdates", {true}, kCheckTimeout);
+  ASSERT_TRUE(reply.at(0).boolValue()) << service_->log();
+  ASSERT_EQ(identifiersOf(reply.at(1)), (std::vector<std::uint64_t>{101}));
+  EXPECT_TRUE(reply.at(1).array()->front()["hasBeenSeenByUser"].boolValue());
+
+  const std::string cache = platform_.cacheHome() + "/com.orvane.larderd/updates.plist";
+  const auto modified = fs::last_write_time(cache);
+  store_->stop();
+  const LarderctlRun ran = run({"updates", "--check"});
+  EXPECT_EQ(ran.status, 1);
+  EXPECT_NE(ran.errors.find("the update check failed"), std::string::npos) << ran.errors;
+  EXPECT_NE(ran.output.find("com.example.atlas"), std::string::npos) << ran.output;
+  EXPECT_NE(ran.output.find("seen"), std::string::npos) << ran.output;
+  EXPECT_EQ(fs::last_write_time(cache), modified);
+}
+
+TEST_F(UpdateCheckServiceTest, TheStoreNamesTheAccountThatOwnsAnInstalledProduct) {
+  start();
+  auto asking = client();
+  const PlistValue atlas =
+      asking->call("ProductForBundleIdentifier", {std::string("com.example.atlas")}).at(0);
+  ASSERT_TRUE(atlas.dictionary() && !atlas.dictionary()->empty()) << service_->log();
+  EXPECT_EQ(*asking->call("LookupOrvaneIDForApp", {atlas}, kCheckTimeout).at(0).string(),
+            "owner@example.org");
+  EXPECT_EQ(store_->requestCount("orvane-id-lookup"), 1U);
+  // No product, and a store that has gone: no name.
+  EXPECT_EQ(*asking->call("LookupOrvaneIDForApp", {PlistDictionary{}}).at(0).string(), "");
+  store_->stop();
+  EXPECT_EQ(*asking->call("LookupOrvaneIDForApp", {atlas}, kCheckTimeout).at(0).string(), "");
+  EXPECT_TRUE(
+      service_->waitForLog("App may be from wrong environment! Lookup failed with error - "))
+      << service_->log();
+}
+
+}  // namespace
+}  // namespace larder::testing
