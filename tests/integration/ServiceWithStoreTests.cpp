@@ -7,8 +7,10 @@
 #include <barrier>
 #include <filesystem>
 #include <memory>
+#include <optional>
 #include <thread>
 
+#include "client/ServiceError.h"
 #include "platform/log/TillLogManager.h"
 #include "platform/plist/JsonConversion.h"
 #include "store-runtime/records/LedgerUpdate.h"
@@ -218,6 +220,29 @@ TEST_F(UpdateCheckServiceTest, TenClientsCheckingAtOnceCauseOneStoreRequestAndSh
 
 // The store's answer carries, after its own items, entries that make no
 // update record and one that does.
+// A stop while an update check waits for a store that never answers: the
+// caller hears at once that the service is stopping, not a timeout later.
+TEST_F(UpdateCheckServiceTest, ACallOpenWhenTheServiceStopsIsAnsweredAsStopping) {
+  start({std::string(kUpdateRoute) + "=stall"});
+  auto caller = client();
+  std::optional<std::string> errorName;
+  std::thread waiting([&] {
+    try {
+      caller->call("CheckForUpdatesWithUserHasSeenUpdates", {false}, kCheckTimeout);
+    } catch (const sdbus::Error& error) {
+      errorName = error.getName();
+    }
+  });
+  ASSERT_TRUE(eventually([&] { return store_->requestCount(kUpdateRoute) == 1; }))
+      << service_->log();
+  const auto stoppedAt = std::chrono::steady_clock::now();
+  EXPECT_EQ(service_->stop(), 0) << service_->log();
+  waiting.join();
+  EXPECT_EQ(errorName, std::string(ServiceError::kStopping)) << service_->log();
+  EXPECT_LT(std::chrono::steady_clock::now() - stoppedAt, 5s);
+  EXPECT_FALSE(service_->logLines("open requests answered as stopping").empty()) << service_->log();
+}
+
 TEST_F(UpdateCheckServiceTest, TheGoodItemsOfAnAnswerAreKeptAndTheOthersDropped) {
   catalogue_.writeStoreSettings(PlistDictionary{
       {"extraUpdateItems", PlistArray{"not an item", PlistDictionary{{"ware-id", "not a number"}},
