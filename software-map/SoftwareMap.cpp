@@ -115,7 +115,7 @@ void SoftwareMap::asyncInitializeAndLoadPersistedStore() {
   } catch (const std::exception& exception) {
     TILL_LOG(1, "%@: Exception loading persisted SoftwareMap - %@", kSpeaker, exception.what());
   }
-  std::size_t count = appsByPath_ ? appsByPath_->size() : 0;
+  std::size_t count = records_->appsByPath ? records_->appsByPath->size() : 0;
   logAppsByPath({2,
                  2,
                  __func__,
@@ -123,7 +123,7 @@ void SoftwareMap::asyncInitializeAndLoadPersistedStore() {
                  {kSpeaker},
                  "%@: After loading persisted store, SoftwareMap has %ld items",
                  {kSpeaker, LogArgument::number(count)}});
-  if (!appsByPath_) appsByPath_.emplace();
+  if (!records_->appsByPath) records_->appsByPath.emplace();
   // Readers wait for this barrier; freeing the decoded archive and handing
   // the memory back can happen after they have their answers.
   // Held by a shared pointer: the task may be copied on its way to a worker,
@@ -164,7 +164,7 @@ std::optional<PlistValue> SoftwareMap::loadPersistedStore() {
     // not ours to trust.
     if (product && product->bundlePath() == path) loaded.emplace(path, std::move(product));
   }
-  appsByPath_ = std::move(loaded);
+  records_->appsByPath = std::move(loaded);
   rebuildSecondaryMaps();
   return root;
 }
@@ -173,8 +173,8 @@ void SoftwareMap::logAppsByPath(MapLogLine line) const {
   auto& log = TillLogManager::sharedManager();
   if (!log.isEnabled(line.level)) return;
   PlistDictionary described;
-  if (appsByPath_) {
-    for (const auto& [path, product] : *appsByPath_)
+  if (records_->appsByPath) {
+    for (const auto& [path, product] : *records_->appsByPath)
       described.emplace(path, product->toDictionary());
   }
   if (described.size() <= kMostRecordsInLogLine) {
@@ -190,13 +190,13 @@ void SoftwareMap::logAppsByPath(MapLogLine line) const {
 }
 
 void SoftwareMap::writePersistedStoreToDisk() {
-  if (!appsByPath_) return;
+  if (!records_->appsByPath) return;
   // The barrier takes only the membership; encoding and the disk, with its
   // fsync, happen on the store queue in the order of the changes, so that
   // readers never wait for the disk. A record's values are read when it is
   // encoded, which is never older than the change that asked for the write.
   auto members = std::make_shared<std::vector<std::pair<std::string, LedgerSoftwareProductRef>>>(
-      appsByPath_->begin(), appsByPath_->end());
+      records_->appsByPath->begin(), records_->appsByPath->end());
   storeQueue_->async([members, path = persistedStoreURL()] {
     PlistDictionary records;
     for (const auto& [memberPath, product] : *members) {
@@ -218,20 +218,21 @@ void SoftwareMap::writePersistedStoreToDisk() {
 // MARK: secondary maps and lookups
 
 void SoftwareMap::rebuildSecondaryMaps() {
-  appsByBundleID_.clear();
-  appsByItemID_.clear();
-  if (!appsByPath_) return;
-  appsByBundleID_.reserve(appsByPath_->size());
-  appsByItemID_.reserve(appsByPath_->size());
-  for (const auto& entry : *appsByPath_) {
+  records_->appsByBundleID.clear();
+  records_->appsByItemID.clear();
+  if (!records_->appsByPath) return;
+  records_->appsByBundleID.reserve(records_->appsByPath->size());
+  records_->appsByItemID.reserve(records_->appsByPath->size());
+  for (const auto& entry : *records_->appsByPath) {
     const LedgerSoftwareProductRef& product = entry.second;
     bool hasBundleIdentifier = false;
     bool hasItemIdentifier = false;
     product->read([&](const LedgerSoftwareProductFields& fields) {
       hasBundleIdentifier = fields.bundleIdentifier.has_value();
       hasItemIdentifier = fields.itemIdentifier.has_value();
-      if (hasBundleIdentifier) appsByBundleID_[*fields.bundleIdentifier].push_back(product);
-      if (hasItemIdentifier) appsByItemID_[*fields.itemIdentifier].push_back(product);
+      if (hasBundleIdentifier)
+        records_->appsByBundleID[*fields.bundleIdentifier].push_back(product);
+      if (hasItemIdentifier) records_->appsByItemID[*fields.itemIdentifier].push_back(product);
     });
     if (!hasBundleIdentifier) {
       TILL_LOG(3, "%@: App does not have bundleIdentifier, ignoring in secondary map: %@", kSpeaker,
@@ -304,9 +305,9 @@ LedgerSoftwareProductRef SoftwareMap::productForBundleIdentifier(
     std::string_view bundleIdentifier) {
   LedgerSoftwareProductRef product;
   dispatchQueue_->sync([&] {
-    auto found = appsByBundleID_.find(bundleIdentifier);
+    auto found = records_->appsByBundleID.find(bundleIdentifier);
     product = productWithIdentifierInDictionary(
-        found == appsByBundleID_.end() ? nullptr : &found->second, bundleIdentifier);
+        found == records_->appsByBundleID.end() ? nullptr : &found->second, bundleIdentifier);
   });
   return product;
 }
@@ -314,8 +315,8 @@ LedgerSoftwareProductRef SoftwareMap::productForBundleIdentifier(
 LedgerSoftwareProductRef SoftwareMap::productForItemIdentifier(std::uint64_t itemIdentifier) {
   LedgerSoftwareProductRef product;
   dispatchQueue_->sync([&] {
-    auto found = appsByItemID_.find(itemIdentifier);
-    if (found == appsByItemID_.end()) return;
+    auto found = records_->appsByItemID.find(itemIdentifier);
+    if (found == records_->appsByItemID.end()) return;
     product = productWithIdentifierInDictionary(&found->second, std::to_string(itemIdentifier));
   });
   return product;
@@ -324,9 +325,9 @@ LedgerSoftwareProductRef SoftwareMap::productForItemIdentifier(std::uint64_t ite
 SoftwareMap::ProductList SoftwareMap::allProducts() {
   ProductList products;
   dispatchQueue_->sync([&] {
-    if (!appsByPath_) return;
-    products.reserve(appsByPath_->size());
-    for (const auto& entry : *appsByPath_) products.push_back(entry.second);
+    if (!records_->appsByPath) return;
+    products.reserve(records_->appsByPath->size());
+    for (const auto& entry : *records_->appsByPath) products.push_back(entry.second);
   });
   return products;
 }
@@ -377,7 +378,7 @@ std::optional<PlistData> SoftwareMap::iconDataForApplicationWithBundleID(
 std::string SoftwareMap::addObserver(std::shared_ptr<VendSoftwareMapObserver> observer) {
   std::string token = Uuid::generateString();
   if (observer) {
-    observerQueue_->sync([&] { observers_.emplace(token, std::move(observer)); });
+    observerQueue_->sync([&] { observers_->emplace(token, std::move(observer)); });
     TILL_LOG(3, "%@: SoftwareMap added observer with token: %@", kSpeaker, token);
   }
   return token;
@@ -385,7 +386,7 @@ std::string SoftwareMap::addObserver(std::shared_ptr<VendSoftwareMapObserver> ob
 
 void SoftwareMap::removeObserverWithToken(const std::string& token) {
   bool removed = false;
-  observerQueue_->sync([&] { removed = observers_.erase(token) > 0; });
+  observerQueue_->sync([&] { removed = observers_->erase(token) > 0; });
   if (removed) {
     TILL_LOG(3, "%@: Removed SoftwareMap observer for token: %@", kSpeaker, token);
   } else {
@@ -398,7 +399,7 @@ void SoftwareMap::notifyObserversAboutProduct(const LedgerSoftwareProductRef& pr
   TILL_LOG(3, "%@: Notifying observers of software product change: %@: %@", kSpeaker,
            stateName(state), product);
   observerQueue_->sync([&] {
-    for (const auto& entry : observers_) entry.second->softwareProductUpdatedState(product, state);
+    for (const auto& entry : *observers_) entry.second->softwareProductUpdatedState(product, state);
   });
 }
 

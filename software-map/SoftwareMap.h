@@ -13,6 +13,7 @@
 
 #include "platform/background/BackgroundActivityScheduler.h"
 #include "platform/dispatch/DispatchQueue.h"
+#include "platform/dispatch/QueueConfined.h"
 #include "platform/log/TillLogManager.h"
 #include "platform/metadata/MetadataQuery.h"
 #include "platform/plist/PlistValue.h"
@@ -234,19 +235,21 @@ class SoftwareMap {
   template <typename Value>
   using StringMap = std::unordered_map<std::string, Value, StringHash, std::equal_to<>>;
 
-  // Guarded by dispatchQueue_.
-  std::optional<StringMap<LedgerSoftwareProductRef>> appsByPath_;
-  StringMap<ProductList> appsByBundleID_;
-  std::unordered_map<std::uint64_t, ProductList> appsByItemID_;
-
   // Items the queries reported, by identity, with their records. The item
-  // is held so that its address stays a valid key. Guarded by
-  // dispatchQueue_ (changed only in barriers and in initializeLantern).
+  // is held so that its address stays a valid key.
   struct MappedItem {
     MetadataItemRef item;
     LedgerSoftwareProductRef product;
   };
-  std::unordered_map<const MetadataItem*, MappedItem> appsByMDItem_;
+  // The records and their indexes: read in tasks of dispatchQueue_, changed
+  // in its barriers (and by initializeLantern, before any query reports).
+  struct Records {
+    std::optional<StringMap<LedgerSoftwareProductRef>> appsByPath;
+    StringMap<ProductList> appsByBundleID;
+    std::unordered_map<std::uint64_t, ProductList> appsByItemID;
+    std::unordered_map<const MetadataItem*, MappedItem> appsByMDItem;
+  };
+  QueueConfined<Records> records_{dispatchQueue_};
 
   // Owned by metadataQueryQueue_.
   std::shared_ptr<MetadataQuery> metadataQueryRefQMT_;
@@ -255,8 +258,8 @@ class SoftwareMap {
 
   std::unique_ptr<BackgroundActivityScheduler> periodicReload_;
 
-  // Guarded by observerQueue_.
-  std::map<std::string, std::shared_ptr<VendSoftwareMapObserver>> observers_;
+  QueueConfined<std::map<std::string, std::shared_ptr<VendSoftwareMapObserver>>> observers_{
+      observerQueue_};
 };
 
 }  // namespace larder

@@ -95,7 +95,7 @@ void SoftwareMap::initialDiscovery() {
                    "SoftwareMap: Finished initial load with %@",
                    {},
                    "SoftwareMap: Finished initial load (%ld items)",
-                   {LogArgument::number(appsByPath_->size())}});
+                   {LogArgument::number(records_->appsByPath->size())}});
     registerForPeriodicReload();
     if (options_.liveQueries) dispatchQueue_->async([this] { initializeLantern(); });
   });
@@ -150,15 +150,15 @@ SoftwareMap::ProductList SoftwareMap::discoverAppsUsingAppRegistry() {
 
 void SoftwareMap::rebuildMapUsingDiscoveredApps(const ProductList& discovered) {
   auto start = std::chrono::steady_clock::now();
-  if (!appsByPath_) appsByPath_.emplace();
+  if (!records_->appsByPath) records_->appsByPath.emplace();
   Changes changes;
-  StringMap<LedgerSoftwareProductRef> removed = *appsByPath_;
+  StringMap<LedgerSoftwareProductRef> removed = *records_->appsByPath;
   for (const LedgerSoftwareProductRef& fresh : discovered) {
     std::string path = fresh->bundlePath();
-    auto existing = appsByPath_->find(path);
-    if (existing == appsByPath_->end()) {
+    auto existing = records_->appsByPath->find(path);
+    if (existing == records_->appsByPath->end()) {
       changes.added.push_back(fresh);
-      appsByPath_->emplace(std::move(path), fresh);
+      records_->appsByPath->emplace(std::move(path), fresh);
       continue;
     }
     bool didChange = false;
@@ -175,7 +175,7 @@ void SoftwareMap::rebuildMapUsingDiscoveredApps(const ProductList& discovered) {
           "%@: Valid QMT app at path %@ was not found in full app scan, but seems to exist on disk",
           kSpeaker, path);
     }
-    appsByPath_->erase(path);
+    records_->appsByPath->erase(path);
     product->update([](LedgerSoftwareProductFields& fields) { fields.installed = false; });
     changes.removed.push_back(product);
   }
@@ -190,7 +190,7 @@ void SoftwareMap::rebuildMapUsingDiscoveredApps(const ProductList& discovered) {
 
 void SoftwareMap::logRebuild(double seconds) {
   std::vector<LogArgument> arguments{kSpeaker, LogArgument::number(seconds),
-                                     LogArgument::number(appsByPath_->size())};
+                                     LogArgument::number(records_->appsByPath->size())};
   logAppsByPath({1, 3, "_rebuildMapUsingDiscoveredApps:",
                  "%@: Software map rebuild took %.4f seconds for %lu records and produced: %@",
                  arguments, "%@: Software map rebuild took %.4f seconds for %lu records",

@@ -18,9 +18,9 @@ void clearExpectation(LedgerSoftwareProductFields& fields) {
 }  // namespace
 
 LedgerSoftwareProductRef SoftwareMap::productAtPath(const std::string& path) const {
-  if (!appsByPath_) return nullptr;
-  auto found = appsByPath_->find(path);
-  return found == appsByPath_->end() ? nullptr : found->second;
+  if (!records_->appsByPath) return nullptr;
+  auto found = records_->appsByPath->find(path);
+  return found == records_->appsByPath->end() ? nullptr : found->second;
 }
 
 void SoftwareMap::productAtPathWillBeUpdatedToBundleVersionStoreVersion(

@@ -89,7 +89,7 @@ std::vector<std::string> SoftwareMap::metadataQueryValueAttributes() {
 // MARK: starting and stopping
 
 void SoftwareMap::initializeLantern() {
-  appsByMDItem_.clear();
+  records_->appsByMDItem.clear();
   startMetadataQueryForQMTApps();
   startMetadataQueryForLegacyApps();
 }
@@ -249,11 +249,11 @@ void SoftwareMap::rememberItem(const MetadataItemRef& item,
                                const LedgerSoftwareProductRef& product) {
   product->update(
       [&](LedgerSoftwareProductFields& fields) { fields.mdItemRef = boxedReference(item.get()); });
-  appsByMDItem_[item.get()] = MappedItem{item, product};
+  records_->appsByMDItem[item.get()] = MappedItem{item, product};
 }
 
 void SoftwareMap::mergeFirstResults(const MappedApplications& results, std::size_t resultCount) {
-  if (!appsByPath_) appsByPath_.emplace();
+  if (!records_->appsByPath) records_->appsByPath.emplace();
   Changes changed;
   Changes added;
   for (const auto& [item, fresh] : results) {
@@ -275,7 +275,7 @@ void SoftwareMap::mergeFirstResults(const MappedApplications& results, std::size
       TILL_LOG(1, "%@: Warning: Lantern query found an app that App Registry did not: %@", kSpeaker,
                fresh);
       added.added.push_back(fresh);
-      appsByPath_->emplace(fresh->bundlePath(), fresh);
+      records_->appsByPath->emplace(fresh->bundlePath(), fresh);
       rememberItem(item, fresh);
     }
   }
@@ -314,11 +314,11 @@ void SoftwareMap::queryDidUpdateWithUserInfo(MetadataQuery& query,
 
 void SoftwareMap::mergeUpdate(const MappedApplications& added, const MappedApplications& changed,
                               const std::vector<MetadataItemRef>& removed) {
-  if (!appsByPath_) appsByPath_.emplace();
+  if (!records_->appsByPath) records_->appsByPath.emplace();
   Changes changes;
   for (const MetadataItemRef& item : removed) {
-    auto found = appsByMDItem_.find(item.get());
-    if (found == appsByMDItem_.end()) {
+    auto found = records_->appsByMDItem.find(item.get());
+    if (found == records_->appsByMDItem.end()) {
       TILL_LOG(1,
                "%@: Warning: Could not find reference to app reported as removed in "
                "MetadataQuery update: %@",
@@ -335,9 +335,9 @@ void SoftwareMap::mergeUpdate(const MappedApplications& added, const MappedAppli
       // Observers get the record itself: it must say that it is no longer there.
       existing->update([](LedgerSoftwareProductFields& fields) { fields.installed = false; });
       changes.removed.push_back(existing);
-      appsByPath_->erase(existing->bundlePath());
+      records_->appsByPath->erase(existing->bundlePath());
     }
-    appsByMDItem_.erase(found);
+    records_->appsByMDItem.erase(found);
   }
   for (const auto& [item, fresh] : added) {
     std::string path = fresh->bundlePath();
@@ -362,13 +362,13 @@ void SoftwareMap::mergeUpdate(const MappedApplications& added, const MappedAppli
     } else {
       TILL_LOG(1, "%@: Lantern detected added app: %@", kSpeaker, fresh);
       changes.added.push_back(fresh);
-      appsByPath_->emplace(path, fresh);
+      records_->appsByPath->emplace(path, fresh);
       rememberItem(item, fresh);
     }
   }
   for (const auto& [item, fresh] : changed) {
-    auto found = appsByMDItem_.find(item.get());
-    if (found == appsByMDItem_.end()) {
+    auto found = records_->appsByMDItem.find(item.get());
+    if (found == records_->appsByMDItem.end()) {
       TILL_LOG(
           1, "%@: Error: Lantern reported a change to an app that isn't in our data structures: %@",
           kSpeaker, fresh);
@@ -378,8 +378,8 @@ void SoftwareMap::mergeUpdate(const MappedApplications& added, const MappedAppli
     if (newPath.empty() || !VendFileManager::isUpdatableAtPath(newPath)) continue;
     LedgerSoftwareProductRef existing = found->second.product;
     if (std::string oldPath = existing->bundlePath(); oldPath != newPath) {
-      appsByPath_->erase(oldPath);
-      appsByPath_->insert_or_assign(newPath, existing);
+      records_->appsByPath->erase(oldPath);
+      records_->appsByPath->insert_or_assign(newPath, existing);
     }
     bool didChange = false;
     updateAppWithApp(*existing, *fresh, &didChange);

@@ -2,8 +2,8 @@
 // names the account only by an opaque id, which the store turns into a name.
 #include "platform/log/TillLogManager.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/services/VendOrvaneIDLookupOperation.h"
 #include "store-runtime/records/VendPurchaseRecord.h"
+#include "store-runtime/services/VendOrvaneIDLookupOperation.h"
 
 namespace larder {
 

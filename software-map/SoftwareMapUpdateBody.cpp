@@ -354,8 +354,8 @@ SoftwareMap::SoftwareEntries SoftwareMap::copyApplicationDictionariesForUpdateSk
   std::unordered_set<std::string_view> skipped(skipList.begin(), skipList.end());
   SoftwareEntries entries;
   dispatchQueue_->sync([&] {
-    entries.reserve(appsByItemID_.size());
-    for (const auto& [itemIdentifier, copies] : appsByItemID_) {
+    entries.reserve(records_->appsByItemID.size());
+    for (const auto& [itemIdentifier, copies] : records_->appsByItemID) {
       // Of several copies of one application only the preferred one is
       // offered for update.
       LedgerSoftwareProductRef product =

@@ -13,8 +13,8 @@
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/StoreClientRegistry.h"
-#include "store-runtime/services/VendOperationQueue.h"
 #include "store-runtime/download/VendFileManager.h"
+#include "store-runtime/services/VendOperationQueue.h"
 #include "update-queue/LoadUpdateQueueOperation.h"
 
 namespace larder {
@@ -204,9 +204,9 @@ LedgerUpdateRef UpdateQueue::availableUpdateWithItemIdentifierOnQueue(
 
 LedgerUpdateRef UpdateQueue::updateWithItemIdentifier(std::uint64_t itemIdentifier) const {
   if (auto update = availableUpdateWithItemIdentifierOnQueue(itemIdentifier)) return update;
-  if (!updatesBeingDownloaded_) return nullptr;
-  auto found = updatesBeingDownloaded_->find(itemIdentifier);
-  return found == updatesBeingDownloaded_->end() ? nullptr : found->second;
+  if (!check_->updatesBeingDownloaded) return nullptr;
+  auto found = check_->updatesBeingDownloaded->find(itemIdentifier);
+  return found == check_->updatesBeingDownloaded->end() ? nullptr : found->second;
 }
 
 LedgerUpdateRef UpdateQueue::availableUpdateWithItemIdentifier(std::uint64_t itemIdentifier) {
@@ -246,9 +246,9 @@ void UpdateQueue::availableUpdatesDidChange() {
 
 void UpdateQueue::checkForUpdatesWithCompletionHandler(CompletionHandler handler) {
   dispatchQueue_->barrierSync([&] {
-    if (handler) clients_.push_back(UpdateQueueClient{std::move(handler)});
-    if (loadInProgress_) return;
-    loadInProgress_ = true;
+    if (handler) check_->clients.push_back(UpdateQueueClient{std::move(handler)});
+    if (check_->loadInProgress) return;
+    check_->loadInProgress = true;
     auto operation = std::make_shared<LoadUpdateQueueOperation>(storeClient_, softwareMap_);
     // The handler runs while the operation finishes, so the operation it
     // names is alive; holding it strongly would make a cycle.
@@ -266,8 +266,8 @@ void UpdateQueue::updateCheckDidFinish(LoadUpdateQueueOperation& operation, bool
   dispatchQueue_->barrierSync([&] {
     if (success) reconcile(operation);
     answerClients(success, error);
-    clients_.clear();
-    loadInProgress_ = false;
+    check_->clients.clear();
+    check_->loadInProgress = false;
   });
 }
 
@@ -326,7 +326,7 @@ void UpdateQueue::answerClients(bool success, const OptionalError& error) {
   const UpdateList available = *availableUpdates();
   std::optional<UpdateList> incompatible;
   if (auto list = incompatibleUpdates()) incompatible = *list;
-  for (UpdateQueueClient& client : clients_) {
+  for (UpdateQueueClient& client : check_->clients) {
     if (!client.queueCheckCompletionHandler) continue;
     DispatchQueue::globalQueue().async(
         [handler = std::move(client.queueCheckCompletionHandler), success, available, incompatible,
@@ -338,9 +338,9 @@ void UpdateQueue::answerClients(bool success, const OptionalError& error) {
 
 void UpdateQueue::willStartDownloadForUpdateWithIdentifier(std::uint64_t itemIdentifier) {
   dispatchQueue_->barrierSync([&] {
-    if (!updatesBeingDownloaded_) updatesBeingDownloaded_.emplace();
+    if (!check_->updatesBeingDownloaded) check_->updatesBeingDownloaded.emplace();
     if (auto update = updateWithItemIdentifier(itemIdentifier)) {
-      (*updatesBeingDownloaded_)[itemIdentifier] = std::move(update);
+      (*check_->updatesBeingDownloaded)[itemIdentifier] = std::move(update);
     }
   });
 }
@@ -364,7 +364,7 @@ void UpdateQueue::didFinishDownloadForUpdateWithItemIdentifier(std::uint64_t ite
                  kSpeaker, itemIdentifier);
       }
     }
-    if (updatesBeingDownloaded_) updatesBeingDownloaded_->erase(itemIdentifier);
+    if (check_->updatesBeingDownloaded) check_->updatesBeingDownloaded->erase(itemIdentifier);
   });
 }
 

@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "platform/dispatch/DispatchQueue.h"
+#include "platform/dispatch/QueueConfined.h"
 #include "platform/system/Mutex.h"
 #include "store-runtime/core/VendError.h"
 #include "store-runtime/core/VendStoreClient.h"
@@ -117,9 +118,6 @@ class UpdateQueue : public std::enable_shared_from_this<UpdateQueue> {
   void publishIncompatible(std::shared_ptr<const UpdateList> incompatible);
   void appendInstalledUpdateToJournal(const LedgerUpdateRef& update);
 
-  std::vector<UpdateQueueClient> clients_;
-  std::optional<std::map<std::uint64_t, LedgerUpdateRef>> updatesBeingDownloaded_;
-  bool loadInProgress_ = false;
   std::shared_ptr<UpdateQueueDelegate> delegate_;
   VendStoreClient storeClient_;
   SoftwareMap& softwareMap_;
@@ -132,6 +130,14 @@ class UpdateQueue : public std::enable_shared_from_this<UpdateQueue> {
   std::shared_ptr<const UpdateList> incompatibleUpdates_ GUARDED_BY(snapshotMutex_);
 
   std::shared_ptr<DispatchQueue> dispatchQueue_;
+  // The check in flight and who waits for it: changed in barriers of
+  // dispatchQueue_ only.
+  struct Check {
+    std::vector<UpdateQueueClient> clients;
+    std::optional<std::map<std::uint64_t, LedgerUpdateRef>> updatesBeingDownloaded;
+    bool loadInProgress = false;
+  };
+  QueueConfined<Check> check_{dispatchQueue_};
 };
 
 }  // namespace larder

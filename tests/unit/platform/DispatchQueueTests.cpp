@@ -1,4 +1,5 @@
 #include "platform/dispatch/DispatchQueue.h"
+#include "platform/dispatch/QueueConfined.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -776,6 +777,22 @@ class EveryQueueKindDeathTest : public EveryQueueKind {};
 
 INSTANTIATE_TEST_SUITE_P(DispatchQueue, EveryQueueKindDeathTest,
                          ::testing::Values(Kind::Serial, Kind::Concurrent), kindName);
+
+TEST_P(EveryQueueKindDeathTest, ConfinedStateTouchedOffItsQueueAbortsInDebugBuilds) {
+  auto queue = makeQueue(GetParam(), "confined");
+  QueueConfined<std::vector<int>> numbers(queue, 1, 7);
+  queue->sync([&] { numbers->push_back(8); });
+  queue->sync([&] { EXPECT_EQ(*numbers, (std::vector<int>{7, 8})); });
+#ifdef NDEBUG
+  GTEST_SKIP() << "the check is compiled into debug builds only";
+#else
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_DEATH(numbers->clear(), "'confined' used outside it");
+  // Another queue's task is outside it too.
+  auto other = makeQueue(GetParam(), "other");
+  EXPECT_DEATH(other->sync([&] { numbers->clear(); }), "'confined' used outside it");
+#endif
+}
 
 TEST_P(EveryQueueKindDeathTest, SyncOnTheQueueOfTheRunningTaskAbortsInDebugBuilds) {
 #ifdef NDEBUG
