@@ -46,9 +46,9 @@ void sendAnswer(sdbus::MethodCall& call, const VendDialogAnswer& answer) {
 
 static_assert(DialogAgentProtocol::kSignInKind == VendDialog::kSignIn,
               "agents recognise the sign-in dialog by its kind");
-static_assert(DialogAgentProtocol::kCancel == VendDialogButton::kCancel &&
-                  DialogAgentProtocol::kOK == VendDialogButton::kOK &&
-                  DialogAgentProtocol::kOther == VendDialogButton::kOther,
+static_assert(std::int64_t{DialogAgentProtocol::kCancel} == VendDialogButton::kCancel &&
+                  std::int64_t{DialogAgentProtocol::kOK} == VendDialogButton::kOK &&
+                  std::int64_t{DialogAgentProtocol::kOther} == VendDialogButton::kOther,
               "an agent's exit code is the role of the chosen button");
 
 DialogAgentRegistry::DialogAgentRegistry()
