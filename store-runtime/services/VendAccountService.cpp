@@ -1,14 +1,13 @@
-#include "store-runtime/dialogs/VendCancellingDialogPresenter.h"
 #include "store-runtime/services/VendAccountService.h"
+#include "store-runtime/dialogs/VendCancellingDialogPresenter.h"
 
 #include "platform/dispatch/DispatchSemaphore.h"
 #include "platform/log/TillLogManager.h"
-#include "platform/plist/PropertyListSerialization.h"
 #include "store-runtime/core/VendElasticQueue.h"
 #include "store-runtime/dialogs/VendDialog.h"
 #include "store-runtime/dialogs/VendDialogPresenter.h"
-#include "store-runtime/services/VendPropertyListProvider.h"
 #include "store-runtime/http/VendStoreAnswer.h"
+#include "store-runtime/services/VendPropertyListProvider.h"
 #include "store-runtime/services/VendStoreURLOperation.h"
 
 namespace larder {
@@ -150,10 +149,11 @@ VendAccountService::SignInResult VendAccountService::askUserAndAuthenticate(
     const VendAuthenticationContext& context) {
   DispatchSemaphore answered;
   VendDialogAnswer answer;
-  VendCancellingDialogPresenter::presenterOf(*runtime_)->present(signInDialog(context), [&](VendDialogAnswer given) {
-    answer = std::move(given);
-    answered.signal();
-  });
+  VendCancellingDialogPresenter::presenterOf(*runtime_)->present(signInDialog(context),
+                                                                 [&](VendDialogAnswer given) {
+                                                                   answer = std::move(given);
+                                                                   answered.signal();
+                                                                 });
   answered.wait();
   const PlistValue values(answer.values);
   const std::string* name = values["accountName"].string();
@@ -165,20 +165,12 @@ VendAccountService::SignInResult VendAccountService::askUserAndAuthenticate(
 
 VendAccountService::SignInResult VendAccountService::authenticateWithStore(
     const std::string& accountName, const std::string& password) {
-  auto operation = VendStoreURLOperation::propertyListOperationWithURLBagKey(
-      std::string(kAuthenticateBagKey), storeClient_);
   // The sign-in answer is not signed (there is no key yet), so nothing it
   // orders may install software: only purchase answers start downloads.
-  auto provider = std::static_pointer_cast<VendPropertyListProvider>(operation->dataProvider());
-  provider->setShouldProcessDownloads(false);
-  provider->setShouldTriggerDownloads(false);
-  VendURLRequest request;
-  request.setMethod("POST");
-  request.setValue("application/x-plist", "Content-Type");
-  const std::string body = PropertyListSerialization::writeXml(
+  auto operation = VendStoreURLOperation::propertyListPostWithURLBagKey(
+      std::string(kAuthenticateBagKey), storeClient_,
       PlistDictionary{{"accountName", accountName}, {"password", password}});
-  request.setBody(PlistData(body.begin(), body.end()));
-  operation->setRequest(std::move(request));
+  auto provider = std::static_pointer_cast<VendPropertyListProvider>(operation->dataProvider());
   OptionalError error;
   if (!operation->runSyncReturningError(&error)) {
     TILL_LOG(1, "%@: Signing in %@ failed: %@", kSpeaker, accountName,

@@ -1,10 +1,11 @@
 #include "store-runtime/services/VendStoreURLOperation.h"
 
-#include "store-runtime/services/VendAccountService.h"
+#include "platform/plist/PropertyListSerialization.h"
 #include "store-runtime/accounts/VendAccountStore.h"
-#include "store-runtime/services/VendPropertyListProvider.h"
 #include "store-runtime/http/VendStoreAnswer.h"
 #include "store-runtime/http/VendURLBag.h"
+#include "store-runtime/services/VendAccountService.h"
+#include "store-runtime/services/VendPropertyListProvider.h"
 #include "store-runtime/services/VendServiceProxy.h"
 
 namespace larder {
@@ -15,6 +16,21 @@ std::shared_ptr<VendStoreURLOperation> VendStoreURLOperation::propertyListOperat
   operation->setUrlBagKey(std::move(key));
   operation->setDataProvider(
       VendPropertyListProvider::providerWithStoreClient(std::move(storeClient)));
+  return operation;
+}
+
+std::shared_ptr<VendStoreURLOperation> VendStoreURLOperation::propertyListPostWithURLBagKey(
+    std::string key, VendStoreClient storeClient, const PlistDictionary& body) {
+  auto operation = propertyListOperationWithURLBagKey(std::move(key), std::move(storeClient));
+  auto provider = std::static_pointer_cast<VendPropertyListProvider>(operation->dataProvider());
+  provider->setShouldProcessDownloads(false);
+  provider->setShouldTriggerDownloads(false);
+  VendURLRequest request;
+  request.setMethod("POST");
+  request.setValue("application/x-plist", "Content-Type");
+  const std::string xml = PropertyListSerialization::writeXml(body);
+  request.setBody(PlistData(xml.begin(), xml.end()));
+  operation->setRequest(std::move(request));
   return operation;
 }
 

@@ -22,6 +22,10 @@ class VendStoreURLOperation : public VendURLOperation {
   // provider is a property-list provider.
   static std::shared_ptr<VendStoreURLOperation> propertyListOperationWithURLBagKey(
       std::string key, VendStoreClient storeClient);
+  // The same, posting `body` as an XML property list. Downloads its answer
+  // names are neither read nor started: the caller decides about them.
+  static std::shared_ptr<VendStoreURLOperation> propertyListPostWithURLBagKey(
+      std::string key, VendStoreClient storeClient, const PlistDictionary& body);
 
   void setUrlBagKey(std::string key) { urlBagKey_ = std::move(key); }
   [[nodiscard]] const std::string& urlBagKey() const { return urlBagKey_; }

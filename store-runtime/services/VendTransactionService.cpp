@@ -1,17 +1,16 @@
 #include "store-runtime/services/VendTransactionService.h"
 
 #include "platform/log/TillLogManager.h"
-#include "platform/plist/PropertyListSerialization.h"
 #include "store-runtime/accounts/VendAccountStore.h"
 #include "store-runtime/core/VendElasticQueue.h"
 #include "store-runtime/core/VendStringHelpers.h"
+#include "store-runtime/http/VendRequestSigner.h"
+#include "store-runtime/http/VendStoreAnswer.h"
+#include "store-runtime/http/VendURLBag.h"
 #include "store-runtime/records/TillDownload.h"
 #include "store-runtime/services/VendDownloadService.h"
 #include "store-runtime/services/VendPropertyListProvider.h"
-#include "store-runtime/http/VendRequestSigner.h"
-#include "store-runtime/http/VendStoreAnswer.h"
 #include "store-runtime/services/VendStoreURLOperation.h"
-#include "store-runtime/http/VendURLBag.h"
 
 namespace larder {
 namespace {
@@ -36,11 +35,6 @@ std::string queryText(const PlistDictionary& request) {
     query += percentEncodedQueryComponent(key) + "=" + percentEncodedQueryComponent(text);
   }
   return query;
-}
-
-PlistData xmlBody(const PlistValue& value) {
-  const std::string xml = PropertyListSerialization::writeXml(value);
-  return {xml.begin(), xml.end()};
 }
 
 // The item a purchase buys: its identifier, else the one its buy
@@ -111,17 +105,10 @@ void VendTransactionService::performPurchases(std::vector<TillPurchase> purchase
 
 VendTransactionService::PurchaseOutcome VendTransactionService::purchase(
     const TillPurchase& purchase, std::int64_t options) const {
-  auto operation = VendStoreURLOperation::propertyListOperationWithURLBagKey(
-      std::string(kBuyBagKey), storeClient_);
-  auto provider = std::static_pointer_cast<VendPropertyListProvider>(operation->dataProvider());
   // The downloads are read below, where the options decide who starts them.
-  provider->setShouldProcessDownloads(false);
-  provider->setShouldTriggerDownloads(false);
-  VendURLRequest request;
-  request.setMethod("POST");
-  request.setValue("application/x-plist", "Content-Type");
-  request.setBody(xmlBody(purchase.toDictionary()));
-  operation->setRequest(std::move(request));
+  auto operation = VendStoreURLOperation::propertyListPostWithURLBagKey(
+      std::string(kBuyBagKey), storeClient_, purchase.toDictionary());
+  auto provider = std::static_pointer_cast<VendPropertyListProvider>(operation->dataProvider());
   if (!purchase.isAccountLessPurchase()) {
     operation->setNeedsAuthentication(true);
     std::optional<VendAccount> account;
