@@ -8,8 +8,8 @@
 
 #include "AssetService/RemoteObjectFactory.h"
 #include "platform/dispatch/DispatchQueue.h"
-#include "platform/plist/PlistValue.h"
 #include "platform/system/Mutex.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/core/VendStoreClient.h"
 
 namespace larder {

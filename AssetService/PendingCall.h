@@ -7,7 +7,7 @@
 #include <sdbus-c++/Error.h>
 #include <sdbus-c++/Message.h>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -8,8 +8,8 @@
 #include <optional>
 #include <string>
 
-#include "platform/plist/PlistValue.h"
 #include "platform/plist/PropertyListSerialization.h"
+#include "platform/value/PlistValue.h"
 
 namespace {
 

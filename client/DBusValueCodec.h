@@ -6,7 +6,7 @@
 
 #include <sdbus-c++/Message.h>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

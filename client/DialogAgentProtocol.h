@@ -5,7 +5,7 @@
 #include <string_view>
 
 #include "client/BusMethod.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -11,7 +11,7 @@
 #include <sdbus-c++/IObject.h>
 #include <sdbus-c++/IProxy.h>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

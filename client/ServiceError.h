@@ -7,7 +7,7 @@
 
 #include <sdbus-c++/Error.h>
 
-#include "store-runtime/core/VendError.h"
+#include "platform/error/VendError.h"
 
 namespace larder {
 

@@ -2,7 +2,7 @@
 
 #include <cstddef>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -260,11 +260,9 @@ std::optional<std::string> DAAPParser::parseUnicodeCharacter(Bytes bytes) const 
 
 DAAPValue DAAPParser::processXMLContent(Bytes bytes) const {
   if (bytes.empty()) return {};
-  std::string error;
-  const std::optional<PlistValue> plist =
-      PropertyListSerialization::read(bytes, &error, embeddedPlistLimits(bytes.size()));
+  const auto plist = PropertyListSerialization::read(bytes, embeddedPlistLimits(bytes.size()));
   if (!plist) {
-    TILL_LOG(3, "%@: Attempting to process XML response: %@", kSpeaker, error);
+    TILL_LOG(3, "%@: Attempting to process XML response: %@", kSpeaker, plist.errorDescription());
     return {};
   }
   DAAPDocumentBudget::charge(*plist);

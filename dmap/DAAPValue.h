@@ -10,7 +10,7 @@
 #include <vector>
 
 #include "dmap/DAAPKey.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -8,8 +8,8 @@
 #include <span>
 #include <string>
 
-#include "platform/plist/PlistValue.h"
 #include "platform/plist/PropertyListSerialization.h"
+#include "platform/value/PlistValue.h"
 
 namespace {
 
@@ -75,9 +75,8 @@ larder::PlistReadLimits fuzzLimits() {
 void checkXmlDepthScan(std::span<const std::uint8_t> bytes) {
   larder::PlistReadLimits shallow = fuzzLimits();
   shallow.maxDepth = 3;
-  std::string error;
-  if (!PropertyListSerialization::readXml(bytes, &error, shallow) &&
-      error.find("parsed tree nested deeper") != std::string::npos) {
+  const std::string error = PropertyListSerialization::readXml(bytes, shallow).errorDescription();
+  if (error.find("parsed tree nested deeper") != std::string::npos) {
     failWith("nesting scan missed depth:", error);
   }
 }
@@ -87,18 +86,16 @@ void checkXmlDepthScan(std::span<const std::uint8_t> bytes) {
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   const std::span<const std::uint8_t> bytes(data, size);
   if (size > 0 && data[0] != 'b') checkXmlDepthScan(bytes);
-  std::string error;
-  const std::optional<PlistValue> value =
-      PropertyListSerialization::read(bytes, &error, fuzzLimits());
+  const auto value = PropertyListSerialization::read(bytes, fuzzLimits());
   if (!value) {
-    if (error.empty()) failWith("refused without an error text");
+    if (value.errorDescription().empty()) failWith("refused without an error text");
     return 0;
   }
   if (value->isNull()) failWith("accepted a document as a null value");
 
   const larder::PlistData encoded = PropertyListSerialization::writeBinary(*value);
-  const std::optional<PlistValue> again = PropertyListSerialization::readBinary(encoded, &error);
-  if (!again) failWith("could not read back its own encoding:", error);
+  const auto again = PropertyListSerialization::readBinary(encoded);
+  if (!again) failWith("could not read back its own encoding:", again.errorDescription());
   if (!sameValue(*value, *again)) failWith("value changed in a binary write and read");
 
   // The XML writer goes through libplist; it only has to cope.

@@ -10,7 +10,7 @@
 #include <vector>
 
 #include "platform/metadata/MetadataQueryPredicate.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace {
 

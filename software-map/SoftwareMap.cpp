@@ -142,7 +142,7 @@ std::optional<PlistValue> SoftwareMap::loadPersistedStore() {
     TILL_LOG(2, "%@: Removed %@ stale temporary file(s) beside %@", kSpeaker, stale,
              persistedStoreURL());
   }
-  std::optional<PlistData> data = FileIO::read(persistedStoreURL());
+  std::optional<PlistData> data = FileIO::read(persistedStoreURL()).optional();
   if (!data || data->empty()) {
     TILL_LOG(2, "%@: Persisted SoftwareMap not found", kSpeaker);
     return std::nullopt;
@@ -205,10 +205,10 @@ void SoftwareMap::writePersistedStoreToDisk() {
     PlistValue root = KeyedArchive::dictionary(
         {{std::string(kAppsByPathKey), KeyedArchive::dictionary(std::move(records))}});
     PlistData data = KeyedArchive::archivedData(root);
-    std::string error;
     if (data.empty()) return;
-    if (!FileIO::writeAtomically(path, data, &error)) {
-      TILL_LOG(1, "%@: Exception writing persisted SoftwareMap to %@ - %@", kSpeaker, path, error);
+    if (auto written = FileIO::writeAtomically(path, data); !written) {
+      TILL_LOG(1, "%@: Exception writing persisted SoftwareMap to %@ - %@", kSpeaker, path,
+               written.error().description);
       return;
     }
     TILL_LOG(2, "%@: Updated persisted SoftwareMap at %@", kSpeaker, path);

@@ -16,7 +16,7 @@
 #include "platform/dispatch/QueueConfined.h"
 #include "platform/log/TillLogManager.h"
 #include "platform/metadata/MetadataQuery.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 #include "software-map/VendSoftwareMapObserver.h"
 #include "store-runtime/records/LedgerSoftwareProduct.h"
 

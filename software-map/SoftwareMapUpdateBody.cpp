@@ -145,19 +145,19 @@ HeldBundledManifest& heldBundledManifest() {
 // that the next request tries again.
 std::shared_ptr<const PlistArray> readBundledManifestRows() {
   std::string path = Environment::rootedPath(kManifestPath);
-  std::string error;
-  std::optional<PlistData> bytes = FileIO::read(path, kMaxManifestBytes, &error);
+  Result<PlistData> bytes = FileIO::read(path, kMaxManifestBytes);
   if (!bytes) {
     // Most machines have none.
-    TILL_LOG(3, "%@: No bundled applications manifest at %@ (%@)", kSpeaker, path, error);
+    TILL_LOG(3, "%@: No bundled applications manifest at %@ (%@)", kSpeaker, path,
+             bytes.error().description);
     return nullptr;
   }
   PlistReadLimits limits;
   limits.maxBytes = kMaxManifestBytes;
-  std::optional<PlistValue> root = PropertyListSerialization::read(*bytes, &error, limits);
+  Result<PlistValue> root = PropertyListSerialization::read(*bytes, limits);
   if (!root) {
     TILL_LOG(1, "%@: Could not read the bundled applications manifest at %@: %@", kSpeaker, path,
-             error);
+             root.error().description);
     return nullptr;
   }
   PlistArray* rows = root->array();

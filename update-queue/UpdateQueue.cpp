@@ -128,7 +128,7 @@ std::optional<std::string> UpdateQueue::cachePath() {
 void UpdateQueue::readUpdatesFromPersistedStore() {
   std::optional<std::string> path = cachePath();
   if (!path) return;
-  std::optional<std::vector<std::uint8_t>> bytes = FileIO::read(*path);
+  std::optional<std::vector<std::uint8_t>> bytes = FileIO::read(*path).optional();
   if (!bytes) return;
   std::optional<PlistValue> cache = PropertyListSerialization::read(*bytes);
   const PlistDictionary* dictionary = cache ? cache->dictionary() : nullptr;
@@ -161,9 +161,9 @@ void UpdateQueue::writeUpdatesToPersistedStore(
   cache.emplace(kIncompatibleUpdatesKey,
                 incompatible ? dictionariesOf(*incompatible) : PlistArray{});
   // A failed write leaves memory as it is; the next save writes it all.
-  std::string error;
-  if (!FileIO::writeInPlace(*path, PropertyListSerialization::writeBinary(cache), &error)) {
-    TILL_LOG(3, "%@: %@", kSpeaker, error);
+  if (auto written = FileIO::writeInPlace(*path, PropertyListSerialization::writeBinary(cache));
+      !written) {
+    TILL_LOG(3, "%@: %@", kSpeaker, written.error().description);
   }
 }
 

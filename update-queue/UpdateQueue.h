@@ -11,8 +11,8 @@
 
 #include "platform/dispatch/DispatchQueue.h"
 #include "platform/dispatch/QueueConfined.h"
+#include "platform/error/VendError.h"
 #include "platform/system/Mutex.h"
-#include "store-runtime/core/VendError.h"
 #include "store-runtime/core/VendStoreClient.h"
 #include "store-runtime/records/LedgerUpdate.h"
 #include "update-queue/UpdateQueueClient.h"

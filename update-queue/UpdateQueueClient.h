@@ -5,7 +5,7 @@
 #include <optional>
 #include <vector>
 
-#include "store-runtime/core/VendError.h"
+#include "platform/error/VendError.h"
 #include "store-runtime/records/LedgerUpdate.h"
 
 namespace larder {

@@ -212,9 +212,10 @@ void TillLogManager::logLevelForPlist(int level, std::string_view function, std:
                                       std::string_view filename) {
   if (!isEnabled(level)) return;
   std::string path = Environment::stateDirectory() + "/" + std::string(filename) + ".plist";
-  std::string error;
-  if (!FileIO::writeAtomically(path, PropertyListSerialization::writeXml(plist), &error)) {
-    write(1, function, file, line, "TillLogManager: cannot write side file " + error);
+  if (auto written = FileIO::writeAtomically(path, PropertyListSerialization::writeXml(plist));
+      !written) {
+    write(1, function, file, line,
+          "TillLogManager: cannot write side file " + written.error().description);
   }
 }
 

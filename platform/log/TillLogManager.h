@@ -10,8 +10,8 @@
 #include <variant>
 #include <vector>
 
-#include "platform/plist/PlistValue.h"
 #include "platform/system/Mutex.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -40,7 +40,7 @@ PlistValue readSourceFile(const std::string& path) {
   limits.maxBytes = MetadataAttributes::kMaxSourceFileBytes;
   limits.maxDepth = 64;
   limits.maxObjects = 100'000;
-  std::optional<PlistValue> value = PropertyListSerialization::read(bytes, nullptr, limits);
+  std::optional<PlistValue> value = PropertyListSerialization::read(bytes, limits);
   return value ? std::move(*value) : PlistValue();
 }
 

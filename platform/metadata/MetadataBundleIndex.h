@@ -17,7 +17,7 @@
 #include "platform/metadata/MetadataItem.h"
 #include "platform/metadata/MetadataQueryPredicate.h"
 #include "platform/metadata/MetadataSearchScope.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -4,8 +4,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/plist/PlistValue.h"
 #include "platform/system/Mutex.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -16,8 +16,8 @@
 #include "platform/metadata/MetadataBundleIndex.h"
 #include "platform/metadata/MetadataIndexWatcher.h"
 #include "platform/metadata/MetadataItem.h"
-#include "platform/plist/PlistValue.h"
 #include "platform/system/Mutex.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -7,7 +7,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

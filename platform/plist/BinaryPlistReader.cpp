@@ -34,11 +34,11 @@ class BinaryDecoder {
   BinaryDecoder(std::span<const std::uint8_t> bytes, const PlistReadLimits& limits)
       : bytes_(bytes), limits_(limits) {}
 
-  std::optional<PlistValue> decode(std::string* error) {
+  Result<PlistValue> decode() {
     PlistValue root;
     if (!parseTrailer() || !decodeObject(topObject_, 1, root)) {
-      if (error != nullptr) *error = "binary property list: " + error_;
-      return std::nullopt;
+      return PropertyListSerialization::readError(PropertyListSerialization::kMalformedCode,
+                                                  "binary property list: " + error_);
     }
     return root;
   }
@@ -372,17 +372,15 @@ class BinaryDecoder {
 
 }  // namespace
 
-std::optional<PlistValue> BinaryPlistReader::read(std::span<const std::uint8_t> bytes,
-                                                  std::string* error,
-                                                  const PlistReadLimits& limits) {
+Result<PlistValue> BinaryPlistReader::read(std::span<const std::uint8_t> bytes,
+                                           const PlistReadLimits& limits) {
   if (bytes.size() > limits.maxBytes) {
-    if (error != nullptr) {
-      *error = "binary property list: larger than " + std::to_string(limits.maxBytes) + " bytes";
-    }
-    return std::nullopt;
+    return PropertyListSerialization::readError(
+        PropertyListSerialization::kLimitCode,
+        "binary property list: larger than " + std::to_string(limits.maxBytes) + " bytes");
   }
   BinaryDecoder decoder(bytes, limits);
-  return decoder.decode(error);
+  return decoder.decode();
 }
 
 }  // namespace larder

@@ -5,8 +5,8 @@
 #include <span>
 #include <string>
 
-#include "platform/plist/PlistValue.h"
 #include "platform/plist/PropertyListSerialization.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 
@@ -25,8 +25,8 @@ namespace larder {
 // strings are read as Latin-1.
 class BinaryPlistReader {
  public:
-  static std::optional<PlistValue> read(std::span<const std::uint8_t> bytes, std::string* error,
-                                        const PlistReadLimits& limits);
+  static Result<PlistValue> read(std::span<const std::uint8_t> bytes,
+                                 const PlistReadLimits& limits);
 };
 
 }  // namespace larder

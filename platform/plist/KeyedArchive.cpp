@@ -24,8 +24,10 @@ using AllowedClasses = std::set<std::string, std::less<>>;
 // few milliseconds per 10,000 records but leaves the process twice as big.
 class SecureDecoder {
  public:
-  SecureDecoder(const AllowedClasses& allowed, std::string* error)
-      : allowed_(allowed), error_(error) {}
+  explicit SecureDecoder(const AllowedClasses& allowed) : allowed_(allowed) {}
+
+  // Why the last decode gave nothing.
+  [[nodiscard]] const std::string& refusal() const { return refusal_; }
 
   std::optional<PlistValue> decode(const PlistValue& encoded, std::size_t depth) {
     if (depth > kMaxDepth) return refuse("archive nested too deeply");
@@ -96,12 +98,12 @@ class SecureDecoder {
   }
 
   std::optional<PlistValue> refuse(const std::string& why) {
-    if (error_) *error_ = why;
+    refusal_ = why;
     return std::nullopt;
   }
 
   const AllowedClasses& allowed_;
-  std::string* error_;
+  std::string refusal_;
 };
 
 }  // namespace
@@ -134,22 +136,22 @@ PlistData KeyedArchive::archivedData(const PlistValue& root) {
   return PropertyListSerialization::writeBinary(archive);
 }
 
-std::optional<PlistValue> KeyedArchive::unarchivedRoot(std::span<const std::uint8_t> data,
-                                                       const AllowedClasses& allowed,
-                                                       std::string* error) {
-  std::optional<PlistValue> archive = PropertyListSerialization::read(data, error);
-  if (!archive) return std::nullopt;
+Result<PlistValue> KeyedArchive::unarchivedRoot(std::span<const std::uint8_t> data,
+                                                const AllowedClasses& allowed) {
+  Result<PlistValue> archive = PropertyListSerialization::read(data);
+  if (!archive) return archive;
+  const auto notAnArchive = [](std::string why) {
+    return PropertyListSerialization::readError(PropertyListSerialization::kMalformedCode,
+                                                std::move(why));
+  };
   const std::string* archiver = (*archive)[kArchiverKey].string();
-  if (!archiver || *archiver != kArchiverName) {
-    if (error) *error = "not a keyed archive";
-    return std::nullopt;
-  }
+  if (!archiver || *archiver != kArchiverName) return notAnArchive("not a keyed archive");
   const PlistValue& root = (*archive)[kTopKey][kRootKey];
-  if (root.isNull()) {
-    if (error) *error = "keyed archive without root object";
-    return std::nullopt;
-  }
-  return SecureDecoder(allowed, error).decode(root, 0);
+  if (root.isNull()) return notAnArchive("keyed archive without root object");
+  SecureDecoder decoder(allowed);
+  std::optional<PlistValue> decoded = decoder.decode(root, 0);
+  if (!decoded) return notAnArchive(decoder.refusal());
+  return std::move(*decoded);
 }
 
 }  // namespace larder

@@ -6,7 +6,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/error/Result.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 
@@ -41,11 +42,10 @@ class KeyedArchive {
 
   // The decoded tree with plain dictionaries and arrays unwrapped into
   // PlistDictionary and PlistArray, and records left as their dictionaries
-  // (with "$class") for their classes to decode. nullopt when the data is
-  // not an archive or names a class that is not allowed; `error` says why.
-  static std::optional<PlistValue> unarchivedRoot(std::span<const std::uint8_t> data,
-                                                  const std::set<std::string, std::less<>>& allowed,
-                                                  std::string* error = nullptr);
+  // (with "$class") for their classes to decode. An error when the data is
+  // not an archive or names a class that is not allowed.
+  static Result<PlistValue> unarchivedRoot(std::span<const std::uint8_t> data,
+                                           const std::set<std::string, std::less<>>& allowed);
 
   // The class name of an encoded record, or empty.
   static std::string_view classNameOf(const PlistValue& encoded);

@@ -39,9 +39,14 @@ struct XmlTextDeleter {
 };
 using XmlText = std::unique_ptr<char, XmlTextDeleter>;
 
-std::optional<PlistValue> failure(std::string* error, std::string message) {
-  if (error != nullptr) *error = std::move(message);
-  return std::nullopt;
+VendError malformed(std::string message) {
+  return PropertyListSerialization::readError(PropertyListSerialization::kMalformedCode,
+                                              std::move(message));
+}
+
+VendError beyondLimits(std::string message) {
+  return PropertyListSerialization::readError(PropertyListSerialization::kLimitCode,
+                                              std::move(message));
 }
 
 PlistNode parseXmlDocument(std::string_view xml) {
@@ -411,51 +416,51 @@ std::string_view asText(std::span<const std::uint8_t> bytes) {
 
 }  // namespace
 
-std::optional<PlistValue> PropertyListSerialization::read(std::span<const std::uint8_t> bytes,
-                                                          std::string* error,
-                                                          const PlistReadLimits& limits) {
+VendError PropertyListSerialization::readError(std::int64_t code, std::string description) {
+  return VendError::withDomain(std::string(kErrorDomain), code, std::move(description));
+}
+
+Result<PlistValue> PropertyListSerialization::read(std::span<const std::uint8_t> bytes,
+                                                   const PlistReadLimits& limits) {
   const std::string_view text = asText(bytes);
-  if (text.empty()) return failure(error, "property list: empty input");
-  if (text.starts_with(kBinaryMagic)) return readBinary(bytes, error, limits);
+  if (text.empty()) return malformed("property list: empty input");
+  if (text.starts_with(kBinaryMagic)) return readBinary(bytes, limits);
   if (text.starts_with(kBinaryFamilyMagic)) {
-    return failure(error, "property list: unsupported binary format version");
+    return malformed("property list: unsupported binary format version");
   }
-  return readXml(bytes, error, limits);
+  return readXml(bytes, limits);
 }
 
-std::optional<PlistValue> PropertyListSerialization::read(std::string_view bytes,
-                                                          std::string* error,
-                                                          const PlistReadLimits& limits) {
-  return read(asBytes(bytes), error, limits);
+Result<PlistValue> PropertyListSerialization::read(std::string_view bytes,
+                                                   const PlistReadLimits& limits) {
+  return read(asBytes(bytes), limits);
 }
 
-std::optional<PlistValue> PropertyListSerialization::readBinary(std::span<const std::uint8_t> bytes,
-                                                                std::string* error,
-                                                                const PlistReadLimits& limits) {
-  return BinaryPlistReader::read(bytes, error, limits);
+Result<PlistValue> PropertyListSerialization::readBinary(std::span<const std::uint8_t> bytes,
+                                                         const PlistReadLimits& limits) {
+  return BinaryPlistReader::read(bytes, limits);
 }
 
-std::optional<PlistValue> PropertyListSerialization::readXml(std::span<const std::uint8_t> bytes,
-                                                             std::string* error,
-                                                             const PlistReadLimits& limits) {
-  if (bytes.empty()) return failure(error, "XML property list: empty input");
+Result<PlistValue> PropertyListSerialization::readXml(std::span<const std::uint8_t> bytes,
+                                                      const PlistReadLimits& limits) {
+  if (bytes.empty()) return malformed("XML property list: empty input");
   if (bytes.size() > limits.maxBytes || bytes.size() > std::numeric_limits<std::uint32_t>::max()) {
-    return failure(error,
-                   "XML property list: larger than " + std::to_string(limits.maxBytes) + " bytes");
+    return beyondLimits("XML property list: larger than " + std::to_string(limits.maxBytes) +
+                        " bytes");
   }
   // A terminated copy: the parser is handed a length, but a terminator costs
   // little and leaves no room for reading past the caller's buffer.
   const std::string xml(asText(bytes));
   if (XmlNestingScanner(xml).exceeds(limits.maxDepth)) {
-    return failure(error,
-                   "XML property list: nesting deeper than " + std::to_string(limits.maxDepth));
+    return beyondLimits("XML property list: nesting deeper than " +
+                        std::to_string(limits.maxDepth));
   }
   const PlistNode root = parseXmlDocument(xml);
-  if (!root) return failure(error, "XML property list: malformed document");
+  if (!root) return malformed("XML property list: malformed document");
   LibplistTreeReader reader(limits);
   PlistValue value;
   if (!reader.convert(root.get(), 1, value)) {
-    return failure(error, "XML property list: " + reader.error());
+    return malformed("XML property list: " + reader.error());
   }
   return value;
 }

@@ -6,7 +6,8 @@
 #include <span>
 #include <string>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/error/Result.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 
@@ -30,21 +31,23 @@ enum class PlistFormat { Xml, Binary };
 
 class PropertyListSerialization {
  public:
-  // Reads an XML or binary ("bplist00") property list, telling them apart by
-  // their first bytes. On failure returns nullopt and, if given, sets *error
-  // to a one-line description.
-  static std::optional<PlistValue> read(std::span<const std::uint8_t> bytes,
-                                        std::string* error = nullptr,
-                                        const PlistReadLimits& limits = {});
-  static std::optional<PlistValue> read(std::string_view bytes, std::string* error = nullptr,
-                                        const PlistReadLimits& limits = {});
+  // Failures of the readers: an error of kErrorDomain whose description is
+  // one line that says what is wrong with the input.
+  static constexpr std::string_view kErrorDomain = "PropertyListSerialization";
+  static constexpr std::int64_t kMalformedCode = 1;  // not a property list we read
+  static constexpr std::int64_t kLimitCode = 2;      // beyond the limits of the read
+  static VendError readError(std::int64_t code, std::string description);
 
-  static std::optional<PlistValue> readBinary(std::span<const std::uint8_t> bytes,
-                                              std::string* error = nullptr,
-                                              const PlistReadLimits& limits = {});
-  static std::optional<PlistValue> readXml(std::span<const std::uint8_t> bytes,
-                                           std::string* error = nullptr,
-                                           const PlistReadLimits& limits = {});
+  // Reads an XML or binary ("bplist00") property list, telling them apart by
+  // their first bytes.
+  static Result<PlistValue> read(std::span<const std::uint8_t> bytes,
+                                 const PlistReadLimits& limits = {});
+  static Result<PlistValue> read(std::string_view bytes, const PlistReadLimits& limits = {});
+
+  static Result<PlistValue> readBinary(std::span<const std::uint8_t> bytes,
+                                       const PlistReadLimits& limits = {});
+  static Result<PlistValue> readXml(std::span<const std::uint8_t> bytes,
+                                    const PlistReadLimits& limits = {});
 
   // Writers. Null values inside containers are skipped (a property list has
   // no null); a null root gives an empty dictionary.

@@ -48,21 +48,21 @@ std::optional<std::string> Bundle::identifier() const {
 }
 
 std::optional<PlistValue> Bundle::readPropertyList(std::string_view fileName) const {
-  std::optional<PlistData> bytes =
-      FileIO::read(path_ + "/" + std::string(fileName), kMaxPropertyListBytes);
+  auto bytes = FileIO::read(path_ + "/" + std::string(fileName), kMaxPropertyListBytes);
   if (!bytes) return std::nullopt;
-  return PropertyListSerialization::read(*bytes);
+  return PropertyListSerialization::read(*bytes).optional();
 }
 
 std::optional<PlistData> Bundle::resourceData(std::string_view name) const {
   if (!isPlainResourceName(name)) return std::nullopt;
   std::string base = path_ + "/" + std::string(kResourcesFolder) + "/" + std::string(name);
-  if (std::optional<PlistData> data = FileIO::read(base)) return data;
+  if (std::optional<PlistData> data = FileIO::read(base).optional()) return data;
   if (hasExtension(name)) return std::nullopt;
   static constexpr std::array<std::string_view, 4> kImageExtensions = {".png", ".tiff", ".svg",
                                                                        ".icns"};
   for (std::string_view extension : kImageExtensions) {
-    if (std::optional<PlistData> data = FileIO::read(base + std::string(extension))) return data;
+    if (std::optional<PlistData> data = FileIO::read(base + std::string(extension)).optional())
+      return data;
   }
   return std::nullopt;
 }

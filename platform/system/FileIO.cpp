@@ -20,9 +20,15 @@ namespace larder {
 
 namespace {
 
-bool fail(std::string* error, const std::string& what) {
-  if (error) *error = what + ": " + std::strerror(errno);
-  return false;
+// The failure of a system call, by the errno it left.
+VendError systemError(const std::string& what) {
+  const int code = errno;
+  return VendError::withDomain(std::string(FileIO::kErrorDomain), code,
+                               what + ": " + std::strerror(code));
+}
+
+VendError fileError(std::int64_t code, std::string description) {
+  return VendError::withDomain(std::string(FileIO::kErrorDomain), code, std::move(description));
 }
 
 bool writeAll(int fd, std::span<const std::uint8_t> bytes) {
@@ -76,18 +82,13 @@ void syncParentDirectory(const std::string& path) {
 
 }  // namespace
 
-std::optional<std::vector<std::uint8_t>> FileIO::read(const std::string& path, std::size_t maxBytes,
-                                                      std::string* error) {
+Result<std::vector<std::uint8_t>> FileIO::read(const std::string& path, std::size_t maxBytes) {
   FileDescriptor file(
       ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));  // a FIFO never blocks
-  if (!file.valid()) {
-    fail(error, "open " + path);
-    return std::nullopt;
-  }
+  if (!file.valid()) return systemError("open " + path);
   struct stat info {};
   if (::fstat(file.get(), &info) != 0 || !S_ISREG(info.st_mode)) {
-    if (error) *error = path + " is not a regular file";
-    return std::nullopt;
+    return fileError(EINVAL, path + " is not a regular file");
   }
   std::vector<std::uint8_t> contents;
   contents.reserve(static_cast<std::size_t>(info.st_size));
@@ -96,61 +97,60 @@ std::optional<std::vector<std::uint8_t>> FileIO::read(const std::string& path, s
     ssize_t count = ::read(file.get(), buffer, sizeof buffer);
     if (count < 0) {
       if (errno == EINTR) continue;
-      fail(error, "read " + path);
-      return std::nullopt;
+      return systemError("read " + path);
     }
     if (count == 0) break;
     if (contents.size() + static_cast<std::size_t>(count) > maxBytes) {
-      if (error) *error = path + " is larger than " + std::to_string(maxBytes) + " bytes";
-      return std::nullopt;
+      return fileError(EFBIG, path + " is larger than " + std::to_string(maxBytes) + " bytes");
     }
     contents.insert(contents.end(), buffer, buffer + count);
   }
   return contents;
 }
 
-bool FileIO::createDirectories(const std::string& path, std::string* error) {
+Result<void> FileIO::createDirectories(const std::string& path) {
   std::error_code code;
   std::filesystem::create_directories(path, code);
   if (code && !std::filesystem::is_directory(path)) {
-    if (error) *error = "create " + path + ": " + code.message();
-    return false;
+    return fileError(code.value(), "create " + path + ": " + code.message());
   }
-  return true;
+  return {};
 }
 
-bool FileIO::writeAtomically(const std::string& path, std::span<const std::uint8_t> bytes,
-                             std::string* error) {
+Result<void> FileIO::writeAtomically(const std::string& path, std::span<const std::uint8_t> bytes) {
   std::string parent = std::filesystem::path(path).parent_path().string();
-  if (!parent.empty() && !createDirectories(parent, error)) return false;
+  if (!parent.empty()) {
+    if (auto created = createDirectories(parent); !created) return created;
+  }
   std::string temporary = temporarySibling(path);
   FileDescriptor file(
       ::open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, S_IRUSR | S_IWUSR));
-  if (!file.valid()) return fail(error, "create " + temporary);
+  if (!file.valid()) return systemError("create " + temporary);
   if (!writeAll(file.get(), bytes) || ::fsync(file.get()) != 0) {
-    fail(error, "write " + temporary);
+    VendError failure = systemError("write " + temporary);
     ::unlink(temporary.c_str());
-    return false;
+    return failure;
   }
   if (::close(file.release()) != 0 || ::rename(temporary.c_str(), path.c_str()) != 0) {
-    fail(error, "replace " + path);
+    VendError failure = systemError("replace " + path);
     ::unlink(temporary.c_str());
-    return false;
+    return failure;
   }
   syncParentDirectory(path);
-  return true;
+  return {};
 }
 
-bool FileIO::writeInPlace(const std::string& path, std::span<const std::uint8_t> bytes,
-                          std::string* error) {
+Result<void> FileIO::writeInPlace(const std::string& path, std::span<const std::uint8_t> bytes) {
   std::string parent = std::filesystem::path(path).parent_path().string();
-  if (!parent.empty() && !createDirectories(parent, error)) return false;
+  if (!parent.empty()) {
+    if (auto created = createDirectories(parent); !created) return created;
+  }
   FileDescriptor file(
       ::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, S_IRUSR | S_IWUSR));
-  if (!file.valid()) return fail(error, "open " + path);
-  if (!writeAll(file.get(), bytes)) return fail(error, "write " + path);
-  if (::close(file.release()) != 0) return fail(error, "close " + path);
-  return true;
+  if (!file.valid()) return systemError("open " + path);
+  if (!writeAll(file.get(), bytes)) return systemError("write " + path);
+  if (::close(file.release()) != 0) return systemError("close " + path);
+  return {};
 }
 
 std::size_t FileIO::removeStaleTemporaries(const std::string& path) {
@@ -170,9 +170,9 @@ std::size_t FileIO::removeStaleTemporaries(const std::string& path) {
   return removed;
 }
 
-bool FileIO::writeAtomically(const std::string& path, std::string_view text, std::string* error) {
+Result<void> FileIO::writeAtomically(const std::string& path, std::string_view text) {
   return writeAtomically(
-      path, std::span(reinterpret_cast<const std::uint8_t*>(text.data()), text.size()), error);
+      path, std::span(reinterpret_cast<const std::uint8_t*>(text.data()), text.size()));
 }
 
 }  // namespace larder

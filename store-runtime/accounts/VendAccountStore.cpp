@@ -65,10 +65,12 @@ void VendAccountStore::saveLocked() const {
   }
   PlistDictionary root{{"accounts", std::move(entries)}};
   if (primaryAccountID_) root["primaryAccountID"] = *primaryAccountID_;
-  std::string error;
   // Signing keys are secrets: FileIO creates the file for its owner alone.
-  if (!FileIO::writeAtomically(path_, PropertyListSerialization::writeBinary(root), &error))
-    TILL_LOG(1, "%@: Could not save the accounts to %@: %@", kSpeaker, path_, error);
+  if (auto written = FileIO::writeAtomically(path_, PropertyListSerialization::writeBinary(root));
+      !written) {
+    TILL_LOG(1, "%@: Could not save the accounts to %@: %@", kSpeaker, path_,
+             written.error().description);
+  }
 }
 
 std::optional<VendAccount> VendAccountStore::primaryAccount() const {

@@ -4,7 +4,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

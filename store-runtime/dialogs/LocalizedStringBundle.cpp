@@ -21,7 +21,7 @@ std::optional<std::string> textInBundleOnDisk(const std::string& bundlePath, std
   std::string_view name = table && !table->empty() ? *table : kDefaultTable;
   if (!isPlainTableName(name)) return std::nullopt;
   std::string path = bundlePath + "/resources/" + std::string(name) + ".strings";
-  std::optional<std::vector<std::uint8_t>> bytes = FileIO::read(path, kMaxTableBytes);
+  std::optional<std::vector<std::uint8_t>> bytes = FileIO::read(path, kMaxTableBytes).optional();
   if (!bytes) return std::nullopt;
   std::optional<PlistValue> strings = PropertyListSerialization::read(*bytes);
   if (!strings) return std::nullopt;

@@ -3,7 +3,7 @@
 #include <algorithm>
 
 #include "platform/log/TillLogManager.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/host/PlatformStateFile.h"
 
 namespace larder {

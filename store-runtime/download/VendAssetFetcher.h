@@ -5,9 +5,9 @@
 #include <functional>
 #include <string>
 
-#include "store-runtime/core/VendError.h"
-#include "store-runtime/records/TillDownloadAsset.h"
+#include "platform/error/VendError.h"
 #include "store-runtime/download/VendChunkDigestVerifier.h"
+#include "store-runtime/records/TillDownloadAsset.h"
 
 namespace larder {
 

@@ -9,8 +9,8 @@
 #include <thread>
 #include <vector>
 
+#include "platform/error/VendError.h"
 #include "platform/system/Mutex.h"
-#include "store-runtime/core/VendError.h"
 #include "store-runtime/download/VendChunkDigestVerifier.h"
 
 namespace larder {

@@ -4,7 +4,7 @@
 #include <string>
 #include <string_view>
 
-#include "store-runtime/core/VendError.h"
+#include "platform/error/VendError.h"
 
 namespace larder {
 

@@ -10,13 +10,13 @@
 #include <thread>
 #include <vector>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/error/VendError.h"
 #include "platform/system/Mutex.h"
-#include "store-runtime/core/VendError.h"
-#include "store-runtime/records/TillDownload.h"
+#include "platform/value/PlistValue.h"
+#include "store-runtime/core/VendRuntimeConfiguration.h"
 #include "store-runtime/download/VendApplicationLocks.h"
 #include "store-runtime/download/VendPackageInstaller.h"
-#include "store-runtime/core/VendRuntimeConfiguration.h"
+#include "store-runtime/records/TillDownload.h"
 
 namespace larder {
 

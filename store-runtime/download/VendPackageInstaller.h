@@ -2,7 +2,7 @@
 
 #include <string>
 
-#include "store-runtime/core/VendError.h"
+#include "platform/error/VendError.h"
 
 namespace larder {
 

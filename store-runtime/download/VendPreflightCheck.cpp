@@ -75,11 +75,12 @@ VendPreflightCheck::Answer VendPreflightCheck::run(std::uint64_t itemIdentifier,
     return refused(itemIdentifier,
                    url + " answered HTTP " + std::to_string(result.response.statusCode));
   }
-  std::string parseError;
-  std::optional<PlistValue> answer = PropertyListSerialization::read(result.body, &parseError);
+  auto answer = PropertyListSerialization::read(result.body);
   if (!answer || !answer->isDictionary()) {
-    return refused(itemIdentifier, url + " did not answer with a dictionary" +
-                                       (parseError.empty() ? "" : " (" + parseError + ")"));
+    return refused(
+        itemIdentifier,
+        url + " did not answer with a dictionary" +
+            (answer.errorDescription().empty() ? "" : " (" + answer.errorDescription() + ")"));
   }
   const PlistValue& allowed = (*answer)["allowed"];
   if (!allowed.isBoolean() && !allowed.isInteger()) {

@@ -41,7 +41,7 @@ std::optional<std::string> localIconPath(std::string_view url) {
 std::optional<std::string> copyLocalIcon(std::string_view url, const std::string& location) {
   std::optional<std::string> source = localIconPath(url);
   if (!source) return std::nullopt;
-  std::optional<PlistData> bytes = FileIO::read(*source, kMaxIconBytes);
+  std::optional<PlistData> bytes = FileIO::read(*source, kMaxIconBytes).optional();
   if (!bytes || !FileIO::writeAtomically(location, *bytes)) {
     TILL_LOG(1, "%@: Cannot copy the icon %@ to %@", kSpeaker, *source, location);
     return std::nullopt;

@@ -5,7 +5,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/core/DaemonDefaults.h"
 
 namespace larder {

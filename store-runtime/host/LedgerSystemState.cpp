@@ -99,7 +99,7 @@ std::string LedgerIconLocationForIdentifier(std::string_view clientIdentifier,
 }
 
 std::optional<PlistDate> LedgerCriticalUpdateTimeStamp() {
-  std::optional<PlistData> bytes = FileIO::read(criticalUpdateFilePath(), 1u << 20u);
+  std::optional<PlistData> bytes = FileIO::read(criticalUpdateFilePath(), 1u << 20u).optional();
   if (!bytes) return std::nullopt;
   std::optional<PlistValue> stored = PropertyListSerialization::read(*bytes);
   if (!stored) return std::nullopt;
@@ -112,11 +112,12 @@ void LedgerCreateCriticalUpdateTimeStamp() {
   PlistDictionary stored;
   stored[std::string(kCriticalUpdateTimeStampKey)] =
       PlistDate{std::chrono::duration<double>(since).count()};
-  std::string error;
-  if (!FileIO::writeAtomically(criticalUpdateFilePath(),
-                               PropertyListSerialization::writeXml(PlistValue(std::move(stored))),
-                               &error)) {
-    TILL_LOG(1, "%@: Cannot store the critical update time stamp: %@", kSpeaker, error);
+  if (auto written = FileIO::writeAtomically(
+          criticalUpdateFilePath(),
+          PropertyListSerialization::writeXml(PlistValue(std::move(stored))));
+      !written) {
+    TILL_LOG(1, "%@: Cannot store the critical update time stamp: %@", kSpeaker,
+             written.error().description);
   }
 }
 

@@ -57,12 +57,12 @@ std::string PlatformStateFile::pathForName(std::string_view name) {
 }
 
 PlistValue PlatformStateFile::read() const {
-  std::optional<PlistData> bytes = FileIO::read(path_, kMaxStateBytes);
+  std::optional<PlistData> bytes = FileIO::read(path_, kMaxStateBytes).optional();
   if (!bytes) return {};
-  std::string error;
-  std::optional<PlistValue> value = PropertyListSerialization::read(*bytes, &error);
+  auto value = PropertyListSerialization::read(*bytes);
   if (!value) {
-    TILL_LOG(1, "%@: Ignoring damaged state file %@: %@", kSpeaker, path_, error);
+    TILL_LOG(1, "%@: Ignoring damaged state file %@: %@", kSpeaker, path_,
+             value.errorDescription());
     return {};
   }
   return std::move(*value);
@@ -82,9 +82,9 @@ bool PlatformStateFile::updateValue(const std::function<void(PlistValue&)>& chan
   }
   PlistValue value = read();
   change(value);
-  std::string error;
-  if (!FileIO::writeAtomically(path_, PropertyListSerialization::writeXml(value), &error)) {
-    TILL_LOG(1, "%@: Cannot write state file %@: %@", kSpeaker, path_, error);
+  if (auto written = FileIO::writeAtomically(path_, PropertyListSerialization::writeXml(value));
+      !written) {
+    TILL_LOG(1, "%@: Cannot write state file %@: %@", kSpeaker, path_, written.error().description);
     return false;
   }
   return true;

@@ -20,7 +20,7 @@ constexpr std::string_view kSpeaker = "VendDevice";
 constexpr std::size_t kMaxSmallFileBytes = 64u * 1024u;
 
 std::optional<std::string> readSmallTextFile(const std::string& path) {
-  std::optional<PlistData> bytes = FileIO::read(path, kMaxSmallFileBytes);
+  std::optional<PlistData> bytes = FileIO::read(path, kMaxSmallFileBytes).optional();
   if (!bytes) return std::nullopt;
   return std::string(bytes->begin(), bytes->end());
 }

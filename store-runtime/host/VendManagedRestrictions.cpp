@@ -22,12 +22,12 @@ std::string VendManagedRestrictions::restrictionsFilePath() {
 
 bool VendManagedRestrictions::isRestrictedTo(std::string_view restriction) {
   std::string path = restrictionsFilePath();
-  std::optional<PlistData> bytes = FileIO::read(path, kMaxRestrictionsBytes);
+  std::optional<PlistData> bytes = FileIO::read(path, kMaxRestrictionsBytes).optional();
   if (!bytes) return false;
-  std::string error;
-  std::optional<PlistValue> restrictions = PropertyListSerialization::read(*bytes, &error);
+  auto restrictions = PropertyListSerialization::read(*bytes);
   if (!restrictions || !restrictions->isDictionary()) {
-    TILL_LOG(1, "%@: Ignoring unreadable restrictions at %@ %@", kSpeaker, path, error);
+    TILL_LOG(1, "%@: Ignoring unreadable restrictions at %@ %@", kSpeaker, path,
+             restrictions.errorDescription());
     return false;
   }
   const PlistValue& value = (*restrictions)[restriction];

@@ -5,7 +5,7 @@
 #include <optional>
 #include <span>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

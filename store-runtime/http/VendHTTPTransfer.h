@@ -6,8 +6,8 @@
 #include <span>
 #include <string>
 
-#include "platform/plist/PlistValue.h"
-#include "store-runtime/core/VendError.h"
+#include "platform/error/VendError.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/http/VendURLRequest.h"
 #include "store-runtime/http/VendURLResponse.h"
 

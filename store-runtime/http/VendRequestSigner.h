@@ -6,7 +6,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/http/VendURLRequest.h"
 #include "store-runtime/http/VendURLResponse.h"
 

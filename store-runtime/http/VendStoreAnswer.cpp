@@ -14,11 +14,11 @@ VendError VendStoreAnswer::error(std::int64_t code, std::string description) {
 
 std::optional<PlistValue> VendStoreAnswer::propertyList(std::span<const std::uint8_t> body,
                                                         OptionalError* error) {
-  std::string reason;
-  auto parsed = PropertyListSerialization::read(body, &reason);
+  auto parsed = PropertyListSerialization::read(body);
   if (!parsed && error) {
-    *error = VendStoreAnswer::error(kNotPropertyList,
-                                    "The store's answer is not a property list (" + reason + ")");
+    *error =
+        VendStoreAnswer::error(kNotPropertyList, "The store's answer is not a property list (" +
+                                                     parsed.errorDescription() + ")");
   }
   return parsed;
 }

@@ -4,8 +4,8 @@
 #include <span>
 #include <string_view>
 
-#include "platform/plist/PlistValue.h"
-#include "store-runtime/core/VendError.h"
+#include "platform/error/VendError.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/http/VendURLResponse.h"
 
 namespace larder {

@@ -10,9 +10,9 @@
 #include <utility>
 #include <vector>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/error/VendError.h"
 #include "platform/system/Mutex.h"
-#include "store-runtime/core/VendError.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/core/VendRuntimeConfiguration.h"
 
 namespace larder {

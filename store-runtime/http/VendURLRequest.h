@@ -7,7 +7,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -5,9 +5,9 @@
 #include <string>
 #include <string_view>
 
-#include "platform/plist/PlistValue.h"
-#include "store-runtime/records/TillPurchase.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/records/LedgerCloudItemFields.h"
+#include "store-runtime/records/TillPurchase.h"
 
 namespace larder {
 

@@ -6,8 +6,8 @@
 #include <optional>
 #include <string>
 
-#include "platform/plist/PlistValue.h"
 #include "platform/system/Mutex.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -5,8 +5,8 @@
 #include <string>
 #include <string_view>
 
-#include "platform/plist/PlistValue.h"
-#include "store-runtime/core/VendError.h"
+#include "platform/error/VendError.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

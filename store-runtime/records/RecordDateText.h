@@ -3,7 +3,7 @@
 #include <optional>
 #include <string_view>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -6,7 +6,7 @@
 #include <vector>
 
 #include "platform/plist/KeyedArchive.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -8,8 +8,8 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/plist/PlistValue.h"
 #include "platform/system/Mutex.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/records/TillDownloadAsset.h"
 #include "store-runtime/records/TillDownloadMetadata.h"
 

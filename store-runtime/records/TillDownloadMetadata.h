@@ -5,7 +5,7 @@
 #include <string>
 #include <string_view>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

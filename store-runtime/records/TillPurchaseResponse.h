@@ -6,7 +6,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/records/TillDownload.h"
 
 namespace larder {

@@ -6,10 +6,10 @@
 #include <optional>
 #include <string>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/error/VendError.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/accounts/VendAccount.h"
 #include "store-runtime/accounts/VendAccountStore.h"
-#include "store-runtime/core/VendError.h"
 #include "store-runtime/core/VendStoreClient.h"
 #include "store-runtime/http/VendURLBag.h"
 #include "store-runtime/runtime/VendRuntime.h"

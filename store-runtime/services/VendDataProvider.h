@@ -2,8 +2,8 @@
 
 #include <memory>
 
-#include "platform/plist/PlistValue.h"
-#include "store-runtime/core/VendError.h"
+#include "platform/error/VendError.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/core/VendStoreClient.h"
 #include "store-runtime/http/VendURLResponse.h"
 

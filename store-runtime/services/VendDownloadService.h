@@ -6,8 +6,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/plist/PlistValue.h"
-#include "store-runtime/core/VendError.h"
+#include "platform/error/VendError.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/core/VendStoreClient.h"
 #include "store-runtime/records/TillDownload.h"
 #include "store-runtime/runtime/VendRuntime.h"

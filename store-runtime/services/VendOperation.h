@@ -7,12 +7,12 @@
 #include <optional>
 #include <string_view>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/error/VendError.h"
 #include "platform/system/Mutex.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/accounts/VendAccount.h"
-#include "store-runtime/core/VendError.h"
-#include "store-runtime/services/VendOperationDelegate.h"
 #include "store-runtime/core/VendStoreClient.h"
+#include "store-runtime/services/VendOperationDelegate.h"
 
 namespace larder {
 

@@ -1,7 +1,7 @@
 #pragma once
 
-#include "platform/plist/PlistValue.h"
-#include "store-runtime/core/VendError.h"
+#include "platform/error/VendError.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/http/VendURLResponse.h"
 
 namespace larder {

@@ -4,7 +4,7 @@
 #include <memory>
 
 #include "platform/dispatch/DispatchSemaphore.h"
-#include "store-runtime/core/VendError.h"
+#include "platform/error/VendError.h"
 #include "store-runtime/core/VendStoreClient.h"
 #include "store-runtime/runtime/VendRuntime.h"
 

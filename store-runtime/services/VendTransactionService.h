@@ -8,14 +8,14 @@
 #include <utility>
 #include <vector>
 
-#include "platform/plist/PlistValue.h"
-#include "store-runtime/core/VendError.h"
+#include "platform/error/VendError.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/core/VendStoreClient.h"
 #include "store-runtime/http/VendURLRequest.h"
 #include "store-runtime/http/VendURLResponse.h"
+#include "store-runtime/records/LedgerSoftwareProduct.h"
 #include "store-runtime/records/TillPurchase.h"
 #include "store-runtime/records/TillPurchaseResponse.h"
-#include "store-runtime/records/LedgerSoftwareProduct.h"
 #include "store-runtime/runtime/VendRuntime.h"
 
 namespace larder {

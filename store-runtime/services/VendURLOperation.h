@@ -4,11 +4,11 @@
 #include <memory>
 #include <optional>
 
-#include "platform/plist/PlistValue.h"
-#include "store-runtime/services/VendOperation.h"
-#include "store-runtime/services/VendDataProvider.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/http/VendURLRequest.h"
 #include "store-runtime/http/VendURLResponse.h"
+#include "store-runtime/services/VendDataProvider.h"
+#include "store-runtime/services/VendOperation.h"
 
 namespace larder {
 

@@ -11,7 +11,7 @@
 #include <vector>
 
 #include "client/ServiceClient.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder::testing {
 

@@ -4,7 +4,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 #include "tests/integration/ServiceHarness.h"
 
 namespace larder::testing {

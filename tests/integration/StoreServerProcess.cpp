@@ -81,7 +81,8 @@ std::uint64_t StoreServerProcess::signedRequestCount(const std::string& route) c
 
 std::uint64_t StoreServerProcess::countAt(const std::string& path, const std::string& route) const {
   const auto result = get(baseURL_ + path);
-  const auto counts = result.error ? std::nullopt : PropertyListSerialization::read(result.body);
+  const std::optional<PlistValue> counts =
+      result.error ? std::nullopt : PropertyListSerialization::read(result.body).optional();
   if (!counts || !(*counts)[route].isInteger()) {
     throw std::runtime_error("larder-store gave no request count for " + route);
   }

@@ -404,8 +404,7 @@ TEST_F(StoreServerTest, ServerErrorNotPlistAndWrongShapeFaults) {
                   PlistDictionary{{"accountName", "ada@example.com"}, {"password", "lovelace"}}));
   EXPECT_EQ(result.response.statusCode, 200);
   EXPECT_FALSE(result.body.empty());
-  std::string error;
-  EXPECT_FALSE(PropertyListSerialization::read(result.body, &error));
+  EXPECT_FALSE(PropertyListSerialization::read(result.body));
 
   result = get(store->baseURL() + "/lookup?id=1001");
   EXPECT_EQ(result.response.statusCode, 200);

@@ -3,7 +3,7 @@
 #include <cstdint>
 #include <string>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

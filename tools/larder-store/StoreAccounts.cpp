@@ -40,11 +40,10 @@ StoreAccounts StoreAccounts::load(const std::string& path) {
     TILL_LOG(2, "%@: no %@, so no account can sign in", "StoreAccounts", path);
     return {};
   }
-  std::string error;
-  const auto bytes = FileIO::read(path, 16u << 20u, &error);
-  const auto root = bytes ? PropertyListSerialization::read(*bytes, &error) : std::nullopt;
+  const auto bytes = FileIO::read(path, 16u << 20u);
+  const Result<PlistValue> root = bytes ? PropertyListSerialization::read(*bytes) : bytes.error();
   if (!root) {
-    TILL_LOG(1, "%@: skipping %@: %@", "StoreAccounts", path, error);
+    TILL_LOG(1, "%@: skipping %@: %@", "StoreAccounts", path, root.errorDescription());
     return {};
   }
   return StoreAccounts(*root);

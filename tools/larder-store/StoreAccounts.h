@@ -6,7 +6,7 @@
 #include <vector>
 
 #include "larder-store/StoreAccount.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

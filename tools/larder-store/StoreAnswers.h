@@ -4,7 +4,7 @@
 #include <string_view>
 
 #include "larder-store/StoreItem.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

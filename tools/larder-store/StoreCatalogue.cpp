@@ -14,10 +14,10 @@ namespace fs = std::filesystem;
 
 constexpr std::size_t kLargestSettingsFile = 16u << 20u;
 
-std::optional<PlistValue> readPlistFile(const std::string& path, std::string* error) {
-  const auto bytes = FileIO::read(path, kLargestSettingsFile, error);
-  if (!bytes) return std::nullopt;
-  return PropertyListSerialization::read(*bytes, error);
+Result<PlistValue> readPlistFile(const std::string& path) {
+  const auto bytes = FileIO::read(path, kLargestSettingsFile);
+  if (!bytes) return bytes.error();
+  return PropertyListSerialization::read(*bytes);
 }
 
 bool exists(const std::string& path) {
@@ -47,11 +47,10 @@ std::optional<StoreCatalogue> StoreCatalogue::load(const std::string& directory,
 
 void StoreCatalogue::loadSettings(const std::string& path) {
   if (!exists(path)) return;
-  std::string error;
-  const auto settings = readPlistFile(path, &error);
+  const auto settings = readPlistFile(path);
   if (!settings || !settings->isDictionary()) {
     TILL_LOG(1, "%@: ignoring %@: %@", "StoreCatalogue", path,
-             settings ? std::string("not a dictionary") : error);
+             settings ? std::string("not a dictionary") : settings.errorDescription());
     return;
   }
   if (const PlistDictionary* bag = (*settings)["bag"].dictionary()) {
@@ -88,8 +87,8 @@ void StoreCatalogue::loadItems(const std::string& directory) {
 }
 
 void StoreCatalogue::loadItem(const std::string& folder) {
-  std::string error;
-  const auto dictionary = readPlistFile(folder + "/item.plist", &error);
+  const auto dictionary = readPlistFile(folder + "/item.plist");
+  std::string error = dictionary.errorDescription();
   auto item = dictionary ? StoreItem::fromDictionary(*dictionary, folder, &error) : std::nullopt;
   auto digest =
       item ? PackageDigest::compute(item->packagePath(), chunkSize_, &error) : std::nullopt;

@@ -10,7 +10,7 @@
 #include "larder-store/StoreAccounts.h"
 #include "larder-store/StoreCloudLibrary.h"
 #include "larder-store/StoreItem.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -46,12 +46,12 @@ void StoreCloudLibrary::refreshLocked() {
 }
 
 void StoreCloudLibrary::loadLocked() {
-  std::string error;
-  const auto bytes = FileIO::read(path_, kLargestLibraryFile, &error);
-  const auto library = bytes ? PropertyListSerialization::read(*bytes, &error) : std::nullopt;
+  const auto bytes = FileIO::read(path_, kLargestLibraryFile);
+  const Result<PlistValue> library =
+      bytes ? PropertyListSerialization::read(*bytes) : bytes.error();
   if (!library || !library->isDictionary()) {
     TILL_LOG(1, "%@: ignoring %@: %@", kSpeaker, path_,
-             library ? std::string("not a dictionary") : error);
+             library ? std::string("not a dictionary") : library.errorDescription());
     return;
   }
   present_ = true;

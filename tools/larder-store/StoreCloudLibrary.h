@@ -12,8 +12,8 @@
 
 #include "dmap/DAAPItemsRequest.h"
 #include "larder-store/StoreLibraryItem.h"
-#include "platform/plist/PlistValue.h"
 #include "platform/system/Mutex.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

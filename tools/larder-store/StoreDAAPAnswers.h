@@ -3,7 +3,7 @@
 #include <cstdint>
 
 #include "larder-store/StoreCloudLibrary.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -5,7 +5,7 @@
 #include <string>
 
 #include "larder-store/PackageDigest.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -5,7 +5,7 @@
 #include <cstdint>
 
 #include "larder-store/StoreRoute.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -57,11 +57,10 @@ PlistDictionary StoreUpdateCheck::updateItem(const StoreItem& item, const PlistV
 
 StoreReply StoreUpdateCheck::answer(const std::optional<std::string>& body) const {
   if (!body) return invalidRequest("The request's body cannot be decoded.");
-  std::string error;
-  const auto report = PropertyListSerialization::read(*body, &error);
+  const auto report = PropertyListSerialization::read(*body);
   if (!report || !report->isDictionary()) {
     TILL_LOG(2, "%@: refusing a report that is no dictionary: %@", kSpeaker,
-             report ? std::string("wrong shape") : error);
+             report ? std::string("wrong shape") : report.errorDescription());
     return invalidRequest("The request is not a dictionary of installed software.");
   }
   PlistArray items;

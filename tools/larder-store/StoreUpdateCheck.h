@@ -6,7 +6,7 @@
 #include "larder-store/StoreCatalogue.h"
 #include "larder-store/StoreItem.h"
 #include "larder-store/StoreReply.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

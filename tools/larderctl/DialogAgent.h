@@ -13,9 +13,9 @@
 #include <sdbus-c++/Message.h>
 
 #include "client/DialogAgentProtocol.h"
-#include "platform/plist/PlistValue.h"
 #include "platform/system/FileDescriptor.h"
 #include "platform/system/Mutex.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

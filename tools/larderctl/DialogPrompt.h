@@ -7,7 +7,7 @@
 #include <vector>
 
 #include "client/DialogAgentProtocol.h"
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 

@@ -11,8 +11,8 @@
 namespace larder {
 namespace {
 
-std::optional<PlistData> readDocument(const std::string& path, std::string* error) {
-  if (path != "-") return FileIO::read(path, DAAPParser::kMaxDocumentSize, error);
+Result<PlistData> readDocument(const std::string& path) {
+  if (path != "-") return FileIO::read(path, DAAPParser::kMaxDocumentSize);
   PlistData bytes{std::istreambuf_iterator<char>(std::cin), std::istreambuf_iterator<char>()};
   return bytes;
 }
@@ -25,10 +25,10 @@ nlohmann::json DmapDumpCommand::toJson(const DAAPValue& value) const {
 }
 
 int DmapDumpCommand::run(const std::string& path) const {
-  std::string error;
-  const std::optional<PlistData> document = readDocument(path, &error);
+  const Result<PlistData> document = readDocument(path);
   if (!document) {
-    std::cerr << "larderctl: cannot read " << path << ": " << error << std::endl;
+    std::cerr << "larderctl: cannot read " << path << ": " << document.error().description
+              << std::endl;
     return 1;
   }
   const DAAPValue value = DAAPParser::decodeData(*document);

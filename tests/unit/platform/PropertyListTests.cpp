@@ -12,8 +12,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/plist/PlistValue.h"
 #include "platform/plist/PropertyListSerialization.h"
+#include "platform/value/PlistValue.h"
 
 namespace larder {
 namespace {
@@ -34,9 +34,8 @@ PlistData bytesOf(std::string_view text) {
   return PlistData(text.begin(), text.end());
 }
 
-std::optional<PlistValue> readBytes(const PlistData& bytes, std::string* error = nullptr,
-                                    const PlistReadLimits& limits = {}) {
-  return PropertyListSerialization::read(std::span<const std::uint8_t>(bytes), error, limits);
+Result<PlistValue> readBytes(const PlistData& bytes, const PlistReadLimits& limits = {}) {
+  return PropertyListSerialization::read(std::span<const std::uint8_t>(bytes), limits);
 }
 
 // Equality that treats two NaN reals as the same value.
@@ -373,9 +372,10 @@ PlistData libplistToBinary(const PlistValue& value) {
 
 void expectReadFails(const PlistData& bytes, const std::string& errorPart = "",
                      const PlistReadLimits& limits = {}) {
-  std::string error;
-  const std::optional<PlistValue> value = readBytes(bytes, &error, limits);
-  EXPECT_FALSE(value.has_value());
+  const Result<PlistValue> value = readBytes(bytes, limits);
+  ASSERT_FALSE(value.has_value());
+  const std::string& error = value.error().description;
+  EXPECT_EQ(value.error().domain, PropertyListSerialization::kErrorDomain);
   EXPECT_FALSE(error.empty());
   if (!errorPart.empty()) {
     EXPECT_NE(error.find(errorPart), std::string::npos) << error;
@@ -615,10 +615,9 @@ TEST(PropertyListRoundTripTest, BinaryKeepsValues) {
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
-    std::string error;
-    const std::optional<PlistValue> back =
-        readBytes(PropertyListSerialization::writeBinary(c.value), &error);
-    ASSERT_TRUE(back) << error;
+
+    const Result<PlistValue> back = readBytes(PropertyListSerialization::writeBinary(c.value));
+    ASSERT_TRUE(back) << back.errorDescription();
     EXPECT_EQ(firstDifference(*back, c.value), "");
   }
 }
@@ -641,9 +640,8 @@ TEST(PropertyListRoundTripTest, XmlKeepsEveryKindOfValue) {
   EXPECT_NE(xml.find("<plist"), std::string::npos);
   EXPECT_NE(xml.find("<integer>18446744073709551615</integer>"), std::string::npos);
   EXPECT_NE(xml.find("<integer>-42</integer>"), std::string::npos);
-  std::string error;
-  const std::optional<PlistValue> back = PropertyListSerialization::read(xml, &error);
-  ASSERT_TRUE(back) << error;
+  const auto back = PropertyListSerialization::read(xml);
+  ASSERT_TRUE(back) << back.errorDescription();
   EXPECT_EQ(*back, value);
   EXPECT_EQ((*back)["aboveInt64"].type(), Type::UnsignedInteger);
   EXPECT_EQ((*back)["int64Min"].type(), Type::Integer);
@@ -711,9 +709,8 @@ TEST(BinaryPlistInteropTest, WeReadWhatLibplistWrites) {
   // one above INT64_MAX cannot come back as such.
   value.dictionary()->erase("aboveInt64");
   for (const PlistValue& written : {value, productCatalogue(5'000)}) {
-    std::string error;
-    const std::optional<PlistValue> back = readBytes(libplistToBinary(written), &error);
-    ASSERT_TRUE(back) << error;
+    const Result<PlistValue> back = readBytes(libplistToBinary(written));
+    ASSERT_TRUE(back) << back.errorDescription();
     EXPECT_EQ(firstDifference(*back, written), "");
   }
 }
@@ -727,9 +724,7 @@ TEST(BinaryPlistReaderTest, RefusesEveryTruncation) {
     SCOPED_TRACE(length);
     const PlistData prefix(file.begin(), file.begin() + static_cast<long>(length));
     expectReadFails(prefix);
-    std::string error;
-    EXPECT_FALSE(PropertyListSerialization::readBinary(prefix, &error));
-    EXPECT_FALSE(error.empty());
+    EXPECT_FALSE(PropertyListSerialization::readBinary(prefix).errorDescription().empty());
   }
 }
 
@@ -819,9 +814,9 @@ TEST(BinaryPlistReaderTest, RefusesMalformedObjects) {
 TEST(BinaryPlistReaderTest, CopiesSharedObjects) {
   const PlistData file = assembleBinary(
       {sequence({0xA3, 0x01, 0x01, 0x02}), sequence({0x51, 'x'}), sequence({0xA2, 0x01, 0x01})});
-  std::string error;
-  const std::optional<PlistValue> value = readBytes(file, &error);
-  ASSERT_TRUE(value) << error;
+
+  const Result<PlistValue> value = readBytes(file);
+  ASSERT_TRUE(value) << value.errorDescription();
   EXPECT_EQ(*value, PlistValue(PlistArray{"x", "x", PlistArray{"x", "x"}}));
 }
 
@@ -832,7 +827,7 @@ TEST(BinaryPlistReaderTest, EnforcesTheDepthLimit) {
   expectReadFails(overLimit, "nesting deeper than 512");
   PlistReadLimits deeper;
   deeper.maxDepth = 600;
-  EXPECT_EQ(readBytes(overLimit, nullptr, deeper), nestedArrays(513));
+  EXPECT_EQ(readBytes(overLimit, deeper), nestedArrays(513));
 }
 
 TEST(BinaryPlistReaderTest, EnforcesTheObjectLimit) {
@@ -841,7 +836,7 @@ TEST(BinaryPlistReaderTest, EnforcesTheObjectLimit) {
   const PlistData file = PropertyListSerialization::writeBinary(hundred);
   PlistReadLimits limits;
   limits.maxObjects = 101;  // the array and its hundred integers
-  EXPECT_TRUE(readBytes(file, nullptr, limits));
+  EXPECT_TRUE(readBytes(file, limits));
   limits.maxObjects = 100;
   expectReadFails(file, "objects", limits);
   limits.maxObjects = 3;
@@ -868,7 +863,7 @@ TEST(BinaryPlistReaderTest, CountsEveryCopyOfASharedObject) {
   const PlistData sixteenLevels = fanOutFile(16);
   expectReadFails(sixteenLevels, "objects", limits);
   limits.maxObjects = (1u << 17) - 1;  // exactly the 2^17 - 1 values it expands to
-  const std::optional<PlistValue> expanded = readBytes(sixteenLevels, nullptr, limits);
+  const std::optional<PlistValue> expanded = readBytes(sixteenLevels, limits);
   ASSERT_TRUE(expanded);
   const PlistValue* innermost = &*expanded;
   for (int level = 0; level < 16; ++level) innermost = &(*innermost->array())[1];
@@ -890,7 +885,7 @@ TEST(BinaryPlistReaderTest, CountsDecodedBytesOfSharedStrings) {
   limits.maxBytes = 100'000;
   expectReadFails(file, "bytes", limits);
   limits.maxBytes = 1'000'000;
-  const std::optional<PlistValue> value = readBytes(file, nullptr, limits);
+  const std::optional<PlistValue> value = readBytes(file, limits);
   ASSERT_TRUE(value);
   EXPECT_EQ(value->array()->size(), 1000u);
   EXPECT_EQ(*(*value->array())[999].string(), std::string(1000, 'a'));
@@ -964,10 +959,10 @@ TEST(BinaryPlistReaderTest, SurvivesEverySingleByteCorruption) {
     for (const int replacement : {0x00, 0xFF, file[at] ^ 0x80, (file[at] + 1) & 0xFF}) {
       PlistData corrupted = file;
       corrupted[at] = static_cast<std::uint8_t>(replacement);
-      std::string error;
-      const std::optional<PlistValue> value = readBytes(corrupted, &error);
+
+      const Result<PlistValue> value = readBytes(corrupted);
       if (!value) {
-        EXPECT_FALSE(error.empty());
+        EXPECT_FALSE(value.error().description.empty());
         continue;
       }
       ++accepted;
@@ -1002,9 +997,8 @@ TEST(XmlPlistReaderTest, ReadsADocument) {
   <key>list</key><array><string><![CDATA[<raw>]]></string><array/><dict/></array>
 </dict>
 </plist>)";
-  std::string error;
-  const std::optional<PlistValue> value = PropertyListSerialization::read(xml, &error);
-  ASSERT_TRUE(value) << error;
+  const auto value = PropertyListSerialization::read(xml);
+  ASSERT_TRUE(value) << value.errorDescription();
   const PlistValue expected =
       PlistDictionary{{"name", "caf\xC3\xA9 & more"},
                       {"count", -12},
@@ -1019,9 +1013,7 @@ TEST(XmlPlistReaderTest, ReadsADocument) {
 
 TEST(XmlPlistReaderTest, RefusesEmptyAndMalformedInput) {
   expectReadFails(PlistData{}, "empty");
-  std::string error;
-  EXPECT_FALSE(PropertyListSerialization::readXml({}, &error));
-  EXPECT_FALSE(error.empty());
+  EXPECT_FALSE(PropertyListSerialization::readXml({}).errorDescription().empty());
   expectReadFails(bytesOf("   \n"));
   expectReadFails(bytesOf("not a property list"));
   expectReadFails(bytesOf("<plist><dict><key>a</key></plist>"));
@@ -1059,8 +1051,8 @@ TEST(XmlPlistReaderTest, EnforcesTheDepthLimit) {
   expectReadFails(bytesOf(xmlNestedArrays(11)), kRefusedBeforeParsing + "10", limits);
   // An empty container is a level too, as it is in binary documents.
   limits.maxDepth = 2;
-  EXPECT_TRUE(PropertyListSerialization::read("<plist><dict><key>k</key><array/></dict></plist>",
-                                              nullptr, limits));
+  EXPECT_TRUE(
+      PropertyListSerialization::read("<plist><dict><key>k</key><array/></dict></plist>", limits));
   limits.maxDepth = 1;
   expectReadFails(bytesOf("<plist><dict><key>k</key><array/></dict></plist>"),
                   kRefusedBeforeParsing + "1", limits);
@@ -1092,23 +1084,23 @@ TEST(XmlPlistReaderTest, DepthScanTokenizesLikeLibplist) {
   for (const std::string& xml : documents) {
     SCOPED_TRACE(xml.substr(0, 60));
     expectReadFails(bytesOf(xml), kRefusedBeforeParsing);
-    std::string error;
-    EXPECT_TRUE(PropertyListSerialization::read(xml, &error, deepEnough)) << error;
+    const auto read = PropertyListSerialization::read(xml, deepEnough);
+    EXPECT_TRUE(read) << read.errorDescription();
   }
   std::string withNul = "<plist>";
   for (int level = 0; level < 600; ++level) withNul += std::string("<array\0>", 8);
   for (int level = 0; level < 600; ++level) withNul += std::string("</array\0>", 9);
   withNul += "</plist>";
   expectReadFails(bytesOf(withNul), kRefusedBeforeParsing);
-  EXPECT_TRUE(PropertyListSerialization::read(withNul, nullptr, deepEnough));
+  EXPECT_TRUE(PropertyListSerialization::read(withNul, deepEnough));
 
   std::string attributes = "<plist>";
   for (int level = 0; level < 600; ++level) attributes += "<array a=\"</array>\">";
   for (int level = 0; level < 600; ++level) attributes += "</array>";
   attributes += "</plist>";
   expectReadFails(bytesOf(attributes), kRefusedBeforeParsing);
-  std::string error;
-  EXPECT_TRUE(PropertyListSerialization::read(attributes, &error, deepEnough)) << error;
+  const auto read = PropertyListSerialization::read(attributes, deepEnough);
+  EXPECT_TRUE(read) << read.errorDescription();
 }
 
 TEST(XmlPlistReaderTest, EnforcesTheObjectAndSizeLimits) {
@@ -1117,7 +1109,7 @@ TEST(XmlPlistReaderTest, EnforcesTheObjectAndSizeLimits) {
       "</plist>";
   PlistReadLimits limits;
   limits.maxObjects = 5;  // the dictionary, two keys, two values
-  EXPECT_TRUE(PropertyListSerialization::read(xml, nullptr, limits));
+  EXPECT_TRUE(PropertyListSerialization::read(xml, limits));
   limits.maxObjects = 4;
   expectReadFails(bytesOf(xml), "objects", limits);
   limits = {};

@@ -108,9 +108,8 @@ TEST(TillDownloadRecord, EveryFieldSurvivesTheArchiveAndTheWire) {
   const TillDownload original(everyFieldSet());
 
   const PlistData archived = KeyedArchive::archivedData(original.encodeWithCoder());
-  std::string error;
-  std::optional<PlistValue> root = KeyedArchive::unarchivedRoot(archived, {"TillDownload"}, &error);
-  ASSERT_TRUE(root) << error;
+  auto root = KeyedArchive::unarchivedRoot(archived, {"TillDownload"});
+  ASSERT_TRUE(root) << root.errorDescription();
   std::shared_ptr<TillDownload> fromArchive = TillDownload::initWithCoder(*root);
   ASSERT_NE(fromArchive, nullptr);
   EXPECT_EQ(fromArchive->snapshot(), everyFieldSet());

@@ -29,9 +29,9 @@
 #include <thread>
 #include <vector>
 
-#include "platform/plist/PlistValue.h"
+#include "platform/error/VendError.h"
 #include "platform/plist/PropertyListSerialization.h"
-#include "store-runtime/core/VendError.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/records/TillDownload.h"
 #include "store-runtime/runtime/VendRuntime.h"
 #include "tests/unit/ScopedEnvironment.h"

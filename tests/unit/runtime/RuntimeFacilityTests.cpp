@@ -24,9 +24,9 @@
 #include <thread>
 #include <vector>
 
+#include "platform/error/VendError.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
-#include "store-runtime/core/VendError.h"
 #include "store-runtime/core/VendStoreClient.h"
 #include "store-runtime/core/VendStringHelpers.h"
 #include "store-runtime/dialogs/LedgerLocalizedString.h"
@@ -72,7 +72,7 @@ std::string readText(const std::string& path) {
 }
 
 PlistValue readPlist(const std::string& path) {
-  std::optional<PlistData> bytes = FileIO::read(path);
+  std::optional<PlistData> bytes = FileIO::read(path).optional();
   if (!bytes) return {};
   std::optional<PlistValue> value = PropertyListSerialization::read(*bytes);
   return value ? *value : PlistValue();

@@ -39,10 +39,8 @@ const std::set<std::string, std::less<>> kRecordClasses{"dictionary",
 
 // Through a real archive: binary property list out and back in.
 PlistValue throughArchive(const PlistValue& root) {
-  std::string error;
-  std::optional<PlistValue> decoded =
-      KeyedArchive::unarchivedRoot(KeyedArchive::archivedData(root), kRecordClasses, &error);
-  EXPECT_TRUE(decoded) << error;
+  auto decoded = KeyedArchive::unarchivedRoot(KeyedArchive::archivedData(root), kRecordClasses);
+  EXPECT_TRUE(decoded) << decoded.errorDescription();
   return decoded.value_or(PlistValue());
 }
 

@@ -21,9 +21,13 @@ Allowed without(std::string_view className) {
   return allowed;
 }
 
-std::optional<PlistValue> decode(const PlistValue& root, const Allowed& allowed,
-                                 std::string* error = nullptr) {
-  return KeyedArchive::unarchivedRoot(KeyedArchive::archivedData(root), allowed, error);
+Result<PlistValue> decode(const PlistValue& root, const Allowed& allowed) {
+  return KeyedArchive::unarchivedRoot(KeyedArchive::archivedData(root), allowed);
+}
+
+// Why `data` is refused as an archive; empty when it is not.
+std::string refusal(const PlistData& data) {
+  return KeyedArchive::unarchivedRoot(data, kEverything).errorDescription();
 }
 
 PlistValue sampleRecord() {
@@ -52,9 +56,8 @@ PlistValue everyClassTree() {
 }
 
 TEST(KeyedArchive, NestedContainersUnwrapIntoPlainValues) {
-  std::string error;
-  std::optional<PlistValue> decoded = decode(everyClassTree(), kEverything, &error);
-  ASSERT_TRUE(decoded) << error;
+  Result<PlistValue> decoded = decode(everyClassTree(), kEverything);
+  ASSERT_TRUE(decoded) << decoded.errorDescription();
   PlistValue expected = PlistDictionary{
       {"list", PlistArray{"text", 42, 2.5, true, PlistData{0, 1, 2}, PlistDate{1234567890},
                           PlistDictionary{{"deep", "leaf"}, {"record", sampleRecord()}}}},
@@ -73,9 +76,8 @@ TEST(KeyedArchive, NestedContainersUnwrapIntoPlainValues) {
 TEST(KeyedArchive, EveryClassMustBeAllowedWhereverItAppears) {
   for (const char* className :
        {"dictionary", "array", "string", "number", "data", "date", "Record"}) {
-    std::string error;
-    EXPECT_FALSE(decode(everyClassTree(), without(className), &error))
-        << className << " was admitted although not allowed";
+    const std::string error = decode(everyClassTree(), without(className)).errorDescription();
+    EXPECT_FALSE(error.empty()) << className << " was admitted although not allowed";
     EXPECT_NE(error.find(className), std::string::npos) << className << ": " << error;
   }
   // Each leaf class alone at the root.
@@ -109,40 +111,26 @@ TEST(KeyedArchive, MalformedObjectsAreRefused) {
        KeyedArchive::dictionary({{"a", KeyedArchive::array({PlistDictionary{{"x", 1}}})}})},
   };
   for (const auto& [name, root] : cases) {
-    std::string error;
-    EXPECT_FALSE(decode(root, kEverything, &error)) << name;
-    EXPECT_FALSE(error.empty()) << name;
+    EXPECT_FALSE(decode(root, kEverything).errorDescription().empty()) << name;
   }
 }
 
 TEST(KeyedArchive, DataThatIsNotAnArchiveIsRefused) {
-  std::string error;
   PlistData garbage{'n', 'o', 't', ' ', 'a', 'n', ' ', 'a', 'r', 'c', 'h', 'i', 'v', 'e'};
-  EXPECT_FALSE(KeyedArchive::unarchivedRoot(garbage, kEverything, &error));
-  EXPECT_FALSE(error.empty());
-
-  error.clear();
-  EXPECT_FALSE(KeyedArchive::unarchivedRoot(PlistData{}, kEverything, &error));
-  EXPECT_FALSE(error.empty());
+  EXPECT_FALSE(refusal(garbage).empty());
+  EXPECT_FALSE(refusal(PlistData{}).empty());
 
   // A property list, but not from our archiver.
-  error.clear();
   PlistData foreign = PropertyListSerialization::writeBinary(PlistDictionary{
       {"$archiver", "SomeoneElse"}, {"$version", 1}, {"$top", PlistDictionary{{"root", "x"}}}});
-  EXPECT_FALSE(KeyedArchive::unarchivedRoot(foreign, kEverything, &error));
-  EXPECT_EQ(error, "not a keyed archive");
-
-  error.clear();
-  PlistData plainArray = PropertyListSerialization::writeBinary(PlistArray{"x"});
-  EXPECT_FALSE(KeyedArchive::unarchivedRoot(plainArray, kEverything, &error));
-  EXPECT_EQ(error, "not a keyed archive");
+  EXPECT_EQ(refusal(foreign), "not a keyed archive");
+  EXPECT_EQ(refusal(PropertyListSerialization::writeBinary(PlistArray{"x"})),
+            "not a keyed archive");
 
   // Ours, but with nothing at the top.
-  error.clear();
   PlistData rootless = PropertyListSerialization::writeBinary(PlistDictionary{
       {"$archiver", "larder.KeyedArchive"}, {"$version", 1}, {"$top", PlistDictionary{}}});
-  EXPECT_FALSE(KeyedArchive::unarchivedRoot(rootless, kEverything, &error));
-  EXPECT_EQ(error, "keyed archive without root object");
+  EXPECT_EQ(refusal(rootless), "keyed archive without root object");
 
   // Every prefix of a real archive is refused rather than half read.
   PlistData whole = KeyedArchive::archivedData(everyClassTree());
@@ -159,9 +147,7 @@ TEST(KeyedArchive, NestingBeyondTheLimitIsRefused) {
     return value;
   };
   EXPECT_TRUE(decode(nested(100), kEverything));
-  std::string error;
-  EXPECT_FALSE(decode(nested(200), kEverything, &error));
-  EXPECT_EQ(error, "archive nested too deeply");
+  EXPECT_EQ(decode(nested(200), kEverything).errorDescription(), "archive nested too deeply");
 }
 
 }  // namespace

@@ -24,8 +24,8 @@
 
 #include "platform/log/TillLogManager.h"
 #include "platform/plist/KeyedArchive.h"
-#include "platform/plist/PlistValue.h"
 #include "platform/plist/PropertyListSerialization.h"
+#include "platform/value/PlistValue.h"
 #include "software-map/SoftwareMap.h"
 #include "software-map/VendSoftwareMapObserver.h"
 #include "store-runtime/records/LedgerSoftwareProduct.h"

@@ -252,7 +252,7 @@ TEST_F(SoftwareMapStoreTest, SmallStoreIsDescribedInTheLogLineLargeOneInASideFil
     EXPECT_TRUE(
         log.hasOnce("SoftwareMap: After loading persisted store, SoftwareMap has 6 items", 2));
     EXPECT_EQ(log.countContaining("After loading persisted store, SoftwareMap is"), 0U);
-    std::optional<PlistData> bytes = FileIO::read(sideFile);
+    std::optional<PlistData> bytes = FileIO::read(sideFile).optional();
     ASSERT_TRUE(bytes) << sideFile;
     std::optional<PlistValue> side = PropertyListSerialization::read(*bytes);
     ASSERT_TRUE(side && side->dictionary());

@@ -75,9 +75,8 @@ class SoftwareMapUpdateBodyTest : public ServiceTest {
     EXPECT_TRUE(body.data.has_value());
     if (!body.data) return {};
     EXPECT_FALSE(body.compressed);
-    std::string error;
-    std::optional<PlistValue> parsed = PropertyListSerialization::read(*body.data, &error);
-    EXPECT_TRUE(parsed.has_value()) << error << "\n" << textOf(*body.data);
+    auto parsed = PropertyListSerialization::read(*body.data);
+    EXPECT_TRUE(parsed.has_value()) << parsed.errorDescription() << "\n" << textOf(*body.data);
     if (!parsed || !parsed->isDictionary()) {
       ADD_FAILURE() << "the body is not a dictionary:\n" << textOf(*body.data);
       return {};
@@ -198,7 +197,8 @@ TEST_F(SoftwareMapUpdateBodyTest, InstalledEntriesCarryTheRecordsValuesAndLeaveO
 
   EXPECT_TRUE(log.hasOnce("SoftwareMap: installed: 1; bundled: 0; conditional: 0", 2));
   // The same dictionary goes to the side file at level 3.
-  std::optional<PlistData> side = FileIO::read(stateFolder() + "/UpdateQueueRequstBody.plist");
+  std::optional<PlistData> side =
+      FileIO::read(stateFolder() + "/UpdateQueueRequstBody.plist").optional();
   ASSERT_TRUE(side.has_value());
   EXPECT_EQ(PropertyListSerialization::read(*side), PlistValue(parsed));
 }

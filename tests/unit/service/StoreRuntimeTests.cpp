@@ -247,10 +247,9 @@ TEST(LedgerSoftwareProduct, ArchiveRoundTripKeepsEveryFieldButTheQueryHandle) {
     EXPECT_FALSE(encoded.contains("mdItemRef"));
     // Through the bytes the store is made of.
     PlistData bytes = KeyedArchive::archivedData(encoded);
-    std::string error;
-    std::optional<PlistValue> root = KeyedArchive::unarchivedRoot(
-        bytes, {std::string(LedgerSoftwareProduct::kClassName)}, &error);
-    ASSERT_TRUE(root) << error;
+    auto root =
+        KeyedArchive::unarchivedRoot(bytes, {std::string(LedgerSoftwareProduct::kClassName)});
+    ASSERT_TRUE(root) << root.errorDescription();
     auto decoded = LedgerSoftwareProduct::initWithCoder(*root);
     ASSERT_NE(decoded, nullptr);
     LedgerSoftwareProductFields expected = fields;

@@ -14,8 +14,8 @@
 #include <thread>
 #include <vector>
 
-#include "platform/plist/PlistValue.h"
 #include "platform/plist/PropertyListSerialization.h"
+#include "platform/value/PlistValue.h"
 #include "store-runtime/runtime/VendRuntime.h"
 
 namespace larder::testing {

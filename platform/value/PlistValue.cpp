@@ -1,4 +1,4 @@
-#include "platform/plist/PlistValue.h"
+#include "platform/value/PlistValue.h"
 
 #include <charconv>
 #include <cmath>

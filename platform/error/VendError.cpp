@@ -1,4 +1,4 @@
-#include "store-runtime/core/VendError.h"
+#include "platform/error/VendError.h"
 
 namespace larder {
 
