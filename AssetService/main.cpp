@@ -67,9 +67,8 @@ bool finishPendingWrites() {
 
 int main(int argc, const char** argv) {
   using namespace larder;
-  std::string confinementError;
-  if (!Confinement::confine(kProfileName, &confinementError)) {
-    std::fprintf(stderr, "confinement: %s\n", confinementError.c_str());
+  if (auto confined = Confinement::confine(kProfileName); !confined) {
+    std::fprintf(stderr, "confinement: %s\n", confined.error().description.c_str());
     return -1;
   }
   StopSignals::block();

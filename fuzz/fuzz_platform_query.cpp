@@ -52,18 +52,16 @@ std::vector<PlistDictionary> samplesFor(const MetadataQueryPredicate& predicate)
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   const std::string_view text(reinterpret_cast<const char*>(data), size);
-  std::string error;
-  const std::optional<MetadataQueryPredicate> predicate =
-      MetadataQueryPredicate::parse(text, &error);
+  const auto predicate = MetadataQueryPredicate::parse(text);
   if (!predicate) {
-    if (error.empty()) failWith("refused without a reason");
+    if (predicate.error().description.empty()) failWith("refused without a reason");
     return 0;
   }
   const std::string canonical = predicate->canonicalText();
-  std::string againError;
-  const std::optional<MetadataQueryPredicate> again =
-      MetadataQueryPredicate::parse(canonical, &againError);
-  if (!again) failWith("canonical text does not parse:", canonical + " -- " + againError);
+  const auto again = MetadataQueryPredicate::parse(canonical);
+  if (!again) {
+    failWith("canonical text does not parse:", canonical + " -- " + again.error().description);
+  }
   if (again->canonicalText() != canonical) {
     failWith("canonical text is not stable:", canonical + " -> " + again->canonicalText());
   }

@@ -77,11 +77,9 @@ bool MetadataQuery::start() {
     startError_ = "the query was started before";
     return false;
   }
-  std::string error;
-  std::optional<MetadataQueryPredicate> predicate =
-      MetadataQueryPredicate::parse(queryString_, &error);
+  Result<MetadataQueryPredicate> predicate = MetadataQueryPredicate::parse(queryString_);
   if (!predicate) {
-    startError_ = "the query does not parse: " + error;
+    startError_ = "the query does not parse: " + predicate.error().description;
     return false;
   }
   auto watcher = std::make_unique<MetadataIndexWatcher>();

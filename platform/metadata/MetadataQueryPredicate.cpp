@@ -405,18 +405,16 @@ void print(const Node& node, std::string& text) {
 
 }  // namespace
 
-std::optional<MetadataQueryPredicate> MetadataQueryPredicate::parse(std::string_view text,
-                                                                    std::string* error) {
+Result<MetadataQueryPredicate> MetadataQueryPredicate::parse(std::string_view text) {
+  const auto refused = [](std::string why) {
+    return VendError::withDomain(std::string(kErrorDomain), 1, std::move(why));
+  };
   if (text.size() > kMaxQueryLength) {
-    if (error) *error = "query longer than " + std::to_string(kMaxQueryLength) + " bytes";
-    return std::nullopt;
+    return refused("query longer than " + std::to_string(kMaxQueryLength) + " bytes");
   }
   Parser parser(text);
   std::optional<Node> root = parser.parseQuery();
-  if (!root) {
-    if (error) *error = parser.error();
-    return std::nullopt;
-  }
+  if (!root) return refused(parser.error());
   return MetadataQueryPredicate(std::make_shared<const Node>(std::move(*root)));
 }
 

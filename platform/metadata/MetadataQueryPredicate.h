@@ -7,6 +7,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/error/Result.h"
 #include "platform/value/PlistValue.h"
 
 namespace larder {
@@ -44,8 +45,10 @@ class MetadataQueryPredicate {
   static constexpr std::size_t kMaxQueryLength = 64u * 1024u;
   static constexpr std::size_t kMaxNestingDepth = 32;
 
-  static std::optional<MetadataQueryPredicate> parse(std::string_view text,
-                                                     std::string* error = nullptr);
+  // A query that does not parse is an error of kErrorDomain whose
+  // description says what is wrong and at which offset.
+  static constexpr std::string_view kErrorDomain = "MetadataQueryPredicate";
+  static Result<MetadataQueryPredicate> parse(std::string_view text);
 
   [[nodiscard]] bool matches(const PlistDictionary& attributes) const;
 

@@ -33,27 +33,28 @@ bool allowWritesBelow(int ruleset, const std::string& folder) {
 
 // Landlock is an extra wall, not a requirement: a kernel without it (or
 // with it switched off) leaves the process as it is.
-bool restrictWrites(const std::vector<std::string>& folders, std::string* errorText) {
+// The failure of a system call, by the errno it left.
+VendError confinementError(const std::string& what) {
+  const int code = errno;
+  return VendError::withDomain(std::string(Confinement::kErrorDomain), code,
+                               what + ": " + std::strerror(code));
+}
+
+Result<void> restrictWrites(const std::vector<std::string>& folders) {
   landlock_ruleset_attr attributes{};
   attributes.handled_access_fs = kWriteAccess;
   int ruleset =
       static_cast<int>(::syscall(SYS_landlock_create_ruleset, &attributes, sizeof attributes, 0));
   if (ruleset < 0) {
-    return errno == ENOSYS || errno == EOPNOTSUPP || errno == EINVAL ||
-           (*errorText = std::strerror(errno), false);
+    if (errno == ENOSYS || errno == EOPNOTSUPP || errno == EINVAL) return {};
+    return confinementError("landlock ruleset");
   }
   FileDescriptor owned(ruleset);
   for (const std::string& folder : folders) {
-    if (!allowWritesBelow(ruleset, folder)) {
-      *errorText = "landlock rule for " + folder + ": " + std::strerror(errno);
-      return false;
-    }
+    if (!allowWritesBelow(ruleset, folder)) return confinementError("landlock rule for " + folder);
   }
-  if (::syscall(SYS_landlock_restrict_self, ruleset, 0) != 0) {
-    *errorText = std::string("landlock: ") + std::strerror(errno);
-    return false;
-  }
-  return true;
+  if (::syscall(SYS_landlock_restrict_self, ruleset, 0) != 0) return confinementError("landlock");
+  return {};
 }
 
 }  // namespace
@@ -66,12 +67,9 @@ std::vector<std::string> Confinement::writableFolders(std::string_view /*profile
           Environment::userConfigDirectory(), "/tmp"};
 }
 
-bool Confinement::confine(std::string_view profileName, std::string* errorText) {
-  if (::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0) {
-    *errorText = std::string("no_new_privs: ") + std::strerror(errno);
-    return false;
-  }
-  return restrictWrites(writableFolders(profileName), errorText);
+Result<void> Confinement::confine(std::string_view profileName) {
+  if (::prctl(PR_SET_NO_NEW_PRIVS, 1, 0, 0, 0) != 0) return confinementError("no_new_privs");
+  return restrictWrites(writableFolders(profileName));
 }
 
 }  // namespace larder

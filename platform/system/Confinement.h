@@ -4,6 +4,8 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/error/Result.h"
+
 namespace larder {
 
 // Confines the process before it serves anyone: no new privileges ever
@@ -14,8 +16,10 @@ class Confinement {
  public:
   // The folders a profile may write below.
   static std::vector<std::string> writableFolders(std::string_view profileName);
-  // false with `errorText` set when the process could not be confined.
-  static bool confine(std::string_view profileName, std::string* errorText);
+  // An error of kErrorDomain, its code the errno, when the process could
+  // not be confined.
+  static constexpr std::string_view kErrorDomain = "Confinement";
+  static Result<void> confine(std::string_view profileName);
 };
 
 }  // namespace larder

@@ -24,9 +24,8 @@ constexpr const char* kLegacyQuery =
     "kHostItemHostBundleIdentifier='com.orvane.ReelcutApp')";
 
 MetadataQueryPredicate parsed(std::string_view text) {
-  std::string error;
-  std::optional<MetadataQueryPredicate> predicate = MetadataQueryPredicate::parse(text, &error);
-  EXPECT_TRUE(predicate.has_value()) << text << ": " << error;
+  Result<MetadataQueryPredicate> predicate = MetadataQueryPredicate::parse(text);
+  EXPECT_TRUE(predicate.has_value()) << text << ": " << predicate.errorDescription();
   if (!predicate) return *MetadataQueryPredicate::parse("never == 1");
   return *predicate;
 }
@@ -36,11 +35,12 @@ bool matches(std::string_view text, const PlistDictionary& attributes) {
 }
 
 std::string refusal(std::string_view text) {
-  std::string error;
-  std::optional<MetadataQueryPredicate> predicate = MetadataQueryPredicate::parse(text, &error);
+  Result<MetadataQueryPredicate> predicate = MetadataQueryPredicate::parse(text);
   EXPECT_FALSE(predicate.has_value()) << text << " was accepted";
-  EXPECT_FALSE(error.empty()) << text;
-  return error;
+  if (predicate) return "";
+  EXPECT_EQ(predicate.error().domain, MetadataQueryPredicate::kErrorDomain);
+  EXPECT_FALSE(predicate.error().description.empty()) << text;
+  return predicate.error().description;
 }
 
 PlistDictionary storeBundle() {
