@@ -4,6 +4,9 @@
 #include <optional>
 #include <stdexcept>
 #include <string>
+#include <string_view>
+
+#include "platform/error/Result.h"
 
 namespace larder {
 
@@ -13,34 +16,43 @@ namespace larder {
 // the functions taken from it never dangle.
 class SharedLibrary {
  public:
-  // nullopt, with the loader's reason in *error, when it cannot be opened.
-  static std::optional<SharedLibrary> open(const std::string& soname, std::string* error);
+  // Failures are errors of kErrorDomain: the loader's reason, or the
+  // symbol the library lacks.
+  static constexpr std::string_view kErrorDomain = "SharedLibrary";
 
-  // Sets `function` to the library's `name`; false, with the reason in
-  // *error, when the library has no such symbol.
+  static Result<SharedLibrary> open(const std::string& soname);
+
+  // Sets `function` to the library's `name`; false when the library has no
+  // such symbol, which `missingSymbolError` then names. Meant to be chained
+  // with && over a whole function table.
   template <typename Function>
-  bool resolve(Function*& function, const char* name, std::string* error) const {
-    void* address = symbol(name, error);
+  bool resolve(Function*& function, const char* name) {
+    void* address = symbol(name);
     function = reinterpret_cast<Function*>(address);
+    if (!address) missingSymbol_ = name;
     return address != nullptr;
   }
+  [[nodiscard]] VendError missingSymbolError() const;
 
   // The function table `load` fills, loaded by the first caller and kept for
   // the process; throws with the loader's reason when it cannot be had.
   // One table type has one loader, so the table is one per type.
   template <typename Table>
-  static const Table& sharedTable(const char* library, std::optional<Table> (*load)(std::string*)) {
-    static std::string error;
-    static const std::optional<Table> table = load(&error);
-    if (!table) throw std::runtime_error(std::string(library) + " could not be loaded: " + error);
+  static const Table& sharedTable(const char* library, Result<Table> (*load)()) {
+    static const Result<Table> table = load();
+    if (!table) {
+      throw std::runtime_error(std::string(library) +
+                               " could not be loaded: " + table.error().description);
+    }
     return *table;
   }
 
  private:
   explicit SharedLibrary(void* handle);
-  void* symbol(const char* name, std::string* error) const;
+  [[nodiscard]] void* symbol(const char* name) const;
 
   std::shared_ptr<void> handle_;
+  std::string missingSymbol_;
 };
 
 }  // namespace larder

@@ -85,7 +85,8 @@ std::string VendFileManager::displayNameAtPath(const std::string& path) {
 
 std::string VendFileManager::cacheDirectoryPathWithName(std::string_view name) {
   std::string path = Environment::cacheHome() + "/" + std::string(name);
-  FileIO::createDirectories(path);
+  // A folder that cannot be made shows where the caller first writes in it.
+  (void)FileIO::createDirectories(path);
   return path;
 }
 

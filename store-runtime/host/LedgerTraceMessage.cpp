@@ -13,10 +13,10 @@
 
 #include "platform/dispatch/DispatchQueue.h"
 #include "platform/log/TillLogManager.h"
+#include "platform/plist/JsonConversion.h"
 #include "platform/system/Environment.h"
 #include "platform/system/FileDescriptor.h"
 #include "platform/system/FileIO.h"
-#include "platform/plist/JsonConversion.h"
 
 namespace larder {
 
@@ -51,7 +51,7 @@ bool writeWholeLine(int fd, const std::string& line) {
 // Runs on the trace queue only, so lines of this process never interleave;
 // O_APPEND keeps whole lines apart from other processes' too.
 void appendLine(const std::string& directory, const std::string& path, const std::string& line) {
-  FileIO::createDirectories(directory);
+  (void)FileIO::createDirectories(directory);  // a failure shows as the open below failing
   FileDescriptor file(::open(path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0600));
   if (!file.valid() || !writeWholeLine(file.get(), line)) {
     TILL_LOG(1, "%@: Cannot write the message trace to %@: %@", kSpeaker, path,

@@ -42,7 +42,8 @@ class ExclusiveFileLock {
 
  private:
   static int openLockFile(const std::string& lockPath) {
-    FileIO::createDirectories(std::filesystem::path(lockPath).parent_path().string());
+    // A folder that cannot be made shows as the open below failing.
+    (void)FileIO::createDirectories(std::filesystem::path(lockPath).parent_path().string());
     return ::open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
   }
 

@@ -9,21 +9,20 @@ namespace larder {
 
 namespace {
 
-std::optional<CryptoLibrary> load(std::string* error) {
-  std::optional<SharedLibrary> library = SharedLibrary::open("libcrypto.so.3", error);
-  if (!library) return std::nullopt;
+Result<CryptoLibrary> load() {
+  Result<SharedLibrary> library = SharedLibrary::open("libcrypto.so.3");
+  if (!library) return library.error();
   CryptoLibrary f;
-  const bool resolved = library->resolve(f.sha256, "EVP_sha256", error) &&
-                        library->resolve(f.md5, "EVP_md5", error) &&
-                        library->resolve(f.digest, "EVP_Digest", error) &&
-                        library->resolve(f.contextNew, "EVP_MD_CTX_new", error) &&
-                        library->resolve(f.contextFree, "EVP_MD_CTX_free", error) &&
-                        library->resolve(f.digestInit, "EVP_DigestInit_ex", error) &&
-                        library->resolve(f.digestUpdate, "EVP_DigestUpdate", error) &&
-                        library->resolve(f.digestFinal, "EVP_DigestFinal_ex", error) &&
-                        library->resolve(f.hmac, "HMAC", error) &&
-                        library->resolve(f.constantTimeCompare, "CRYPTO_memcmp", error);
-  if (!resolved) return std::nullopt;
+  const bool resolved =
+      library->resolve(f.sha256, "EVP_sha256") && library->resolve(f.md5, "EVP_md5") &&
+      library->resolve(f.digest, "EVP_Digest") &&
+      library->resolve(f.contextNew, "EVP_MD_CTX_new") &&
+      library->resolve(f.contextFree, "EVP_MD_CTX_free") &&
+      library->resolve(f.digestInit, "EVP_DigestInit_ex") &&
+      library->resolve(f.digestUpdate, "EVP_DigestUpdate") &&
+      library->resolve(f.digestFinal, "EVP_DigestFinal_ex") && library->resolve(f.hmac, "HMAC") &&
+      library->resolve(f.constantTimeCompare, "CRYPTO_memcmp");
+  if (!resolved) return library->missingSymbolError();
   return f;
 }
 

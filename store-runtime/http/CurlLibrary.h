@@ -8,6 +8,8 @@
 
 #include <string>
 
+#include "platform/error/Result.h"
+
 namespace larder {
 
 // libcurl, opened on the first transfer. The transport and what it pulls
@@ -29,9 +31,8 @@ struct CurlLibrary {
   decltype(&::curl_url_get) urlGet = nullptr;
   decltype(&::curl_free) free = nullptr;
 
-  // The library, opened and initialised once; nullptr, with the reason in
-  // *error, when it cannot be loaded.
-  static const CurlLibrary* shared(std::string* error);
+  // The library, opened and initialised once, or why it cannot be loaded.
+  static Result<const CurlLibrary*> shared();
 };
 
 }  // namespace larder

@@ -15,7 +15,7 @@ namespace {
 // The loaded library. Both entry points, `perform` and `redirectPolicy`,
 // make sure it loaded before anything below runs.
 const CurlLibrary& curl() {
-  return *CurlLibrary::shared(nullptr);
+  return **CurlLibrary::shared();
 }
 
 struct EasyDeleter {
@@ -286,7 +286,7 @@ VendHTTPTransfer::Result performOnce(const VendURLRequest& request,
 
 VendHTTPTransfer::Redirect VendHTTPTransfer::redirectPolicy(std::string_view fromURL,
                                                             std::string_view toURL) {
-  if (!CurlLibrary::shared(nullptr)) return Redirect::kRefuse;
+  if (!CurlLibrary::shared()) return Redirect::kRefuse;
   const auto from = originOf(fromURL);
   const auto to = originOf(toURL);
   if (!from || !to) return Redirect::kRefuse;
@@ -308,9 +308,10 @@ VendHTTPTransfer::Result VendHTTPTransfer::perform(const VendURLRequest& request
 
 VendHTTPTransfer::Result VendHTTPTransfer::perform(const VendURLRequest& request,
                                                    const Options& options) {
-  if (std::string error; !CurlLibrary::shared(&error)) {
+  if (auto library = CurlLibrary::shared(); !library) {
     Result result;
-    result.error = transferError(CURLE_FAILED_INIT, "the HTTP transport could not start: " + error);
+    result.error = transferError(
+        CURLE_FAILED_INIT, "the HTTP transport could not start: " + library.error().description);
     return result;
   }
   const auto started = std::chrono::steady_clock::now();

@@ -205,7 +205,9 @@ std::string TemporaryPlatform::installBundle(const BundleSpec& spec) const {
                        {"HostBundleExecutable", spec.name}};
   if (!spec.iconBytes.empty()) {
     info.emplace("HostBundleIconFile", "icon");
-    FileIO::writeAtomically(path + "/resources/icon.png", spec.iconBytes);
+    if (!FileIO::writeAtomically(path + "/resources/icon.png", spec.iconBytes)) {
+      throw std::runtime_error("cannot write the icon of " + path);
+    }
   }
   writePlist(path + "/bundle.plist", info);
   if (spec.itemIdentifier) {

@@ -74,7 +74,9 @@ std::string StoreCatalogueBuilder::makeBundle(const std::string& name, const std
   fs::create_directories(folder);
   const std::string path = scratch_.installBundle({folder, name, bundleID, version, wareID});
   const std::string executable = path + "/bin/" + name;
-  FileIO::writeAtomically(executable, payload(payloadBytes, wareID));
+  if (!FileIO::writeAtomically(executable, payload(payloadBytes, wareID))) {
+    throw std::runtime_error("cannot write " + executable);
+  }
   fs::permissions(executable, fs::perms::owner_all | fs::perms::group_read | fs::perms::group_exec |
                                   fs::perms::others_read | fs::perms::others_exec);
   return path;

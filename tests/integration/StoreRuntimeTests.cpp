@@ -180,9 +180,9 @@ TEST_F(StoreRuntimeTest, AnInstallReplacesOnlyStoreSoftwareWithTheBundleBought) 
   platform_.installBundle({applications, "Notes", "com.example.Notes", "1.0", kNotesItem});
   catalogue_.addItem({.wareID = 502, .bundleID = "com.example.Other", .title = "Other"});
   const std::string nameless = catalogue_.makeBundle("Nameless", "", "1.0", 503, 4096);
-  FileIO::writeAtomically(
+  EXPECT_TRUE(FileIO::writeAtomically(
       nameless + "/bundle.plist",
-      PropertyListSerialization::writeXml(PlistDictionary{{"HostBundleExecutable", "Nameless"}}));
+      PropertyListSerialization::writeXml(PlistDictionary{{"HostBundleExecutable", "Nameless"}})));
   catalogue_.addItem({.wareID = 503,
                       .bundleID = "com.example.Nameless",
                       .title = "Nameless",

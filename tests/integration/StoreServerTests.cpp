@@ -716,13 +716,13 @@ TEST_F(StoreServerTest, PackOutputExtractsToTheSameTree) {
   const std::string bundle =
       catalogue.makeBundle("Packed", "com.example.packed", "3.1", 55, 300'000);
   fs::create_directories(bundle + "/resources/deep/deeper");
-  FileIO::writeAtomically(bundle + "/resources/deep/deeper/notes.txt", "some notes\n");
-  FileIO::writeAtomically(bundle + "/resources/empty", "");
+  EXPECT_TRUE(FileIO::writeAtomically(bundle + "/resources/deep/deeper/notes.txt", "some notes\n"));
+  EXPECT_TRUE(FileIO::writeAtomically(bundle + "/resources/empty", ""));
   fs::permissions(bundle + "/resources/deep/deeper/notes.txt", fs::perms::owner_read);
   fs::create_symlink("../bin/Packed", bundle + "/resources/launcher");
   fs::create_symlink("/nonexistent/target", bundle + "/resources/dangling");
   const std::string longName(120, 'n');
-  FileIO::writeAtomically(bundle + "/resources/deep/" + longName, "long name");
+  EXPECT_TRUE(FileIO::writeAtomically(bundle + "/resources/deep/" + longName, "long name"));
 
   const std::string package = catalogue.scratchDirectory() + "/Packed.tar";
   StoreCatalogueBuilder::pack(bundle + "/", package);
