@@ -1083,21 +1083,22 @@ TEST_F(DAAPClientTest, TwoClientsTakeTurnsOnTheOnePollingQueue) {
   first->pollForUpdatesWithForcedUpdate(false);
   ASSERT_TRUE(service_.waitForCount("login", 1));
   // What the service had seen when the first poll came to its revision:
-  // the second poll may not have logged in before then.
-  std::atomic<std::size_t> loginsAtFirstUpdate{0};
-  service_.setResponder("update", [&](const FakeCloudLibrary::Received&) {
-    if (loginsAtFirstUpdate == 0) loginsAtFirstUpdate = service_.count("login");
+  // the second poll may not have logged in before then. Held by the
+  // responder, which the service keeps after this body ends.
+  auto loginsAtFirstUpdate = std::make_shared<std::atomic<std::size_t>>(0);
+  service_.setResponder("update", [this, loginsAtFirstUpdate](const FakeCloudLibrary::Received&) {
+    if (*loginsAtFirstUpdate == 0) *loginsAtFirstUpdate = service_.count("login");
     return FakeCloudLibrary::Answer{
         .body = document(container("mupd", {u32("mstt", 200), u32("musr", 2)}))};
   });
-  std::atomic<bool> secondDone{false};
+  auto secondDone = std::make_shared<std::atomic<bool>>(false);
   second->pollForUpdatesWithForcedUpdate(
-      false, [&](bool, const std::optional<DAAPArray>&, const std::optional<DAAPArray>&) {
-        secondDone = true;
+      false, [secondDone](bool, const std::optional<DAAPArray>&, const std::optional<DAAPArray>&) {
+        *secondDone = true;
       });
   service_.release();
-  ASSERT_TRUE(waitUntil([&] { return secondDone.load(); }));
-  EXPECT_EQ(loginsAtFirstUpdate.load(), 1U) << "the second poll waits for the first";
+  ASSERT_TRUE(waitUntil([&] { return secondDone->load(); }));
+  EXPECT_EQ(loginsAtFirstUpdate->load(), 1U) << "the second poll waits for the first";
   EXPECT_EQ(service_.actions(), (std::vector<std::string>{"login", "update", "login", "update"}));
 }
 
