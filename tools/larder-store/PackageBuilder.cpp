@@ -147,23 +147,25 @@ std::string PackageBuilder::topLevelName(const std::string& bundleDirectory) {
   return name;
 }
 
-bool PackageBuilder::pack(const std::string& bundleDirectory, const std::string& outputPath,
-                          std::string* error) {
+Result<void> PackageBuilder::pack(const std::string& bundleDirectory,
+                                  const std::string& outputPath) {
+  const auto failed = [](std::string why) {
+    return VendError::withDomain(std::string(kErrorDomain), 1, std::move(why));
+  };
   std::error_code code;
-  if (!fs::is_directory(bundleDirectory, code)) {
-    return fail(error, bundleDirectory + " is not a folder");
-  }
+  if (!fs::is_directory(bundleDirectory, code)) return failed(bundleDirectory + " is not a folder");
   const std::string partialPath = outputPath + ".partial-" + std::to_string(::getpid());
-  if (!writeTree(fs::path(bundleDirectory), topLevelName(bundleDirectory), partialPath, error)) {
+  if (std::string why;
+      !writeTree(fs::path(bundleDirectory), topLevelName(bundleDirectory), partialPath, &why)) {
     fs::remove(partialPath, code);
-    return false;
+    return failed(why);
   }
   fs::rename(partialPath, outputPath, code);
   if (code) {
     fs::remove(partialPath, code);
-    return fail(error, "cannot put the archive at " + outputPath + ": " + code.message());
+    return failed("cannot put the archive at " + outputPath + ": " + code.message());
   }
-  return true;
+  return {};
 }
 
 }  // namespace larder

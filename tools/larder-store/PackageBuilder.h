@@ -2,6 +2,8 @@
 
 #include <string>
 
+#include "platform/error/Result.h"
+
 namespace larder {
 
 // Builds a package: an uncompressed tar archive (ustar, with pax headers
@@ -12,8 +14,8 @@ class PackageBuilder {
  public:
   // Writes the package of `bundleDirectory` to `outputPath`, replacing it
   // only when the whole archive has been written.
-  static bool pack(const std::string& bundleDirectory, const std::string& outputPath,
-                   std::string* error);
+  static constexpr std::string_view kErrorDomain = "PackageBuilder";
+  static Result<void> pack(const std::string& bundleDirectory, const std::string& outputPath);
 
   // "Foo.app" for ".../Foo.app/" and for ".../Foo".
   static std::string topLevelName(const std::string& bundleDirectory);

@@ -70,17 +70,13 @@ class ChunkHasher {
 
 }  // namespace
 
-std::optional<PackageDigest> PackageDigest::compute(const std::string& path,
-                                                    std::uint64_t chunkSize, std::string* error) {
-  if (chunkSize == 0) {
-    if (error) *error = "the chunk size is 0";
-    return std::nullopt;
-  }
+Result<PackageDigest> PackageDigest::compute(const std::string& path, std::uint64_t chunkSize) {
+  const auto failed = [](int code, std::string why) {
+    return VendError::withDomain(std::string(kErrorDomain), code, std::move(why));
+  };
+  if (chunkSize == 0) return failed(EINVAL, "the chunk size is 0");
   FileDescriptor file(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  if (!file.valid()) {
-    if (error) *error = "cannot open " + path + ": " + std::strerror(errno);
-    return std::nullopt;
-  }
+  if (!file.valid()) return failed(errno, "cannot open " + path + ": " + std::strerror(errno));
   ::posix_fadvise(file.get(), 0, 0, POSIX_FADV_SEQUENTIAL);
   std::vector<unsigned char> block(kReadBlockSize);
   ChunkHasher hasher(chunkSize);
@@ -89,10 +85,7 @@ std::optional<PackageDigest> PackageDigest::compute(const std::string& path,
   for (;;) {
     const ssize_t got = ::read(file.get(), block.data(), block.size());
     if (got < 0 && errno == EINTR) continue;
-    if (got < 0) {
-      if (error) *error = "cannot read " + path + ": " + std::strerror(errno);
-      return std::nullopt;
-    }
+    if (got < 0) return failed(errno, "cannot read " + path + ": " + std::strerror(errno));
     if (got == 0) break;
     hasher.add({block.data(), static_cast<std::size_t>(got)});
     digest.fileSize += static_cast<std::uint64_t>(got);

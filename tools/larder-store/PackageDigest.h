@@ -5,6 +5,8 @@
 #include <string>
 #include <vector>
 
+#include "platform/error/Result.h"
+
 namespace larder {
 
 // The digests a download is checked against: the hex SHA-256 of each chunk
@@ -14,10 +16,10 @@ struct PackageDigest {
   std::uint64_t chunkSize = 0;
   std::vector<std::string> hashes;
 
-  // Reads the file once, in large blocks; nullopt (with *error) when it
-  // cannot be read or `chunkSize` is 0.
-  static std::optional<PackageDigest> compute(const std::string& path, std::uint64_t chunkSize,
-                                              std::string* error);
+  // Reads the file once, in large blocks; an error when it cannot be read
+  // (its errno as code) or `chunkSize` is 0.
+  static constexpr std::string_view kErrorDomain = "PackageDigest";
+  static Result<PackageDigest> compute(const std::string& path, std::uint64_t chunkSize);
 };
 
 }  // namespace larder

@@ -27,12 +27,10 @@ bool exists(const std::string& path) {
 
 }  // namespace
 
-std::optional<StoreCatalogue> StoreCatalogue::load(const std::string& directory,
-                                                   std::string* error) {
+Result<StoreCatalogue> StoreCatalogue::load(const std::string& directory) {
   std::error_code code;
   if (!fs::is_directory(directory, code)) {
-    if (error) *error = directory + " is not a folder";
-    return std::nullopt;
+    return VendError::withDomain(std::string(kErrorDomain), 1, directory + " is not a folder");
   }
   StoreCatalogue catalogue;
   catalogue.loadSettings(directory + "/store.plist");
@@ -87,13 +85,13 @@ void StoreCatalogue::loadItems(const std::string& directory) {
 }
 
 void StoreCatalogue::loadItem(const std::string& folder) {
-  const auto dictionary = readPlistFile(folder + "/item.plist");
-  std::string error = dictionary.errorDescription();
-  auto item = dictionary ? StoreItem::fromDictionary(*dictionary, folder, &error) : std::nullopt;
-  auto digest =
-      item ? PackageDigest::compute(item->packagePath(), chunkSize_, &error) : std::nullopt;
+  const Result<PlistValue> dictionary = readPlistFile(folder + "/item.plist");
+  Result<StoreItem> item =
+      dictionary ? StoreItem::fromDictionary(*dictionary, folder) : dictionary.error();
+  Result<PackageDigest> digest =
+      item ? PackageDigest::compute(item->packagePath(), chunkSize_) : item.error();
   if (!digest) {
-    TILL_LOG(1, "%@: skipping item %@: %@", "StoreCatalogue", folder, error);
+    TILL_LOG(1, "%@: skipping item %@: %@", "StoreCatalogue", folder, digest.error().description);
     return;
   }
   item->digest = std::move(*digest);

@@ -10,6 +10,7 @@
 #include "larder-store/StoreAccounts.h"
 #include "larder-store/StoreCloudLibrary.h"
 #include "larder-store/StoreItem.h"
+#include "platform/error/Result.h"
 #include "platform/value/PlistValue.h"
 
 namespace larder {
@@ -27,7 +28,8 @@ class StoreCatalogue {
   static constexpr std::uint64_t kDefaultChunkSize = 10u << 20u;
 
   // nullopt (with *error) only when the folder itself cannot be read.
-  static std::optional<StoreCatalogue> load(const std::string& directory, std::string* error);
+  static constexpr std::string_view kErrorDomain = "StoreCatalogue";
+  static Result<StoreCatalogue> load(const std::string& directory);
 
   [[nodiscard]] const StoreAccounts& accounts() const { return accounts_; }
   [[nodiscard]] const PlistDictionary& bagExtras() const { return bagExtras_; }

@@ -84,11 +84,10 @@ std::optional<StoreCloudLibrary::Revision> StoreCloudLibrary::revisionFromEntry(
   revision.number = static_cast<std::uint32_t>(number.uint64Value());
   if (const PlistArray* items = entry["items"].array()) {
     for (std::size_t itemIndex = 0; itemIndex < items->size(); ++itemIndex) {
-      std::string error;
-      auto item = StoreLibraryItem::fromDictionary((*items)[itemIndex], revision.number, &error);
+      auto item = StoreLibraryItem::fromDictionary((*items)[itemIndex], revision.number);
       if (!item) {
         TILL_LOG(1, "%@: skipping item %lu of revision %u: %@", kSpeaker,
-                 static_cast<unsigned long>(itemIndex), revision.number, error);
+                 static_cast<unsigned long>(itemIndex), revision.number, item.error().description);
         continue;
       }
       revision.items.push_back(std::move(*item));

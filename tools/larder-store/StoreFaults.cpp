@@ -36,8 +36,10 @@ std::optional<StoreFaults::Kind> StoreFaults::kindNamed(std::string_view name) {
   return std::nullopt;
 }
 
-std::optional<StoreFaults> StoreFaults::parse(const std::vector<std::string>& faultTexts,
-                                              std::string* error) {
+Result<StoreFaults> StoreFaults::parse(const std::vector<std::string>& faultTexts) {
+  const auto refused = [](std::string why) {
+    return VendError::withDomain(std::string(kErrorDomain), 1, std::move(why));
+  };
   StoreFaults faults;
   for (const std::string& faultText : faultTexts) {
     const auto equals = faultText.find('=');
@@ -46,16 +48,11 @@ std::optional<StoreFaults> StoreFaults::parse(const std::vector<std::string>& fa
                           ? std::nullopt
                           : kindNamed(std::string_view(faultText).substr(equals + 1));
     if (!route || !kind) {
-      if (error)
-        *error = "fault \"" + faultText + "\" is not ROUTE=KIND with a known route and kind";
-      return std::nullopt;
+      return refused("fault \"" + faultText + "\" is not ROUTE=KIND with a known route and kind");
     }
     if (const auto only = onlyRouteOf(*kind); only && *route != *only) {
-      if (error) {
-        *error = "fault \"" + faultText + "\" applies only to the " +
-                 std::string(storeRouteName(*only)) + " route";
-      }
-      return std::nullopt;
+      return refused("fault \"" + faultText + "\" applies only to the " +
+                     std::string(storeRouteName(*only)) + " route");
     }
     faults.faults_[*route] = *kind;
   }

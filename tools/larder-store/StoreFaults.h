@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "larder-store/StoreRoute.h"
+#include "platform/error/Result.h"
 
 namespace larder {
 
@@ -28,10 +29,9 @@ class StoreFaults {
     RedirectHost,   // "redirect-host": 307 from 127.0.0.1 to localhost, same port and target
   };
 
-  // Parses every "ROUTE=KIND" text; on the first bad one returns nullopt and
-  // says why in *error.
-  static std::optional<StoreFaults> parse(const std::vector<std::string>& faultTexts,
-                                          std::string* error);
+  // Parses every "ROUTE=KIND" text; the first bad one is the error.
+  static constexpr std::string_view kErrorDomain = "StoreFaults";
+  static Result<StoreFaults> parse(const std::vector<std::string>& faultTexts);
 
   [[nodiscard]] std::optional<Kind> faultFor(StoreRoute route) const;
   [[nodiscard]] bool empty() const { return faults_.empty(); }

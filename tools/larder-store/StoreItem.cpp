@@ -127,17 +127,15 @@ std::optional<std::string> StoreItem::assetPath(std::string_view name) const {
   return std::nullopt;
 }
 
-std::optional<StoreItem> StoreItem::fromDictionary(const PlistValue& dictionary,
-                                                   const std::string& folder, std::string* error) {
-  if (!dictionary.isDictionary()) {
-    fail(error, "item.plist is not a dictionary");
-    return std::nullopt;
-  }
+Result<StoreItem> StoreItem::fromDictionary(const PlistValue& dictionary,
+                                            const std::string& folder) {
+  std::string why = "item.plist is not a dictionary";
   StoreItem item;
   item.folder = folder;
-  if (!readWareID(dictionary, folder, item, error) || !readTexts(dictionary, item, error) ||
-      !readFiles(dictionary, item, error) || !readOptions(dictionary, item, error)) {
-    return std::nullopt;
+  if (!dictionary.isDictionary() || !readWareID(dictionary, folder, item, &why) ||
+      !readTexts(dictionary, item, &why) || !readFiles(dictionary, item, &why) ||
+      !readOptions(dictionary, item, &why)) {
+    return VendError::withDomain(std::string(kErrorDomain), 1, why);
   }
   return item;
 }

@@ -5,6 +5,7 @@
 #include <string>
 
 #include "larder-store/PackageDigest.h"
+#include "platform/error/Result.h"
 #include "platform/value/PlistValue.h"
 
 namespace larder {
@@ -42,9 +43,9 @@ struct StoreItem {
 
   // Reads an item.plist found in `folder`; the folder's name must be the
   // ware id when the dictionary gives one, and is the ware id when it does
-  // not. nullopt with *error when the entry is malformed.
-  static std::optional<StoreItem> fromDictionary(const PlistValue& dictionary,
-                                                 const std::string& folder, std::string* error);
+  // not. An error of kErrorDomain says what is malformed.
+  static constexpr std::string_view kErrorDomain = "StoreItem";
+  static Result<StoreItem> fromDictionary(const PlistValue& dictionary, const std::string& folder);
 
   // "itemId=<ware-id>&..." for an item whose catalogue entry names no buy
   // parameters.

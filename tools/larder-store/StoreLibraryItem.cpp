@@ -109,12 +109,10 @@ bool hasAnyOf(std::span<const Field> table, const PlistDictionary& fields) {
 
 }  // namespace
 
-std::optional<StoreLibraryItem> StoreLibraryItem::fromDictionary(const PlistValue& entry,
-                                                                 std::uint32_t revision,
-                                                                 std::string* error) {
-  const auto fail = [error](std::string text) -> std::optional<StoreLibraryItem> {
-    if (error) *error = std::move(text);
-    return std::nullopt;
+Result<StoreLibraryItem> StoreLibraryItem::fromDictionary(const PlistValue& entry,
+                                                          std::uint32_t revision) {
+  const auto fail = [](std::string text) {
+    return VendError::withDomain(std::string(kErrorDomain), 1, std::move(text));
   };
   if (!entry.isDictionary()) return fail("not a dictionary");
   const PlistValue& identifier = entry["id"];

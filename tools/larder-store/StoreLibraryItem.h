@@ -4,6 +4,7 @@
 #include <optional>
 #include <string>
 
+#include "platform/error/Result.h"
 #include "platform/value/PlistValue.h"
 
 namespace larder {
@@ -24,9 +25,9 @@ struct StoreLibraryItem {
   // The entry's fields that go on the wire, checked.
   PlistDictionary fields;
 
-  // nullopt with *error when the entry is malformed.
-  static std::optional<StoreLibraryItem> fromDictionary(const PlistValue& entry,
-                                                        std::uint32_t revision, std::string* error);
+  // An error of kErrorDomain says what is malformed.
+  static constexpr std::string_view kErrorDomain = "StoreLibraryItem";
+  static Result<StoreLibraryItem> fromDictionary(const PlistValue& entry, std::uint32_t revision);
 
   // Appends the item as one `mlit` container.
   void writeTo(DAAPBuffer& buffer) const;

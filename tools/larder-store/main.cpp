@@ -43,19 +43,17 @@ std::string urlHost(const std::string& host) {
 }
 
 int pack(const PackOptions& options) {
-  std::string error;
-  if (!PackageBuilder::pack(options.bundle, options.output, &error)) {
-    std::cerr << "larder-store pack: " << error << "\n";
+  if (auto packed = PackageBuilder::pack(options.bundle, options.output); !packed) {
+    std::cerr << "larder-store pack: " << packed.error().description << "\n";
     return 1;
   }
   return 0;
 }
 
 int serve(const ServeOptions& options) {
-  std::string error;
-  const auto faults = StoreFaults::parse(options.faults, &error);
+  const auto faults = StoreFaults::parse(options.faults);
   if (!faults) {
-    std::cerr << "larder-store: " << error << "\n";
+    std::cerr << "larder-store: " << faults.error().description << "\n";
     return 2;
   }
   // The stop signals are taken by one thread of their own, so that every
@@ -70,9 +68,9 @@ int serve(const ServeOptions& options) {
   }
   ::signal(SIGPIPE, SIG_IGN);  // a client that goes away is an error of that write, not our end
 
-  auto catalogue = StoreCatalogue::load(options.catalogue, &error);
+  auto catalogue = StoreCatalogue::load(options.catalogue);
   if (!catalogue) {
-    std::cerr << "larder-store: " << error << "\n";
+    std::cerr << "larder-store: " << catalogue.error().description << "\n";
     return 1;
   }
   StoreServer server(std::move(*catalogue), *faults);
