@@ -7,6 +7,7 @@
 #include <filesystem>
 #include <string>
 
+#include "bench/BenchFiles.h"
 #include "platform/plist/KeyedArchive.h"
 #include "platform/system/FileIO.h"
 #include "store-runtime/records/LedgerSoftwareProduct.h"
@@ -37,7 +38,7 @@ class ProductStoreFixture {
     }
     PlistValue root =
         KeyedArchive::dictionary({{"appsByPath", KeyedArchive::dictionary(std::move(records))}});
-    FileIO::writeAtomically(storePath(), KeyedArchive::archivedData(root));
+    larder::bench::writeFixture(storePath(), KeyedArchive::archivedData(root));
   }
   ~ProductStoreFixture() {
     std::error_code code;

@@ -15,9 +15,9 @@
 #include <random>
 #include <thread>
 
+#include "ProductStoreFixture.h"
 #include "client/DBusValueCodec.h"
 #include "client/ServiceClient.h"
-#include "ProductStoreFixture.h"
 
 extern char** environ;
 

@@ -23,6 +23,7 @@
 #include <string>
 #include <vector>
 
+#include "bench/BenchFiles.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
 #include "store-runtime/download/VendDownloadManager.h"
@@ -82,8 +83,8 @@ void writeCatalogue(const fs::path& catalogue) {
                               {"version", "1.0"},
                               {"package", "Bench.tar"},
                               {"accountLess", true}};
-  FileIO::writeAtomically((item / "item.plist").string(),
-                          PropertyListSerialization::writeXml(entry));
+  larder::bench::writeFixture((item / "item.plist").string(),
+                              PropertyListSerialization::writeXml(entry));
 }
 
 pid_t spawn(const std::vector<std::string>& argv, int stdoutFd) {

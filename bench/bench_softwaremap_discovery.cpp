@@ -12,6 +12,7 @@
 #include <random>
 #include <thread>
 
+#include "bench/BenchFiles.h"
 #include "platform/log/TillLogManager.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
@@ -29,17 +30,17 @@ void writeBundle(const std::string& folder, std::size_t i) {
   std::string path = folder + "/App" + std::to_string(i) + ".app";
   std::string identifier = "com.example.app" + std::to_string(i);
   fs::create_directories(path);
-  larder::FileIO::writeAtomically(
+  larder::bench::writeFixture(
       path + "/bundle.plist",
       larder::PropertyListSerialization::writeXml(PlistDictionary{
           {"HostBundleIdentifier", identifier}, {"HostBundleShortVersionString", "1.0"}}));
-  larder::FileIO::writeAtomically(path + "/purchase.plist",
-                                  larder::PropertyListSerialization::writeXml(PlistDictionary{
-                                      {"bundleIdentifier", identifier},
-                                      {"bundleVersion", "1.0"},
-                                      {"wareID", static_cast<std::int64_t>(500000 + i)},
-                                      {"installerVersionID", 3},
-                                      {"opaqueAccountIDString", "account"}}));
+  larder::bench::writeFixture(path + "/purchase.plist",
+                              larder::PropertyListSerialization::writeXml(
+                                  PlistDictionary{{"bundleIdentifier", identifier},
+                                                  {"bundleVersion", "1.0"},
+                                                  {"wareID", static_cast<std::int64_t>(500000 + i)},
+                                                  {"installerVersionID", 3},
+                                                  {"opaqueAccountIDString", "account"}}));
 }
 
 struct Platform {

@@ -9,6 +9,7 @@
 #include <string>
 
 #include "LoadedSoftwareMap.h"
+#include "bench/BenchFiles.h"
 #include "platform/log/TillLogManager.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
@@ -69,7 +70,7 @@ void BM_ReconcileAnswerWithCache(benchmark::State& state) {
   std::size_t kept = 0;
   for (auto _ : state) {
     state.PauseTiming();
-    larder::FileIO::writeAtomically(path, s.cache);
+    larder::bench::writeFixture(path, s.cache);
     auto queue = std::make_shared<UpdateQueue>(larder::VendStoreClient::initWithStoreClientType(0),
                                                nullptr, *s.map);
     larder::LoadUpdateQueueOperation operation(larder::VendStoreClient::initWithStoreClientType(0),

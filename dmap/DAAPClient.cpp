@@ -16,11 +16,11 @@
 #include "platform/dispatch/DispatchQueue.h"
 #include "platform/dispatch/DispatchSemaphore.h"
 #include "platform/log/TillLogManager.h"
-#include "store-runtime/services/VendAccountService.h"
 #include "store-runtime/core/VendStringHelpers.h"
 #include "store-runtime/host/VendDevice.h"
-#include "store-runtime/services/VendStoreURLOperation.h"
 #include "store-runtime/http/VendURLBag.h"
+#include "store-runtime/services/VendAccountService.h"
+#include "store-runtime/services/VendStoreURLOperation.h"
 #include "store-runtime/services/VendTransactionService.h"
 
 namespace larder {

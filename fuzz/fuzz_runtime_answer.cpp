@@ -5,11 +5,11 @@
 #include <cstdint>
 #include <span>
 
-#include "store-runtime/records/TillDownload.h"
 #include "store-runtime/http/VendStoreAnswer.h"
+#include "store-runtime/records/LedgerUpdate.h"
+#include "store-runtime/records/TillDownload.h"
 #include "store-runtime/records/TillPurchase.h"
 #include "store-runtime/records/TillPurchaseResponse.h"
-#include "store-runtime/records/LedgerUpdate.h"
 
 namespace {
 

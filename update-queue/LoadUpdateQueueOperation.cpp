@@ -2,8 +2,8 @@
 
 #include "platform/log/TillLogManager.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/services/VendStoreURLOperation.h"
 #include "store-runtime/http/VendURLRequest.h"
+#include "store-runtime/services/VendStoreURLOperation.h"
 #include "update-queue/SoftwareUpdatesProvider.h"
 
 namespace larder {

@@ -4,9 +4,9 @@
 #include <optional>
 #include <vector>
 
+#include "store-runtime/records/LedgerUpdate.h"
 #include "store-runtime/services/VendOperation.h"
 #include "store-runtime/services/VendOperationDelegate.h"
-#include "store-runtime/records/LedgerUpdate.h"
 
 namespace larder {
 

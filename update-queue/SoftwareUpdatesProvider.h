@@ -4,8 +4,8 @@
 #include <optional>
 #include <vector>
 
-#include "store-runtime/services/VendDataProvider.h"
 #include "store-runtime/records/LedgerUpdate.h"
+#include "store-runtime/services/VendDataProvider.h"
 
 namespace larder {
 

@@ -18,7 +18,7 @@ namespace larder {
 template <typename T>
 class [[nodiscard]] Result {
  public:
-  Result(T value) : state_(std::in_place_index<0>, std::move(value)) {}  // NOLINT: implicit
+  Result(T value) : state_(std::in_place_index<0>, std::move(value)) {}          // NOLINT: implicit
   Result(VendError error) : state_(std::in_place_index<1>, std::move(error)) {}  // NOLINT
 
   [[nodiscard]] bool has_value() const { return state_.index() == 0; }
@@ -63,7 +63,7 @@ class [[nodiscard]] Result {
     return std::move(std::get<0>(state_));
   }
   operator std::optional<T>() && { return std::move(*this).optional(); }  // NOLINT: implicit
-  operator std::optional<T>() const& {  // NOLINT: implicit
+  operator std::optional<T>() const& {                                    // NOLINT: implicit
     if (!has_value()) return std::nullopt;
     return std::get<0>(state_);
   }

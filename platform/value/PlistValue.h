@@ -48,19 +48,25 @@ class PlistValue {
   };
 
   PlistValue() = default;
-  PlistValue(bool value) : storage_(value) {}  // NOLINT(google-explicit-constructor)
+  PlistValue(bool value) : storage_(value) {}               // NOLINT(google-explicit-constructor)
   PlistValue(int value) : storage_(std::int64_t{value}) {}  // NOLINT(google-explicit-constructor)
   PlistValue(std::int64_t value) : storage_(value) {}       // NOLINT(google-explicit-constructor)
-  PlistValue(std::uint64_t value);                           // NOLINT(google-explicit-constructor)
-  PlistValue(double value) : storage_(value) {}              // NOLINT(google-explicit-constructor)
-  PlistValue(const char* value) : storage_(std::string(value)) {}  // NOLINT(google-explicit-constructor)
-  PlistValue(std::string value) : storage_(std::move(value)) {}    // NOLINT(google-explicit-constructor)
-  PlistValue(std::string_view value) : storage_(std::string(value)) {}  // NOLINT(google-explicit-constructor)
-  PlistValue(PlistData value) : storage_(std::move(value)) {}      // NOLINT(google-explicit-constructor)
-  PlistValue(PlistDate value) : storage_(value) {}                 // NOLINT(google-explicit-constructor)
-  PlistValue(PlistArray value) : storage_(std::move(value)) {}     // NOLINT(google-explicit-constructor)
-  PlistValue(PlistDictionary value) : storage_(std::move(value)) {}  // NOLINT(google-explicit-constructor)
-  PlistValue(PlistUid value) : storage_(value) {}                  // NOLINT(google-explicit-constructor)
+  PlistValue(std::uint64_t value);                          // NOLINT(google-explicit-constructor)
+  PlistValue(double value) : storage_(value) {}             // NOLINT(google-explicit-constructor)
+  PlistValue(const char* value)
+      : storage_(std::string(value)) {}  // NOLINT(google-explicit-constructor)
+  PlistValue(std::string value)
+      : storage_(std::move(value)) {}  // NOLINT(google-explicit-constructor)
+  PlistValue(std::string_view value)
+      : storage_(std::string(value)) {}  // NOLINT(google-explicit-constructor)
+  PlistValue(PlistData value)
+      : storage_(std::move(value)) {}               // NOLINT(google-explicit-constructor)
+  PlistValue(PlistDate value) : storage_(value) {}  // NOLINT(google-explicit-constructor)
+  PlistValue(PlistArray value)
+      : storage_(std::move(value)) {}  // NOLINT(google-explicit-constructor)
+  PlistValue(PlistDictionary value)
+      : storage_(std::move(value)) {}              // NOLINT(google-explicit-constructor)
+  PlistValue(PlistUid value) : storage_(value) {}  // NOLINT(google-explicit-constructor)
 
   [[nodiscard]] Type type() const { return static_cast<Type>(storage_.index()); }
   [[nodiscard]] bool isNull() const { return type() == Type::Null; }

@@ -102,7 +102,8 @@ void VendDialog::dismissDialogWithDictionary(const PlistDictionary& dictionary) 
                                 ? exitCode->second.int64Value()
                                 : kNoButtonExitCode;
   TILL_LOG(2, "%@: Dismissing dialog %@ with exit code %@", kSpeaker, identifier, code);
-  if (auto presenter = VendRuntime::shared()->dialogPresenter()) presenter->dismiss(identifier, code);
+  if (auto presenter = VendRuntime::shared()->dialogPresenter())
+    presenter->dismiss(identifier, code);
 }
 
 std::optional<VendDialogButton> VendDialog::okButton() const {

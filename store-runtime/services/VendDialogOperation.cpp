@@ -4,8 +4,8 @@
 
 #include "platform/dispatch/DispatchSemaphore.h"
 #include "platform/log/TillLogManager.h"
-#include "store-runtime/services/VendUIService.h"
 #include "store-runtime/services/VendServiceProxy.h"
+#include "store-runtime/services/VendUIService.h"
 
 namespace larder {
 

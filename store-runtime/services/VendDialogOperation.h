@@ -4,8 +4,8 @@
 #include <optional>
 
 #include "platform/system/Mutex.h"
-#include "store-runtime/services/VendOperation.h"
 #include "store-runtime/dialogs/VendDialog.h"
+#include "store-runtime/services/VendOperation.h"
 
 namespace larder {
 

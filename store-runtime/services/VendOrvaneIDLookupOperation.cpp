@@ -2,12 +2,12 @@
 
 #include "platform/log/TillLogManager.h"
 #include "store-runtime/core/VendStringHelpers.h"
-#include "store-runtime/services/VendPropertyListProvider.h"
 #include "store-runtime/http/VendStoreAnswer.h"
-#include "store-runtime/services/VendStoreURLOperation.h"
 #include "store-runtime/http/VendURLBag.h"
 #include "store-runtime/runtime/VendRuntime.h"
+#include "store-runtime/services/VendPropertyListProvider.h"
 #include "store-runtime/services/VendServiceProxy.h"
+#include "store-runtime/services/VendStoreURLOperation.h"
 
 namespace larder {
 namespace {

@@ -6,8 +6,8 @@
 #include <string_view>
 
 #include "platform/system/Mutex.h"
-#include "store-runtime/services/VendOperation.h"
 #include "store-runtime/records/VendPurchaseRecord.h"
+#include "store-runtime/services/VendOperation.h"
 
 namespace larder {
 

@@ -2,11 +2,11 @@
 
 #include "platform/log/TillLogManager.h"
 #include "store-runtime/dialogs/VendDialog.h"
-#include "store-runtime/services/VendUIService.h"
-#include "store-runtime/records/TillDownload.h"
-#include "store-runtime/services/VendDownloadService.h"
 #include "store-runtime/http/VendStoreAnswer.h"
+#include "store-runtime/records/TillDownload.h"
 #include "store-runtime/runtime/VendRuntime.h"
+#include "store-runtime/services/VendDownloadService.h"
+#include "store-runtime/services/VendUIService.h"
 
 namespace larder {
 namespace {

@@ -1,10 +1,10 @@
 #include "store-runtime/services/VendServiceProxy.h"
 
 #include "store-runtime/services/VendAccountService.h"
-#include "store-runtime/services/VendUIService.h"
 #include "store-runtime/services/VendAssetService.h"
 #include "store-runtime/services/VendDownloadService.h"
 #include "store-runtime/services/VendTransactionService.h"
+#include "store-runtime/services/VendUIService.h"
 
 namespace larder {
 

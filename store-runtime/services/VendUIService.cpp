@@ -1,13 +1,13 @@
-#include "store-runtime/dialogs/VendCancellingDialogPresenter.h"
 #include "store-runtime/services/VendUIService.h"
+#include "store-runtime/dialogs/VendCancellingDialogPresenter.h"
 
 #include <atomic>
 #include <exception>
 
 #include "platform/log/TillLogManager.h"
-#include "store-runtime/services/VendOperationDelegate.h"
 #include "store-runtime/dialogs/VendDialogPresenter.h"
 #include "store-runtime/runtime/VendRuntime.h"
+#include "store-runtime/services/VendOperationDelegate.h"
 
 namespace larder {
 

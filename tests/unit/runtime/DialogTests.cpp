@@ -17,10 +17,10 @@
 
 #include "store-runtime/dialogs/VendCancellingDialogPresenter.h"
 #include "store-runtime/dialogs/VendDialog.h"
-#include "store-runtime/services/VendDialogOperation.h"
 #include "store-runtime/dialogs/VendDialogPresenter.h"
-#include "store-runtime/services/VendUIService.h"
 #include "store-runtime/runtime/VendRuntime.h"
+#include "store-runtime/services/VendDialogOperation.h"
+#include "store-runtime/services/VendUIService.h"
 
 namespace larder {
 namespace {

@@ -8,11 +8,11 @@
 #include <vector>
 
 #include "DownloadTestSupport.h"
-#include "store-runtime/records/TillDownloadAsset.h"
 #include "store-runtime/download/VendAssetFetcher.h"
 #include "store-runtime/download/VendAssetFileWriter.h"
 #include "store-runtime/download/VendChunkDigestVerifier.h"
 #include "store-runtime/download/VendDownloadError.h"
+#include "store-runtime/records/TillDownloadAsset.h"
 
 namespace larder {
 namespace {

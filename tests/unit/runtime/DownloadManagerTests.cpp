@@ -13,8 +13,8 @@
 #include "store-runtime/download/VendApplicationLocks.h"
 #include "store-runtime/download/VendDownloadError.h"
 #include "store-runtime/download/VendDownloadManager.h"
-#include "store-runtime/services/VendDownloadService.h"
 #include "store-runtime/http/VendHTTPTransfer.h"
+#include "store-runtime/services/VendDownloadService.h"
 
 namespace larder {
 namespace {

@@ -13,11 +13,11 @@
 
 #include "platform/log/TillLogManager.h"
 #include "platform/plist/PropertyListSerialization.h"
-#include "store-runtime/services/VendOrvaneIDLookupOperation.h"
 #include "store-runtime/core/VendStringHelpers.h"
 #include "store-runtime/http/VendRequestSigner.h"
 #include "store-runtime/http/VendStoreAnswer.h"
 #include "store-runtime/runtime/VendRuntime.h"
+#include "store-runtime/services/VendOrvaneIDLookupOperation.h"
 
 namespace larder::testing {
 namespace {

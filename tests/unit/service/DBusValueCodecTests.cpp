@@ -71,7 +71,8 @@ TEST(DBusValueCodec, NestedValuesSurviveAMessage) {
 
 TEST(DBusValueCodec, AbsentValuesTravelAsEmptyValues) {
   PlistArray read = roundTrip(kSignature, {});
-  PlistArray expected{"", PlistDictionary{}, 0, 0, false, 0.0, PlistData{}, PlistArray{}, PlistArray{}};
+  PlistArray expected{"",          PlistDictionary{}, 0,           0, false, 0.0,
+                      PlistData{}, PlistArray{},      PlistArray{}};
   EXPECT_EQ(read, expected);
 
   // Absent members of containers are left out; present ones keep their place.
@@ -148,7 +149,7 @@ TEST(DBusValueCodec, VariantsCarryNaturalTypes) {
 
 TEST(DBusValueCodec, OtherBasicTypesAndObjectPaths) {
   PlistArray read = roundTrip("ynqiuod", {255, -32768, 65535, std::int64_t{-2147483648LL},
-                                           std::int64_t{4294967295LL}, "/com/example/Object", 2.0});
+                                          std::int64_t{4294967295LL}, "/com/example/Object", 2.0});
   EXPECT_EQ(read, (PlistArray{255, -32768, 65535, std::int64_t{-2147483648LL},
                               std::int64_t{4294967295LL}, "/com/example/Object", 2.0}));
   // An absent object path is the root path, the one that names no object.

@@ -12,10 +12,10 @@
 #include <vector>
 
 #include "AssetService/AssetServiceInterface.h"
-#include "client/DBusValueCodec.h"
 #include "AssetService/RequestTable.h"
-#include "client/ServiceError.h"
 #include "ServiceTestSupport.h"
+#include "client/DBusValueCodec.h"
+#include "client/ServiceError.h"
 
 #ifndef LARDER_SOURCE_DIR
 #error "the service tests read committed files of the source tree: define LARDER_SOURCE_DIR"
@@ -85,7 +85,9 @@ class SignatureChecker {
  private:
   explicit SignatureChecker(std::string_view signature) : signature_(signature) {}
 
-  static bool isBasic(char c) { return std::string_view("ybnqiuxtdsogh").find(c) != std::string_view::npos; }
+  static bool isBasic(char c) {
+    return std::string_view("ybnqiuxtdsogh").find(c) != std::string_view::npos;
+  }
 
   bool completeType(int arrays, int structs) {
     if (position_ >= signature_.size()) return false;
@@ -135,7 +137,8 @@ bool isValidMemberName(std::string_view name) {
 
 TEST(RequestTable, NamingRuleOfTheChecker) {
   // The rule as stated, on the examples that define it.
-  EXPECT_EQ(memberNameForSelector("productForBundleIdentifier:replyBlock:"), "ProductForBundleIdentifier");
+  EXPECT_EQ(memberNameForSelector("productForBundleIdentifier:replyBlock:"),
+            "ProductForBundleIdentifier");
   EXPECT_EQ(memberNameForSelector("allProductsWithReplyBlock:"), "AllProducts");
   EXPECT_EQ(memberNameForSelector("addSoftwareMapObserver:reply:"), "AddSoftwareMapObserver");
   EXPECT_EQ(memberNameForSelector("hideOSUpdatesWithProductKeys:withReplyBlock:"),
@@ -155,7 +158,8 @@ TEST(RequestTable, EveryMemberFollowsFromItsSelector) {
     EXPECT_EQ(request.member, memberNameForSelector(request.selector)) << request.selector;
     EXPECT_TRUE(isValidMemberName(request.member)) << request.member;
     EXPECT_TRUE(members.insert(request.member).second) << "member twice: " << request.member;
-    EXPECT_TRUE(selectors.insert(request.selector).second) << "selector twice: " << request.selector;
+    EXPECT_TRUE(selectors.insert(request.selector).second)
+        << "selector twice: " << request.selector;
     EXPECT_EQ(RequestTable::find(request.member), &request) << request.member;
   }
   EXPECT_EQ(RequestTable::find("NoSuchMember"), nullptr);
@@ -203,7 +207,8 @@ TEST(RequestTable, SignatureCheckerRefusesMalformedSignatures) {
   EXPECT_EQ(count, 0U);
   EXPECT_TRUE(SignatureChecker::valid("sa{sv}x(ias)", &count));
   EXPECT_EQ(count, 4U);
-  for (const char* bad : {"a", "a{", "{sv}", "a{vs}", "a{sv", "()", "(s", "s)", "z", "a{s}", "a{svv}"}) {
+  for (const char* bad :
+       {"a", "a{", "{sv}", "a{vs}", "a{sv", "()", "(s", "s)", "z", "a{s}", "a{svv}"}) {
     EXPECT_FALSE(SignatureChecker::valid(bad, nullptr)) << bad;
   }
   EXPECT_THROW(DBusValueCodec::splitSignature("a"), sdbus::Error);
@@ -324,7 +329,8 @@ std::map<std::string, CommittedMethod> committedServiceMethods(const std::string
 
 TEST(RequestTable, IntrospectionMatchesTheCommittedInterfaceFile) {
   const std::string committed = committedInterfaceFile();
-  EXPECT_EQ(ServiceRequests::introspectionXml(), committed) << "regenerate data/dbus from the table";
+  EXPECT_EQ(ServiceRequests::introspectionXml(), committed)
+      << "regenerate data/dbus from the table";
 
   // The committed file is the contract clients build against: it declares
   // the listed requests, and the table serves each as declared.
@@ -356,8 +362,8 @@ TEST(RequestTable, IntrospectionMatchesTheCommittedInterfaceFile) {
 
 class FakeRemoteObjects final : public RemoteObjectFactory {
  public:
-  std::shared_ptr<VendSoftwareMapObserver> softwareMapObserver(const std::string& peer,
-                                                               const std::string& objectPath) override {
+  std::shared_ptr<VendSoftwareMapObserver> softwareMapObserver(
+      const std::string& peer, const std::string& objectPath) override {
     requests.emplace_back(peer, objectPath);
     return observer;
   }
@@ -404,7 +410,8 @@ TEST_F(AssetServiceInterfaceTest, ClientTypeOfARequestOnlyFillsAnEmptySlot) {
   EXPECT_EQ(connection.storeClient()->clientType(), VendStoreClient::kBookApplication);
 
   AssetServiceInterface other(":1.43", *map_, remote_);
-  other.setStoreClient(VendStoreClient::initWithStoreClientType(VendStoreClient::kStoreApplication));
+  other.setStoreClient(
+      VendStoreClient::initWithStoreClientType(VendStoreClient::kStoreApplication));
   other.setStoreClientFromTypeIfNeeded(VendStoreClient::kBookApplication);
   EXPECT_EQ(other.storeClient()->clientType(), VendStoreClient::kStoreApplication);
   EXPECT_EQ(other.storeClient()->identifier(), "com.orvane.quaymart");
@@ -418,14 +425,15 @@ TEST_F(AssetServiceInterfaceTest, RequestsNamingAClientTypeSetItThroughTheTable)
   RequestTable::perform(*redownload, connection, {12, "com.example.x", 1}, {});
   ASSERT_TRUE(connection.storeClient());
   EXPECT_EQ(connection.storeClient()->clientType(), 1);
-  RequestTable::perform(*RequestTable::find("ShowInviteOrganizationNameStoreClientType"), connection,
-                        {"https://invite", "Org", 0}, {});
+  RequestTable::perform(*RequestTable::find("ShowInviteOrganizationNameStoreClientType"),
+                        connection, {"https://invite", "Org", 0}, {});
   EXPECT_EQ(connection.storeClient()->clientType(), 1);
 
   const RequestDescriptor* setClient = RequestTable::find("SetStoreClient");
   ASSERT_NE(setClient, nullptr);
   RequestTable::perform(*setClient, connection,
-                        {PlistDictionary{{"identifier", "com.example.client"}, {"clientType", 4}}}, {});
+                        {PlistDictionary{{"identifier", "com.example.client"}, {"clientType", 4}}},
+                        {});
   EXPECT_EQ(connection.storeClient()->identifier(), "com.example.client");
   EXPECT_EQ(connection.storeClient()->clientType(), 4);
 }
@@ -439,25 +447,29 @@ TEST_F(AssetServiceInterfaceTest, ObserverAtTheRootPathIsNoObserver) {
   EXPECT_NE(rootToken, emptyToken);
   EXPECT_TRUE(remote_->requests.empty()) << "a handle was made for no object";
   connection.removeSoftwareMapObserver(rootToken);
-  EXPECT_EQ(log.countExactly(
-                "SoftwareMap: Could not find SoftwareMap observer to remove for token: " + rootToken),
-            1U)
+  EXPECT_EQ(
+      log.countExactly("SoftwareMap: Could not find SoftwareMap observer to remove for token: " +
+                       rootToken),
+      1U)
       << log.dump();
 
   std::string realToken = connection.addSoftwareMapObserver("/com/example/Observer");
   ASSERT_EQ(remote_->requests.size(), 1U);
-  EXPECT_EQ(remote_->requests[0], (std::pair<std::string, std::string>{":1.42", "/com/example/Observer"}));
+  EXPECT_EQ(remote_->requests[0],
+            (std::pair<std::string, std::string>{":1.42", "/com/example/Observer"}));
   auto product = std::make_shared<LedgerSoftwareProduct>(
       LedgerSoftwareProductFields{.bundlePath = "/Applications/Seen.app"});
   map_->notifyObserversAboutProduct(product, kSoftwareProductAdded);
   ASSERT_EQ(remote_->observer->calls().size(), 1U);
   EXPECT_EQ(remote_->observer->calls()[0].product, product);
   connection.removeSoftwareMapObserver(realToken);
-  EXPECT_EQ(log.countExactly("SoftwareMap: Removed SoftwareMap observer for token: " + realToken), 1U);
+  EXPECT_EQ(log.countExactly("SoftwareMap: Removed SoftwareMap observer for token: " + realToken),
+            1U);
 }
 
 TEST_F(AssetServiceInterfaceTest, InstalledSoftwareRequestsAnswerInWireForm) {
-  std::string app = makeStoreBundle(rootApplications(), "Wire", "com.example.wire", "5.1", 71, 7100);
+  std::string app =
+      makeStoreBundle(rootApplications(), "Wire", "com.example.wire", "5.1", 71, 7100);
   AssetServiceInterface& connection = connect(true);
   std::vector<PlistArray> replies;
   ReplyHandler collect = [&](PlistArray out) { replies.push_back(std::move(out)); };

@@ -49,14 +49,16 @@ TEST_F(SoftwareMapDiscoveryTest, DiscoveryTakesStoreBundlesAndTheSetupHeraldOnly
   std::string store = makeStoreBundle(rootApplications(), "Store", "com.example.store", "1.0", 1);
   std::string herald = makeBundle(rootApplications(), "Install Something",
                                   "com.orvane.SetupHerald.Sonoma", "14.0", std::nullopt, "21A5");
-  std::string plain = makeBundle(rootApplications(), "Plain", "com.example.plain", "1.0", std::nullopt);
-  std::string malformed = makeBundle(rootApplications(), "Malformed", "com.example.malformed", "1.0",
-                                     std::nullopt);
+  std::string plain =
+      makeBundle(rootApplications(), "Plain", "com.example.plain", "1.0", std::nullopt);
+  std::string malformed =
+      makeBundle(rootApplications(), "Malformed", "com.example.malformed", "1.0", std::nullopt);
   writeText(malformed + "/purchase.plist", "<?xml version=\"1.0\"?><plist><dict><key>");
-  std::string empty = makeBundle(homeApplications(), "Empty", "com.example.empty", "1.0", std::nullopt);
+  std::string empty =
+      makeBundle(homeApplications(), "Empty", "com.example.empty", "1.0", std::nullopt);
   writeText(empty + "/purchase.plist", "");
-  std::string listRecord = makeBundle(homeApplications(), "ListRecord", "com.example.list", "1.0",
-                                      std::nullopt);
+  std::string listRecord =
+      makeBundle(homeApplications(), "ListRecord", "com.example.list", "1.0", std::nullopt);
   writePlist(listRecord + "/purchase.plist", PlistArray{"bundleIdentifier", "com.example.list"});
   // A damaged record of an installer is no reason to skip the installer.
   std::string damagedHerald = makeBundle(rootApplications(), "Damaged Herald",
@@ -69,10 +71,10 @@ TEST_F(SoftwareMapDiscoveryTest, DiscoveryTakesStoreBundlesAndTheSetupHeraldOnly
   writeText(rootApplications() + "/File.app", "not a folder");
   makeStoreBundle(rootApplications() + "/One/Two", "Deep", "com.example.deep", "1.0", 3);
   // Every kind of application folder is scanned.
-  std::string nested = makeStoreBundle(rootApplications() + "/Games", "Nested", "com.example.nested",
-                                       "1.0", 4);
-  std::string volume = makeStoreBundle(volumeApplications("Backup"), "OnVolume",
-                                       "com.example.volume", "1.0", 5);
+  std::string nested =
+      makeStoreBundle(rootApplications() + "/Games", "Nested", "com.example.nested", "1.0", 4);
+  std::string volume =
+      makeStoreBundle(volumeApplications("Backup"), "OnVolume", "com.example.volume", "1.0", 5);
   std::string home = makeStoreBundle(homeApplications(), "AtHome", "com.example.home", "1.0", 6);
 
   SoftwareMap map(options(storePath(), true));
@@ -124,14 +126,16 @@ TEST_F(SoftwareMapDiscoveryTest, RecoveryEnvironmentDisablesDiscovery) {
 }
 
 TEST_F(SoftwareMapDiscoveryTest, ReloadMergesIntoTheSameRecordsAndNotifiesInOrder) {
-  std::string changedA = makeStoreBundle(rootApplications(), "ChangeA", "com.example.change-a",
-                                         "1.0", 11, 1100);
-  std::string changedB = makeStoreBundle(homeApplications(), "ChangeB", "com.example.change-b",
-                                         "2.0", 12, 1200);
-  std::string removedA = makeStoreBundle(rootApplications(), "GoneA", "com.example.gone-a", "1.0", 13);
-  std::string removedB = makeStoreBundle(volumeApplications("V"), "GoneB", "com.example.gone-b",
-                                         "1.0", 14);
-  std::string steady = makeStoreBundle(rootApplications(), "Steady", "com.example.steady", "1.0", 15);
+  std::string changedA =
+      makeStoreBundle(rootApplications(), "ChangeA", "com.example.change-a", "1.0", 11, 1100);
+  std::string changedB =
+      makeStoreBundle(homeApplications(), "ChangeB", "com.example.change-b", "2.0", 12, 1200);
+  std::string removedA =
+      makeStoreBundle(rootApplications(), "GoneA", "com.example.gone-a", "1.0", 13);
+  std::string removedB =
+      makeStoreBundle(volumeApplications("V"), "GoneB", "com.example.gone-b", "1.0", 14);
+  std::string steady =
+      makeStoreBundle(rootApplications(), "Steady", "com.example.steady", "1.0", 15);
 
   SoftwareMap map(options(storePath(), true));
   map.waitUntilIdle();
@@ -149,14 +153,12 @@ TEST_F(SoftwareMapDiscoveryTest, ReloadMergesIntoTheSameRecordsAndNotifiesInOrde
 
   // A new version without an installer version; another with a new
   // account; two bundles gone; two new ones.
-  writePlist(changedA + "/purchase.plist",
-             Purchase{"com.example.change-a", "1.1", PlistValue(11), PlistValue(), "account-ChangeA",
-                      1600000000.0}
-                 .toDictionary());
-  writePlist(changedB + "/purchase.plist",
-             Purchase{"com.example.change-b", "2.0", PlistValue(12), PlistValue(1200), "other-account",
-                      1600000000.0}
-                 .toDictionary());
+  writePlist(changedA + "/purchase.plist", Purchase{"com.example.change-a", "1.1", PlistValue(11),
+                                                    PlistValue(), "account-ChangeA", 1600000000.0}
+                                               .toDictionary());
+  writePlist(changedB + "/purchase.plist", Purchase{"com.example.change-b", "2.0", PlistValue(12),
+                                                    PlistValue(1200), "other-account", 1600000000.0}
+                                               .toDictionary());
   std::filesystem::remove_all(removedA);
   std::filesystem::remove_all(removedB);
   std::string addedA = makeStoreBundle(rootApplications(), "NewA", "com.example.new-a", "1.0", 16);
@@ -186,9 +188,9 @@ TEST_F(SoftwareMapDiscoveryTest, ReloadMergesIntoTheSameRecordsAndNotifiesInOrde
   EXPECT_EQ(map.allProducts().size(), 5U);
 
   std::vector<RecordingObserver::Call> calls = observer->calls();
-  EXPECT_THAT(statesOf(calls),
-              ElementsAre(kSoftwareProductAdded, kSoftwareProductAdded, kSoftwareProductChanged,
-                          kSoftwareProductChanged, kSoftwareProductRemoved, kSoftwareProductRemoved));
+  EXPECT_THAT(statesOf(calls), ElementsAre(kSoftwareProductAdded, kSoftwareProductAdded,
+                                           kSoftwareProductChanged, kSoftwareProductChanged,
+                                           kSoftwareProductRemoved, kSoftwareProductRemoved));
   EXPECT_THAT(pathsOf(calls, kSoftwareProductAdded), UnorderedElementsAre(addedA, addedB));
   EXPECT_THAT(pathsOf(calls, kSoftwareProductChanged), UnorderedElementsAre(changedA, changedB));
   EXPECT_THAT(pathsOf(calls, kSoftwareProductRemoved), UnorderedElementsAre(removedA, removedB));
@@ -217,7 +219,8 @@ TEST_F(SoftwareMapDiscoveryTest, ReloadMergesIntoTheSameRecordsAndNotifiesInOrde
 }
 
 TEST_F(SoftwareMapDiscoveryTest, OnlyTheSourceDifferingIsNoChange) {
-  std::string app = makeStoreBundle(rootApplications(), "Known", "com.example.known", "3.0", 21, 2100);
+  std::string app =
+      makeStoreBundle(rootApplications(), "Known", "com.example.known", "3.0", 21, 2100);
   // What discovery would read, but as the metadata query found it.
   LedgerSoftwareProductFields remembered;
   remembered.bundlePath = app;

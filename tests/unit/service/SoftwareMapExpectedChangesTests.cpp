@@ -31,8 +31,8 @@ class SoftwareMapExpectedChangesTest : public ServiceTest {
   // What the installer leaves behind: the new purchase record.
   void replaceBundleWith(const std::string& version, std::int64_t installerVersion) {
     writePlist(path_ + "/purchase.plist",
-               Purchase{"com.example.updating", version, PlistValue(61), PlistValue(installerVersion),
-                        "account-Updating", 1600000000.0}
+               Purchase{"com.example.updating", version, PlistValue(61),
+                        PlistValue(installerVersion), "account-Updating", 1600000000.0}
                    .toDictionary());
   }
 

@@ -83,10 +83,12 @@ class SoftwareMapPreferenceTest : public ServiceTest {
         }
         return paths;
       };
-      std::vector<std::string> firstPaths = install(winnerFirst ? preference.winner : preference.loser);
+      std::vector<std::string> firstPaths =
+          install(winnerFirst ? preference.winner : preference.loser);
       SoftwareMap map(options(storePath("layout" + std::to_string(layoutIndex)), true));
       map.waitUntilIdle();
-      std::vector<std::string> secondPaths = install(winnerFirst ? preference.loser : preference.winner);
+      std::vector<std::string> secondPaths =
+          install(winnerFirst ? preference.loser : preference.winner);
       map.reloadFromApplicationRegistry();
       map.waitUntilIdle();
       ASSERT_EQ(map.allProducts().size(), static_cast<std::size_t>(kPairsPerLayout) * 2)
@@ -94,9 +96,10 @@ class SoftwareMapPreferenceTest : public ServiceTest {
       std::vector<Pair> pairs;
       for (int i = 0; i < kPairsPerLayout; ++i) {
         auto index = static_cast<std::size_t>(i);
-        pairs.push_back({"com.example.preference" + std::to_string(layoutIndex) + "." + std::to_string(i),
-                         winnerFirst ? firstPaths[index] : secondPaths[index],
-                         winnerFirst ? secondPaths[index] : firstPaths[index]});
+        pairs.push_back(
+            {"com.example.preference" + std::to_string(layoutIndex) + "." + std::to_string(i),
+             winnerFirst ? firstPaths[index] : secondPaths[index],
+             winnerFirst ? secondPaths[index] : firstPaths[index]});
       }
 
       // The order in which the map holds the records is the order in which
@@ -114,16 +117,13 @@ class SoftwareMapPreferenceTest : public ServiceTest {
         EXPECT_EQ(found->bundlePath(), pair.winnerPath)
             << preference.name << ": " << pair.identifier << "\n"
             << log.dump();
-        std::string decidingLine = std::string("SoftwareMap: Preferring (") + preference.rule +
-                                   ") app version " + preference.winner.version + " at " +
-                                   pair.winnerPath + " over " +
-                                   (std::string_view(preference.rule) == "updatable"
-                                        ? "non-updatable "
-                                        : "") +
-                                   "version " + preference.loser.version + " at " + pair.loserPath;
-        EXPECT_EQ(log.countExactly(decidingLine, 1), 1U)
-            << "expected: " << decidingLine << "\n"
-            << log.dump();
+        std::string decidingLine =
+            std::string("SoftwareMap: Preferring (") + preference.rule + ") app version " +
+            preference.winner.version + " at " + pair.winnerPath + " over " +
+            (std::string_view(preference.rule) == "updatable" ? "non-updatable " : "") +
+            "version " + preference.loser.version + " at " + pair.loserPath;
+        EXPECT_EQ(log.countExactly(decidingLine, 1), 1U) << "expected: " << decidingLine << "\n"
+                                                         << log.dump();
         std::vector<LogCapture::Line> warnings =
             log.linesContaining("multiple matches for " + pair.identifier + " found");
         ASSERT_EQ(warnings.size(), 1U) << log.dump();
@@ -185,7 +185,8 @@ TEST_F(SoftwareMapPreferenceTest, UpdatableCopyBeatsHigherVersionThatCannotBeRep
   useLayout(layout.rootName, layout.homeName);
   const std::string locked = rootApplications() + "/" + layout.subfolderName;
   std::string higher = makeStoreBundle(locked, "Tool", "com.example.tool", "9.0", 77);
-  std::string lower = makeStoreBundle(volumeApplications("D"), "Tool", "com.example.tool", "1.0", 77);
+  std::string lower =
+      makeStoreBundle(volumeApplications("D"), "Tool", "com.example.tool", "1.0", 77);
   SoftwareMap map(options(storePath(), true));
   map.waitUntilIdle();
   ASSERT_EQ(map.allProducts().size(), 2U);
@@ -212,8 +213,8 @@ TEST_F(SoftwareMapPreferenceTest, RememberedCopyThatIsGoneLosesToUpdatableLowerV
   std::vector<std::pair<std::string, std::string>> winnerAndLoser;
   for (int i = 0; i < kPairsPerLayout; ++i) {
     std::string identifier = "com.example.gone" + std::to_string(i);
-    std::string present =
-        makeStoreBundle(volumeApplications("D"), "G" + std::to_string(i), identifier, "1.0", 500 + i);
+    std::string present = makeStoreBundle(volumeApplications("D"), "G" + std::to_string(i),
+                                          identifier, "1.0", 500 + i);
     std::string gone = rootApplications() + "/G" + std::to_string(i) + ".app";
     for (const auto& [path, version] : {std::pair{present, "1.0"}, std::pair{gone, "8.0"}}) {
       LedgerSoftwareProductFields fields;
@@ -240,10 +241,12 @@ TEST_F(SoftwareMapPreferenceTest, RememberedCopyThatIsGoneLosesToUpdatableLowerV
                                 " over non-updatable version 8.0 at " + gone,
                             1));
     // The item identifier index follows the same preference.
-    LedgerSoftwareProductRef byItem = map.productForItemIdentifier(static_cast<std::uint64_t>(500 + i));
+    LedgerSoftwareProductRef byItem =
+        map.productForItemIdentifier(static_cast<std::uint64_t>(500 + i));
     ASSERT_NE(byItem, nullptr);
     EXPECT_EQ(byItem->bundlePath(), present);
-    EXPECT_EQ(log.countContaining("multiple matches for " + std::to_string(500 + i) + " found", 1), 1U)
+    EXPECT_EQ(log.countContaining("multiple matches for " + std::to_string(500 + i) + " found", 1),
+              1U)
         << log.dump();
   }
 }
