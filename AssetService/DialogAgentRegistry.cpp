@@ -26,16 +26,9 @@ std::string describeError(const sdbus::Error& error) {
   return error.getName() + ": " + error.getMessage();
 }
 
-void sendEmptyReply(sdbus::MethodCall& call) {
-  if (!call.doesntExpectReply()) call.createReply().send();
-}
-
 void sendAnswer(sdbus::MethodCall& call, const VendDialogAnswer& answer) {
-  if (call.doesntExpectReply()) return;
   try {
-    sdbus::MethodReply reply = call.createReply();
-    DBusValueCodec::writeAll(reply, "xa{sv}", {answer.exitCode, answer.values});
-    reply.send();
+    DBusValueCodec::reply(call, "xa{sv}", {answer.exitCode, answer.values});
   } catch (const sdbus::Error& error) {
     TILL_LOG(2, "%@: Answer to %@ not delivered: %@", kSpeaker, call.getSender(),
              describeError(error));
@@ -81,7 +74,7 @@ void DialogAgentRegistry::registerAgent(sdbus::MethodCall call) {
     agents_.push_back(agent);
   }
   TILL_LOG(2, "%@: Dialog agent %@ %@ registered", kSpeaker, agent.peer, agent.objectPath);
-  sendEmptyReply(call);
+  DBusValueCodec::reply(call, "", {});
 }
 
 void DialogAgentRegistry::unregisterAgent(sdbus::MethodCall call) {
@@ -97,7 +90,7 @@ void DialogAgentRegistry::unregisterAgent(sdbus::MethodCall call) {
   // Dialogs the agent already shows stay with it until it answers them.
   TILL_LOG(removed > 0 ? 2 : 3, "%@: Dialog agent %@ %@ %@", kSpeaker, peer, objectPath,
            removed > 0 ? "unregistered" : "was not registered");
-  sendEmptyReply(call);
+  DBusValueCodec::reply(call, "", {});
 }
 
 void DialogAgentRegistry::displayDialog(sdbus::MethodCall call) {

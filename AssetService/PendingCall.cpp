@@ -29,9 +29,7 @@ bool PendingCall::takeAnswer() {
 bool PendingCall::reply(std::string_view signature, const PlistArray& values) {
   if (!takeAnswer()) return false;
   try {
-    sdbus::MethodReply message = call_.createReply();
-    DBusValueCodec::writeAll(message, signature, values);
-    message.send();
+    DBusValueCodec::reply(call_, signature, values);
   } catch (const sdbus::Error& failure) {
     // A reply the codec cannot write still answers the caller.
     TILL_LOG(1, "%@: reply to %@ not sent: %@", kSpeaker, member_, failure.getMessage());

@@ -31,11 +31,8 @@ PlistDictionary errorDictionary(const OptionalError& error) {
 }
 
 void reply(sdbus::MethodCall& call, std::string_view signature, const PlistArray& values) {
-  if (call.doesntExpectReply()) return;
   try {
-    sdbus::MethodReply answer = call.createReply();
-    DBusValueCodec::writeAll(answer, signature, values);
-    answer.send();
+    DBusValueCodec::reply(call, signature, values);
   } catch (const sdbus::Error& error) {
     TILL_LOG(2, "%@: Answer to %@ not delivered: %@", kSpeaker, call.getSender(),
              error.getMessage());

@@ -344,4 +344,12 @@ std::string DBusValueCodec::naturalSignature(const PlistValue& value) {
   return "s";
 }
 
+void DBusValueCodec::reply(sdbus::MethodCall& call, std::string_view signature,
+                           const PlistArray& values) {
+  if (call.doesntExpectReply()) return;
+  sdbus::MethodReply message = call.createReply();
+  writeAll(message, signature, values);
+  message.send();
+}
+
 }  // namespace larder

@@ -35,6 +35,11 @@ class DBusValueCodec {
   static void writeAll(sdbus::Message& message, std::string_view signature,
                        const PlistArray& values);
 
+  // Sends the reply of `call` with `values` written by `signature`; nothing
+  // for a call sent without wanting one. Throws sdbus::Error as writing and
+  // sending do.
+  static void reply(sdbus::MethodCall& call, std::string_view signature, const PlistArray& values);
+
   // s, b, x, t, d, ay, d (dates), av, a{sv}, t (UIDs).
   static std::string naturalSignature(const PlistValue& value);
 };

@@ -81,7 +81,7 @@ void ServiceClient::exportSoftwareMapObserver(
       [onChange = std::move(onChange)](sdbus::MethodCall call) {
         PlistArray arguments = DBusValueCodec::readAll(call, "a{sv}x");
         onChange(arguments.at(0), arguments.at(1).int64Value());
-        if (!call.doesntExpectReply()) call.createReply().send();
+        DBusValueCodec::reply(call, "", {});
       });
   observer_->finishRegistration();
 }

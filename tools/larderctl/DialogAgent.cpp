@@ -22,10 +22,7 @@ int makeEventDescriptor() {
 }
 
 void sendAnswer(sdbus::MethodCall& call, const DialogAgentProtocol::Answer& answer) {
-  if (call.doesntExpectReply()) return;
-  sdbus::MethodReply reply = call.createReply();
-  DBusValueCodec::writeAll(reply, "xa{sv}", {answer.exitCode, answer.values});
-  reply.send();
+  DBusValueCodec::reply(call, "xa{sv}", {answer.exitCode, answer.values});
 }
 
 }  // namespace
