@@ -120,7 +120,9 @@ void DialogAgentRegistry::present(const VendDialog& dialog, Reply reply) {
   if (ticket == 0) {
     TILL_LOG(2, "%@: No dialog agent; dialog %@ \"%@\" counts as cancelled", kSpeaker,
              dialog.identifier(), dialog.message());
-    reply(cancelledAnswer());
+    VendDialogAnswer answer = cancelledAnswer();
+    answer.nobodyAsked = true;
+    reply(std::move(answer));
     return;
   }
   TILL_LOG(2, "%@: Dialog %@ goes to agent %@ %@", kSpeaker, dialog.identifier(), agent.peer,

@@ -67,6 +67,7 @@ ServiceListener::ServiceListener(std::string serviceName, SoftwareMap& softwareM
     : serviceName_(std::move(serviceName)), softwareMap_(softwareMap) {}
 
 ServiceListener::~ServiceListener() {
+  if (storeRuntime_) storeRuntime_->withdraw();
   if (connection_) connection_->leaveEventLoop();
 }
 
@@ -108,6 +109,7 @@ void ServiceListener::resume() {
 
 void ServiceListener::stopServing() {
   if (!connection_) return;
+  if (storeRuntime_) storeRuntime_->withdraw();
   answerPendingCallsStopping();
   try {
     connection_->releaseName(serviceName_);

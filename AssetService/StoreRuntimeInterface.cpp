@@ -56,6 +56,16 @@ void StoreRuntimeInterface::exportOn(sdbus::IObject& object) {
        {"Purchase", &StoreRuntimeInterface::purchase},
        {"Downloads", &StoreRuntimeInterface::downloads}},
       shared_from_this());
+  object.registerSignal(std::string(StoreRuntimeProtocol::kInterfaceName),
+                        std::string(StoreRuntimeProtocol::kDownloadEndedSignal),
+                        std::string(StoreRuntimeProtocol::kDownloadEndedSignature));
+  MutexLock lock(objectMutex_);
+  object_ = &object;
+}
+
+void StoreRuntimeInterface::withdraw() {
+  MutexLock lock(objectMutex_);
+  object_ = nullptr;
 }
 
 void StoreRuntimeInterface::signIn(sdbus::MethodCall call) {
@@ -83,14 +93,49 @@ void StoreRuntimeInterface::purchase(sdbus::MethodCall call) {
   TillPurchase purchase = TillPurchase::purchaseWithBuyParameters(*arguments[1].string());
   purchase.setItemIdentifier(arguments[0].uint64Value());
   purchase.setPurchaseType(2);  // started by the user
+  // The downloads are started here rather than by the purchase, so that the
+  // client hears how each one ended instead of guessing from the disk.
   toolProxy().transactionService()->performPurchase(
-      std::move(purchase), {}, 0,
-      [call](const std::optional<TillPurchaseResponse>& response, bool success,
-             const OptionalError& error) mutable {
+      std::move(purchase), {}, VendTransactionService::kLeaveDownloadsToCaller,
+      [self = shared_from_this(), call](const std::optional<TillPurchaseResponse>& response,
+                                        bool success, const OptionalError& error) mutable {
+        if (response) self->startDownloads(response->downloads());
         reply(call, "ba{sv}aa{sv}",
               {success, errorDictionary(error),
                response ? downloadList(response->downloads()) : PlistArray{}});
       });
+}
+
+void StoreRuntimeInterface::startDownloads(
+    const std::vector<std::shared_ptr<TillDownload>>& downloads) {
+  const std::shared_ptr<VendDownloadService> service = toolProxy().downloadService();
+  for (const auto& download : downloads) {
+    download->setDownloadType(TillDownload::kInstall);
+    service->performDownload(
+        download, 0,
+        [self = shared_from_this(), download](std::int64_t result, const OptionalError& error) {
+          self->announceDownloadEnded(*download, result == 1, error);
+        });
+  }
+}
+
+void StoreRuntimeInterface::announceDownloadEnded(const TillDownload& download, bool success,
+                                                  const OptionalError& error) {
+  TILL_LOG(2, "%@: Download of %@ ended: %@", kSpeaker, download.description(),
+           error ? error->descriptionText() : std::string(success ? "installed" : "failed"));
+  MutexLock lock(objectMutex_);
+  if (!object_) return;
+  try {
+    sdbus::Signal signal =
+        object_->createSignal(std::string(StoreRuntimeProtocol::kInterfaceName),
+                              std::string(StoreRuntimeProtocol::kDownloadEndedSignal));
+    DBusValueCodec::writeAll(signal, StoreRuntimeProtocol::kDownloadEndedSignature,
+                             {download.toDictionary(), success, errorDictionary(error)});
+    object_->emitSignal(signal);
+  } catch (const sdbus::Error& failure) {
+    TILL_LOG(2, "%@: The end of %@ not announced: %@", kSpeaker, download.description(),
+             failure.getMessage());
+  }
 }
 
 void StoreRuntimeInterface::downloads(sdbus::MethodCall call) {

@@ -36,6 +36,22 @@ bool isDaemonMode(int argc, const char** argv) {
   return argc == 2 && std::strcmp(argv[1], "daemon") == 0;
 }
 
+// Any other argument means no argument, so `larderd --help` starts the
+// service all the same; whoever typed it learns what happened.
+void tellAboutIgnoredArguments(int argc, const char** argv, const char* serviceName) {
+  if (argc == 1 || isDaemonMode(argc, argv)) return;
+  std::string words;
+  for (int index = 1; index < argc; ++index) {
+    words += words.empty() ? "\"" : " \"";
+    words += argv[index];
+    words += '"';
+  }
+  std::fprintf(stderr,
+               "larderd %s: ignoring %s (the only argument is \"daemon\"); serving as %s. "
+               "larderctl talks to the service; see larderd(8).\n",
+               LARDER_VERSION, words.c_str(), serviceName);
+}
+
 // Waits, at most `kStopWriteBound`, for what the map and the update queues
 // have queued for the disk.
 bool finishPendingWrites() {
@@ -73,14 +89,17 @@ int main(int argc, const char** argv) {
   }
   StopSignals::block();
   const bool daemonMode = isDaemonMode(argc, argv);
+  const char* serviceName = daemonMode ? kDaemonServiceName : kServiceName;
+  tellAboutIgnoredArguments(argc, argv, serviceName);
   TillLogManager::sharedManager().logLevel(3, "int main(int, const char **)", __FILE__, __LINE__,
                                            "%s %@", "int main(int, const char **)",
                                            daemonMode ? "daemon" : "");
+  TILL_LOG(2, "larderd %@ serving as %@", LARDER_VERSION, serviceName);
   UserNotificationCenterDelegate::sharedInstance().start();
   SoftwareMap& softwareMap = SoftwareMap::sharedInstance();
   auto delegate = std::make_shared<AssetServiceDelegate>("AssetService");
   // Never released: the listener serves until the process ends.
-  static ServiceListener listener(daemonMode ? kDaemonServiceName : kServiceName, softwareMap);
+  static ServiceListener listener(serviceName, softwareMap);
   listener.setDelegate(delegate);
   // Dialogs of the runtime go to the agents that clients register.
   auto dialogAgents = std::make_shared<DialogAgentRegistry>();

@@ -2,6 +2,7 @@
 
 #include <stdexcept>
 
+#include "client/BusFailureText.h"
 #include "client/DBusValueCodec.h"
 #include "client/DialogAgentProtocol.h"
 #include "client/ServiceError.h"
@@ -12,11 +13,29 @@
 
 namespace larder {
 
+namespace {
+
+bool wantsSystemBus() {
+  return Environment::variable("LARDER_BUS") == "system";
+}
+
+std::unique_ptr<sdbus::IConnection> openBus() {
+  try {
+    return wantsSystemBus() ? sdbus::createSystemBusConnection()
+                            : sdbus::createSessionBusConnection();
+  } catch (const sdbus::Error& error) {
+    throw sdbus::Error(
+        error.getName(),
+        BusFailureText::forConnection(error.getMessage(), wantsSystemBus() ? "system" : "session"));
+  }
+}
+
+}  // namespace
+
 ServiceClient::ServiceClient(const std::string& serviceName, std::uint64_t timeoutMicroseconds)
-    : ServiceClient(Environment::variable("LARDER_BUS") == "system"
-                        ? sdbus::createSystemBusConnection()
-                        : sdbus::createSessionBusConnection(),
-                    serviceName, timeoutMicroseconds) {}
+    : ServiceClient(openBus(), serviceName, timeoutMicroseconds) {
+  busName_ = wantsSystemBus() ? "system" : "session";
+}
 
 ServiceClient::ServiceClient(std::unique_ptr<sdbus::IConnection> connection,
                              const std::string& serviceName, std::uint64_t timeoutMicroseconds)
@@ -37,12 +56,9 @@ PlistArray ServiceClient::call(const std::string& member, const PlistArray& argu
                                std::uint64_t timeoutMicroseconds) {
   const RequestSignature* request = ServiceRequests::find(member);
   if (!request) throw ServiceError::unknownRequest(ServiceRequests::kInterfaceName, member);
-  sdbus::MethodCall message =
-      proxy_->createMethodCall(std::string(ServiceRequests::kInterfaceName), member);
-  DBusValueCodec::writeAll(message, request->inSignature, arguments);
-  sdbus::MethodReply reply =
-      proxy_->callMethod(message, timeoutMicroseconds != 0 ? timeoutMicroseconds : timeout_);
-  return DBusValueCodec::readAll(reply, request->outSignature);
+  return callMethod(ServiceRequests::kInterfaceName,
+                    BusMethod{request->member, request->inSignature, {}, request->outSignature, {}},
+                    arguments, timeoutMicroseconds);
 }
 
 PlistArray ServiceClient::callDialogAgents(const std::string& member, const PlistArray& arguments,
@@ -64,12 +80,19 @@ PlistArray ServiceClient::callStoreRuntime(const std::string& member, const Plis
 PlistArray ServiceClient::callMethod(std::string_view interfaceName, const BusMethod& method,
                                      const PlistArray& arguments,
                                      std::uint64_t timeoutMicroseconds) {
+  const std::uint64_t timeout = timeoutMicroseconds != 0 ? timeoutMicroseconds : timeout_;
   sdbus::MethodCall message =
       proxy_->createMethodCall(std::string(interfaceName), std::string(method.member));
   DBusValueCodec::writeAll(message, method.inSignature, arguments);
-  sdbus::MethodReply reply =
-      proxy_->callMethod(message, timeoutMicroseconds != 0 ? timeoutMicroseconds : timeout_);
-  return DBusValueCodec::readAll(reply, method.outSignature);
+  try {
+    sdbus::MethodReply reply = proxy_->callMethod(message, timeout);
+    return DBusValueCodec::readAll(reply, method.outSignature);
+  } catch (const sdbus::Error& error) {
+    const BusFailureText::Call call{serviceName_, busName_, method.member,
+                                    static_cast<double>(timeout) / 1e6};
+    throw sdbus::Error(error.getName(),
+                       BusFailureText::forCall(error.getName(), error.getMessage(), call));
+  }
 }
 
 void ServiceClient::exportSoftwareMapObserver(
@@ -84,6 +107,38 @@ void ServiceClient::exportSoftwareMapObserver(
         DBusValueCodec::reply(call, "", {});
       });
   observer_->finishRegistration();
+}
+
+void ServiceClient::watchDownloadEndings(
+    std::function<void(const PlistValue&, bool, const PlistValue&)> onEnded) {
+  const std::string rule = "type='signal',sender='" + serviceName_ + "',interface='" +
+                           std::string(StoreRuntimeProtocol::kInterfaceName) + "',member='" +
+                           std::string(StoreRuntimeProtocol::kDownloadEndedSignal) + "'";
+  matches_.push_back(
+      connection_->addMatch(rule, [onEnded = std::move(onEnded)](sdbus::Message& signal) {
+        PlistArray values;
+        try {
+          values = DBusValueCodec::readAll(signal, StoreRuntimeProtocol::kDownloadEndedSignature);
+        } catch (const sdbus::Error&) {
+          return;  // not what the service sends: nothing to tell
+        }
+        onEnded(values.at(0), values.at(1).boolValue(), values.at(2));
+      }));
+}
+
+void ServiceClient::watchServiceOwner(std::function<void(bool)> onChange) {
+  const std::string rule =
+      "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop.DBus',"
+      "member='NameOwnerChanged',path='/org/freedesktop/DBus',arg0='" +
+      serviceName_ + "'";
+  matches_.push_back(
+      connection_->addMatch(rule, [onChange = std::move(onChange)](sdbus::Message& signal) {
+        std::string name;
+        std::string oldOwner;
+        std::string newOwner;
+        signal >> name >> oldOwner >> newOwner;
+        onChange(!newOwner.empty());
+      }));
 }
 
 }  // namespace larder

@@ -5,6 +5,7 @@
 
 #include <memory>
 #include <string>
+#include <vector>
 #include "client/BusMethod.h"
 
 #include <sdbus-c++/IConnection.h>
@@ -28,8 +29,10 @@ class ServiceClient {
   void presentStoreClient(std::int64_t clientType);
 
   // Calls `member`; the reply's arguments in order. Throws sdbus::Error on
-  // a D-Bus error, and ServiceError (UnknownRequest) for a member the
-  // client does not know, without sending anything.
+  // a D-Bus error, by its name, with a message for a person (what failed,
+  // with what, what to do: see BusFailureText), and ServiceError
+  // (UnknownRequest) for a member the client does not know, without
+  // sending anything.
   // A timeout of 0 is the client's.
   PlistArray call(const std::string& member, const PlistArray& arguments,
                   std::uint64_t timeoutMicroseconds = 0);
@@ -46,6 +49,16 @@ class ServiceClient {
   void exportSoftwareMapObserver(const std::string& objectPath,
                                  std::function<void(const PlistValue&, std::int64_t)> onChange);
 
+  // Hands every download the service reports ended (see
+  // StoreRuntimeProtocol::kDownloadEndedSignal) to `onEnded`, on the
+  // client's bus thread: the download, success, the error dictionary.
+  void watchDownloadEndings(
+      std::function<void(const PlistValue& download, bool success, const PlistValue& error)>
+          onEnded);
+  // Tells `onChange` each time the service's name gains an owner (true: the
+  // service started again) or loses it (false), on the client's bus thread.
+  void watchServiceOwner(std::function<void(bool present)> onChange);
+
   sdbus::IConnection& connection() { return *connection_; }
   [[nodiscard]] const std::string& serviceName() const { return serviceName_; }
 
@@ -55,8 +68,10 @@ class ServiceClient {
 
   std::unique_ptr<sdbus::IConnection> connection_;
   std::string serviceName_;
+  std::string busName_ = "session";
   std::unique_ptr<sdbus::IProxy> proxy_;
   std::unique_ptr<sdbus::IObject> observer_;
+  std::vector<sdbus::Slot> matches_;
   std::uint64_t timeout_;
 };
 

@@ -12,7 +12,7 @@ constexpr std::string_view kSpeaker = "VendCancellingDialogPresenter";
 void VendCancellingDialogPresenter::present(const VendDialog& dialog, Reply reply) {
   TILL_LOG(2, "%@: No one to show dialog %@ (\"%@\") to; it counts as cancelled", kSpeaker,
            dialog.identifier(), dialog.message());
-  reply(VendDialogAnswer{VendDialogButton::kCancel, {}});
+  reply(VendDialogAnswer{VendDialogButton::kCancel, {}, true});
 }
 
 void VendCancellingDialogPresenter::dismiss(std::string_view dialogIdentifier,

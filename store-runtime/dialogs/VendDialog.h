@@ -72,6 +72,9 @@ struct VendDialogAnswer {
   std::int64_t exitCode = VendDialogButton::kCancel;
   // Extra answers: "accountName" and "password" for a sign-in dialog.
   PlistDictionary values;
+  // No one saw the dialog (no agent to show it): the cancel is nobody's
+  // choice, and an error should say so.
+  bool nobodyAsked = false;
 };
 
 }  // namespace larder

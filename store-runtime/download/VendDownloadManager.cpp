@@ -144,10 +144,11 @@ struct VendDownloadManager::Outcome {
   enum class Kind { kSucceeded, kFailed, kInterrupted };
   Kind kind = Kind::kSucceeded;
   OptionalError error;
+  std::optional<std::string> installedPath;
 
   static Outcome succeeded() { return {}; }
-  static Outcome failed(VendError error) { return {Kind::kFailed, std::move(error)}; }
-  static Outcome interrupted() { return {Kind::kInterrupted, std::nullopt}; }
+  static Outcome failed(VendError error) { return {Kind::kFailed, std::move(error), {}}; }
+  static Outcome interrupted() { return {Kind::kInterrupted, std::nullopt, {}}; }
 };
 
 VendDownloadManager::VendDownloadManager(const VendRuntimeConfiguration& configuration)
@@ -342,6 +343,7 @@ void VendDownloadManager::finish(const Job& job, const Outcome& outcome) {
     fields.status.isPaused = false;
     fields.status.isFailed = !success;
     if (success) fields.progress = 1;
+    fields.installedPath = outcome.installedPath;
   });
   if (success) {
     TILL_LOG(2, "%@: Download of %@ finished", kSpeaker, job.download->description());
@@ -431,6 +433,7 @@ VendDownloadManager::Outcome VendDownloadManager::installAssets(const TillDownlo
       outcome = Outcome::failed(std::move(*result.error));
       break;
     }
+    outcome.installedPath = std::move(result.installedPath);
   }
   if (!bundleIdentifier.empty()) locks_.unlock(bundleIdentifier);
   return outcome;

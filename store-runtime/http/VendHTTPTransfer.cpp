@@ -136,6 +136,11 @@ int reportProgress(void* context, curl_off_t expected, curl_off_t received, curl
   return 1;
 }
 
+// The query may carry an account's tokens; errors travel to clients and logs.
+std::string withoutQuery(const std::string& url) {
+  return url.substr(0, url.find_first_of("?#"));
+}
+
 VendError transferError(long code, std::string description) {
   VendError error;
   error.domain = std::string(VendHTTPTransfer::kErrorDomain);
@@ -279,6 +284,8 @@ VendHTTPTransfer::Result performOnce(const VendURLRequest& request,
   } else {
     result.error = transferError(code, curl().easyStrerror(code));
   }
+  // Which server, for the person who reads the error far from this log.
+  if (result.error) result.error->description += " (" + withoutQuery(request.url()) + ")";
   return result;
 }
 

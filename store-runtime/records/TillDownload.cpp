@@ -21,6 +21,7 @@ void putLocalFields(PlistDictionary& dictionary, const TillDownloadFields& field
   writer.put("status", PlistDictionary{{"isPaused", fields.status.isPaused},
                                        {"isFailed", fields.status.isFailed}});
   writer.put("progress", fields.progress);
+  writer.put("installedPath", fields.installedPath);
 }
 
 void putFields(PlistDictionary& dictionary, const TillDownloadFields& fields, Form form) {
@@ -87,6 +88,7 @@ std::shared_ptr<TillDownload> readDownload(const PlistDictionary& source, Form f
   fields.skipAssetDownloadIfNotAlreadyOnDisk =
       reader.boolean("skipAssetDownloadIfNotAlreadyOnDisk").value_or(false);
   fields.progress = reader.real("progress").value_or(0);
+  fields.installedPath = reader.string("installedPath");
   if (!readStatus(reader, fields.status) || !reader.ok()) return nullptr;
   if (fields.progress < 0 || fields.progress > 1) return nullptr;
   return std::make_shared<TillDownload>(std::move(fields));
@@ -162,6 +164,10 @@ void TillDownload::setStatus(TillDownloadStatus status) {
 
 double TillDownload::progress() const {
   return field(&TillDownloadFields::progress);
+}
+
+std::optional<std::string> TillDownload::installedPath() const {
+  return field(&TillDownloadFields::installedPath);
 }
 
 void TillDownload::setProgress(double fraction) {

@@ -32,6 +32,9 @@ struct TillDownloadFields {
   TillDownloadStatus status;
   // Share of the assets' bytes on disk and checked, 0 to 1.
   double progress = 0;
+  // Where an install put the bundle, once it has: the truth of an ended
+  // install, which a look-up by identifier is not while an older copy stays.
+  std::optional<std::string> installedPath;
 
   friend bool operator==(const TillDownloadFields&, const TillDownloadFields&) = default;
 };
@@ -72,6 +75,7 @@ class TillDownload {
   void setStatus(TillDownloadStatus status);
   [[nodiscard]] double progress() const;
   void setProgress(double fraction);
+  [[nodiscard]] std::optional<std::string> installedPath() const;
 
   // Keyed-archive form: "$class", the metadata and assets as records of
   // their own, and the local fields.
@@ -82,7 +86,7 @@ class TillDownload {
   // Wire form: the store's download dictionary, { "metadata": {...},
   // "assets": [...] }, plus the local fields "downloadType",
   // "relaunchAppWithBundleURL", "skipAssetDownloadIfNotAlreadyOnDisk",
-  // "status" { "isPaused", "isFailed" } and "progress".
+  // "status" { "isPaused", "isFailed" }, "progress" and "installedPath".
   [[nodiscard]] PlistDictionary toDictionary() const;
   // nullptr for a malformed download: a field of the wrong type, no
   // metadata, no assets, or an asset whose sizes and digests do not fit.

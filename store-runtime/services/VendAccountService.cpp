@@ -23,6 +23,14 @@ VendError cancelledError() {
   return error;
 }
 
+VendError nobodyAskedError() {
+  VendError error = cancelledError();
+  error.description =
+      "No one was asked to sign in: no dialog agent is registered with the service. Run "
+      "`larderctl agent` in a terminal of this session, or sign in first with `larderctl signin`.";
+  return error;
+}
+
 std::optional<VendAccount> accountFromAnswer(const PlistValue& answer) {
   const PlistValue& identifier = answer["accountID"];
   const PlistData* key = answer["signingKey"].data();
@@ -158,6 +166,7 @@ VendAccountService::SignInResult VendAccountService::askUserAndAuthenticate(
   const PlistValue values(answer.values);
   const std::string* name = values["accountName"].string();
   const std::string* password = values["password"].string();
+  if (answer.nobodyAsked) return {std::nullopt, nobodyAskedError()};
   if (answer.exitCode != VendDialogButton::kOK || !name || !password)
     return {std::nullopt, cancelledError()};
   return authenticateWithStore(*name, *password);

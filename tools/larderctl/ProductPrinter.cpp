@@ -6,6 +6,7 @@
 
 #include "client/DBusValueCodec.h"
 #include "platform/plist/JsonConversion.h"
+#include "tools/larderctl/ValueText.h"
 
 namespace larder {
 
@@ -60,8 +61,13 @@ void ProductPrinter::printProducts(const PlistValue& products) const {
     std::cout << JsonConversion::toJson(products).dump(2) << std::endl;
     return;
   }
+  const PlistArray* list = products.array();
+  if (!list || list->empty()) {
+    std::cout << "no store software is installed" << std::endl;
+    return;
+  }
   std::vector<Row> rows{{"BUNDLE ID", "VERSION", "ITEM ID", "PATH"}};
-  if (const PlistArray* list = products.array()) {
+  {
     for (const PlistValue& product : *list) rows.push_back(productRow(product));
     std::sort(rows.begin() + 1, rows.end());
   }
@@ -75,10 +81,7 @@ void ProductPrinter::printProduct(const PlistValue& product) const {
   }
   std::vector<Row> rows;
   if (const PlistDictionary* fields = product.dictionary()) {
-    for (const auto& [key, value] : *fields) {
-      rows.push_back(
-          {key, value.string() ? *value.string() : JsonConversion::toJson(value).dump()});
-    }
+    for (const auto& [key, value] : *fields) rows.push_back({key, ValueText::of(key, value)});
   }
   printTable(rows);
 }

@@ -1,20 +1,15 @@
 #include "tools/larderctl/StoreCommands.h"
 
-#include <chrono>
 #include <iostream>
-#include <map>
-#include <thread>
+#include <optional>
 
 #include "platform/plist/JsonConversion.h"
-#include "tools/larderctl/ProgressBar.h"
+#include "tools/larderctl/DownloadFollower.h"
+#include "tools/larderctl/ExitStatus.h"
+#include "tools/larderctl/Spinner.h"
 
 namespace larder {
 namespace {
-
-constexpr std::int64_t kAllDownloadTypes = 3;
-constexpr std::chrono::milliseconds kDownloadPollInterval{200};
-// How long an ended download may take to show up as installed software.
-constexpr std::chrono::seconds kInstalledSightingLimit{10};
 
 std::string describeDownload(const PlistValue& download) {
   const PlistValue& metadata = download["metadata"];
@@ -29,15 +24,16 @@ std::string describeDownload(const PlistValue& download) {
 
 }  // namespace
 
-int StoreCommands::reportFailure(const PlistValue& error) const {
+int StoreCommands::reportFailure(std::string_view what, const PlistValue& error) const {
   if (json_) {
     std::cout << JsonConversion::toJson(error).dump() << std::endl;
   } else {
     const std::string* description = error["description"].string();
-    std::cerr << "larderctl: " << (description ? *description : "failed") << " (code "
-              << error["code"].int64Value() << ")" << std::endl;
+    std::cerr << "larderctl: " << what
+              << " failed: " << (description ? *description : "the service gave no reason")
+              << " (code " << error["code"].int64Value() << ")" << std::endl;
   }
-  return 1;
+  return kExitFailure;
 }
 
 int StoreCommands::signIn(const std::string& accountName, std::optional<std::string> password) {
@@ -46,9 +42,13 @@ int StoreCommands::signIn(const std::string& accountName, std::optional<std::str
     std::getline(std::cin, line);
     password = line;
   }
-  PlistArray reply =
-      client_.callStoreRuntime("SignIn", {accountName, *password}, kPurchaseTimeoutMicroseconds);
-  if (!reply.at(0).boolValue()) return reportFailure(reply.at(2));
+  PlistArray reply;
+  {
+    Spinner spinner(stderr, "signing in as " + accountName);
+    reply =
+        client_.callStoreRuntime("SignIn", {accountName, *password}, kPurchaseTimeoutMicroseconds);
+  }
+  if (!reply.at(0).boolValue()) return reportFailure("signing in as " + accountName, reply.at(2));
   if (json_) {
     std::cout << JsonConversion::toJson(PlistDictionary{{"accountID", reply.at(1)}}).dump()
               << std::endl;
@@ -56,105 +56,65 @@ int StoreCommands::signIn(const std::string& accountName, std::optional<std::str
     std::cout << "signed in as " << accountName << " (account " << reply.at(1).uint64Value() << ")"
               << std::endl;
   }
-  return 0;
+  return kExitSuccess;
 }
 
 int StoreCommands::signOut() {
   client_.callStoreRuntime("SignOut", {});
-  return 0;
+  return kExitSuccess;
 }
 
 int StoreCommands::account() {
   PlistArray reply = client_.callStoreRuntime("PrimaryAccount", {});
   const PlistValue& account = reply.at(0);
-  if (json_) {
-    std::cout << JsonConversion::toJson(account).dump() << std::endl;
-    return 0;
-  }
   const std::string* name = account["orvaneID"].string();
-  if (!name) {
+  if (json_) {
+    std::cout << (name ? JsonConversion::toJson(account).dump() : "null") << std::endl;
+  } else if (name) {
+    std::cout << *name << " (account " << account["accountID"].uint64Value() << ")" << std::endl;
+  } else {
     std::cout << "nobody is signed in" << std::endl;
-    return 1;
   }
-  std::cout << *name << " (account " << account["accountID"].uint64Value() << ")" << std::endl;
-  return 0;
+  return name ? kExitSuccess : kExitFailure;
 }
 
 int StoreCommands::purchase(std::uint64_t itemIdentifier, const std::string& buyParameters,
                             bool wait) {
   const std::string parameters =
       buyParameters.empty() ? "itemId=" + std::to_string(itemIdentifier) : buyParameters;
-  PlistArray reply = client_.callStoreRuntime("Purchase", {itemIdentifier, parameters},
-                                              kPurchaseTimeoutMicroseconds);
-  if (!reply.at(0).boolValue()) return reportFailure(reply.at(1));
-  if (json_) {
-    std::cout << JsonConversion::toJson(reply.at(2)).dump() << std::endl;
-    return 0;
+  std::optional<DownloadFollower> follower;
+  if (wait) follower.emplace(client_, json_);
+  PlistArray reply;
+  {
+    Spinner spinner(stderr, "buying item " + std::to_string(itemIdentifier) + " from the store");
+    reply = client_.callStoreRuntime("Purchase", {itemIdentifier, parameters},
+                                     kPurchaseTimeoutMicroseconds);
   }
-  for (const PlistValue& download : *reply.at(2).array()) {
-    std::cout << "downloading " << describeDownload(download) << std::endl;
+  if (!reply.at(0).boolValue()) {
+    return reportFailure("the purchase of item " + std::to_string(itemIdentifier), reply.at(1));
   }
-  return wait ? followDownloads(*reply.at(2).array()) : 0;
-}
-
-int StoreCommands::followDownloads(const PlistArray& started) {
-  std::map<std::uint64_t, std::string> pending;
-  for (const PlistValue& download : started) {
-    const PlistValue& metadata = download["metadata"];
-    const std::string* title = metadata["title"].string();
-    pending.emplace(metadata["itemIdentifier"].uint64Value(), title ? *title : "");
-  }
-  ProgressBar bar(stderr);
-  int status = 0;
-  while (!pending.empty()) {
-    const PlistArray reply = client_.callStoreRuntime("Downloads", {kAllDownloadTypes});
-    std::map<std::uint64_t, double> progress;
-    for (const PlistValue& download : *reply.at(0).array()) {
-      const std::uint64_t item = download["metadata"]["itemIdentifier"].uint64Value();
-      if (!pending.contains(item) || download["status"]["isFailed"].boolValue()) continue;
-      progress.emplace(item, download["progress"].doubleValue());
+  const PlistArray& started = *reply.at(2).array();
+  if (json_ && !wait) std::cout << JsonConversion::toJson(started).dump() << std::endl;
+  if (!json_) {
+    if (started.empty()) std::cout << "the store sent nothing to download" << std::endl;
+    for (const PlistValue& download : started) {
+      std::cout << "downloading " << describeDownload(download) << std::endl;
     }
-    for (auto entry = pending.begin(); entry != pending.end();) {
-      if (progress.contains(entry->first)) {
-        bar.show(progress[entry->first], entry->second);
-        ++entry;
-        continue;
-      }
-      bar.clear();
-      if (!reportInstalled(entry->first, entry->second)) status = 1;
-      entry = pending.erase(entry);
-    }
-    if (!pending.empty()) std::this_thread::sleep_for(kDownloadPollInterval);
   }
-  return status;
-}
-
-// A download leaves the list when it has ended either way; the software
-// map tells which, once its live query has seen the bundle arrive.
-bool StoreCommands::reportInstalled(std::uint64_t itemIdentifier, const std::string& title) {
-  const auto deadline = std::chrono::steady_clock::now() + kInstalledSightingLimit;
-  do {
-    const PlistValue product = client_.call("ProductForItemIdentifier", {itemIdentifier}).at(0);
-    if (const std::string* path = product["bundlePath"].string()) {
-      std::cout << "installed " << title << " at " << *path << std::endl;
-      return true;
-    }
-    std::this_thread::sleep_for(kDownloadPollInterval);
-  } while (std::chrono::steady_clock::now() < deadline);
-  std::cerr << "larderctl: the download of " << title << " (" << itemIdentifier
-            << ") ended without an installed application; the service's log says why" << std::endl;
-  return false;
+  return follower ? follower->follow(started) : kExitSuccess;
 }
 
 int StoreCommands::downloads(std::int64_t typeMask) {
   PlistArray reply = client_.callStoreRuntime("Downloads", {typeMask});
+  const PlistArray& list = *reply.at(0).array();
   if (json_) {
-    std::cout << JsonConversion::toJson(reply.at(0)).dump() << std::endl;
-    return 0;
+    std::cout << JsonConversion::toJson(list).dump() << std::endl;
+  } else if (list.empty()) {
+    std::cout << "no downloads in progress" << std::endl;
+  } else {
+    for (const PlistValue& download : list) std::cout << describeDownload(download) << std::endl;
   }
-  for (const PlistValue& download : *reply.at(0).array())
-    std::cout << describeDownload(download) << std::endl;
-  return 0;
+  return kExitSuccess;
 }
 
 }  // namespace larder

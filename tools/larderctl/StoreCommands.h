@@ -22,15 +22,14 @@ class StoreCommands {
   int signIn(const std::string& accountName, std::optional<std::string> password);
   int signOut();
   int account();
-  // With `wait`, follows the downloads until they are installed, with a
-  // progress bar on a terminal; 1 when one of them did not end installed.
+  // With `wait`, follows the downloads until the service says how each
+  // ended, with a progress bar on a terminal; 1 when one of them was not
+  // installed.
   int purchase(std::uint64_t itemIdentifier, const std::string& buyParameters, bool wait);
   int downloads(std::int64_t typeMask);
 
  private:
-  int reportFailure(const PlistValue& error) const;
-  int followDownloads(const PlistArray& started);
-  bool reportInstalled(std::uint64_t itemIdentifier, const std::string& title);
+  int reportFailure(std::string_view what, const PlistValue& error) const;
 
   ServiceClient& client_;
   bool json_;

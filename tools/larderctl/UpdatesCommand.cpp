@@ -5,6 +5,8 @@
 #include <sstream>
 
 #include "platform/plist/JsonConversion.h"
+#include "tools/larderctl/ExitStatus.h"
+#include "tools/larderctl/Spinner.h"
 
 namespace larder {
 namespace {
@@ -32,6 +34,7 @@ int UpdatesCommand::run(bool check) {
   PlistValue error = PlistDictionary{};
   PlistValue available;
   if (check) {
+    Spinner spinner(stderr, "asking the store for updates");
     PlistArray reply =
         client_.call("CheckForUpdatesWithUserHasSeenUpdates", {false}, kCheckTimeoutMicroseconds);
     success = reply.at(0);
@@ -41,6 +44,7 @@ int UpdatesCommand::run(bool check) {
     available = client_.call("AvailableUpdates", {}).at(0);
   }
   const PlistValue incompatible = client_.call("IncompatibleUpdates", {}).at(0);
+  const PlistArray& updates = available.array() ? *available.array() : PlistArray{};
   if (json_) {
     printJson(success, available, incompatible, error);
   } else {
@@ -49,13 +53,15 @@ int UpdatesCommand::run(bool check) {
                 << " (code " << error["code"].int64Value() << "); showing what the service knew"
                 << std::endl;
     }
-    printTable(available.array() ? *available.array() : PlistArray{}, false);
+    // After a failed check an empty list says nothing about the store.
+    if (!updates.empty() || success.boolValue()) printTable(updates, false);
     if (const PlistArray* list = incompatible.array(); list && !list->empty()) {
       std::cout << "\nIncompatible with this machine:\n";
       printTable(*list, true);
     }
   }
-  return success.boolValue() ? 0 : 1;
+  if (!success.boolValue()) return kExitFailure;
+  return updates.empty() ? kExitNothingToDo : kExitSuccess;
 }
 
 void UpdatesCommand::printTable(const PlistArray& updates, bool incompatible) const {

@@ -16,8 +16,8 @@ class UpdatesCommand {
 
   UpdatesCommand(ServiceClient& client, bool json) : client_(client), json_(json) {}
 
-  // 0 when the list could be given; 1 when the check failed (the cached
-  // lists are still printed).
+  // 0 when there are updates; 3 (nothing to do) when there are none; 1
+  // when the check failed (what the service knew is still printed).
   int run(bool check);
 
  private:

@@ -1,0 +1,194 @@
+#include "tools/larderctl/CommandLine.h"
+
+#include <charconv>
+#include <cmath>
+#include <limits>
+
+namespace larder {
+namespace {
+
+// The longest wait a person may ask for: a day.
+constexpr double kLongestTimeoutSeconds = 86400;
+
+// A store item identifier as people type it: 1 to 2^64-1, digits only, so
+// that "-5" is refused rather than wrapped round to a huge number.
+const CLI::Validator& itemIdentifierCheck() {
+  static const CLI::Validator validator(
+      [](std::string& word) -> std::string {
+        std::uint64_t value = 0;
+        const char* end = word.data() + word.size();
+        const auto [stop, error] = std::from_chars(word.data(), end, value);
+        if (word.empty() || word.front() == '+' || error != std::errc() || stop != end ||
+            value == 0) {
+          return "a store item identifier is a whole number from 1 to " +
+                 std::to_string(std::numeric_limits<std::uint64_t>::max()) + ", not '" + word + "'";
+        }
+        return {};
+      },
+      "ITEM");
+  return validator;
+}
+
+// Seconds to wait: a finite number above 0, at most a day.
+const CLI::Validator& waitSeconds() {
+  static const CLI::Validator validator(
+      [](std::string& word) -> std::string {
+        double value = 0;
+        const char* end = word.data() + word.size();
+        const auto [stop, error] = std::from_chars(word.data(), end, value);
+        if (error != std::errc() || stop != end || !std::isfinite(value) || value <= 0 ||
+            value > kLongestTimeoutSeconds) {
+          return "seconds to wait are a number above 0 and at most " +
+                 std::to_string(static_cast<int>(kLongestTimeoutSeconds)) + ", not '" + word + "'";
+        }
+        return {};
+      },
+      "SECONDS");
+  return validator;
+}
+
+const CLI::Validator& delaySeconds() {
+  static const CLI::Validator validator(
+      [](std::string& word) -> std::string {
+        double value = 0;
+        const char* end = word.data() + word.size();
+        const auto [stop, error] = std::from_chars(word.data(), end, value);
+        if (error != std::errc() || stop != end || !std::isfinite(value) || value < 0 ||
+            value > kLongestTimeoutSeconds) {
+          return "a delay is a number of seconds from 0 to " +
+                 std::to_string(static_cast<int>(kLongestTimeoutSeconds)) + ", not '" + word + "'";
+        }
+        return {};
+      },
+      "SECONDS");
+  return validator;
+}
+
+}  // namespace
+
+CommandLine::CommandLine() : app_("larderctl: talk to the larder store service", "larderctl") {
+  app_.require_subcommand(1);
+  app_.fallthrough();
+  app_.set_version_flag("--version", LARDER_VERSION, "print the version and exit");
+  app_.footer(
+      "Exit status: 0 success; 1 the operation failed or the service could not be reached; 2 "
+      "the command line was wrong; 3 nothing to do (updates: none available).");
+  addGlobalOptions();
+  addSoftwareMapCommands();
+  addDialogCommands();
+  addStoreCommands();
+  addOtherCommands();
+}
+
+const CLI::App* CommandLine::chosen() const {
+  const auto parsed = app_.get_subcommands();
+  return parsed.empty() ? nullptr : parsed.front();
+}
+
+bool CommandLine::chose(std::string_view name) const {
+  const CLI::App* command = chosen();
+  return command != nullptr && command->get_name() == name;
+}
+
+bool CommandLine::knows(const std::string& name) const {
+  try {
+    return app_.get_subcommand(name) != nullptr;
+  } catch (const CLI::OptionNotFound&) {
+    return false;
+  }
+}
+
+void CommandLine::addGlobalOptions() {
+  app_.add_flag("--json", global.json, "print JSON instead of text");
+  app_.add_flag("--daemon", global.daemon, "talk to com.orvane.larderd.daemon");
+  app_.add_option("--client-type", global.clientType,
+                  "store client type to present: 0 store application, 1 book application, 2 "
+                  "device configuration tool, 3 metadata search, 4 web browser")
+      ->check(CLI::Range(0, 4));
+  global.timeoutOption =
+      app_.add_option("--timeout", global.timeoutSeconds, "seconds to wait for a reply")
+          ->check(waitSeconds());
+}
+
+void CommandLine::addSoftwareMapCommands() {
+  app_.add_subcommand("products", "list the installed store software");
+  auto* product = app_.add_subcommand("product", "show one product");
+  auto* byBundle = product->add_option("--bundle-id", bundleIdentifier, "bundle identifier");
+  auto* byItem = product->add_option("--item-id", itemIdentifier, "store item identifier")
+                     ->check(itemIdentifierCheck());
+  byBundle->excludes(byItem);
+  product->callback([this] {
+    if (bundleIdentifier.empty() && !itemIdentifier) {
+      throw CLI::ValidationError("give --bundle-id or --item-id");
+    }
+  });
+  app_.add_subcommand("watch", "print software map changes until interrupted");
+  auto* call = app_.add_subcommand("call", "call any request: call METHOD ARGS...");
+  call->add_option("method", member, "D-Bus method name, e.g. ProductForBundleIdentifier")
+      ->required();
+  call->add_option("arguments", words, "arguments; containers as JSON");
+}
+
+void CommandLine::addDialogCommands() {
+  auto* agentCommand = app_.add_subcommand(
+      "agent", "answer the service's dialogs, at the terminal or with a fixed answer");
+  agentCommand->add_option("--answer", agent.answer, "answer every dialog so: ok, cancel or other")
+      ->check(CLI::IsMember({"ok", "cancel", "other"}));
+  auto* accountOption =
+      agentCommand->add_option("--account", agent.accountName, "account name for sign-in dialogs");
+  auto* passwordOption =
+      agentCommand->add_option("--password", agent.password, "password for sign-in dialogs");
+  accountOption->needs(passwordOption);
+  passwordOption->needs(accountOption);
+  agentCommand->add_option("--count", agent.count, "exit after this many dialogs")
+      ->check(CLI::PositiveNumber);
+  agentCommand
+      ->add_option("--delay", agent.delaySeconds, "seconds to wait before giving a fixed answer")
+      ->check(delaySeconds());
+  agentCommand->callback([this, accountOption] {
+    agent.json = global.json;
+    if (agent.answer.empty() && (accountOption->count() > 0 || agent.delaySeconds > 0)) {
+      throw CLI::ValidationError("--account, --password and --delay go with --answer");
+    }
+  });
+  auto* dialogCommand =
+      app_.add_subcommand("dialog", "show a dialog through the service and print its exit code");
+  dialogCommand->add_option("--message", dialog.message, "title of the dialog")->required();
+  dialogCommand->add_option("--explanation", dialog.explanation, "body text");
+  dialogCommand->add_option("--ok", dialog.okButton, "title of the OK button (exit code 1)");
+  dialogCommand->add_option("--cancel", dialog.cancelButton,
+                            "title of the cancel button (exit code 0)");
+  dialogCommand->add_option("--other", dialog.otherButton,
+                            "title of the other button (exit code 2)");
+}
+
+void CommandLine::addStoreCommands() {
+  auto* signin = app_.add_subcommand("signin", "sign an account in with the store");
+  signin->add_option("account", accountName, "account name")->required();
+  signin->add_option("--password", password, "password (read from standard input when not given)");
+  app_.add_subcommand("signout", "sign the primary account out");
+  app_.add_subcommand("account", "show the primary account (exit status 1 when nobody is)");
+  auto* purchase = app_.add_subcommand(
+      "purchase", "buy an item and install its download, following it to its end");
+  purchase->add_option("item", purchaseItem, "store item identifier")
+      ->required()
+      ->check(itemIdentifierCheck());
+  purchase->add_option("--buy-params", buyParameters,
+                       "the store's buy parameters (default itemId=ITEM)");
+  purchase->add_flag("--no-wait", noWait,
+                     "return once the store has answered, without following the install");
+  auto* downloads = app_.add_subcommand("downloads", "list the downloads in progress");
+  downloads
+      ->add_option("--mask", downloadMask, "download types: 1 install, 2 stage, 3 both (default)")
+      ->check(CLI::Range(1, 3));
+  auto* updates = app_.add_subcommand(
+      "updates", "list the updates known for the installed software (exit status 3: none)");
+  updates->add_flag("--check", checkFirst, "ask the store first");
+}
+
+void CommandLine::addOtherCommands() {
+  auto* dmapDump = app_.add_subcommand("dmap-dump", "decode a DMAP document and print it as JSON");
+  dmapDump->add_option("file", dmapFile, "the document; - for standard input")->required();
+}
+
+}  // namespace larder
