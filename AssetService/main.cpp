@@ -11,6 +11,7 @@
 
 #include "AssetService/AssetServiceDelegate.h"
 #include "AssetService/DialogAgentRegistry.h"
+#include "AssetService/ServiceEntry.h"
 #include "AssetService/ServiceListener.h"
 #include "AssetService/StoreRuntimeInterface.h"
 #include "notifications/UserNotificationCenterDelegate.h"
@@ -25,15 +26,13 @@
 
 namespace {
 
-constexpr const char* kProfileName = "com.orvane.larderd";
-constexpr const char* kServiceName = "com.orvane.larderd";
-constexpr const char* kDaemonServiceName = "com.orvane.larderd.daemon";
+using larder::ServiceEntry;
 
 // How long the writes queued before a stop may take to reach the disk.
 constexpr std::chrono::seconds kStopWriteBound{2};
 
 bool isDaemonMode(int argc, const char** argv) {
-  return argc == 2 && std::strcmp(argv[1], "daemon") == 0;
+  return argc == 2 && std::strcmp(argv[1], ServiceEntry::kDaemonArgument) == 0;
 }
 
 // Any other argument means no argument, so `larderd --help` starts the
@@ -83,13 +82,14 @@ bool finishPendingWrites() {
 
 int main(int argc, const char** argv) {
   using namespace larder;
-  if (auto confined = Confinement::confine(kProfileName); !confined) {
+  if (auto confined = Confinement::confine(ServiceEntry::kProfileName); !confined) {
     std::fprintf(stderr, "confinement: %s\n", confined.error().description.c_str());
     return -1;
   }
   StopSignals::block();
   const bool daemonMode = isDaemonMode(argc, argv);
-  const char* serviceName = daemonMode ? kDaemonServiceName : kServiceName;
+  const char* serviceName =
+      daemonMode ? ServiceEntry::kDaemonServiceName : ServiceEntry::kServiceName;
   tellAboutIgnoredArguments(argc, argv, serviceName);
   TillLogManager::sharedManager().logLevel(3, "int main(int, const char **)", __FILE__, __LINE__,
                                            "%s %@", "int main(int, const char **)",

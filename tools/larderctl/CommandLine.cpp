@@ -66,7 +66,7 @@ const CLI::Validator& delaySeconds() {
 
 }  // namespace
 
-CommandLine::CommandLine() : app_("larderctl: talk to the larder store service", "larderctl") {
+CommandLine::CommandLine() : app_("talk to the larder store service", "larderctl") {
   app_.require_subcommand(1);
   app_.fallthrough();
   app_.set_version_flag("--version", LARDER_VERSION, "print the version and exit");
