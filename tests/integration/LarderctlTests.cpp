@@ -122,13 +122,20 @@ TEST_F(LarderctlTest, WithoutServiceOrBusTheErrorSaysWhatToLookAt) {
       << ran.errors;
 }
 
-TEST_F(LarderctlTest, AStoreThatIsAwayIsNamedAndAFailedCheckClaimsNothing) {
+TEST_F(LarderctlTest, AStoreThatIsAwayOrFailsIsNamedAndAFailedCheckClaimsNothing) {
   startService(closedStoreURL());
-  const LarderctlRun ran = run({"updates", "--check"});
+  LarderctlRun ran = run({"updates", "--check"});
   EXPECT_EQ(ran.status, 1);
   EXPECT_TRUE(firstLine(ran.errors).starts_with("larderctl: the update check failed: "))
       << ran.errors;
   EXPECT_NE(firstLine(ran.errors).find("(" + closedStoreURL() + ")"), std::string::npos)
+      << ran.errors;
+  EXPECT_EQ(ran.output.find("No updates available"), std::string::npos) << ran.output;
+
+  startStoreAndService({"available-software-updates=500"});
+  ran = run({"updates", "--check"});
+  EXPECT_EQ(ran.status, 1);
+  EXPECT_TRUE(firstLine(ran.errors).starts_with("larderctl: the update check failed: "))
       << ran.errors;
   EXPECT_EQ(ran.output.find("No updates available"), std::string::npos) << ran.output;
 }
