@@ -29,39 +29,23 @@ const CLI::Validator& itemIdentifierCheck() {
   return validator;
 }
 
-// Seconds to wait: a finite number above 0, at most a day.
-const CLI::Validator& waitSeconds() {
-  static const CLI::Validator validator(
-      [](std::string& word) -> std::string {
+// A number of seconds, finite and at most a day: above 0 for a wait, from
+// 0 for a delay.
+CLI::Validator secondsCheck(bool zeroAllowed, std::string what) {
+  return CLI::Validator(
+      [zeroAllowed, what = std::move(what)](std::string& word) -> std::string {
         double value = 0;
         const char* end = word.data() + word.size();
         const auto [stop, error] = std::from_chars(word.data(), end, value);
-        if (error != std::errc() || stop != end || !std::isfinite(value) || value <= 0 ||
+        const bool inRange = zeroAllowed ? value >= 0 : value > 0;
+        if (error != std::errc() || stop != end || !std::isfinite(value) || !inRange ||
             value > kLongestTimeoutSeconds) {
-          return "seconds to wait are a number above 0 and at most " +
+          return what + (zeroAllowed ? " from 0" : " above 0") + " and at most " +
                  std::to_string(static_cast<int>(kLongestTimeoutSeconds)) + ", not '" + word + "'";
         }
         return {};
       },
       "SECONDS");
-  return validator;
-}
-
-const CLI::Validator& delaySeconds() {
-  static const CLI::Validator validator(
-      [](std::string& word) -> std::string {
-        double value = 0;
-        const char* end = word.data() + word.size();
-        const auto [stop, error] = std::from_chars(word.data(), end, value);
-        if (error != std::errc() || stop != end || !std::isfinite(value) || value < 0 ||
-            value > kLongestTimeoutSeconds) {
-          return "a delay is a number of seconds from 0 to " +
-                 std::to_string(static_cast<int>(kLongestTimeoutSeconds)) + ", not '" + word + "'";
-        }
-        return {};
-      },
-      "SECONDS");
-  return validator;
 }
 
 }  // namespace
@@ -107,7 +91,7 @@ void CommandLine::addGlobalOptions() {
       ->check(CLI::Range(0, 4));
   global.timeoutOption =
       app_.add_option("--timeout", global.timeoutSeconds, "seconds to wait for a reply")
-          ->check(waitSeconds());
+          ->check(secondsCheck(false, "seconds to wait are a number"));
 }
 
 void CommandLine::addSoftwareMapCommands() {
@@ -144,7 +128,7 @@ void CommandLine::addDialogCommands() {
       ->check(CLI::PositiveNumber);
   agentCommand
       ->add_option("--delay", agent.delaySeconds, "seconds to wait before giving a fixed answer")
-      ->check(delaySeconds());
+      ->check(secondsCheck(true, "a delay is a number of seconds"));
   agentCommand->callback([this, accountOption] {
     agent.json = global.json;
     if (agent.answer.empty() && (accountOption->count() > 0 || agent.delaySeconds > 0)) {
