@@ -92,6 +92,10 @@ class [[nodiscard]] Result<void> {
     assert(error_);
     return *error_;
   }
+  // Why it failed, for a log line; empty on success.
+  [[nodiscard]] std::string errorDescription() const {
+    return error_ ? error_->description : std::string();
+  }
 
  private:
   std::optional<VendError> error_;

@@ -3,9 +3,9 @@
 #include <algorithm>
 
 #include "platform/log/TillLogManager.h"
-#include "platform/system/Environment.h"
 #include "store-runtime/host/LedgerDockMessaging.h"
 #include "store-runtime/host/PlatformStateFile.h"
+#include "store-runtime/host/PreferenceStore.h"
 #include "store-runtime/host/VendDevice.h"
 
 namespace larder {
@@ -48,7 +48,7 @@ LedgerRootHelper& LedgerRootHelper::sharedInstance() {
 }
 
 std::string LedgerRootHelper::systemPreferencesPath() {
-  return Environment::rootedPath("/etc/larder/") + std::string(kSystemPreferencesDomain) + ".plist";
+  return PreferenceStore::pathFor(kSystemPreferencesDomain, PreferenceScope::System);
 }
 
 std::string LedgerRootHelper::lockedFilePathsPath() {

@@ -4,6 +4,7 @@
 #include <sys/file.h>
 
 #include <cerrno>
+#include <cstring>
 #include <filesystem>
 
 #include "platform/log/TillLogManager.h"
@@ -25,12 +26,16 @@ constexpr std::size_t kMaxStateBytes = 16u << 20u;
 class ExclusiveFileLock {
  public:
   explicit ExclusiveFileLock(const std::string& path) : descriptor_(openLockFile(path + ".lock")) {
-    if (!descriptor_.valid()) return;
+    if (!descriptor_.valid()) {
+      error_ = errno;
+      return;
+    }
     int result;
     do {
       result = ::flock(descriptor_.get(), LOCK_EX);
     } while (result != 0 && errno == EINTR);
     locked_ = result == 0;
+    if (!locked_) error_ = errno;
   }
   ~ExclusiveFileLock() {
     if (locked_) ::flock(descriptor_.get(), LOCK_UN);
@@ -39,6 +44,8 @@ class ExclusiveFileLock {
   ExclusiveFileLock& operator=(const ExclusiveFileLock&) = delete;
 
   [[nodiscard]] bool isLocked() const { return locked_; }
+  // The errno of the open or flock that failed.
+  [[nodiscard]] int error() const { return error_; }
 
  private:
   static int openLockFile(const std::string& lockPath) {
@@ -49,6 +56,7 @@ class ExclusiveFileLock {
 
   FileDescriptor descriptor_;
   bool locked_ = false;
+  int error_ = 0;
 };
 
 }  // namespace
@@ -75,20 +83,21 @@ PlistDictionary PlatformStateFile::readDictionary() const {
   return {};
 }
 
-bool PlatformStateFile::updateValue(const std::function<void(PlistValue&)>& change) const {
+Result<void> PlatformStateFile::update(const std::function<void(PlistValue&)>& change) const {
   ExclusiveFileLock lock(path_);
   if (!lock.isLocked()) {
-    TILL_LOG(1, "%@: Cannot lock state file %@", kSpeaker, path_);
-    return false;
+    return VendError::withDomain(std::string(FileIO::kErrorDomain), lock.error(),
+                                 "Cannot lock " + path_ + ".lock: " + std::strerror(lock.error()));
   }
   PlistValue value = read();
   change(value);
-  if (auto written = FileIO::writeAtomically(path_, PropertyListSerialization::writeXml(value));
-      !written) {
-    TILL_LOG(1, "%@: Cannot write state file %@: %@", kSpeaker, path_, written.error().description);
-    return false;
-  }
-  return true;
+  return FileIO::writeAtomically(path_, PropertyListSerialization::writeXml(value));
+}
+
+bool PlatformStateFile::updateValue(const std::function<void(PlistValue&)>& change) const {
+  Result<void> updated = update(change);
+  if (!updated) TILL_LOG(1, "%@: Cannot change state file %@: %@", kSpeaker, path_, updated.errorDescription());
+  return updated.has_value();
 }
 
 bool PlatformStateFile::updateDictionary(

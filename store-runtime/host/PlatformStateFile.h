@@ -4,6 +4,7 @@
 #include <string>
 #include <string_view>
 
+#include "platform/error/Result.h"
 #include "platform/value/PlistValue.h"
 
 namespace larder {
@@ -30,6 +31,10 @@ class PlatformStateFile {
   [[nodiscard]] PlistValue read() const;
   // The stored dictionary; empty when missing, damaged or of another type.
   [[nodiscard]] PlistDictionary readDictionary() const;
+
+  // Hands the current value (null when there is none) to `change` and
+  // stores what it leaves; the error says why the lock or the write failed.
+  Result<void> update(const std::function<void(PlistValue&)>& change) const;
 
   // Hands the current dictionary (empty when there is none) to `change`
   // and stores what it leaves. False when the lock or the write failed.

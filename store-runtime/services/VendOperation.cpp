@@ -105,11 +105,18 @@ void VendOperation::runOnce() {
   } catch (const std::exception& exception) {
     TILL_LOG(1, "%@: Exception running %@ - %@", kSpeaker, storeClient_.identifier(),
              exception.what());
-    setSuccess(false);
+    failForException(exception.what());
   } catch (...) {
     TILL_LOG(1, "%@: Unknown exception running %@", kSpeaker, storeClient_.identifier());
-    setSuccess(false);
+    failForException("unknown exception");
   }
+}
+
+// A run cut short by an exception has failed, whatever it had set before;
+// the caller and the delegate learn why unless the run had already said.
+void VendOperation::failForException(const std::string& what) {
+  setSuccess(false);
+  if (!error()) setError(VendError::make(0, std::nullopt, "The operation stopped: " + what));
 }
 
 void VendOperation::finish() {

@@ -82,6 +82,7 @@ class VendOperation : public std::enable_shared_from_this<VendOperation> {
 
  private:
   void runOnce();
+  void failForException(const std::string& what);
   void finish();
 
   VendStoreClient storeClient_;

@@ -12,6 +12,8 @@ std::string optionWords(const CLI::App& app) {
     for (const std::string& name : option->get_lnames()) words += " --" + name;
     for (const std::string& name : option->get_snames()) words += " -" + name;
   }
+  // A command's own commands ("prefs get") complete as its words too.
+  for (const CLI::App* action : app.get_subcommands({})) words += " " + action->get_name();
   return words.empty() ? words : words.substr(1);
 }
 

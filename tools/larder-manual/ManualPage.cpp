@@ -63,6 +63,20 @@ std::string ManualPage::escape(const std::string& text) {
   return escaped;
 }
 
+namespace {
+
+// A command, then its own commands under their full names ("prefs get").
+void writeCommand(std::ostream& out, const CLI::App& command, const std::string& parents) {
+  const std::string name = parents + command.get_name();
+  out << ".SS " << ManualPage::escape(name) << "\n" << ManualPage::escape(command.get_description()) << "\n";
+  writeOptions(out, command);
+  for (const CLI::App* action : command.get_subcommands({})) {
+    writeCommand(out, *action, name + " ");
+  }
+}
+
+}  // namespace
+
 void ManualPage::write(std::ostream& out, const CLI::App& app, const std::string& section,
                        const std::string& version, const std::string& synopsis,
                        const std::vector<Section>& extra) {
@@ -80,11 +94,7 @@ void ManualPage::write(std::ostream& out, const CLI::App& app, const std::string
   }
   if (!app.get_subcommands({}).empty()) {
     out << ".SH COMMANDS\n";
-    for (const CLI::App* command : app.get_subcommands({})) {
-      out << ".SS " << escape(command->get_name()) << "\n"
-          << escape(command->get_description()) << "\n";
-      writeOptions(out, *command);
-    }
+    for (const CLI::App* command : app.get_subcommands({})) writeCommand(out, *command, "");
   }
   for (const Section& part : extra) {
     out << ".SH " << escape(part.title) << "\n";

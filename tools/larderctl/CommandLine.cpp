@@ -62,6 +62,7 @@ CommandLine::CommandLine() : app_("talk to the larder store service", "larderctl
   addDialogCommands();
   addStoreCommands();
   addOtherCommands();
+  addPreferenceCommands();
 }
 
 const CLI::App* CommandLine::chosen() const {
@@ -72,6 +73,13 @@ const CLI::App* CommandLine::chosen() const {
 bool CommandLine::chose(std::string_view name) const {
   const CLI::App* command = chosen();
   return command != nullptr && command->get_name() == name;
+}
+
+std::string CommandLine::chosenAction() const {
+  const CLI::App* command = chosen();
+  if (command == nullptr) return {};
+  const auto actions = command->get_subcommands();
+  return actions.empty() ? std::string() : actions.front()->get_name();
 }
 
 bool CommandLine::knows(const std::string& name) const {
@@ -173,6 +181,34 @@ void CommandLine::addStoreCommands() {
 void CommandLine::addOtherCommands() {
   auto* dmapDump = app_.add_subcommand("dmap-dump", "decode a DMAP document and print it as JSON");
   dmapDump->add_option("file", dmapFile, "the document; - for standard input")->required();
+}
+
+void CommandLine::addPreferenceCommands() {
+  auto* prefs = app_.add_subcommand(
+      "prefs", "read and write preferences: prefs get|set|delete DOMAIN [KEY] [VALUE]");
+  prefs->require_subcommand(1);
+  prefs->footer(
+      "Domains: com.orvane.larderd (the service), com.orvane.quaymart (the store application), "
+      "com.orvane.SoftwareUpdate (software update). Scope app reads the user's value, else the "
+      "machine's, and writes the user's.");
+  auto* get = prefs->add_subcommand("get", "print a preference, or a whole domain without KEY");
+  auto* set = prefs->add_subcommand("set", "store a preference");
+  auto* remove = prefs->add_subcommand(
+      "delete", "remove a preference (exit status 3: there was none)");
+  for (CLI::App* action : {get, set, remove}) {
+    action->add_option("domain", preferences.domain, "preference domain")->required();
+    auto* key = action->add_option("key", preferences.key, "preference key");
+    if (action != get) key->required();
+    action->add_option("--scope", preferences.scope, "app (default), user or system")
+        ->check(CLI::IsMember({"app", "user", "system"}));
+  }
+  set->add_option("value", preferences.value,
+                  "the value: true/false, a number, an ISO 8601 date, JSON for containers, "
+                  "else text")
+      ->required();
+  set->add_option("--type", preferences.type, "read VALUE as bool, integer, real, string, date "
+                                              "or json")
+      ->check(CLI::IsMember({"bool", "integer", "real", "string", "date", "json"}));
 }
 
 }  // namespace larder

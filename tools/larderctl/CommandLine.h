@@ -8,6 +8,7 @@
 
 #include "tools/larderctl/DialogAgentCommand.h"
 #include "tools/larderctl/DialogCommand.h"
+#include "tools/larderctl/PreferencesOptions.h"
 
 namespace larder {
 
@@ -58,6 +59,10 @@ class CommandLine {
   bool checkFirst = false;
   // dmap-dump
   std::string dmapFile;
+  // prefs get|set|delete
+  PreferencesOptions preferences;
+  // The subcommand of a command that has them ("get" of "prefs get").
+  [[nodiscard]] std::string chosenAction() const;
 
  private:
   void addGlobalOptions();
@@ -65,6 +70,7 @@ class CommandLine {
   void addDialogCommands();
   void addStoreCommands();
   void addOtherCommands();
+  void addPreferenceCommands();
 
   CLI::App app_;
 };

@@ -9,7 +9,7 @@ enum ExitStatus : int {
   kExitFailure = 1,
   // The command line was wrong; nothing was tried.
   kExitUsage = 2,
-  // Nothing to do: `updates` found none.
+  // Nothing to do: `updates` found none, `prefs delete` found no such key.
   kExitNothingToDo = 3,
 };
 

@@ -13,6 +13,7 @@
 #include "tools/larderctl/DialogCommand.h"
 #include "tools/larderctl/DmapDumpCommand.h"
 #include "tools/larderctl/ExitStatus.h"
+#include "tools/larderctl/PreferencesCommand.h"
 #include "tools/larderctl/ProductPrinter.h"
 #include "tools/larderctl/StoreCommands.h"
 #include "tools/larderctl/UpdatesCommand.h"
@@ -108,6 +109,9 @@ int runStore(const CommandLine& line) {
 
 int runChosen(const CommandLine& line) {
   if (line.chose("dmap-dump")) return DmapDumpCommand(line.global.json).run(line.dmapFile);
+  if (line.chose("prefs")) {
+    return PreferencesCommand(line.global.json).run(line.chosenAction(), line.preferences);
+  }
   if (line.chose("products")) return runProducts(line);
   if (line.chose("product")) return runProduct(line);
   if (line.chose("watch")) return runWatch(line);
