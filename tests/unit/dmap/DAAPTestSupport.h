@@ -22,6 +22,9 @@ namespace larder {
 inline void PrintTo(const DAAPValue& value, std::ostream* out) {
   *out << value.description();
 }
+inline void PrintTo(const DAAPKey& key, std::ostream* out) {
+  *out << key.str();
+}
 
 }  // namespace larder
 
