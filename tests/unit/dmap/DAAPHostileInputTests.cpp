@@ -53,12 +53,6 @@ void expectShapeAndBound(const TopLevelCode& top, const PlistData& body) {
   EXPECT_EQ(value.toPlist().isNull(), value.isNull()) << top.code;
 }
 
-PlistData bodyOf(const std::vector<Tag>& tags) {
-  DAAPBuffer buffer;
-  for (const Tag& tag : tags) tag.writeTo(buffer);
-  return buffer.data();
-}
-
 TEST(DAAPHostileTest, HostileBodiesUnderEveryTopLevelCodeKeepTheCodesShapeAndStayBounded) {
   // Every code any parser knows with an empty value: nothing may be read
   // from an empty value.

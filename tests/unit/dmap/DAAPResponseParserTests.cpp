@@ -33,10 +33,9 @@ DAAPItemRef decodeItem(std::vector<Tag> children) {
 
 PlistData bigEndian(std::initializer_list<std::uint64_t> numbers, int width) {
   PlistData bytes;
-  for (const std::uint64_t number : numbers) {
-    for (int shift = 8 * (width - 1); shift >= 0; shift -= 8) {
-      bytes.push_back(static_cast<std::uint8_t>(number >> shift));
-    }
+  for (const std::uint64_t value : numbers) {
+    const PlistData one = number("", value, width).bytes;
+    bytes.insert(bytes.end(), one.begin(), one.end());
   }
   return bytes;
 }

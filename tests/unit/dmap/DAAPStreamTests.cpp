@@ -399,12 +399,6 @@ TEST(DAAPValueDecoderTest, TypeForDRCPValueTypeNamesEveryType) {
 
 // --------------------------------------------------------------- flavors
 
-PlistData bodyOf(const std::vector<Tag>& tags) {
-  DAAPBuffer buffer;
-  for (const auto& tag : tags) tag.writeTo(buffer);
-  return buffer.data();
-}
-
 DAAPDictionary flavor(std::uint32_t identifier) {
   return dictionaryOf({{"com.orvane.sonorel.item-flavor-id", std::int64_t{identifier}}});
 }

@@ -96,6 +96,13 @@ inline PlistData document(const Tag& top) {
   return buffer.data();
 }
 
+// Tags one after another, as a container's value.
+inline PlistData bodyOf(const std::vector<Tag>& tags) {
+  DAAPBuffer buffer;
+  for (const Tag& tag : tags) tag.writeTo(buffer);
+  return buffer.data();
+}
+
 inline DAAPValue decode(const Tag& top) {
   return DAAPParser::decodeData(document(top));
 }
