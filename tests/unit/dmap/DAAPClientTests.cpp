@@ -115,7 +115,6 @@ class FakeCloudLibrary {
       const auto found = headers.find(name);
       return found == headers.end() ? std::string() : found->second;
     }
-    [[nodiscard]] bool hasHeader(const std::string& name) const { return headers.contains(name); }
     [[nodiscard]] std::string bodyText() const { return {body.begin(), body.end()}; }
   };
   using Responder = std::function<Answer(const Received&)>;
@@ -544,11 +543,27 @@ TEST_F(DAAPClientTest, FirstPollFetchesEverythingAndComesInStep) {
   EXPECT_EQ(delegate_->tokenPairRequests(), 1);
 }
 
-TEST_F(DAAPClientTest, DelegateEventsCarryTheirInfoAndTheReason) {
+TEST_F(DAAPClientTest, EveryStepIsSignedWithTheClientsHeadersAndToldWithItsInfo) {
   signIn();
   service_.setRevision(3);
   service_.setItems({FakeCloudLibrary::item(1001, "First")}, {});
   auto client = startedClient(1);
+  ASSERT_EQ(service_.actions(), (std::vector<std::string>{"login", "update", "items"}));
+  for (const std::string action : {"login", "update", "items"}) {
+    const Received request = service_.received(action).at(0);
+    SCOPED_TRACE(action);
+    EXPECT_EQ(request.method, "POST");
+    EXPECT_TRUE(request.signatureValid);
+    EXPECT_EQ(request.header("X-Larder-Account-ID"), std::to_string(kAccountID));
+    EXPECT_EQ(request.header("Client-DAAP-Version"), "3.13");
+    EXPECT_EQ(request.header("Client-Cloud-Purchase-Daap-Version"), "2");
+    EXPECT_EQ(request.header("Client-Cloud-DAAP-Request-Reason"), "1");
+    EXPECT_EQ(request.header("X-Guid"), kMachineID);
+  }
+  EXPECT_EQ(service_.received("login").at(0).target, "/daap/login");
+  EXPECT_TRUE(service_.received("login").at(0).body.empty());
+  EXPECT_EQ(service_.received("update").at(0).target, "/daap/update");
+  EXPECT_EQ(service_.received("items").at(0).target, "/daap/databases/1/items?includePreorders=1");
 
   const auto events = delegate_->events();
   ASSERT_EQ(eventNumbers(events), (std::vector<std::int64_t>{1, 2, 4}));
@@ -568,7 +583,7 @@ TEST_F(DAAPClientTest, DelegateEventsCarryTheirInfoAndTheReason) {
   EXPECT_EQ(lookup(events[2].info, "response")["dmap.listing"].array()->size(), 1U);
 }
 
-TEST_F(DAAPClientTest, UnchangedRevisionSendsNoItemsRequest) {
+TEST_F(DAAPClientTest, UnchangedRevisionSendsNoItemsRequestUnlessForced) {
   signIn();
   service_.setRevision(5);
   LogCapture log;
@@ -587,14 +602,9 @@ TEST_F(DAAPClientTest, UnchangedRevisionSendsNoItemsRequest) {
                              "localVersion=latestVersion (5=5), forcedUpdate=0",
                              1),
             2U);
-}
 
-TEST_F(DAAPClientTest, ForcedPollAsksForItemsWithBothRevisionsTheSame) {
-  signIn();
-  service_.setRevision(5);
-  auto client = startedClient(5);
-  const auto poll = pollAndWait(*client, true);
-  ASSERT_TRUE(poll && poll->success);
+  const auto forced = pollAndWait(*client, true);
+  ASSERT_TRUE(forced && forced->success);
   ASSERT_EQ(service_.count("items"), 1U);
   const auto body = DAAPItemsRequest::parse(service_.received("items").at(0).body);
   ASSERT_TRUE(body);
@@ -634,28 +644,6 @@ TEST_F(DAAPClientTest, ItemsRequestIsTheExactBody) {
             "session-id=77&revision-number=6&query=" + query);
   EXPECT_EQ(service_.received("update").at(0).header("Content-Type"),
             "application/x-www-form-urlencoded");
-}
-
-TEST_F(DAAPClientTest, RequestsCarryTheClientsHeadersAndAGoodSignature) {
-  signIn();
-  service_.setRevision(2);
-  auto client = startedClient(1);
-  ASSERT_EQ(service_.actions(), (std::vector<std::string>{"login", "update", "items"}));
-  for (const std::string action : {"login", "update", "items"}) {
-    const Received request = service_.received(action).at(0);
-    SCOPED_TRACE(action);
-    EXPECT_EQ(request.method, "POST");
-    EXPECT_TRUE(request.signatureValid);
-    EXPECT_EQ(request.header("X-Larder-Account-ID"), std::to_string(kAccountID));
-    EXPECT_EQ(request.header("Client-DAAP-Version"), "3.13");
-    EXPECT_EQ(request.header("Client-Cloud-Purchase-Daap-Version"), "2");
-    EXPECT_EQ(request.header("Client-Cloud-DAAP-Request-Reason"), "1");
-    EXPECT_EQ(request.header("X-Guid"), kMachineID);
-  }
-  EXPECT_EQ(service_.received("login").at(0).target, "/daap/login");
-  EXPECT_TRUE(service_.received("login").at(0).body.empty());
-  EXPECT_EQ(service_.received("update").at(0).target, "/daap/update");
-  EXPECT_EQ(service_.received("items").at(0).target, "/daap/databases/1/items?includePreorders=1");
 }
 
 TEST_F(DAAPClientTest, DatabasesListingIsAskedForWithBothRevisions) {

@@ -17,22 +17,17 @@ DAAPKey key(const char* text) {
   return DAAPKey(text);
 }
 
-DAAPItemRef itemWithInfo(std::initializer_list<std::pair<const char*, DAAPValue>> entries) {
+DAAPItemRef itemWithInfo(std::initializer_list<std::pair<const char*, DAAPValue>> entries,
+                         std::optional<std::string> name = std::nullopt) {
   DAAPItemRef item = DAAPItem::item();
-  for (const auto& [name, value] : entries) item->setObject(value, key(name));
+  for (const auto& [entry, value] : entries) item->setObject(value, key(entry));
+  item->setName(std::move(name));
   return item;
 }
 
 // ------------------------------------------------------ freeze and thaw
 
-TEST(DAAPItemFreezeTest, NewItemIsUnfrozenWithoutInfo) {
-  const DAAPItemRef item = DAAPItem::item();
-  EXPECT_FALSE(item->isFrozen());
-  EXPECT_EQ(item->additionalInfo(), nullptr);
-  EXPECT_EQ(item->objectForKey("daap.songalbumid"), DAAPValue("0"));
-}
-
-TEST(DAAPItemFreezeTest, SetObjectOnAFrozenItemChangesNothing) {
+TEST(DAAPItemFreezeTest, FrozenItemRefusesInfoChangesButTakesFixedFields) {
   const DAAPItemRef item = itemWithInfo({{"k", "old"}});
   item->freeze();
   item->setObject("new", key("k"));
@@ -41,24 +36,32 @@ TEST(DAAPItemFreezeTest, SetObjectOnAFrozenItemChangesNothing) {
   item->setValue("via value", key("k"));
   EXPECT_EQ(item->objectForKey("k"), DAAPValue("old"));
   EXPECT_EQ(item->additionalInfo()->size(), 1u);
+  item->setName("n");
+  item->setItemID(5);
+  EXPECT_EQ(item->name(), "n");
+  EXPECT_EQ(item->itemID(), 5u);
 }
 
-TEST(DAAPItemFreezeTest, FreezingAnItemWithoutInfoGivesAnEmptyDictionary) {
-  const DAAPItemRef item = DAAPItem::item();
-  item->freeze();
-  EXPECT_TRUE(item->isFrozen());
-  ASSERT_NE(item->frozenInfo(), nullptr);
-  EXPECT_TRUE(item->frozenInfo()->empty());
-  EXPECT_EQ(item->additionalInfo(), item->frozenInfo());
-  EXPECT_EQ(item->mutableInfo(), nullptr);
-}
+TEST(DAAPItemFreezeTest, FreezeAndThawMoveTheSameEntriesBetweenTheTwoDictionaries) {
+  const DAAPItemRef bare = DAAPItem::item();
+  EXPECT_FALSE(bare->isFrozen());
+  EXPECT_EQ(bare->additionalInfo(), nullptr);
+  EXPECT_EQ(bare->objectForKey("daap.songalbumid"), DAAPValue("0"));
+  bare->freeze();
+  ASSERT_NE(bare->frozenInfo(), nullptr);  // an item without info freezes to an empty one
+  EXPECT_TRUE(bare->frozenInfo()->empty());
+  EXPECT_EQ(bare->additionalInfo(), bare->frozenInfo());
 
-TEST(DAAPItemFreezeTest, ThawAfterFreezeGivesBackTheSameEntries) {
   const DAAPItemRef item = itemWithInfo({{"a", 1}, {"b", "two"}});
   const DAAPDictionary before = *item->additionalInfo();
+  item->thaw();  // unfrozen: no effect
+  EXPECT_EQ(*item->mutableInfo(), before);
   item->freeze();
+  item->freeze();
+  EXPECT_TRUE(item->isFrozen());
   EXPECT_EQ(*item->frozenInfo(), before);
   EXPECT_EQ(item->mutableInfo(), nullptr);
+  item->thaw();
   item->thaw();
   EXPECT_FALSE(item->isFrozen());
   EXPECT_EQ(item->frozenInfo(), nullptr);
@@ -68,64 +71,16 @@ TEST(DAAPItemFreezeTest, ThawAfterFreezeGivesBackTheSameEntries) {
   EXPECT_EQ(item->objectForKey("c").int64Value(), 3);
 }
 
-TEST(DAAPItemFreezeTest, FreezeAndThawAreIdempotent) {
-  const DAAPItemRef item = itemWithInfo({{"a", 1}});
-  item->thaw();  // unfrozen: no effect
-  EXPECT_EQ(item->mutableInfo()->size(), 1u);
-  item->freeze();
-  item->freeze();
-  EXPECT_EQ(item->frozenInfo()->size(), 1u);
-  item->thaw();
-  item->thaw();
-  EXPECT_EQ(item->mutableInfo()->size(), 1u);
-}
-
-TEST(DAAPItemFreezeTest, FixedFieldsCanBeSetOnAFrozenItem) {
-  const DAAPItemRef item = DAAPItem::item();
-  item->freeze();
-  item->setName("n");
-  item->setItemID(5);
-  item->setSongartist("a");
-  item->setContainerItemID(9);
-  EXPECT_EQ(item->name(), "n");
-  EXPECT_EQ(item->itemID(), 5u);
-  EXPECT_EQ(item->songartist(), "a");
-  EXPECT_EQ(item->containerItemID(), 9u);
-}
-
 // ------------------------------------------------------- keyed access
 
-TEST(DAAPItemKeyTest, NameByValueIsThePropertyByObjectIsAnEntry) {
-  const DAAPItemRef byValue = DAAPItem::item();
-  byValue->setValue("Title", key("name"));
-  EXPECT_EQ(byValue->name(), "Title");
-  EXPECT_EQ(byValue->additionalInfo(), nullptr);
+TEST(DAAPItemKeyTest, PropertiesAreReachableByKeyOthersGoToTheDictionary) {
   const DAAPItemRef byObject = DAAPItem::item();
-  byObject->setObject("Title", key("name"));
+  byObject->setObject("Title", key("name"));  // an entry, not the property
   EXPECT_FALSE(byObject->name().has_value());
   EXPECT_EQ(byObject->objectForKey("name"), DAAPValue("Title"));
-}
 
-TEST(DAAPItemKeyTest, ObjectForKeyReadsThreeKeysFromFields) {
-  const DAAPItemRef item = itemWithInfo({{"daap.songartist", "info artist"}});
-  EXPECT_TRUE(item->objectForKey("daap.songartist").isNull());  // the field, which is empty
-  item->setSongartist("Field Artist");
-  item->setSongalbum("Field Album");
-  item->setSongalbumid(18446744073709551615ULL);
-  EXPECT_EQ(item->objectForKey("daap.songartist"), DAAPValue("Field Artist"));
-  EXPECT_EQ(item->objectForKey("daap.songalbum"), DAAPValue("Field Album"));
-  EXPECT_EQ(item->objectForKey("daap.songalbumid"), DAAPValue("18446744073709551615"));
-}
-
-TEST(DAAPItemKeyTest, AbsentValueRemovesTheKey) {
-  const DAAPItemRef item = itemWithInfo({{"a", 1}, {"b", 2}});
-  item->setObject({}, key("a"));
-  item->setValue({}, key("b"));
-  EXPECT_TRUE(item->additionalInfo()->empty());
-}
-
-TEST(DAAPItemKeyTest, PropertiesAreReachableByKeyOthersGoToTheDictionary) {
   const DAAPItemRef item = DAAPItem::item();
+  item->setValue("Title", key("name"));
   item->setValue(std::int64_t{77}, key("itemID"));
   item->setValue("12", key("containerItemID"));
   item->setValue(3, key("downloadStatus"));
@@ -133,7 +88,9 @@ TEST(DAAPItemKeyTest, PropertiesAreReachableByKeyOthersGoToTheDictionary) {
   item->setValue(true, key("hasVideo"));
   item->setValue("Album", key("songalbum"));
   item->setValue(5, key("songartist"));  // not text: ignored
+  EXPECT_EQ(item->additionalInfo(), nullptr);
   item->setValue("yes", key("isFrozen"));
+  EXPECT_EQ(item->name(), "Title");
   EXPECT_EQ(item->itemID(), 77u);
   EXPECT_EQ(item->containerItemID(), 12u);
   EXPECT_EQ(item->downloadStatus(), 3);
@@ -149,6 +106,21 @@ TEST(DAAPItemKeyTest, PropertiesAreReachableByKeyOthersGoToTheDictionary) {
   EXPECT_EQ(item->valueForUndefinedKey("isFrozen"), DAAPValue("yes"));
   item->setValue({}, key("itemID"));
   EXPECT_EQ(item->itemID(), 0u);
+  item->setObject(1, key("a"));
+  item->setValue({}, key("isFrozen"));  // an absent value removes an entry, either way
+  item->setObject({}, key("a"));
+  EXPECT_TRUE(item->additionalInfo()->empty());
+}
+
+TEST(DAAPItemKeyTest, ObjectForKeyReadsThreeKeysFromFields) {
+  const DAAPItemRef item = itemWithInfo({{"daap.songartist", "info artist"}});
+  EXPECT_TRUE(item->objectForKey("daap.songartist").isNull());  // the field, which is empty
+  item->setSongartist("Field Artist");
+  item->setSongalbum("Field Album");
+  item->setSongalbumid(18446744073709551615ULL);
+  EXPECT_EQ(item->objectForKey("daap.songartist"), DAAPValue("Field Artist"));
+  EXPECT_EQ(item->objectForKey("daap.songalbum"), DAAPValue("Field Album"));
+  EXPECT_EQ(item->objectForKey("daap.songalbumid"), DAAPValue("18446744073709551615"));
 }
 
 TEST(DAAPItemKeyTest, ChangesThroughUndefinedKeysAreObservedBeforeAndAfter) {
@@ -175,6 +147,8 @@ TEST(DAAPItemKeyTest, ItemIdFallsBackOnTheLongItemIdAndKeepsIt) {
   EXPECT_EQ(item->itemID(), 5u);
 }
 
+// The fallback writes the id it found while readers share the item; only
+// the thread sanitizer build sees a race, every build sees a wrong id.
 TEST(DAAPItemKeyTest, FrozenItemSharedByThreadsReadsItsIdSafely) {
   const DAAPItemRef item = itemWithInfo({{"dmap.longitemid", std::int64_t{42}}});
   item->freeze();
@@ -208,11 +182,10 @@ TEST(DAAPItemKeyTest, HasVideoIsBitZeroOfTheFlags) {
   EXPECT_EQ(item->itemFlags(), 0xfe);
 }
 
-// -------------------------------------------------------------- updates
+// ------------------------------------------------------ updates, copies
 
 TEST(DAAPItemUpdateTest, UpdateWithItemTakesNameAndInfoOnly) {
-  const DAAPItemRef source = itemWithInfo({{"k", "v"}, {"itemID", 9}});
-  source->setName("Source");
+  const DAAPItemRef source = itemWithInfo({{"k", "v"}, {"itemID", 9}}, "Source");
   source->setSongartist("Artist");
   source->setContainerItemID(4);
   const DAAPItemRef target = DAAPItem::itemWithItem(*source);
@@ -221,15 +194,14 @@ TEST(DAAPItemUpdateTest, UpdateWithItemTakesNameAndInfoOnly) {
   EXPECT_EQ(target->itemID(), 9u);  // an info key that names a property sets it
   EXPECT_FALSE(target->songartist().has_value());
   EXPECT_EQ(target->containerItemID(), 0u);
-
-  const DAAPItemRef unnamed = DAAPItem::item();
-  target->updateItemWithItem(*unnamed);
+  target->updateItemWithItem(*DAAPItem::item());
   EXPECT_EQ(target->name(), "Source");  // only a present name is taken
-}
 
-TEST(DAAPItemUpdateTest, UpdatesDoNothingToAFrozenItem) {
-  const DAAPItemRef source = itemWithInfo({{"k", "v"}});
-  source->setName("Source");
+  const DAAPItemRef self = itemWithInfo({{"a", 1}, {"name", "In Info"}});
+  self->updateItemWithItem(*self);  // with its own info: safe
+  EXPECT_EQ(self->name(), "In Info");
+  EXPECT_EQ(self->objectForKey("a").int64Value(), 1);
+
   const DAAPItemRef frozen = DAAPItem::item();
   frozen->freeze();
   frozen->updateItemWithItem(*source);
@@ -238,18 +210,8 @@ TEST(DAAPItemUpdateTest, UpdatesDoNothingToAFrozenItem) {
   EXPECT_TRUE(frozen->additionalInfo()->empty());
 }
 
-TEST(DAAPItemUpdateTest, UpdateWithItsOwnInfoIsSafe) {
-  const DAAPItemRef item = itemWithInfo({{"a", 1}, {"name", "In Info"}});
-  item->updateItemWithItem(*item);
-  EXPECT_EQ(item->name(), "In Info");
-  EXPECT_EQ(item->objectForKey("a").int64Value(), 1);
-}
-
-// ---------------------------------------------------------------- copies
-
 TEST(DAAPItemCopyTest, CopyHasNameAndInfoButNotTheOtherFields) {
-  const DAAPItemRef source = itemWithInfo({{"dmap.longitemid", 31}, {"k", "v"}});
-  source->setName("Copied");
+  const DAAPItemRef source = itemWithInfo({{"dmap.longitemid", 31}, {"k", "v"}}, "Copied");
   source->setItemID(99);
   source->setSongartist("Artist");
   source->freeze();
@@ -266,17 +228,14 @@ TEST(DAAPItemCopyTest, CopyHasNameAndInfoButNotTheOtherFields) {
 
 // -------------------------------------------------------- representation
 
-TEST(DAAPItemRepresentationTest, AlwaysHoldsTheIdentifiers) {
+TEST(DAAPItemRepresentationTest, FieldsOverInfoIdentifiersAlwaysAndHasVideoOnlyWhenSet) {
   const DAAPDictionary empty = DAAPItem::item()->dictionaryRepresentation();
-  EXPECT_EQ(lookup(empty, "dmap.itemid"), DAAPValue(std::int64_t{0}));
-  EXPECT_EQ(lookup(empty, "daap.songalbumid"), DAAPValue(std::int64_t{0}));
-  EXPECT_EQ(lookup(empty, "dmap.containeritemid"), DAAPValue(std::int64_t{0}));
-  EXPECT_EQ(empty.size(), 3u);
-}
+  EXPECT_EQ(empty, (DAAPDictionary{{DAAPKey("dmap.itemid"), std::int64_t{0}},
+                                   {DAAPKey("daap.songalbumid"), std::int64_t{0}},
+                                   {DAAPKey("dmap.containeritemid"), std::int64_t{0}}}));
 
-TEST(DAAPItemRepresentationTest, FieldsOverInfoAndHasVideoOnlyWhenSet) {
-  const DAAPItemRef item = itemWithInfo({{"hasVideo", true}, {"extra", 1}, {"name", "info name"}});
-  item->setName("Name");
+  const DAAPItemRef item =
+      itemWithInfo({{"hasVideo", true}, {"extra", 1}, {"name", "info name"}}, "Name");
   item->setSongalbum("Album");
   item->setSongalbumartist("Album Artist");
   item->setItemID(0xffffffffffffffffULL);
@@ -294,30 +253,25 @@ TEST(DAAPItemRepresentationTest, FieldsOverInfoAndHasVideoOnlyWhenSet) {
   EXPECT_EQ(lookup(fields, "extra").int64Value(), 1);
   item->setHasVideo(true);
   EXPECT_EQ(lookup(item->dictionaryRepresentation(), "hasVideo"), DAAPValue(true));
-}
 
-TEST(DAAPItemRepresentationTest, ToPlistTurnsNestedItemsIntoTheirRepresentation) {
-  const DAAPItemRef inner = DAAPItem::item();
-  inner->setName("Inner");
-  const DAAPItemRef outer = itemWithInfo({{"context", DAAPArray{DAAPValue(inner)}}});
-  const PlistValue plist = DAAPValue(outer).toPlist();
-  EXPECT_EQ(plist["context"].array()->at(0)["name"], PlistValue("Inner"));
+  const DAAPItemRef outer = itemWithInfo({{"context", DAAPArray{DAAPValue(item)}}});
+  const PlistValue plist = DAAPValue(outer).toPlist();  // nested items as their representation
+  EXPECT_EQ(plist["context"].array()->at(0)["name"], PlistValue("Name"));
   EXPECT_EQ(plist["dmap.itemid"], PlistValue(0));
 }
 
 // ---------------------------------------------------------------- coding
 
 TEST(DAAPItemCodingTest, ArchiveKeepsNameAndInfoAndGivesAnUnfrozenItem) {
-  const DAAPItemRef inner = itemWithInfo({{"k", "inner"}});
-  inner->setName("Inner");
+  const DAAPItemRef inner = itemWithInfo({{"k", "inner"}}, "Inner");
   const DAAPItemRef item =
       itemWithInfo({{"string", "text"},
                     {"number", std::uint64_t{0x8000000000000000ULL}},
                     {"date", PlistDate{1600000000}},
                     {"data", PlistData{1, 2}},
                     {"flavors", DAAPArray{DAAPDictionary{{DAAPKey("daap.songformat"), "epub"}}}},
-                    {"context", DAAPArray{DAAPValue(inner)}}});
-  item->setName("Outer");
+                    {"context", DAAPArray{DAAPValue(inner)}}},
+                   "Outer");
   item->setItemID(5);
   item->freeze();
   const PlistData archive = KeyedArchive::archivedData(item->encodeWithCoder());
@@ -356,37 +310,33 @@ TEST(DAAPItemCodingTest, OtherRecordsAreRefused) {
 
 // ----------------------------------------------------------- description
 
-TEST(DAAPItemDescriptionTest, PlainItem) {
-  const DAAPItemRef item = DAAPItem::item();
-  item->setName("Title");
-  item->setItemID(5);
-  item->setSongalbum("Album");
-  item->setContainerItemID(7);
-  EXPECT_TRUE(std::regex_match(
-      item->description(),
-      std::regex(R"(<DAAPItem: 0x[0-9a-f]+> Title, 5, Album, \(null\), containerItemID = 7)")))
-      << item->description();
-}
-
-TEST(DAAPItemDescriptionTest, SpeakerItem) {
-  const DAAPItemRef speaker = itemWithInfo({{"macAddress", std::int64_t{0x1b638445e6}},
-                                            {"supportsVideo", true},
-                                            {"isPlaying", true},
-                                            {"selected", true},
-                                            {"volume", 0.5},
-                                            {"hasPassword", 1}});
-  speaker->setName("Kitchen");
-  EXPECT_TRUE(std::regex_match(
-      speaker->description(),
-      std::regex(R"(<DAAPItem: 0x[0-9a-f]+> Skylane Video: Kitchen, isPlaying, selected )"
-                 R"(v:0\.500000 supportsVolume:1, locked:1, macAddress:117633730022)")))
-      << speaker->description();
-  const DAAPItemRef quiet = itemWithInfo({{"macAddress", 1}});
-  quiet->setName("Den");
-  EXPECT_TRUE(std::regex_match(quiet->description(),
-                               std::regex(R"(<DAAPItem: 0x[0-9a-f]+> Skylane: Den, )"
-                                          R"(supportsVolume:0, locked:0, macAddress:1)")))
-      << quiet->description();
+TEST(DAAPItemDescriptionTest, PlainAndSpeakerItems) {
+  const DAAPItemRef plain = itemWithInfo({}, "Title");
+  plain->setItemID(5);
+  plain->setSongalbum("Album");
+  plain->setContainerItemID(7);
+  const struct {
+    DAAPItemRef item;
+    const char* pattern;
+  } cases[] = {
+      {plain, R"(Title, 5, Album, \(null\), containerItemID = 7)"},
+      {itemWithInfo({{"macAddress", std::int64_t{0x1b638445e6}},
+                     {"supportsVideo", true},
+                     {"isPlaying", true},
+                     {"selected", true},
+                     {"volume", 0.5},
+                     {"hasPassword", 1}},
+                    "Kitchen"),
+       R"(Skylane Video: Kitchen, isPlaying, selected v:0\.500000 supportsVolume:1, locked:1, )"
+       R"(macAddress:117633730022)"},
+      {itemWithInfo({{"macAddress", 1}}, "Den"),
+       R"(Skylane: Den, supportsVolume:0, locked:0, macAddress:1)"},
+  };
+  for (const auto& c : cases) {
+    EXPECT_TRUE(std::regex_match(
+        c.item->description(), std::regex(std::string(R"(<DAAPItem: 0x[0-9a-f]+> )") + c.pattern)))
+        << c.item->description();
+  }
 }
 
 }  // namespace

@@ -58,38 +58,34 @@ TEST(DAAPItemsBody, WithoutQueryOrPairsIsTheProtocolsSeventyThreeBytes) {
   EXPECT_EQ(body, expected);
 }
 
-TEST(DAAPItemsBody, QueryAndPairsAreLaidOutAndSized) {
+TEST(DAAPItemsBody, QueryAndPairsAreLaidOutInOrderAndPairsWithoutBothNumbersAreLeftOut) {
   const std::string query = *DAAPMediaKindQuery::text(std::vector<std::int64_t>{2, 64});
-  const std::vector<Pair> pairs{{0x1122334455667788ULL, 7}, {42, 0xfffffffe}, {1, 0}};
-  const PlistData body =
-      DAAPClient::itemsRequestBody(1700000000, 12, 40, 39, query, tokenPairs(pairs));
-  EXPECT_EQ(body, expectedBody(1700000000, 12, 40, 39, query, pairs));
-  // adsr: 73 + the query + 36 per pair; aetl: 36 per pair.
-  EXPECT_EQ(sizeAt(body, 0), 73 + query.size() + 36 * pairs.size());
-  EXPECT_EQ(body.size(), 8 + 73 + query.size() + 36 * pairs.size());
-  const std::size_t tokenList = 8 + 12 + 12 + 9 + 12 + 12 + 8 + query.size();
-  EXPECT_EQ(DAAPCode::text(DAAPTagReader::readUInt32(body.data() + tokenList)), "aetl");
-  EXPECT_EQ(sizeAt(body, tokenList), 36 * pairs.size());
-  EXPECT_EQ(sizeAt(body, tokenList + 8), 28U);  // the first aeti
-}
-
-TEST(DAAPItemsBody, ManyPairsKeepTheirOrder) {
-  std::vector<Pair> pairs;
-  for (std::uint32_t index = 0; index < 1000; ++index) pairs.emplace_back(90000 + index, index * 3);
-  const PlistData body = DAAPClient::itemsRequestBody(5, 6, 7, 8, std::nullopt, tokenPairs(pairs));
-  EXPECT_EQ(body, expectedBody(5, 6, 7, 8, std::nullopt, pairs));
-  EXPECT_EQ(sizeAt(body, 0), 65U + 36000U);
-}
-
-TEST(DAAPItemsBody, PairsWithoutBothNumbersAreLeftOut) {
-  DAAPClient::TokenPairs pairs = tokenPairs({{10, 1}});
-  pairs.push_back({{"clientID", 11}});                      // no token
-  pairs.push_back({{"tokenCode", 2}});                      // no cloud id
-  pairs.push_back({{"clientID", "12"}, {"tokenCode", 3}});  // text, not a number
-  pairs.push_back({});                                      // nothing at all
-  pairs.push_back(*DAAPClient::tokenPairWithCloudID(13, 4));
-  const PlistData body = DAAPClient::itemsRequestBody(1, 2, 3, 4, std::nullopt, pairs);
-  EXPECT_EQ(body, expectedBody(1, 2, 3, 4, std::nullopt, {{10, 1}, {13, 4}}));
+  std::vector<Pair> many;
+  for (std::uint32_t index = 0; index < 1000; ++index) many.emplace_back(90000 + index, index * 3);
+  DAAPClient::TokenPairs incomplete = tokenPairs({{10, 1}});
+  incomplete.push_back({{"clientID", 11}});                      // no token
+  incomplete.push_back({{"tokenCode", 2}});                      // no cloud id
+  incomplete.push_back({{"clientID", "12"}, {"tokenCode", 3}});  // text, not a number
+  incomplete.push_back({});                                      // nothing at all
+  incomplete.push_back(*DAAPClient::tokenPairWithCloudID(13, 4));
+  const std::vector<Pair> mixed{{0x1122334455667788ULL, 7}, {42, 0xfffffffe}, {1, 0}};
+  const struct {
+    const char* name;
+    std::optional<std::string> query;
+    DAAPClient::TokenPairs pairs;
+    std::vector<Pair> expected;
+  } cases[] = {
+      {"query and pairs", query, tokenPairs(mixed), mixed},
+      {"many pairs keep their order", std::nullopt, tokenPairs(many), many},
+      {"pairs without both numbers", std::nullopt, incomplete, {{10, 1}, {13, 4}}},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    const PlistData body = DAAPClient::itemsRequestBody(1700000000, 12, 40, 39, c.query, c.pairs);
+    EXPECT_EQ(body, expectedBody(1700000000, 12, 40, 39, c.query, c.expected));
+    // adsr: 65 bytes, a header and the query if any, 36 per pair.
+    EXPECT_EQ(sizeAt(body, 0), 65 + (c.query ? 8 + c.query->size() : 0) + 36 * c.expected.size());
+  }
 }
 
 TEST(DAAPItemsBody, TheServersReaderGetsBackEveryField) {

@@ -5,6 +5,7 @@
 #include <memory>
 #include <mutex>
 #include <ostream>
+#include <sstream>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -21,62 +22,38 @@ namespace larder {
 inline void PrintTo(const DAAPValue& value, std::ostream* out) {
   *out << value.description();
 }
+inline void PrintTo(const DAAPKey& key, std::ostream* out) {
+  *out << key.str();
+}
 
 }  // namespace larder
 
 namespace larder::dmaptest {
 
 // One tag of a document under construction: a leaf with its value bytes,
-// or a container with its children. Written through DAAPBuffer, with each
-// container's size worked out ahead, as a client writes a request body.
+// or a container with its children. Numbers are laid out big-endian here,
+// not by the writer under test; each container's size is worked out ahead,
+// as a client writes a request body.
 struct Tag {
-  enum class Width { Raw, UInt8, UInt32, UInt64 };
-
   std::uint32_t code = 0;
-  Width width = Width::Raw;
-  std::uint64_t number = 0;
   PlistData bytes;
   std::vector<Tag> children;
   bool isContainer = false;
 
   [[nodiscard]] std::uint32_t valueSize() const {
-    if (!isContainer) {
-      switch (width) {
-        case Width::UInt8:
-          return 1;
-        case Width::UInt32:
-          return 4;
-        case Width::UInt64:
-          return 8;
-        case Width::Raw:
-          return static_cast<std::uint32_t>(bytes.size());
-      }
-    }
+    if (!isContainer) return static_cast<std::uint32_t>(bytes.size());
     std::uint32_t size = 0;
     for (const Tag& child : children) size += 8 + child.valueSize();
     return size;
   }
 
   void writeTo(DAAPBuffer& buffer) const {
-    if (isContainer) {
-      buffer.appendHeader(code, valueSize());
-      for (const Tag& child : children) child.writeTo(buffer);
+    if (!isContainer) {
+      buffer.appendUTF8String(std::span<const std::uint8_t>(bytes), code);
       return;
     }
-    switch (width) {
-      case Width::UInt8:
-        buffer.appendUInt8(static_cast<std::uint8_t>(number), code);
-        return;
-      case Width::UInt32:
-        buffer.appendUInt32(static_cast<std::uint32_t>(number), code);
-        return;
-      case Width::UInt64:
-        buffer.appendUInt64(number, code);
-        return;
-      case Width::Raw:
-        buffer.appendUTF8String(std::span<const std::uint8_t>(bytes), code);
-        return;
-    }
+    buffer.appendHeader(code, valueSize());
+    for (const Tag& child : children) child.writeTo(buffer);
   }
 };
 
@@ -85,44 +62,32 @@ inline std::uint32_t code(std::string_view text) {
 }
 
 inline Tag raw(std::string_view name, PlistData bytes) {
-  Tag tag;
-  tag.code = code(name);
-  tag.bytes = std::move(bytes);
-  return tag;
+  return Tag{.code = code(name), .bytes = std::move(bytes)};
 }
 inline Tag text(std::string_view name, std::string_view value) {
   return raw(name, PlistData(value.begin(), value.end()));
 }
+inline Tag number(std::string_view name, std::uint64_t value, int width) {
+  PlistData bytes;
+  for (int shift = 8 * (width - 1); shift >= 0; shift -= 8) {
+    bytes.push_back(static_cast<std::uint8_t>(value >> shift));
+  }
+  return raw(name, std::move(bytes));
+}
 inline Tag u8(std::string_view name, std::uint8_t value) {
-  Tag tag;
-  tag.code = code(name);
-  tag.width = Tag::Width::UInt8;
-  tag.number = value;
-  return tag;
+  return number(name, value, 1);
 }
 inline Tag u16(std::string_view name, std::uint16_t value) {
-  return raw(name, {static_cast<std::uint8_t>(value >> 8), static_cast<std::uint8_t>(value)});
+  return number(name, value, 2);
 }
 inline Tag u32(std::string_view name, std::uint32_t value) {
-  Tag tag;
-  tag.code = code(name);
-  tag.width = Tag::Width::UInt32;
-  tag.number = value;
-  return tag;
+  return number(name, value, 4);
 }
 inline Tag u64(std::string_view name, std::uint64_t value) {
-  Tag tag;
-  tag.code = code(name);
-  tag.width = Tag::Width::UInt64;
-  tag.number = value;
-  return tag;
+  return number(name, value, 8);
 }
 inline Tag container(std::string_view name, std::vector<Tag> children) {
-  Tag tag;
-  tag.code = code(name);
-  tag.isContainer = true;
-  tag.children = std::move(children);
-  return tag;
+  return Tag{.code = code(name), .children = std::move(children), .isContainer = true};
 }
 
 inline PlistData document(const Tag& top) {
@@ -131,8 +96,23 @@ inline PlistData document(const Tag& top) {
   return buffer.data();
 }
 
+// Tags one after another, as a container's value.
+inline PlistData bodyOf(const std::vector<Tag>& tags) {
+  DAAPBuffer buffer;
+  for (const Tag& tag : tags) tag.writeTo(buffer);
+  return buffer.data();
+}
+
 inline DAAPValue decode(const Tag& top) {
   return DAAPParser::decodeData(document(top));
+}
+
+// A dictionary written out in a test, with keys that own their text.
+inline DAAPDictionary dictionaryOf(
+    std::initializer_list<std::pair<const char*, DAAPValue>> entries) {
+  DAAPDictionary result;
+  for (const auto& [key, value] : entries) result.insert_or_assign(DAAPKey(key), value);
+  return result;
 }
 
 inline PlistData bytesOf(std::string_view text) {
@@ -162,13 +142,10 @@ class LogCapture {
   LogCapture(const LogCapture&) = delete;
   LogCapture& operator=(const LogCapture&) = delete;
 
-  [[nodiscard]] std::vector<Line> lines() const {
-    std::lock_guard lock(mutex_);
-    return lines_;
-  }
   [[nodiscard]] std::vector<std::string> texts() const {
+    std::lock_guard lock(mutex_);
     std::vector<std::string> result;
-    for (const Line& line : lines()) result.push_back(line.text);
+    for (const Line& line : lines_) result.push_back(line.text);
     return result;
   }
   void clear() {
@@ -204,239 +181,157 @@ class LogCapture {
 enum class Kind { Bool, UInt8, UInt16, UInt32, UInt64, Date, String };
 
 struct PlainTag {
-  const char* code;
+  std::string code;
   Kind kind;
-  const char* key;
+  std::string key;
 };
 
-// The plain tags of every container, transcribed from the protocol's tables:
-// code, how the value is read, and the key it is stored under.
-
-const std::vector<PlainTag> kListingItemTags{
-    {"aeCR", Kind::String, "com.orvane.sonorel.content-rating"},
-    {"aeCT", Kind::String, "com.orvane.sonorel.cloud-artwork-token"},
-    {"aeCa", Kind::String, "com.orvane.sonorel.cloud-artwork-url"},
-    {"aeEN", Kind::String, "com.orvane.sonorel.episode-num-str"},
-    {"aePd", Kind::String, "com.orvane.sonorel.display-publication-version"},
-    {"aeSN", Kind::String, "com.orvane.sonorel.series-name"},
-    {"agrp", Kind::String, "daap.songgrouping"},
-    {"ascn", Kind::String, "daap.songcontentdescription"},
-    {"ascp", Kind::String, "daap.songcomposer"},
-    {"asct", Kind::String, "daap.songcategory"},
-    {"asdt", Kind::String, "daap.songdescription"},
-    {"asfm", Kind::String, "daap.songformat"},
-    {"asgn", Kind::String, "daap.songgenre"},
-    {"aslc", Kind::String, "daap.songlongcontentdescription"},
-    {"aspu", Kind::String, "daap.songpodcasturl"},
-    {"assa", Kind::String, "daap.sortartist"},
-    {"assn", Kind::String, "daap.sortname"},
-    {"assu", Kind::String, "daap.sortalbum"},
-    {"asul", Kind::String, "daap.songdataurl"},
-    {"cmbd", Kind::String, "libraryDisplayName"},
-    {"cmbm", Kind::String, "libraryServiceDomain"},
-    {"cmbs", Kind::String, "libraryServiceName"},
-    {"cmbt", Kind::String, "libraryServiceType"},
-    {"cmid", Kind::String, "identifier"},
-    {"cmnm", Kind::String, "name"},
-    {"pasp", Kind::String, "aspectRatio"},
-    {"aeHD", Kind::UInt8, "com.orvane.sonorel.is-hd-video"},
-    {"aeMK", Kind::UInt8, "com.orvane.sonorel.mediakind"},
-    {"aePC", Kind::UInt8, "com.orvane.sonorel.is-podcast"},
-    {"aePS", Kind::UInt8, "com.orvane.sonorel.special-playlist"},
-    {"aprm", Kind::UInt8, "daap.playlistrepeatmode"},
-    {"apsm", Kind::UInt8, "daap.playlistshufflemode"},
-    {"asbk", Kind::UInt8, "daap.bookmarkable"},
-    {"ascr", Kind::UInt8, "daap.songcontentrating"},
-    {"ashp", Kind::UInt8, "daap.songhasbeenplayed"},
-    {"asur", Kind::UInt8, "daap.songuserrating"},
-    {"cahp", Kind::UInt8, "hasPassword"},
-    {"mgds", Kind::UInt8, "dmap.groupdownloadstatus"},
-    {"mikd", Kind::UInt8, "dmap.itemkind"},
-    {"msas", Kind::UInt8, "dmap.authenticationschemes"},
-    {"msau", Kind::UInt8, "dmap.authenticationmethod"},
-    {"asac", Kind::UInt16, "daap.songartworkcount"},
-    {"asdc", Kind::UInt16, "daap.songdisccount"},
-    {"asdn", Kind::UInt16, "daap.songdiscnumber"},
-    {"astc", Kind::UInt16, "daap.songtrackcount"},
-    {"astn", Kind::UInt16, "daap.songtracknumber"},
-    {"asyr", Kind::UInt16, "daap.songyear"},
-    {"aeCs", Kind::UInt32, "com.orvane.sonorel.cloud-connect-status"},
-    {"aeES", Kind::UInt32, "com.orvane.sonorel.episode-sort"},
-    {"aeRD", Kind::UInt32, "com.orvane.sonorel.rental-duration"},
-    {"aeRP", Kind::UInt32, "com.orvane.sonorel.rental-pb-start"},
-    {"aeRS", Kind::UInt32, "com.orvane.sonorel.rental-start"},
-    {"aeRU", Kind::UInt32, "com.orvane.sonorel.rental-pb-duration"},
-    {"aeSU", Kind::UInt32, "com.orvane.sonorel.season-num"},
-    {"aeto", Kind::UInt32, "com.orvane.sonorel.cloud-purchased-token"},
-    {"agac", Kind::UInt32, "daap.groupalbumcount"},
-    {"agma", Kind::UInt32, "daap.groupmatchedqueryalbumcount"},
-    {"agmi", Kind::UInt32, "daap.groupmatchedqueryitemcount"},
-    {"asbo", Kind::UInt32, "daap.songbookmark"},
-    {"askp", Kind::UInt32, "daap.songuserskipcount"},
-    {"aspc", Kind::UInt32, "daap.songuserplaycount"},
-    {"astm", Kind::UInt32, "daap.songtime"},
-    {"capr", Kind::UInt32, "dacp.protocolversion"},
-    {"cmmn", Kind::UInt32, "minimum"},
-    {"cmmx", Kind::UInt32, "maximum"},
-    {"cmpr", Kind::UInt32, "dmcp.protocolversion"},
-    {"mctc", Kind::UInt32, "dmap.containercount"},
-    {"mdbk", Kind::UInt32, "dmap.databasekind"},
-    {"merr", Kind::UInt32, "dmap.errorresponse"},
-    {"mimc", Kind::UInt32, "dmap.itemcount"},
-    {"mshi", Kind::UInt32, "headerItemIndex"},
-    {"mshn", Kind::UInt32, "headerItemCount"},
-    {"mstt", Kind::UInt32, "dmap.status"},
-    {"aeAD", Kind::UInt64, "com.orvane.sonorel.ware-ids-array"},
-    {"aeAI", Kind::UInt64, "com.orvane.sonorel.orms-artistid"},
-    {"aeAi", Kind::UInt64, "com.orvane.sonorel.ware-id"},
-    {"aeCU", Kind::UInt64, "com.orvane.sonorel.cloud-user-id"},
-    {"aeCd", Kind::UInt64, "com.orvane.sonorel.cloud-id"},
-    {"aeIM", Kind::UInt64, "com.orvane.sonorel.sonorel-machine-id"},
-    {"aeRM", Kind::UInt64, "com.orvane.sonorel.remote-sonorel-machine-id"},
-    {"aeSE", Kind::UInt64, "com.orvane.sonorel.store-pers-id"},
-    {"aepv", Kind::UInt64, "com.orvane.sonorel.publication-version"},
-    {"ceSX", Kind::UInt64, "kExtDACPSupportedSonorelExtensionsCode"},
-    {"mild", Kind::UInt64, "dmap.longitemid"},
-    {"mper", Kind::UInt64, "dmap.persistentid"},
-    {"mrpr", Kind::UInt64, "dmap.remotepersistentid"},
-    {"msma", Kind::UInt64, "macAddress"},
-    {"abpl", Kind::Bool, "daap.baseplaylist"},
-    {"aeHS", Kind::Bool, "com.orvane.sonorel.is-homeshare"},
-    {"aeMI", Kind::Bool, "com.orvane.sonorel.mastered-for-sonorel"},
-    {"aeSG", Kind::Bool, "com.orvane.sonorel.saved-curator"},
-    {"aeSP", Kind::Bool, "com.orvane.sonorel.smart-playlist"},
-    {"asdb", Kind::Bool, "daap.songdisabled"},
-    {"caia", Kind::Bool, "selected"},
-    {"caip", Kind::Bool, "isPlaying"},
-    {"caiv", Kind::Bool, "supportsVideo"},
-    {"caov", Kind::Bool, "supportsMultiSpeakerVolume"},
-    {"cass", Kind::Bool, "supportsSpeakerSelection"},
-    {"casu", Kind::Bool, "supportsSetUserRating"},
-    {"cavd", Kind::Bool, "selectedForVideo"},
-    {"ceDR", Kind::Bool, "com.orvane.sonorel.supports-directional-remote"},
-    {"ceSG", Kind::Bool, "com.orvane.sonorel.supports-curator-control"},
-    {"cmrl", Kind::Bool, "supportsRemoteLibrarySelection"},
-    {"cmsb", Kind::Bool, "supportsBeaconSourcesUpdates"},
-    {"cmsc", Kind::Bool, "supportsControlPromptRequests"},
-    {"cmsp", Kind::Bool, "supportsPlayStatusUpdate"},
-    {"cmsv", Kind::Bool, "supportsVolume"},
-    {"crol", Kind::Bool, "readOnly"},
-    {"mavl", Kind::Bool, "dmap.itemavailable"},
-    {"mihi", Kind::Bool, "dmap.itemhidden"},
-    {"ajEd", Kind::Date, "com.orvane.sonorel.store.expected-release-date"},
-    {"asda", Kind::Date, "daap.songdateadded"},
-    {"asdm", Kind::Date, "daap.songdatemodified"},
-    {"asdp", Kind::Date, "daap.songdatepurchased"},
-    {"asdr", Kind::Date, "daap.songdatereleased"},
+// The plain tags of every container, transcribed from the protocol's tables
+// and grouped by how the value is read: pairs of code and the key it is
+// stored under, separated by blanks.
+struct KindGroup {
+  Kind kind;
+  std::string_view pairs;
 };
 
-const std::vector<PlainTag> kServerInfoTags{
-    {"mstt", Kind::UInt32, "dmap.status"},
-    {"mpro", Kind::UInt32, "dmap.protocolversion"},
-    {"apro", Kind::UInt32, "daap.protocolversion"},
-    {"ppro", Kind::UInt32, "ppro"},
-    {"atSV", Kind::UInt32, "Client-TVB-Sharing-Version"},
-    {"aeSV", Kind::UInt32, "com.orvane.sonorel.music-sharing-version"},
-    {"aeSX", Kind::UInt64, "com.orvane.sonorel.supportedextensions"},
-    {"aeto", Kind::UInt32, "com.orvane.sonorel.cloud-purchase-token"},
-    {"aeCP", Kind::Bool, "supportsPurchases"},
-    {"aeMQ", Kind::Bool, "com.orvane.sonorel.playlist-contains-media-type"},
-    {"minm", Kind::String, "dmap.itemname"},
-    {"mild", Kind::UInt64, "dmap.longitemid"},
-    {"mmdl", Kind::String, "model"},
-    {"mmnf", Kind::String, "manufacturer"},
-    {"dvty", Kind::UInt8, "deviceType"},
-    {"mslr", Kind::UInt8, "dmap.loginrequired"},
-    {"msal", Kind::UInt8, "dmap.supportsautologout"},
-    {"msau", Kind::UInt8, "dmap.authenticationmethod"},
-    {"msas", Kind::UInt8, "dmap.authenticationschemes"},
-    {"mstm", Kind::UInt32, "dmap.timeoutinterval"},
-    {"mstc", Kind::UInt32, "dmap.utctime"},
-    {"msto", Kind::UInt32, "dmap.utcoffset"},
-    {"msdc", Kind::UInt32, "dmap.databasescount"},
-    {"msup", Kind::UInt8, "dmap.supportsupdate"},
-    {"mspi", Kind::UInt8, "dmap.supportspersistentids"},
-    {"msex", Kind::UInt8, "dmap.supportsextensions"},
-    {"msbr", Kind::UInt8, "dmap.supportsbrowse"},
-    {"msqy", Kind::UInt8, "dmap.supportsquery"},
-    {"msix", Kind::UInt8, "dmap.supportsindex"},
-    {"msrs", Kind::UInt8, "dmap.supportsresolve"},
-    {"msed", Kind::Bool, "supportsEditing"},
-    {"meds", Kind::Bool, "dmap.editcommandssupported"},
-    {"msii", Kind::Bool, "dmap.supportsinlinecontaineritems"},
-    {"msli", Kind::Bool, "dmap.supportslongitemid"},
-    {"asgr", Kind::UInt16, "daap.supportsgroups"},
-    {"ated", Kind::UInt16, "daap.supportsextradata"},
-    {"asse", Kind::Bool, "daap.supportssetproperty"},
-};
+inline std::vector<PlainTag> plainTags(std::initializer_list<KindGroup> groups) {
+  std::vector<PlainTag> table;
+  for (const KindGroup& group : groups) {
+    std::istringstream words{std::string(group.pairs)};
+    std::string code;
+    std::string key;
+    while (words >> code >> key) table.push_back({code, group.kind, key});
+  }
+  return table;
+}
 
-const std::vector<PlainTag> kDACPPropertyTags{
-    {"mstt", Kind::UInt32, "dmap.status"},
-    {"cmsr", Kind::UInt32, "dmcp.playstatusrevision"},
-    {"caps", Kind::UInt8, "dacp.playerstate"},
-    {"cash", Kind::UInt8, "dacp.shufflestate"},
-    {"carp", Kind::UInt8, "dacp.repeatstate"},
-    {"caas", Kind::UInt32, "dacp.availableshufflestates"},
-    {"caar", Kind::UInt32, "dacp.availablerepeatstates"},
-    {"cafe", Kind::Bool, "dacp.fullscreenenabled"},
-    {"cafs", Kind::Bool, "dacp.fullscreen"},
-    {"cave", Kind::Bool, "dacp.visualizerenabled"},
-    {"cavs", Kind::Bool, "dacp.visualizer"},
-    {"cavc", Kind::Bool, "dacp.volumecontrollable"},
-    {"cant", Kind::UInt32, "dacp.playingtime"},
-    {"cast", Kind::UInt32, "daap.songtime"},
-    {"cann", Kind::String, "dmap.itemname"},
-    {"cana", Kind::String, "daap.songartist"},
-    {"canl", Kind::String, "daap.songalbum"},
-    {"cang", Kind::String, "NPGenre"},
-    {"cmbd", Kind::String, "libraryDisplayName"},
-    {"cmbm", Kind::String, "libraryServiceDomain"},
-    {"cmbs", Kind::String, "libraryServiceName"},
-    {"cmbt", Kind::String, "libraryServiceType"},
-    {"cmmk", Kind::UInt32, "mediaKind"},
-    {"mper", Kind::UInt64, "dmap.persistentid"},
-    {"asai", Kind::UInt64, "daap.songalbumid"},
-    {"ceGS", Kind::Bool, "com.orvane.sonorel.can-be-curator-seed"},
-    {"aeSI", Kind::UInt32, "com.orvane.sonorel.orms-songid"},
-};
+const std::vector<PlainTag> kListingItemTags = plainTags({
+    {Kind::String,
+     "aeCR com.orvane.sonorel.content-rating  aeCT com.orvane.sonorel.cloud-artwork-token "
+     "aeCa com.orvane.sonorel.cloud-artwork-url  aeEN com.orvane.sonorel.episode-num-str "
+     "aePd com.orvane.sonorel.display-publication-version "
+     "aeSN com.orvane.sonorel.series-name  agrp daap.songgrouping "
+     "ascn daap.songcontentdescription  ascp daap.songcomposer  asct daap.songcategory "
+     "asdt daap.songdescription  asfm daap.songformat  asgn daap.songgenre "
+     "aslc daap.songlongcontentdescription  aspu daap.songpodcasturl  assa daap.sortartist "
+     "assn daap.sortname  assu daap.sortalbum  asul daap.songdataurl "
+     "cmbd libraryDisplayName  cmbm libraryServiceDomain  cmbs libraryServiceName "
+     "cmbt libraryServiceType  cmid identifier  cmnm name  pasp aspectRatio"},
+    {Kind::UInt8,
+     "aeHD com.orvane.sonorel.is-hd-video  aeMK com.orvane.sonorel.mediakind "
+     "aePC com.orvane.sonorel.is-podcast  aePS com.orvane.sonorel.special-playlist "
+     "aprm daap.playlistrepeatmode  apsm daap.playlistshufflemode  asbk daap.bookmarkable "
+     "ascr daap.songcontentrating  ashp daap.songhasbeenplayed  asur daap.songuserrating "
+     "cahp hasPassword  mgds dmap.groupdownloadstatus  mikd dmap.itemkind "
+     "msas dmap.authenticationschemes  msau dmap.authenticationmethod"},
+    {Kind::UInt16,
+     "asac daap.songartworkcount  asdc daap.songdisccount  asdn daap.songdiscnumber "
+     "astc daap.songtrackcount  astn daap.songtracknumber  asyr daap.songyear"},
+    {Kind::UInt32,
+     "aeCs com.orvane.sonorel.cloud-connect-status  aeES com.orvane.sonorel.episode-sort "
+     "aeRD com.orvane.sonorel.rental-duration  aeRP com.orvane.sonorel.rental-pb-start "
+     "aeRS com.orvane.sonorel.rental-start  aeRU com.orvane.sonorel.rental-pb-duration "
+     "aeSU com.orvane.sonorel.season-num  aeto com.orvane.sonorel.cloud-purchased-token "
+     "agac daap.groupalbumcount  agma daap.groupmatchedqueryalbumcount "
+     "agmi daap.groupmatchedqueryitemcount  asbo daap.songbookmark "
+     "askp daap.songuserskipcount  aspc daap.songuserplaycount  astm daap.songtime "
+     "capr dacp.protocolversion  cmmn minimum  cmmx maximum  cmpr dmcp.protocolversion "
+     "mctc dmap.containercount  mdbk dmap.databasekind  merr dmap.errorresponse "
+     "mimc dmap.itemcount  mshi headerItemIndex  mshn headerItemCount  mstt dmap.status"},
+    {Kind::UInt64,
+     "aeAD com.orvane.sonorel.ware-ids-array  aeAI com.orvane.sonorel.orms-artistid "
+     "aeAi com.orvane.sonorel.ware-id  aeCU com.orvane.sonorel.cloud-user-id "
+     "aeCd com.orvane.sonorel.cloud-id  aeIM com.orvane.sonorel.sonorel-machine-id "
+     "aeRM com.orvane.sonorel.remote-sonorel-machine-id "
+     "aeSE com.orvane.sonorel.store-pers-id  aepv com.orvane.sonorel.publication-version "
+     "ceSX kExtDACPSupportedSonorelExtensionsCode  mild dmap.longitemid "
+     "mper dmap.persistentid  mrpr dmap.remotepersistentid  msma macAddress"},
+    {Kind::Bool,
+     "abpl daap.baseplaylist  aeHS com.orvane.sonorel.is-homeshare "
+     "aeMI com.orvane.sonorel.mastered-for-sonorel  aeSG com.orvane.sonorel.saved-curator "
+     "aeSP com.orvane.sonorel.smart-playlist  asdb daap.songdisabled  caia selected "
+     "caip isPlaying  caiv supportsVideo  caov supportsMultiSpeakerVolume "
+     "cass supportsSpeakerSelection  casu supportsSetUserRating  cavd selectedForVideo "
+     "ceDR com.orvane.sonorel.supports-directional-remote "
+     "ceSG com.orvane.sonorel.supports-curator-control  cmrl supportsRemoteLibrarySelection "
+     "cmsb supportsBeaconSourcesUpdates  cmsc supportsControlPromptRequests "
+     "cmsp supportsPlayStatusUpdate  cmsv supportsVolume  crol readOnly "
+     "mavl dmap.itemavailable  mihi dmap.itemhidden"},
+    {Kind::Date,
+     "ajEd com.orvane.sonorel.store.expected-release-date  asda daap.songdateadded "
+     "asdm daap.songdatemodified  asdp daap.songdatepurchased  asdr daap.songdatereleased"},
+});
 
-const std::vector<PlainTag> kFlavorTags{
-    {"aeRp", Kind::String, "com.orvane.sonorel.item-redownload-param-2"},
-    {"aefd", Kind::UInt32, "com.orvane.sonorel.item-flavor-id"},
-    {"ajUp", Kind::String, "com.orvane.sonorel.store.item-update-param"},
-    {"asbr", Kind::UInt16, "daap.songbitrate"},
-    {"ascd", Kind::UInt32, "daap.songcodectype"},
-    {"ascs", Kind::UInt32, "daap.songcodecsubtype"},
-    {"asdk", Kind::UInt8, "daap.songdatakind"},
-    {"asfm", Kind::String, "daap.songformat"},
-    {"asls", Kind::UInt64, "daap.songlongsize"},
-    {"assr", Kind::UInt32, "daap.songsamplerate"},
-    {"astm", Kind::UInt32, "daap.songtime"},
-};
+const std::vector<PlainTag> kServerInfoTags = plainTags({
+    {Kind::UInt32,
+     "mstt dmap.status  mpro dmap.protocolversion  apro daap.protocolversion  ppro ppro "
+     "atSV Client-TVB-Sharing-Version  aeSV com.orvane.sonorel.music-sharing-version "
+     "aeto com.orvane.sonorel.cloud-purchase-token  mstm dmap.timeoutinterval "
+     "mstc dmap.utctime  msto dmap.utcoffset  msdc dmap.databasescount"},
+    {Kind::UInt64, "aeSX com.orvane.sonorel.supportedextensions  mild dmap.longitemid"},
+    {Kind::Bool,
+     "aeCP supportsPurchases  aeMQ com.orvane.sonorel.playlist-contains-media-type "
+     "msed supportsEditing  meds dmap.editcommandssupported "
+     "msii dmap.supportsinlinecontaineritems  msli dmap.supportslongitemid "
+     "asse daap.supportssetproperty"},
+    {Kind::String, "minm dmap.itemname  mmdl model  mmnf manufacturer"},
+    {Kind::UInt8,
+     "dvty deviceType  mslr dmap.loginrequired  msal dmap.supportsautologout "
+     "msau dmap.authenticationmethod  msas dmap.authenticationschemes "
+     "msup dmap.supportsupdate  mspi dmap.supportspersistentids "
+     "msex dmap.supportsextensions  msbr dmap.supportsbrowse  msqy dmap.supportsquery "
+     "msix dmap.supportsindex  msrs dmap.supportsresolve"},
+    {Kind::UInt16, "asgr daap.supportsgroups  ated daap.supportsextradata"},
+});
 
-const std::vector<PlainTag> kListingHeaderTags{
-    {"mstt", Kind::UInt32, "dmap.status"},
-    {"muty", Kind::UInt8, "dmap.updatetype"},
-    {"mtco", Kind::UInt32, "dmap.specifiedtotalcount"},
-    {"musr", Kind::UInt32, "dmap.serverrevision"},
-    {"cmbr", Kind::UInt32, "dmcp.beaconsourcesrevision"},
-};
+const std::vector<PlainTag> kDACPPropertyTags = plainTags({
+    {Kind::UInt32,
+     "mstt dmap.status  cmsr dmcp.playstatusrevision  caas dacp.availableshufflestates "
+     "caar dacp.availablerepeatstates  cant dacp.playingtime  cast daap.songtime "
+     "cmmk mediaKind  aeSI com.orvane.sonorel.orms-songid"},
+    {Kind::UInt8, "caps dacp.playerstate  cash dacp.shufflestate  carp dacp.repeatstate"},
+    {Kind::Bool,
+     "cafe dacp.fullscreenenabled  cafs dacp.fullscreen  cave dacp.visualizerenabled "
+     "cavs dacp.visualizer  cavc dacp.volumecontrollable "
+     "ceGS com.orvane.sonorel.can-be-curator-seed"},
+    {Kind::String,
+     "cann dmap.itemname  cana daap.songartist  canl daap.songalbum  cang NPGenre "
+     "cmbd libraryDisplayName  cmbm libraryServiceDomain  cmbs libraryServiceName "
+     "cmbt libraryServiceType"},
+    {Kind::UInt64, "mper dmap.persistentid  asai daap.songalbumid"},
+});
 
-const std::vector<PlainTag> kErrorTags{
-    {"mstt", Kind::UInt32, "dmap.status"},
-    {"aeRC", Kind::UInt32, "com.orvane.sonorel.reconnect-interval"},
-};
+const std::vector<PlainTag> kFlavorTags = plainTags({
+    {Kind::String,
+     "aeRp com.orvane.sonorel.item-redownload-param-2 "
+     "ajUp com.orvane.sonorel.store.item-update-param  asfm daap.songformat"},
+    {Kind::UInt32,
+     "aefd com.orvane.sonorel.item-flavor-id  ascd daap.songcodectype "
+     "ascs daap.songcodecsubtype  assr daap.songsamplerate  astm daap.songtime"},
+    {Kind::UInt16, "asbr daap.songbitrate"},
+    {Kind::UInt8, "asdk daap.songdatakind"},
+    {Kind::UInt64, "asls daap.songlongsize"},
+});
 
-const std::vector<PlainTag> kContentCollectionTags{
-    {"mcnm", Kind::UInt32, "dmap.contentcodesnumber"},
-    {"mcna", Kind::String, "dmap.contentcodesname"},
-};
+const std::vector<PlainTag> kListingHeaderTags = plainTags({
+    {Kind::UInt32,
+     "mstt dmap.status  mtco dmap.specifiedtotalcount  musr dmap.serverrevision "
+     "cmbr dmcp.beaconsourcesrevision"},
+    {Kind::UInt8, "muty dmap.updatetype"},
+});
 
-const std::vector<PlainTag> kControlPromptCollectionTags{
-    {"cmca", Kind::String, "attributes"},
-    {"cmcv", Kind::String, "value"},
-    {"cmce", Kind::String, "name"},
-};
+const std::vector<PlainTag> kErrorTags = plainTags({
+    {Kind::UInt32, "mstt dmap.status  aeRC com.orvane.sonorel.reconnect-interval"},
+});
+
+const std::vector<PlainTag> kContentCollectionTags = plainTags({
+    {Kind::UInt32, "mcnm dmap.contentcodesnumber"},
+    {Kind::String, "mcna dmap.contentcodesname"},
+});
+
+const std::vector<PlainTag> kControlPromptCollectionTags = plainTags({
+    {Kind::String, "cmca attributes  cmcv value  cmce name"},
+});
 
 // A value for the `index`th tag of a table, different for every tag and
 // chosen so that a swapped byte order, a lost sign bit or a wrong width
@@ -504,32 +399,27 @@ struct TopLevelCode {
   Shape shape;
 };
 
-const std::vector<TopLevelCode> kTopLevelCodes{{"abro", Shape::Dictionary},
-                                               {"adbs", Shape::Dictionary},
-                                               {"aeBR", Shape::Dictionary},
-                                               {"agal", Shape::Dictionary},
-                                               {"agar", Shape::Dictionary},
-                                               {"aply", Shape::Dictionary},
-                                               {"apso", Shape::Dictionary},
-                                               {"avdb", Shape::Dictionary},
-                                               {"caci", Shape::Dictionary},
-                                               {"cmbu", Shape::Dictionary},
-                                               {"cprp", Shape::Dictionary},
-                                               {"mctl", Shape::Dictionary},
-                                               {"mscr", Shape::Dictionary},
-                                               {"mupd", Shape::Dictionary},
-                                               {"cacr", Shape::Item},
-                                               {"medc", Shape::Item},
-                                               {"casp", Shape::Array},
-                                               {"ceGI", Shape::Array},
-                                               {"cmcp", Shape::Dictionary},
-                                               {"cmgt", Shape::Dictionary},
-                                               {"cmst", Shape::Dictionary},
-                                               {"mccr", Shape::Array},
-                                               {"merr", Shape::DictionaryOrNull},
-                                               {"mlog", Shape::NumberOrNull},
-                                               {"msrv", Shape::Dictionary},
-                                               {"arsv", Shape::Null}};
+// The listing documents, which all decode the same way.
+constexpr const char* kListingCodes[] = {"abro", "adbs", "aeBR", "agal", "agar", "aply", "apso",
+                                         "avdb", "caci", "cmbu", "cprp", "mctl", "mscr", "mupd"};
+
+const std::vector<TopLevelCode> kTopLevelCodes = [] {
+  std::vector<TopLevelCode> codes;
+  for (const char* code : kListingCodes) codes.push_back({code, Shape::Dictionary});
+  codes.insert(codes.end(), {{"cacr", Shape::Item},
+                             {"medc", Shape::Item},
+                             {"casp", Shape::Array},
+                             {"ceGI", Shape::Array},
+                             {"cmcp", Shape::Dictionary},
+                             {"cmgt", Shape::Dictionary},
+                             {"cmst", Shape::Dictionary},
+                             {"mccr", Shape::Array},
+                             {"merr", Shape::DictionaryOrNull},
+                             {"mlog", Shape::NumberOrNull},
+                             {"msrv", Shape::Dictionary},
+                             {"arsv", Shape::Null}});
+  return codes;
+}();
 
 inline bool hasShape(const DAAPValue& value, Shape shape) {
   switch (shape) {
@@ -581,8 +471,7 @@ inline Tag bookItem(std::uint32_t identifier) {
 
 inline std::vector<std::pair<std::string, Tag>> seedDocuments() {
   std::vector<std::pair<std::string, Tag>> seeds;
-  for (const char* code : {"abro", "adbs", "aeBR", "agal", "agar", "aply", "apso", "avdb", "caci",
-                           "cmbu", "cprp", "mctl", "mscr", "mupd"}) {
+  for (const char* code : kListingCodes) {
     seeds.emplace_back(
         code, container(code, {u32("mstt", 200), u8("muty", 0), u32("mtco", 2), u32("mrco", 2),
                                u32("musr", 17), container("mlcl", {bookItem(1), bookItem(2)}),
