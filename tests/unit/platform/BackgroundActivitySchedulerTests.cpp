@@ -16,6 +16,7 @@
 #include <vector>
 
 #include "platform/dispatch/DispatchSemaphore.h"
+#include "tests/unit/platform/TemporaryFolderTest.h"
 
 namespace larder {
 namespace {
@@ -366,21 +367,11 @@ struct Supply {
   std::optional<int> online;
 };
 
-class BackgroundActivityPowerSourceTest : public ::testing::Test {
+class BackgroundActivityPowerSourceTest : public TemporaryFolderTest {
  protected:
-  void SetUp() override {
-    std::string pattern = (fs::temp_directory_path() / "larder-power-XXXXXX").string();
-    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
-    root_ = pattern;
-  }
-  void TearDown() override {
-    std::error_code ignored;
-    fs::remove_all(root_, ignored);
-  }
-
   // Writes the supplies into `folder`, below the test's root, and gives its path.
   std::string supplies(const std::string& folder, const std::vector<Supply>& list) const {
-    const std::string path = root_ + "/" + folder;
+    const std::string path = base_ + "/" + folder;
     fs::create_directories(path);
     for (const Supply& supply : list) {
       fs::create_directories(path + "/" + supply.name);
@@ -390,8 +381,6 @@ class BackgroundActivityPowerSourceTest : public ::testing::Test {
     }
     return path;
   }
-
-  std::string root_;
 };
 
 TEST_F(BackgroundActivityPowerSourceTest, ReadsMainsFromTheSupplyFolder) {
@@ -417,11 +406,11 @@ TEST_F(BackgroundActivityPowerSourceTest, ReadsMainsFromTheSupplyFolder) {
     EXPECT_EQ(BackgroundActivityPowerSource::mainsPowerInSupplyFolder(folder),
               cases[index].onMains);
   }
-  EXPECT_TRUE(BackgroundActivityPowerSource::mainsPowerInSupplyFolder(root_ + "/missing"));
+  EXPECT_TRUE(BackgroundActivityPowerSource::mainsPowerInSupplyFolder(base_ + "/missing"));
 }
 
 TEST_F(BackgroundActivityPowerSourceTest, SystemSourceReadsBelowThePlatformRoot) {
-  ::setenv("LARDER_ROOT", root_.c_str(), 1);
+  ::setenv("LARDER_ROOT", base_.c_str(), 1);
   const auto source = BackgroundActivityPowerSource::system();
   supplies("sys/class/power_supply", {{"AC", "Mains", 0}, {"BAT0", "Battery", std::nullopt}});
   EXPECT_FALSE(source->isOnMainsPower());
@@ -444,7 +433,10 @@ TEST(BackgroundActivitySystemClock, WakesUpAtTheTimeAndNotAfterCancel) {
   std::atomic<bool> cancelledFired{false};
   clock->scheduleWakeUp(clock->now() + 30ms, [&] { cancelledFired = true; });
   clock->cancelWakeUp();
-  std::this_thread::sleep_for(80ms);
+  // Another clock's wake-up, due after the cancelled one, is the sign that its time has passed.
+  const auto yardstick = BackgroundActivityClock::system();
+  yardstick->scheduleWakeUp(clock->now() + 60ms, [&] { woke.signal(); });
+  ASSERT_TRUE(woke.waitFor(2s));
   EXPECT_FALSE(cancelledFired.load());
 }
 

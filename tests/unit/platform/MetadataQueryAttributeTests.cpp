@@ -10,6 +10,7 @@
 
 #include "platform/metadata/MetadataAttributes.h"
 #include "platform/plist/PropertyListSerialization.h"
+#include "tests/unit/platform/TemporaryFolderTest.h"
 
 namespace larder {
 namespace {
@@ -123,27 +124,15 @@ TEST(MetadataQueryAttributes, ContentTypeOnlyForBundleFolders) {
   EXPECT_FALSE(Attributes::isBundleName("x.apps"));
 }
 
-class MetadataQueryBundleReading : public ::testing::Test {
+class MetadataQueryBundleReading : public TemporaryFolderTest {
  protected:
-  void SetUp() override {
-    std::string pattern = (fs::temp_directory_path() / "larder-mdattr-XXXXXX").string();
-    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
-    folder_ = pattern;
-  }
-  void TearDown() override {
-    std::error_code ignored;
-    fs::remove_all(folder_, ignored);
-  }
-
   static void writeFile(const std::string& path, std::string_view contents) {
     std::ofstream(path, std::ios::binary) << contents;
   }
-
-  std::string folder_;
 };
 
 TEST_F(MetadataQueryBundleReading, ReadsBothPropertyListsFromDisk) {
-  const std::string bundle = folder_ + "/Notes.app";
+  const std::string bundle = base_ + "/Notes.app";
   fs::create_directories(bundle);
   writeFile(bundle + "/bundle.plist", PropertyListSerialization::writeXml(bundleInfo()));
   const PlistData binary = PropertyListSerialization::writeBinary(PlistValue(purchaseRecord()));
@@ -184,7 +173,7 @@ TEST_F(MetadataQueryBundleReading, DamagedFilesCountAsAbsent) {
   for (const auto& [name, damage] : damages) {
     for (const bool damageInformation : {true, false}) {
       SCOPED_TRACE(std::string(name) + (damageInformation ? " bundle.plist" : " purchase.plist"));
-      const std::string bundle = folder_ + "/" + std::to_string(++count) + ".app";
+      const std::string bundle = base_ + "/" + std::to_string(++count) + ".app";
       fs::create_directories(bundle);
       // What reading should see: nothing in place of the damaged file.
       const PlistValue info = damageInformation ? PlistValue() : PlistValue(bundleInfo());
@@ -205,11 +194,11 @@ TEST_F(MetadataQueryBundleReading, DamagedFilesCountAsAbsent) {
 }
 
 TEST_F(MetadataQueryBundleReading, NotAFolderIsNoBundle) {
-  EXPECT_FALSE(Attributes::readBundle(folder_ + "/Missing.app").has_value());
-  std::ofstream(folder_ + "/File.app") << "x";
-  EXPECT_FALSE(Attributes::readBundle(folder_ + "/File.app").has_value());
-  fs::create_symlink(folder_ + "/Loop.app", folder_ + "/Loop.app");
-  EXPECT_FALSE(Attributes::readBundle(folder_ + "/Loop.app").has_value());
+  EXPECT_FALSE(Attributes::readBundle(base_ + "/Missing.app").has_value());
+  std::ofstream(base_ + "/File.app") << "x";
+  EXPECT_FALSE(Attributes::readBundle(base_ + "/File.app").has_value());
+  fs::create_symlink(base_ + "/Loop.app", base_ + "/Loop.app");
+  EXPECT_FALSE(Attributes::readBundle(base_ + "/Loop.app").has_value());
 }
 
 }  // namespace
