@@ -1,3 +1,4 @@
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <plist/plist.h>
 
@@ -355,7 +356,7 @@ void expectRead(const ReadCase& c) {
   ASSERT_FALSE(read) << "accepted";
   EXPECT_EQ(read.error().domain, PropertyListSerialization::kErrorDomain);
   EXPECT_FALSE(read.error().description.empty());
-  EXPECT_NE(read.error().description.find(*c.error), std::string::npos) << read.error().description;
+  EXPECT_THAT(read.error().description, testing::HasSubstr(*c.error));
 }
 
 // ---------------------------------------------------------------------------
