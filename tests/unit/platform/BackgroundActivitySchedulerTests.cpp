@@ -162,6 +162,12 @@ class BackgroundActivitySchedulerTest : public ::testing::Test {
     flush();
   }
 
+  // Moves the clock on by `by` and gives the calls that came meanwhile.
+  std::vector<Call> after(Duration by) {
+    pass(by);
+    return takeCalls();
+  }
+
   std::vector<Call> takeCalls() {
     std::lock_guard lock(mutex_);
     return std::exchange(calls_, {});
@@ -180,14 +186,10 @@ class BackgroundActivitySchedulerTest : public ::testing::Test {
 
 TEST_F(BackgroundActivitySchedulerTest, RepeatingActivityRunsEveryInterval) {
   ASSERT_TRUE(add("reload", periodicReload()));
-  pass(10h - 1s);
-  EXPECT_THAT(takeCalls(), IsEmpty());
-  pass(1s);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 10h, 1}));
-  pass(10h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 20h, 2}));
-  pass(25h);
-  EXPECT_THAT(takeCalls(),
+  EXPECT_THAT(after(10h - 1s), IsEmpty());
+  EXPECT_THAT(after(1s), ElementsAre(Call{"reload", State::Run, 10h, 1}));
+  EXPECT_THAT(after(10h), ElementsAre(Call{"reload", State::Run, 20h, 2}));
+  EXPECT_THAT(after(25h),
               ElementsAre(Call{"reload", State::Run, 30h, 3}, Call{"reload", State::Run, 40h, 4}));
   const std::optional<BackgroundActivity> activity = scheduler_->activity("reload");
   ASSERT_TRUE(activity.has_value());
@@ -198,10 +200,8 @@ TEST_F(BackgroundActivitySchedulerTest, RepeatingActivityRunsEveryInterval) {
 
 TEST_F(BackgroundActivitySchedulerTest, OneTimeActivityRunsOnceAfterItsDelay) {
   ASSERT_TRUE(add("once", {.delay = 5min}));
-  pass(1h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"once", State::Run, 5min, 1}));
-  pass(10h);
-  EXPECT_THAT(takeCalls(), IsEmpty());
+  EXPECT_THAT(after(1h), ElementsAre(Call{"once", State::Run, 5min, 1}));
+  EXPECT_THAT(after(10h), IsEmpty());
   EXPECT_EQ(scheduler_->activity("once")->state, State::Done);
 }
 
@@ -214,13 +214,10 @@ TEST_F(BackgroundActivitySchedulerTest, WithoutDelayItRunsAtOnce) {
 TEST_F(BackgroundActivitySchedulerTest, OnBatteryItWaitsHearsDeferredAndRunsOnMains) {
   power_->set(false);
   ASSERT_TRUE(add("reload", periodicReload()));
-  pass(10h);
-  EXPECT_THAT(takeCalls(), IsEmpty()) << "due, but waiting within its grace period";
+  EXPECT_THAT(after(10h), IsEmpty()) << "due, but waiting within its grace period";
   EXPECT_EQ(scheduler_->activity("reload")->state, State::Waiting);
-  pass(2h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Deferred, 12h, 0}));
-  pass(5h);
-  EXPECT_THAT(takeCalls(), IsEmpty()) << "deferred once, never run on battery";
+  EXPECT_THAT(after(2h), ElementsAre(Call{"reload", State::Deferred, 12h, 0}));
+  EXPECT_THAT(after(5h), IsEmpty()) << "deferred once, never run on battery";
 
   power_->set(true);
   scheduler_->powerSourceDidChange();
@@ -234,8 +231,7 @@ TEST_F(BackgroundActivitySchedulerTest, MainsReturningWithinGraceIsNoticedByTheP
   ASSERT_TRUE(add("reload", periodicReload()));
   pass(11h);
   power_->set(true);
-  pass(kPowerCheck);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 11h + kPowerCheck, 1}));
+  EXPECT_THAT(after(kPowerCheck), ElementsAre(Call{"reload", State::Run, 11h + kPowerCheck, 1}));
 }
 
 TEST_F(BackgroundActivitySchedulerTest, AllowedOnBatteryRunsOnBattery) {
@@ -243,28 +239,23 @@ TEST_F(BackgroundActivitySchedulerTest, AllowedOnBatteryRunsOnBattery) {
   BackgroundActivityCriteria criteria = periodicReload();
   criteria.allowBattery = true;
   ASSERT_TRUE(add("sync", criteria));
-  pass(10h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"sync", State::Run, 10h, 1}));
+  EXPECT_THAT(after(10h), ElementsAre(Call{"sync", State::Run, 10h, 1}));
 }
 
 TEST_F(BackgroundActivitySchedulerTest, OccurrencesMissedOnBatteryAreNotMadeUp) {
   power_->set(false);
   ASSERT_TRUE(add("reload", periodicReload()));
-  pass(45h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Deferred, 12h, 0}));
+  EXPECT_THAT(after(45h), ElementsAre(Call{"reload", State::Deferred, 12h, 0}));
   power_->set(true);
-  pass(kPowerCheck);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 45h + kPowerCheck, 1}));
-  pass(10h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 55h + kPowerCheck, 2}));
+  EXPECT_THAT(after(kPowerCheck), ElementsAre(Call{"reload", State::Run, 45h + kPowerCheck, 1}));
+  EXPECT_THAT(after(10h), ElementsAre(Call{"reload", State::Run, 55h + kPowerCheck, 2}));
 }
 
 TEST_F(BackgroundActivitySchedulerTest, UtilityGoesBeforeMaintenanceAtTheSameMoment) {
   ASSERT_TRUE(add("a.tidy", {.delay = 1h, .priority = BackgroundActivityPriority::Maintenance}));
   ASSERT_TRUE(add("b.fetch", {.delay = 1h, .priority = BackgroundActivityPriority::Utility}));
   ASSERT_TRUE(add("c.tidy", {.delay = 1h, .priority = BackgroundActivityPriority::Maintenance}));
-  pass(1h);
-  EXPECT_THAT(takeCalls(),
+  EXPECT_THAT(after(1h),
               ElementsAre(Call{"b.fetch", State::Run, 1h, 1}, Call{"a.tidy", State::Run, 1h, 1},
                           Call{"c.tidy", State::Run, 1h, 1}));
 }
@@ -310,8 +301,7 @@ TEST_F(BackgroundActivitySchedulerTest, RegisteringAgainReplacesTheActivity) {
   BackgroundActivityCriteria sooner = periodicReload();
   sooner.delay = 1h;
   ASSERT_TRUE(add("reload", sooner));
-  pass(1h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 6h, 1}));
+  EXPECT_THAT(after(1h), ElementsAre(Call{"reload", State::Run, 6h, 1}));
   EXPECT_THAT(scheduler_->activityNames(), ElementsAre("reload"));
 }
 
@@ -321,8 +311,7 @@ TEST_F(BackgroundActivitySchedulerTest, UnregisteredActivityRunsNoMore) {
   EXPECT_EQ(takeCalls().size(), 1u);
   EXPECT_TRUE(scheduler_->unregisterActivity("reload"));
   EXPECT_FALSE(scheduler_->unregisterActivity("reload"));
-  pass(30h);
-  EXPECT_THAT(takeCalls(), IsEmpty());
+  EXPECT_THAT(after(30h), IsEmpty());
   EXPECT_FALSE(scheduler_->activity("reload").has_value());
 }
 

@@ -96,9 +96,23 @@ class QueryRecorder {
       : queue_(DispatchQueue::create("MetadataQueryTests", DispatchQueue::Kind::Serial)) {
     query->setQueue(queue_);
     query->setHandlers({
-        [this](MetadataQuery& q) { onFinished(q); },
-        [this](MetadataQuery& q, const MetadataQueryUpdate& update) { onUpdate(q, update); },
-        [this](MetadataQuery& q) { onPortInvalid(q); },
+        [this](MetadataQuery& q) {
+          std::vector<std::string> paths;
+          for (std::size_t index = 0; index < q.resultCount(); ++index) {
+            paths.push_back(q.resultAtIndex(index)->path());
+          }
+          std::sort(paths.begin(), paths.end());
+          record([&] {
+            initialPaths_ = std::move(paths);
+            finished_ = true;
+          });
+        },
+        [this](MetadataQuery&, const MetadataQueryUpdate& update) {
+          RecordedUpdate entry{recorded(update.added), recorded(update.changed),
+                               recorded(update.removed)};
+          record([&] { updates_.push_back(std::move(entry)); });
+        },
+        [this](MetadataQuery&) { record([&] { ++portInvalidCount_; }); },
     });
   }
 
@@ -108,8 +122,10 @@ class QueryRecorder {
   }
 
   bool waitForFinished() {
-    std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, kEventTimeout, [this] { return finished_; });
+    return waitFor([this] { return finished_; });
+  }
+  bool waitForPortInvalid() {
+    return waitFor([this] { return portInvalidCount_ > 0; });
   }
 
   // The next update, or an empty one (and a failure) when none comes.
@@ -161,11 +177,6 @@ class QueryRecorder {
     return !nextUpdate(0ms).has_value();
   }
 
-  bool waitForPortInvalid() {
-    std::unique_lock lock(mutex_);
-    return changed_.wait_for(lock, kEventTimeout, [this] { return portInvalidCount_ > 0; });
-  }
-
   std::vector<std::string> initialPaths() {
     std::lock_guard lock(mutex_);
     return initialPaths_;
@@ -186,33 +197,19 @@ class QueryRecorder {
     to.insert(to.end(), from.begin(), from.end());
   }
 
-  void onFinished(MetadataQuery& query) {
-    std::vector<std::string> paths;
-    for (std::size_t index = 0; index < query.resultCount(); ++index) {
-      paths.push_back(query.resultAtIndex(index)->path());
-    }
-    std::sort(paths.begin(), paths.end());
+  // Takes a change in under the lock, noting whether the handler ran on the queue.
+  template <typename Change>
+  void record(Change change) {
     std::lock_guard lock(mutex_);
     allOnQueue_ = allOnQueue_ && queue_->isCurrent();
-    initialPaths_ = std::move(paths);
-    finished_ = true;
+    change();
     changed_.notify_all();
   }
 
-  void onUpdate(MetadataQuery& /*query*/, const MetadataQueryUpdate& update) {
-    RecordedUpdate entry{recorded(update.added), recorded(update.changed),
-                         recorded(update.removed)};
-    std::lock_guard lock(mutex_);
-    allOnQueue_ = allOnQueue_ && queue_->isCurrent();
-    updates_.push_back(std::move(entry));
-    changed_.notify_all();
-  }
-
-  void onPortInvalid(MetadataQuery& /*query*/) {
-    std::lock_guard lock(mutex_);
-    allOnQueue_ = allOnQueue_ && queue_->isCurrent();
-    ++portInvalidCount_;
-    changed_.notify_all();
+  template <typename Condition>
+  bool waitFor(Condition condition) {
+    std::unique_lock lock(mutex_);
+    return changed_.wait_for(lock, kEventTimeout, condition);
   }
 
   std::shared_ptr<DispatchQueue> queue_;
