@@ -198,22 +198,24 @@ TEST_F(BackgroundActivitySchedulerTest, RepeatingActivityRunsEveryInterval) {
   EXPECT_EQ(activity->runCount, 4u);
 }
 
-TEST_F(BackgroundActivitySchedulerTest, OneTimeActivityRunsOnceAfterItsDelay) {
+TEST_F(BackgroundActivitySchedulerTest, OneTimeActivityRunsOnceAfterItsDelayOrAtOnceWithout) {
+  ASSERT_TRUE(add("now", {}));
   ASSERT_TRUE(add("once", {.delay = 5min}));
+  flush();
+  EXPECT_THAT(takeCalls(), ElementsAre(Call{"now", State::Run, 0h, 1}));
   EXPECT_THAT(after(1h), ElementsAre(Call{"once", State::Run, 5min, 1}));
   EXPECT_THAT(after(10h), IsEmpty());
   EXPECT_EQ(scheduler_->activity("once")->state, State::Done);
 }
 
-TEST_F(BackgroundActivitySchedulerTest, WithoutDelayItRunsAtOnce) {
-  ASSERT_TRUE(add("now", {}));
-  flush();
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"now", State::Run, 0h, 1}));
-}
-
+// One activity that may not run on battery and one that may.
 TEST_F(BackgroundActivitySchedulerTest, OnBatteryItWaitsHearsDeferredAndRunsOnMains) {
   power_->set(false);
   ASSERT_TRUE(add("reload", periodicReload()));
+  BackgroundActivityCriteria anyPower = periodicReload();
+  anyPower.allowBattery = true;
+  anyPower.delay = 20h;
+  ASSERT_TRUE(add("sync", anyPower));
   EXPECT_THAT(after(10h), IsEmpty()) << "due, but waiting within its grace period";
   EXPECT_EQ(scheduler_->activity("reload")->state, State::Waiting);
   EXPECT_THAT(after(2h), ElementsAre(Call{"reload", State::Deferred, 12h, 0}));
@@ -224,6 +226,8 @@ TEST_F(BackgroundActivitySchedulerTest, OnBatteryItWaitsHearsDeferredAndRunsOnMa
   flush();
   EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 17h, 1}));
   EXPECT_EQ(scheduler_->activity("reload")->due.time_since_epoch(), 27h);
+  power_->set(false);
+  EXPECT_THAT(after(3h), ElementsAre(Call{"sync", State::Run, 20h, 1}));
 }
 
 TEST_F(BackgroundActivitySchedulerTest, MainsReturningWithinGraceIsNoticedByThePowerCheck) {
@@ -232,14 +236,6 @@ TEST_F(BackgroundActivitySchedulerTest, MainsReturningWithinGraceIsNoticedByTheP
   pass(11h);
   power_->set(true);
   EXPECT_THAT(after(kPowerCheck), ElementsAre(Call{"reload", State::Run, 11h + kPowerCheck, 1}));
-}
-
-TEST_F(BackgroundActivitySchedulerTest, AllowedOnBatteryRunsOnBattery) {
-  power_->set(false);
-  BackgroundActivityCriteria criteria = periodicReload();
-  criteria.allowBattery = true;
-  ASSERT_TRUE(add("sync", criteria));
-  EXPECT_THAT(after(10h), ElementsAre(Call{"sync", State::Run, 10h, 1}));
 }
 
 TEST_F(BackgroundActivitySchedulerTest, OccurrencesMissedOnBatteryAreNotMadeUp) {

@@ -130,6 +130,18 @@ class Caller {
   std::thread thread_;
 };
 
+// An item that holds its queue until released.
+struct Hold {
+  DispatchSemaphore started;
+  DispatchSemaphore release;
+  std::function<void()> item() {
+    return [this] {
+      started.signal();
+      release.wait();
+    };
+  }
+};
+
 std::string kindName(const ::testing::TestParamInfo<Kind>& info) {
   return info.param == Kind::Serial ? "Serial" : "Concurrent";
 }
@@ -473,20 +485,11 @@ TEST(ConcurrentQueue, ReadersAndBarriersUnderLoadNeverOverlap) {
 
 TEST(ConcurrentQueue, ReaderHeldBackByABarrierIsNotHeldBackByTheWorkerLimit) {
   auto queue = DispatchQueue::create("narrow", Kind::Concurrent, {.concurrentWorkers = 1});
-  DispatchSemaphore barrierStarted;
-  DispatchSemaphore releaseBarrier;
-  queue->barrierAsync([&] {
-    barrierStarted.signal();
-    releaseBarrier.wait();
-  });
-  ASSERT_TRUE(barrierStarted.waitFor(kGenerous));
-
-  DispatchSemaphore asyncStarted;
-  DispatchSemaphore releaseAsync;
-  queue->async([&] {
-    asyncStarted.signal();
-    releaseAsync.wait();
-  });
+  Hold barrier;
+  queue->barrierAsync(barrier.item());
+  ASSERT_TRUE(barrier.started.waitFor(kGenerous));
+  Hold async;
+  queue->async(async.item());
   queue->async([] {});  // waits for the only worker
   DispatchSemaphore readerDone;
   Caller reader([&] {
@@ -494,10 +497,10 @@ TEST(ConcurrentQueue, ReaderHeldBackByABarrierIsNotHeldBackByTheWorkerLimit) {
     readerDone.signal();
   });
   ASSERT_TRUE(reader.blocked());  // queued up behind the barrier
-  releaseBarrier.signal();
-  ASSERT_TRUE(asyncStarted.waitFor(kGenerous));
+  barrier.release.signal();
+  ASSERT_TRUE(async.started.waitFor(kGenerous));
   EXPECT_TRUE(readerDone.waitFor(kGenerous)) << "reader waited for a worker it does not need";
-  releaseAsync.signal();
+  async.release.signal();
   reader.join();
   queue->barrierSync([] {});  // the worker may still be returning from `releaseAsync`
 }
@@ -539,12 +542,8 @@ TEST_P(EveryQueueKind, SyncFromATaskOfAnotherQueueWorks) {
 
 TEST_P(EveryQueueKind, PendingItemsRunAfterTheLastReferenceIsDropped) {
   auto queue = makeQueue(GetParam());
-  DispatchSemaphore firstStarted;
-  DispatchSemaphore releaseFirst;
-  queue->barrierAsync([&] {
-    firstStarted.signal();
-    releaseFirst.wait();
-  });
+  Hold first;
+  queue->barrierAsync(first.item());
   constexpr int kItems = 60;
   std::atomic<int> ran{0};
   DispatchSemaphore allRan;
@@ -558,9 +557,9 @@ TEST_P(EveryQueueKind, PendingItemsRunAfterTheLastReferenceIsDropped) {
       queue->async(countRun);
     }
   }
-  ASSERT_TRUE(firstStarted.waitFor(kGenerous));
+  ASSERT_TRUE(first.started.waitFor(kGenerous));
   queue.reset();
-  releaseFirst.signal();
+  first.release.signal();
   EXPECT_TRUE(allRan.waitFor(kGenerous));
   EXPECT_EQ(ran, kItems);
 }
@@ -568,13 +567,9 @@ TEST_P(EveryQueueKind, PendingItemsRunAfterTheLastReferenceIsDropped) {
 TEST_P(EveryQueueKind, LastReferenceDroppedInsideItsOwnTask) {
   auto queue = makeQueue(GetParam());
   std::weak_ptr<DispatchQueue> weak = queue;
-  DispatchSemaphore blockerStarted;
-  DispatchSemaphore releaseBlocker;
   // A barrier, so that on a concurrent queue too the next item waits for the handle to go.
-  queue->barrierAsync([&] {
-    blockerStarted.signal();
-    releaseBlocker.wait();
-  });
+  Hold blocker;
+  queue->barrierAsync(blocker.item());
   DispatchSemaphore released;
   std::atomic<bool> expiredInside{false};
   queue->async([&released, &expiredInside, &weak, self = queue]() mutable {
@@ -582,9 +577,9 @@ TEST_P(EveryQueueKind, LastReferenceDroppedInsideItsOwnTask) {
     expiredInside = weak.expired();
     released.signal();
   });
-  ASSERT_TRUE(blockerStarted.waitFor(kGenerous));
+  ASSERT_TRUE(blocker.started.waitFor(kGenerous));
   queue.reset();
-  releaseBlocker.signal();
+  blocker.release.signal();
   ASSERT_TRUE(released.waitFor(kGenerous));
   EXPECT_TRUE(expiredInside);
 }
@@ -679,13 +674,9 @@ TEST_P(EveryQueueKind, SyncItemThatThrowsPropagatesAndReleasesTheQueueAlsoAfterW
   EXPECT_TRUE(ran.waitFor(kGenerous));
 
   // Also when the block waited its turn behind a barrier.
-  DispatchSemaphore barrierStarted;
-  DispatchSemaphore releaseBarrier;
-  queue->barrierAsync([&] {
-    barrierStarted.signal();
-    releaseBarrier.wait();
-  });
-  ASSERT_TRUE(barrierStarted.waitFor(kGenerous));
+  Hold barrier;
+  queue->barrierAsync(barrier.item());
+  ASSERT_TRUE(barrier.started.waitFor(kGenerous));
   std::atomic<bool> threw{false};
   Caller reader([&] {
     try {
@@ -695,7 +686,7 @@ TEST_P(EveryQueueKind, SyncItemThatThrowsPropagatesAndReleasesTheQueueAlsoAfterW
     }
   });
   ASSERT_TRUE(reader.blocked());
-  releaseBarrier.signal();
+  barrier.release.signal();
   reader.join();
   EXPECT_TRUE(threw);
   EXPECT_TRUE(completesWithin(kGenerous, [&] { queue->barrierSync([] {}); }));
@@ -704,39 +695,30 @@ TEST_P(EveryQueueKind, SyncItemThatThrowsPropagatesAndReleasesTheQueueAlsoAfterW
 TEST_P(EveryQueueKind, IsCurrentOnlyWhileRunningATaskOfThatQueueAndSyncRunsOnTheCaller) {
   auto queue = makeQueue(GetParam());
   auto other = makeQueue(GetParam());
+  const auto caller = std::this_thread::get_id();
+  std::mutex mutex;
+  std::string seen;  // each item as "name", "+" when the queue is current, "@" on the caller
+  const auto note = [&](const char* name) {
+    return [&, name] {
+      std::lock_guard lock(mutex);
+      seen += std::string(" ") + name + (queue->isCurrent() ? "+" : "") +
+              (other->isCurrent() ? " other+" : "") +
+              (std::this_thread::get_id() == caller ? "@" : "");
+    };
+  };
   EXPECT_FALSE(queue->isCurrent());
   queue->async([] {});
-  bool inSync = false;
-  bool otherInSync = true;
-  std::thread::id syncRanOn;
-  std::thread::id barrierSyncRanOn;
-  queue->sync([&] {
-    inSync = queue->isCurrent();
-    otherInSync = other->isCurrent();
-    syncRanOn = std::this_thread::get_id();
-  });
-  bool inBarrierSync = false;
-  queue->barrierSync([&] {
-    inBarrierSync = queue->isCurrent();
-    barrierSyncRanOn = std::this_thread::get_id();
-  });
-  // Both run on the calling thread.
-  EXPECT_EQ(syncRanOn, std::this_thread::get_id());
-  EXPECT_EQ(barrierSyncRanOn, std::this_thread::get_id());
-  std::atomic<bool> inAsync{false};
-  std::atomic<bool> inBarrierAsync{false};
+  queue->sync(note("sync"));
+  queue->barrierSync(note("barrierSync"));
   DispatchSemaphore done;
-  queue->async([&] { inAsync = queue->isCurrent(); });
-  queue->barrierAsync([&] {
-    inBarrierAsync = queue->isCurrent();
+  queue->async(note("async"));
+  queue->barrierAsync([&, last = note("barrierAsync")] {
+    last();
     done.signal();
   });
   ASSERT_TRUE(done.waitFor(kGenerous));
-  EXPECT_TRUE(inSync);
-  EXPECT_FALSE(otherInSync);
-  EXPECT_TRUE(inBarrierSync);
-  EXPECT_TRUE(inAsync);
-  EXPECT_TRUE(inBarrierAsync);
+  std::lock_guard lock(mutex);
+  EXPECT_EQ(seen, " sync+@ barrierSync+@ async+ barrierAsync+");
   EXPECT_FALSE(queue->isCurrent());
 }
 
@@ -795,21 +777,16 @@ TEST_P(EveryQueueKindDeathTest, SyncOnTheQueueOfTheRunningTaskAbortsInDebugBuild
 // ---------------------------------------------------------------------------------------------
 // Semaphores
 
-TEST(DispatchSemaphore, WaitForTimesOutWithoutASignal) {
-  DispatchSemaphore semaphore;
-  const auto before = Clock::now();
-  EXPECT_FALSE(semaphore.waitFor(20ms));
-  EXPECT_GE(Clock::now() - before, 20ms);
-}
-
-TEST(DispatchSemaphore, EachSignalOrInitialCountReleasesExactlyOneWait) {
+TEST(DispatchSemaphore, EachSignalOrInitialCountReleasesExactlyOneWaitAndOtherwiseTimesOut) {
   DispatchSemaphore semaphore(1);
   semaphore.signal();
   semaphore.signal();
   EXPECT_TRUE(semaphore.waitFor(0ms));
   semaphore.wait();
   EXPECT_TRUE(semaphore.waitFor(0ms));
-  EXPECT_FALSE(semaphore.waitFor(1ms));
+  const auto before = Clock::now();
+  EXPECT_FALSE(semaphore.waitFor(20ms));
+  EXPECT_GE(Clock::now() - before, 20ms);
 }
 
 // The signal comes once the waiter sleeps, so that it is the wake-up that ends the wait, with

@@ -119,8 +119,14 @@ TEST(RunLoop, StopBeforeRunMakesRunReturnAtOnce) {
   EXPECT_FALSE(ran);
 }
 
-TEST(RunLoop, RepeatingTimerCancelledFromItsOwnWorkStopsRepeating) {
+// A one-shot timer cancelled (twice) before it is due, and a repeating one cancelled from its own
+// work.
+TEST(RunLoop, CancelledTimersFireNoMore) {
   RunLoop loop;
+  bool oneShotFired = false;
+  const RunLoop::TimerId oneShot = loop.addTimer(10ms, false, [&] { oneShotFired = true; });
+  loop.cancelTimer(oneShot);
+  loop.cancelTimer(oneShot);
   int fired = 0;
   RunLoop::TimerId id = 0;
   id = loop.addTimer(2ms, true, [&] {
@@ -132,6 +138,7 @@ TEST(RunLoop, RepeatingTimerCancelledFromItsOwnWorkStopsRepeating) {
   });
   ASSERT_TRUE(runStoppedByTheTest(loop));
   EXPECT_EQ(fired, 3);
+  EXPECT_FALSE(oneShotFired);
 }
 
 TEST(RunLoop, RepeatingTimerCancelledFromAnotherThreadStopsFiring) {
@@ -154,17 +161,6 @@ TEST(RunLoop, RepeatingTimerCancelledFromAnotherThreadStopsFiring) {
   canceller.join();
   EXPECT_GE(fired, 3);
   EXPECT_FALSE(firedAfterCancel);
-}
-
-TEST(RunLoop, TimerCancelledBeforeItIsDueNeverFires) {
-  RunLoop loop;
-  bool fired = false;
-  const RunLoop::TimerId id = loop.addTimer(10ms, false, [&] { fired = true; });
-  loop.cancelTimer(id);
-  loop.cancelTimer(id);  // a second cancel is harmless
-  loop.addTimer(40ms, false, [&] { loop.stop(); });
-  ASSERT_TRUE(runStoppedByTheTest(loop));
-  EXPECT_FALSE(fired);
 }
 
 // Each one-shot timer fires once, not before it is due.
