@@ -14,7 +14,6 @@
 #include <map>
 #include <memory>
 #include <mutex>
-#include <numeric>
 #include <stdexcept>
 #include <string>
 #include <thread>
@@ -146,9 +145,6 @@ std::string kindName(const ::testing::TestParamInfo<Kind>& info) {
   return info.param == Kind::Serial ? "Serial" : "Concurrent";
 }
 
-// ---------------------------------------------------------------------------------------------
-// Serial queues
-
 // Half the producers mix in sync items, which keep their place as well; the other half queue
 // only asynchronous items, so that some of those follow each other directly.
 TEST(SerialQueue, ItemsFromSeveralThreadsRunOneAtATimeInSubmissionOrder) {
@@ -238,9 +234,6 @@ TEST(SerialQueue, BarrierItemsKeepTheSameSingleOrder) {
   queue->barrierSync([&] { order.push_back(5); });
   EXPECT_EQ(order, (std::vector<int>{1, 2, 3, 4, 5}));
 }
-
-// ---------------------------------------------------------------------------------------------
-// Concurrent queues
 
 // A sync reader meets another sync reader, or an asynchronous item, inside the queue at once.
 TEST(ConcurrentQueue, SyncReadersOverlapOtherReaders) {
@@ -504,9 +497,6 @@ TEST(ConcurrentQueue, ReaderHeldBackByABarrierIsNotHeldBackByTheWorkerLimit) {
   reader.join();
   queue->barrierSync([] {});  // the worker may still be returning from `releaseAsync`
 }
-
-// ---------------------------------------------------------------------------------------------
-// Behaviour shared by both kinds
 
 class EveryQueueKind : public ::testing::TestWithParam<Kind> {};
 
@@ -773,9 +763,6 @@ TEST_P(EveryQueueKindDeathTest, SyncOnTheQueueOfTheRunningTaskAbortsInDebugBuild
       message);
 #endif
 }
-
-// ---------------------------------------------------------------------------------------------
-// Semaphores
 
 TEST(DispatchSemaphore, EachSignalOrInitialCountReleasesExactlyOneWaitAndOtherwiseTimesOut) {
   DispatchSemaphore semaphore(1);

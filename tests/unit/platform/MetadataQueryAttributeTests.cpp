@@ -2,7 +2,6 @@
 #include <sys/stat.h>
 
 #include <cstdint>
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <functional>

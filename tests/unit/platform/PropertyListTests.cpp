@@ -5,7 +5,6 @@
 #include <algorithm>
 #include <chrono>
 #include <cmath>
-#include <cstdlib>
 #include <limits>
 #include <memory>
 #include <optional>
@@ -25,9 +24,6 @@ constexpr double kEpochOffset2001 = 978307200.0;
 constexpr std::int64_t kInt64Max = std::numeric_limits<std::int64_t>::max();
 constexpr std::int64_t kInt64Min = std::numeric_limits<std::int64_t>::min();
 constexpr std::uint64_t kUint64Max = std::numeric_limits<std::uint64_t>::max();
-
-// ---------------------------------------------------------------------------
-// Helpers
 
 struct PlistNodeDeleter {
   void operator()(void* node) const { plist_free(node); }
@@ -306,8 +302,12 @@ void expectRead(const ReadCase& c) {
   EXPECT_THAT(read.error().description, testing::HasSubstr(*c.error));
 }
 
-// ---------------------------------------------------------------------------
-// PlistValue
+// A refusal whose text holds `says` ("": any refusal).
+struct Refusal {
+  std::string name;
+  PlistData bytes;
+  std::string says;
+};
 
 TEST(PlistValueTest, UnsignedConstructorKeepsSmallValuesSigned) {
   EXPECT_EQ(PlistValue(std::uint64_t{5}).type(), Type::Integer);
@@ -382,9 +382,6 @@ TEST(PlistValueTest, EqualityIsDeepAndTypeExact) {
   EXPECT_FALSE(PlistValue() == PlistValue(PlistDictionary{}));
   EXPECT_FALSE(PlistValue(PlistArray{1, 2}) == PlistValue(PlistArray{2, 1}));
 }
-
-// ---------------------------------------------------------------------------
-// Binary writer: exact encodings
 
 // Each value alone in a file, and the exact bytes of its object: the
 // smallest integer width that fits, every marker, long lengths after it.
@@ -511,9 +508,6 @@ TEST(BinaryPlistWriterTest, ReplacesMalformedUtf8) {
             PlistValue("\xEF\xBF\xBD\xEF\xBF\xBD\xEF\xBF\xBD"));
 }
 
-// ---------------------------------------------------------------------------
-// Round trips
-
 TEST(PropertyListRoundTripTest, BinaryKeepsValues) {
   struct Case {
     const char* name;
@@ -589,9 +583,6 @@ TEST(PropertyListRoundTripTest, EachFormatSkipsNullsAndWritesNullRootAsEmptyDict
   }
 }
 
-// ---------------------------------------------------------------------------
-// Cross-checks against libplist's own binary codec
-
 TEST(BinaryPlistInteropTest, LibplistReadsWhatWeWrite) {
   // The catalogue has enough objects for 4-byte references and offsets.
   for (const PlistValue& value : {everyKindOfValue(), productCatalogue(12'000)}) {
@@ -613,9 +604,6 @@ TEST(BinaryPlistInteropTest, WeReadWhatLibplistWrites) {
     EXPECT_EQ(firstDifference(*back, written), "");
   }
 }
-
-// ---------------------------------------------------------------------------
-// Readers: what they take, what they refuse, and their limits
 
 // Levels of arrays, each holding its successor twice: 2^levels values from a
 // file of a few bytes per level.
@@ -719,78 +707,56 @@ TEST(PropertyListReaderTest, RefusesMalformedInputSayingWhy) {
   const PlistData two = PropertyListSerialization::writeBinary(PlistArray{1, 2});
   const std::size_t secondEntry = trailerOf(two).offsetTableOffset + 1;
   ASSERT_EQ(trailerOf(two).offsetWidth, 1);
-  std::vector<ReadCase> cases{
-      {"bad magic", patched(three, 0, 'X', 1), {}, ""},
-      {"other version", patched(three, 6, '1', 1), {}, "version"},
-      {"offset size 0", patched(three, trailer + 6, 0, 1), {}, "offset size"},
-      {"offset size 9", patched(three, trailer + 6, 9, 1), {}, "offset size"},
-      {"reference size 0", patched(three, trailer + 7, 0, 1), {}, "reference size"},
-      {"no objects", patched(three, trailer + 8, 0, 8), {}, "no objects"},
-      {"object count max", patched(three, trailer + 8, ~std::uint64_t{0}, 8), {}, "offset table"},
-      {"object count 2^61",
-       patched(three, trailer + 8, std::uint64_t{1} << 61, 8),
-       {},
+  std::vector<Refusal> cases{
+      {"bad magic", patched(three, 0, 'X', 1), ""},
+      {"other version", patched(three, 6, '1', 1), "version"},
+      {"offset size 0", patched(three, trailer + 6, 0, 1), "offset size"},
+      {"offset size 9", patched(three, trailer + 6, 9, 1), "offset size"},
+      {"reference size 0", patched(three, trailer + 7, 0, 1), "reference size"},
+      {"no objects", patched(three, trailer + 8, 0, 8), "no objects"},
+      {"object count max", patched(three, trailer + 8, ~std::uint64_t{0}, 8), "offset table"},
+      {"object count 2^61", patched(three, trailer + 8, std::uint64_t{1} << 61, 8), "offset table"},
+      {"top object past the end", patched(three, trailer + 16, 4, 8), "top object"},
+      {"top object max", patched(three, trailer + 16, ~std::uint64_t{0}, 8), "top object"},
+      {"offset table in the header", patched(three, trailer + 24, 3, 8), "offset table"},
+      {"offset table past the end", patched(three, trailer + 24, three.size(), 8), "offset table"},
+      {"offset table offset wraps", patched(three, trailer + 24, ~std::uint64_t{0} - 7, 8),
        "offset table"},
-      {"top object past the end", patched(three, trailer + 16, 4, 8), {}, "top object"},
-      {"top object max", patched(three, trailer + 16, ~std::uint64_t{0}, 8), {}, "top object"},
-      {"offset table in the header", patched(three, trailer + 24, 3, 8), {}, "offset table"},
-      {"offset table past the end",
-       patched(three, trailer + 24, three.size(), 8),
-       {},
-       "offset table"},
-      {"offset table offset wraps",
-       patched(three, trailer + 24, ~std::uint64_t{0} - 7, 8),
-       {},
-       "offset table"},
-      {"object beyond the file", patched(two, secondEntry, 0xF0, 1), {}, "out of range"},
-      {"object in the offset table",
-       patched(two, secondEntry, secondEntry - 1, 1),
-       {},
-       "out of range"},
-      {"object in the header", patched(two, secondEntry, 3, 1), {}, "out of range"},
+      {"object beyond the file", patched(two, secondEntry, 0xF0, 1), "out of range"},
+      {"object in the offset table", patched(two, secondEntry, secondEntry - 1, 1), "out of range"},
+      {"object in the header", patched(two, secondEntry, 3, 1), "out of range"},
       {"array reference out of range",
-       assembleBinary({sequence({0xA1, 0x05}), sequence({0x10, 0x01})}),
-       {},
-       "reference out of range"},
+       assembleBinary({sequence({0xA1, 0x05}), sequence({0x10, 0x01})}), "reference out of range"},
       {"dictionary reference out of range",
        assembleBinary({sequence({0xD1, 0x01, 0x09}), sequence({0x51, 'k'}), sequence({0x09})}),
-       {},
        "reference out of range"},
-      {"array holding itself", assembleBinary({sequence({0xA1, 0x00})}), {}, "contains itself"},
+      {"array holding itself", assembleBinary({sequence({0xA1, 0x00})}), "contains itself"},
       {"arrays holding each other",
-       assembleBinary({sequence({0xA1, 0x01}), sequence({0xA1, 0x00})}),
-       {},
-       "contains itself"},
+       assembleBinary({sequence({0xA1, 0x01}), sequence({0xA1, 0x00})}), "contains itself"},
       {"dictionary holding itself",
-       assembleBinary({sequence({0xD1, 0x01, 0x00}), sequence({0x51, 'k'})}),
-       {},
-       "contains itself"},
-      {"null", assembleBinary({sequence({0x00})}), {}, "unsupported"},
-      {"fill", assembleBinary({sequence({0x0F})}), {}, "unsupported"},
-      {"marker 0x70", assembleBinary({sequence({0x70})}), {}, "unsupported"},
-      {"set", assembleBinary({sequence({0xC0})}), {}, "unsupported"},
-      {"32-byte integer", assembleBinary({sequence({0x15, 0, 0})}), {}, "integer"},
-      {"2-byte real", assembleBinary({sequence({0x21, 0, 0})}), {}, "real"},
-      {"4-byte date", assembleBinary({sequence({0x32, 0, 0, 0, 0})}), {}, "date"},
-      {"truncated integer", assembleBinary({sequence({0x13, 0, 0})}), {}, "integer out of range"},
+       assembleBinary({sequence({0xD1, 0x01, 0x00}), sequence({0x51, 'k'})}), "contains itself"},
+      {"null", assembleBinary({sequence({0x00})}), "unsupported"},
+      {"fill", assembleBinary({sequence({0x0F})}), "unsupported"},
+      {"marker 0x70", assembleBinary({sequence({0x70})}), "unsupported"},
+      {"set", assembleBinary({sequence({0xC0})}), "unsupported"},
+      {"32-byte integer", assembleBinary({sequence({0x15, 0, 0})}), "integer"},
+      {"2-byte real", assembleBinary({sequence({0x21, 0, 0})}), "real"},
+      {"4-byte date", assembleBinary({sequence({0x32, 0, 0, 0, 0})}), "date"},
+      {"truncated integer", assembleBinary({sequence({0x13, 0, 0})}), "integer out of range"},
       {"16-byte integer beyond 64 bits",
        assembleBinary({sequence({0x14, 0, 0, 0, 0, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0, 0})}),
-       {},
        "64 bits"},
       {"key not a string",
        assembleBinary({sequence({0xD1, 0x01, 0x02}), sequence({0x10, 0x01}), sequence({0x09})}),
-       {},
        "key is not a string"},
-      {"bad length marker",
-       assembleBinary({sequence({0x5F, 0x23, 0, 0, 0, 0, 0, 0, 0, 0})}),
-       {},
+      {"bad length marker", assembleBinary({sequence({0x5F, 0x23, 0, 0, 0, 0, 0, 0, 0, 0})}),
        "bad length marker"},
-      {"XML empty", {}, {}, "empty"},
-      {"XML blank", bytesOf("   \n"), {}, ""},
-      {"XML no markup", bytesOf("not a property list"), {}, ""},
-      {"XML key without value", bytesOf("<plist><dict><key>a</key></plist>"), {}, ""},
-      {"XML unclosed string", bytesOf("<plist><array><string>x</array></plist>"), {}, ""},
-      {"XML unclosed tag", bytesOf("<plist><integer>1</integer"), {}, ""},
+      {"XML empty", {}, "empty"},
+      {"XML blank", bytesOf("   \n"), ""},
+      {"XML no markup", bytesOf("not a property list"), ""},
+      {"XML key without value", bytesOf("<plist><dict><key>a</key></plist>"), ""},
+      {"XML unclosed string", bytesOf("<plist><array><string>x</array></plist>"), ""},
+      {"XML unclosed tag", bytesOf("<plist><integer>1</integer"), ""},
   };
   // Declared lengths far beyond the file, for every kind of object that has one.
   for (const int marker : {0x4F, 0x5F, 0x6F, 0xAF, 0xDF}) {
@@ -800,16 +766,13 @@ TEST(PropertyListReaderTest, RefusesMalformedInputSayingWhy) {
       appendBigEndian(object, length, 8);
       object.push_back('a');
       cases.push_back({"marker " + std::to_string(marker) + " length " + std::to_string(length),
-                       assembleBinary({object}),
-                       {},
-                       "out of range"});
+                       assembleBinary({object}), "out of range"});
     }
     cases.push_back({"marker " + std::to_string(marker) + " 4-byte length",
                      assembleBinary({sequence({marker, 0x12, 0x7F, 0xFF, 0xFF, 0xFF})}),
-                     {},
                      "out of range"});
   }
-  for (const ReadCase& c : cases) expectRead(c);
+  for (const Refusal& c : cases) expectRead({c.name, c.bytes, {}, c.says});
   EXPECT_FALSE(PropertyListSerialization::readXml({}).errorDescription().empty());
 }
 
