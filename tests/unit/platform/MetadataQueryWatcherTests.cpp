@@ -98,6 +98,9 @@ class MetadataQueryWatcherOnDisk : public TemporaryFolderTest {
 };
 
 TEST_F(MetadataQueryWatcherOnDisk, ReportsWhatHappensWhileAnyRoleWatches) {
+  EXPECT_EQ(watcher_.addWatch(base_ + "/missing", MetadataIndexWatcher::kFolderMask), -ENOENT);
+  std::ofstream(base_ + "/file") << "x";
+  EXPECT_EQ(watcher_.addWatch(base_ + "/file", MetadataIndexWatcher::kFolderMask), -ENOTDIR);
   const int first = watcher_.addWatch(base_, MetadataIndexWatcher::kFolderMask);
   const int second = watcher_.addWatch(base_, MetadataIndexWatcher::kBundleMask);
   ASSERT_GE(first, 0);
@@ -120,12 +123,6 @@ TEST_F(MetadataQueryWatcherOnDisk, ReportsWhatHappensWhileAnyRoleWatches) {
   const std::vector<std::string> names = namesUntil("marker");
   EXPECT_THAT(names, Contains("marker"));
   EXPECT_THAT(names, Not(Contains("gone")));
-}
-
-TEST_F(MetadataQueryWatcherOnDisk, MissingFolderGivesTheError) {
-  EXPECT_EQ(watcher_.addWatch(base_ + "/missing", MetadataIndexWatcher::kFolderMask), -ENOENT);
-  std::ofstream(base_ + "/file") << "x";
-  EXPECT_EQ(watcher_.addWatch(base_ + "/file", MetadataIndexWatcher::kFolderMask), -ENOTDIR);
 }
 
 TEST_F(MetadataQueryWatcherOnDisk, WakeEndsAWaitWithoutTimeout) {
@@ -171,12 +168,9 @@ class MetadataQuerySearchScope : public TemporaryFolderTest {
   }
 };
 
-TEST_F(MetadataQuerySearchScope, OnlyTheAnchorsOfAnEmptyRoot) {
+TEST_F(MetadataQuerySearchScope, EveryApplicationFolderAndItsAnchors) {
   EXPECT_THAT(MetadataSearchScope::current().folders(),
               ElementsAre(Folder{root_, Role::PlatformRoot}, Folder{home_, Role::Home}));
-}
-
-TEST_F(MetadataQuerySearchScope, EveryApplicationFolderAndItsAnchors) {
   fs::create_directories(root_ + "/Applications/Utilities");
   fs::create_directories(root_ + "/Applications/Notes.app");
   fs::create_directories(home_ + "/Applications");
