@@ -360,16 +360,6 @@ TEST(PlistValueTest, ValuesConvertIntoEachOther) {
   EXPECT_EQ(PlistValue(PlistData{1, 2}).uint64Value(), 0u);
 }
 
-TEST(PlistValueTest, SubscriptFindsMembersAndOtherwiseGivesNull) {
-  const PlistValue value = PlistDictionary{{"a", PlistDictionary{{"b", 2}}}, {"c", "text"}};
-  EXPECT_EQ(value["a"]["b"].int64Value(), 2);
-  EXPECT_TRUE(value["missing"].isNull());
-  EXPECT_TRUE(value["c"]["b"].isNull());
-  EXPECT_TRUE(PlistValue(5)["a"].isNull());
-  EXPECT_EQ(&value["missing"], &PlistValue::null());
-  EXPECT_TRUE(PlistValue::null().isNull());
-}
-
 TEST(PlistValueTest, EqualityIsDeepAndTypeExact) {
   EXPECT_EQ(everyKindOfValue(), everyKindOfValue());
   PlistValue changed = everyKindOfValue();

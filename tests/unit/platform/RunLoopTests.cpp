@@ -276,20 +276,5 @@ TEST(RunLoop, WorkThatThrowsIsReportedAndTheLoopGoesOn) {
   EXPECT_THAT(errors, HasSubstr("timer work failed"));
 }
 
-TEST(RunLoop, MainIsOneInstanceForTheWholeProcess) {
-  RunLoop* fromOtherThread = nullptr;
-  std::thread other([&] { fromOtherThread = &RunLoop::main(); });
-  other.join();
-  EXPECT_EQ(&RunLoop::main(), fromOtherThread);
-
-  bool ran = false;
-  RunLoop::main().perform([&] {
-    ran = true;
-    RunLoop::main().stop();
-  });
-  ASSERT_TRUE(runStoppedByTheTest(RunLoop::main()));
-  EXPECT_TRUE(ran);
-}
-
 }  // namespace
 }  // namespace larder
