@@ -778,20 +778,19 @@ TEST(PropertyListReaderTest, LimitsHoldExactlyAtTheirBoundary) {
   const std::string twoEntries =
       "<plist><dict><key>a</key><integer>1</integer><key>b</key><integer>2</integer></dict>"
       "</plist>";
-  const PlistData emptyArrayInDictionary =
-      bytesOf("<plist><dict><key>k</key><array/></dict></plist>");
+  // An empty container is a level.
+  const PlistData empty = bytesOf("<plist><dict><key>k</key><array/></dict></plist>");
   const auto binary = [](const PlistValue& value) {
     return PropertyListSerialization::writeBinary(value);
   };
+  const PlistValue deep = nestedArrays(513);
+  const PlistData fanOut = fanOutFile(16);
+  const PlistData xmlTwo = bytesOf(twoEntries);
   const std::vector<ReadCase> cases{
       {"binary depth 512", binary(nestedArrays(512)), nestedArrays(512)},
-      {"binary depth 513", binary(nestedArrays(513)), {}, "nesting deeper than 512"},
-      {"binary depth 513 of 600",
-       binary(nestedArrays(513)),
-       nestedArrays(513),
-       {},
-       {.maxDepth = 600}},
-      {"binary empty container is a level",
+      {"binary depth 513", binary(deep), {}, "nesting deeper than 512"},
+      {"binary depth 513 of 600", binary(deep), deep, {}, {.maxDepth = 600}},
+      {"binary empty container",
        binary(PlistDictionary{{"k", PlistArray{}}}),
        {},
        "nesting deeper than 1",
@@ -802,24 +801,16 @@ TEST(PropertyListReaderTest, LimitsHoldExactlyAtTheirBoundary) {
       {"101 of 3 objects", binary(hundred), {}, "objects", {.maxObjects = 3}},
       // Every copy of a shared object counts.
       {"2^61 copies", fanOutFile(60), {}, "objects", {.maxObjects = 100'000}},
-      {"2^17 - 1 copies of 100000", fanOutFile(16), {}, "objects", {.maxObjects = 100'000}},
-      {"2^17 - 1 copies", fanOutFile(16), fanOutValue(16), {}, {.maxObjects = (1u << 17) - 1}},
-      {"2^17 - 1 copies of 2^17 - 2",
-       fanOutFile(16),
-       {},
-       "objects",
-       {.maxObjects = (1u << 17) - 2}},
-      {"shared text over the byte limit", sharedTextFile, {}, "bytes", {.maxBytes = 100'000}},
-      {"shared text within the byte limit",
+      {"2^17 - 1 copies of 100000", fanOut, {}, "objects", {.maxObjects = 100'000}},
+      {"2^17 - 1 copies", fanOut, fanOutValue(16), {}, {.maxObjects = (1u << 17) - 1}},
+      {"2^17 - 1 copies of 2^17 - 2", fanOut, {}, "objects", {.maxObjects = (1u << 17) - 2}},
+      {"shared text over", sharedTextFile, {}, "bytes", {.maxBytes = 100'000}},
+      {"shared text within",
        sharedTextFile,
        PlistArray(1000, PlistValue(std::string(1000, 'a'))),
        {},
        {.maxBytes = 1'000'000}},
-      {"binary input over the size limit",
-       everyKind,
-       {},
-       "larger than",
-       {.maxBytes = everyKind.size() - 1}},
+      {"binary over size", everyKind, {}, "larger than", {.maxBytes = everyKind.size() - 1}},
       {"XML depth 512", bytesOf(xmlNestedArrays(512)), nestedArrays(512)},
       {"XML depth 513", bytesOf(xmlNestedArrays(513)), {}, kRefusedBeforeParsing + "512"},
       {"XML depth 11 of 10",
@@ -827,26 +818,14 @@ TEST(PropertyListReaderTest, LimitsHoldExactlyAtTheirBoundary) {
        {},
        kRefusedBeforeParsing + "10",
        {.maxDepth = 10}},
-      {"XML empty container is a level",
-       emptyArrayInDictionary,
-       PlistDictionary{{"k", PlistArray{}}},
-       {},
-       {.maxDepth = 2}},
-      {"XML empty container over the limit",
-       emptyArrayInDictionary,
-       {},
-       kRefusedBeforeParsing + "1",
-       {.maxDepth = 1}},
+      {"XML empty container", empty, PlistDictionary{{"k", PlistArray{}}}, {}, {.maxDepth = 2}},
+      {"XML empty container over", empty, {}, kRefusedBeforeParsing + "1", {.maxDepth = 1}},
       // Deep enough that releasing libplist's tree would overflow the stack.
       {"XML depth 1000000", bytesOf(xmlNestedArrays(1'000'000)), {}, kRefusedBeforeParsing},
       // The dictionary, two keys, two values.
-      {"XML 5 objects", bytesOf(twoEntries), {}, {}, {.maxObjects = 5}},
-      {"XML 5 of 4 objects", bytesOf(twoEntries), {}, "objects", {.maxObjects = 4}},
-      {"XML input over the size limit",
-       bytesOf(twoEntries),
-       {},
-       "larger than",
-       {.maxBytes = twoEntries.size() - 1}},
+      {"XML 5 objects", xmlTwo, {}, {}, {.maxObjects = 5}},
+      {"XML 5 of 4 objects", xmlTwo, {}, "objects", {.maxObjects = 4}},
+      {"XML over size", xmlTwo, {}, "larger than", {.maxBytes = twoEntries.size() - 1}},
   };
   for (const ReadCase& c : cases) expectRead(c);
 }
