@@ -16,6 +16,7 @@
 #include <vector>
 
 #include "platform/dispatch/DispatchSemaphore.h"
+#include "tests/unit/platform/TemporaryFolderTest.h"
 
 namespace larder {
 namespace {
@@ -161,6 +162,12 @@ class BackgroundActivitySchedulerTest : public ::testing::Test {
     flush();
   }
 
+  // Moves the clock on by `by` and gives the calls that came meanwhile.
+  std::vector<Call> after(Duration by) {
+    pass(by);
+    return takeCalls();
+  }
+
   std::vector<Call> takeCalls() {
     std::lock_guard lock(mutex_);
     return std::exchange(calls_, {});
@@ -179,14 +186,10 @@ class BackgroundActivitySchedulerTest : public ::testing::Test {
 
 TEST_F(BackgroundActivitySchedulerTest, RepeatingActivityRunsEveryInterval) {
   ASSERT_TRUE(add("reload", periodicReload()));
-  pass(10h - 1s);
-  EXPECT_THAT(takeCalls(), IsEmpty());
-  pass(1s);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 10h, 1}));
-  pass(10h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 20h, 2}));
-  pass(25h);
-  EXPECT_THAT(takeCalls(),
+  EXPECT_THAT(after(10h - 1s), IsEmpty());
+  EXPECT_THAT(after(1s), ElementsAre(Call{"reload", State::Run, 10h, 1}));
+  EXPECT_THAT(after(10h), ElementsAre(Call{"reload", State::Run, 20h, 2}));
+  EXPECT_THAT(after(25h),
               ElementsAre(Call{"reload", State::Run, 30h, 3}, Call{"reload", State::Run, 40h, 4}));
   const std::optional<BackgroundActivity> activity = scheduler_->activity("reload");
   ASSERT_TRUE(activity.has_value());
@@ -195,37 +198,36 @@ TEST_F(BackgroundActivitySchedulerTest, RepeatingActivityRunsEveryInterval) {
   EXPECT_EQ(activity->runCount, 4u);
 }
 
-TEST_F(BackgroundActivitySchedulerTest, OneTimeActivityRunsOnceAfterItsDelay) {
+TEST_F(BackgroundActivitySchedulerTest, OneTimeActivityRunsOnceAfterItsDelayOrAtOnceWithout) {
+  ASSERT_TRUE(add("now", {}));
   ASSERT_TRUE(add("once", {.delay = 5min}));
-  pass(1h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"once", State::Run, 5min, 1}));
-  pass(10h);
-  EXPECT_THAT(takeCalls(), IsEmpty());
+  flush();
+  EXPECT_THAT(takeCalls(), ElementsAre(Call{"now", State::Run, 0h, 1}));
+  EXPECT_THAT(after(1h), ElementsAre(Call{"once", State::Run, 5min, 1}));
+  EXPECT_THAT(after(10h), IsEmpty());
   EXPECT_EQ(scheduler_->activity("once")->state, State::Done);
 }
 
-TEST_F(BackgroundActivitySchedulerTest, WithoutDelayItRunsAtOnce) {
-  ASSERT_TRUE(add("now", {}));
-  flush();
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"now", State::Run, 0h, 1}));
-}
-
+// One activity that may not run on battery and one that may.
 TEST_F(BackgroundActivitySchedulerTest, OnBatteryItWaitsHearsDeferredAndRunsOnMains) {
   power_->set(false);
   ASSERT_TRUE(add("reload", periodicReload()));
-  pass(10h);
-  EXPECT_THAT(takeCalls(), IsEmpty()) << "due, but waiting within its grace period";
+  BackgroundActivityCriteria anyPower = periodicReload();
+  anyPower.allowBattery = true;
+  anyPower.delay = 20h;
+  ASSERT_TRUE(add("sync", anyPower));
+  EXPECT_THAT(after(10h), IsEmpty()) << "due, but waiting within its grace period";
   EXPECT_EQ(scheduler_->activity("reload")->state, State::Waiting);
-  pass(2h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Deferred, 12h, 0}));
-  pass(5h);
-  EXPECT_THAT(takeCalls(), IsEmpty()) << "deferred once, never run on battery";
+  EXPECT_THAT(after(2h), ElementsAre(Call{"reload", State::Deferred, 12h, 0}));
+  EXPECT_THAT(after(5h), IsEmpty()) << "deferred once, never run on battery";
 
   power_->set(true);
   scheduler_->powerSourceDidChange();
   flush();
   EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 17h, 1}));
   EXPECT_EQ(scheduler_->activity("reload")->due.time_since_epoch(), 27h);
+  power_->set(false);
+  EXPECT_THAT(after(3h), ElementsAre(Call{"sync", State::Run, 20h, 1}));
 }
 
 TEST_F(BackgroundActivitySchedulerTest, MainsReturningWithinGraceIsNoticedByThePowerCheck) {
@@ -233,37 +235,23 @@ TEST_F(BackgroundActivitySchedulerTest, MainsReturningWithinGraceIsNoticedByTheP
   ASSERT_TRUE(add("reload", periodicReload()));
   pass(11h);
   power_->set(true);
-  pass(kPowerCheck);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 11h + kPowerCheck, 1}));
-}
-
-TEST_F(BackgroundActivitySchedulerTest, AllowedOnBatteryRunsOnBattery) {
-  power_->set(false);
-  BackgroundActivityCriteria criteria = periodicReload();
-  criteria.allowBattery = true;
-  ASSERT_TRUE(add("sync", criteria));
-  pass(10h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"sync", State::Run, 10h, 1}));
+  EXPECT_THAT(after(kPowerCheck), ElementsAre(Call{"reload", State::Run, 11h + kPowerCheck, 1}));
 }
 
 TEST_F(BackgroundActivitySchedulerTest, OccurrencesMissedOnBatteryAreNotMadeUp) {
   power_->set(false);
   ASSERT_TRUE(add("reload", periodicReload()));
-  pass(45h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Deferred, 12h, 0}));
+  EXPECT_THAT(after(45h), ElementsAre(Call{"reload", State::Deferred, 12h, 0}));
   power_->set(true);
-  pass(kPowerCheck);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 45h + kPowerCheck, 1}));
-  pass(10h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 55h + kPowerCheck, 2}));
+  EXPECT_THAT(after(kPowerCheck), ElementsAre(Call{"reload", State::Run, 45h + kPowerCheck, 1}));
+  EXPECT_THAT(after(10h), ElementsAre(Call{"reload", State::Run, 55h + kPowerCheck, 2}));
 }
 
 TEST_F(BackgroundActivitySchedulerTest, UtilityGoesBeforeMaintenanceAtTheSameMoment) {
   ASSERT_TRUE(add("a.tidy", {.delay = 1h, .priority = BackgroundActivityPriority::Maintenance}));
   ASSERT_TRUE(add("b.fetch", {.delay = 1h, .priority = BackgroundActivityPriority::Utility}));
   ASSERT_TRUE(add("c.tidy", {.delay = 1h, .priority = BackgroundActivityPriority::Maintenance}));
-  pass(1h);
-  EXPECT_THAT(takeCalls(),
+  EXPECT_THAT(after(1h),
               ElementsAre(Call{"b.fetch", State::Run, 1h, 1}, Call{"a.tidy", State::Run, 1h, 1},
                           Call{"c.tidy", State::Run, 1h, 1}));
 }
@@ -309,8 +297,7 @@ TEST_F(BackgroundActivitySchedulerTest, RegisteringAgainReplacesTheActivity) {
   BackgroundActivityCriteria sooner = periodicReload();
   sooner.delay = 1h;
   ASSERT_TRUE(add("reload", sooner));
-  pass(1h);
-  EXPECT_THAT(takeCalls(), ElementsAre(Call{"reload", State::Run, 6h, 1}));
+  EXPECT_THAT(after(1h), ElementsAre(Call{"reload", State::Run, 6h, 1}));
   EXPECT_THAT(scheduler_->activityNames(), ElementsAre("reload"));
 }
 
@@ -320,8 +307,7 @@ TEST_F(BackgroundActivitySchedulerTest, UnregisteredActivityRunsNoMore) {
   EXPECT_EQ(takeCalls().size(), 1u);
   EXPECT_TRUE(scheduler_->unregisterActivity("reload"));
   EXPECT_FALSE(scheduler_->unregisterActivity("reload"));
-  pass(30h);
-  EXPECT_THAT(takeCalls(), IsEmpty());
+  EXPECT_THAT(after(30h), IsEmpty());
   EXPECT_FALSE(scheduler_->activity("reload").has_value());
 }
 
@@ -366,21 +352,11 @@ struct Supply {
   std::optional<int> online;
 };
 
-class BackgroundActivityPowerSourceTest : public ::testing::Test {
+class BackgroundActivityPowerSourceTest : public TemporaryFolderTest {
  protected:
-  void SetUp() override {
-    std::string pattern = (fs::temp_directory_path() / "larder-power-XXXXXX").string();
-    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
-    root_ = pattern;
-  }
-  void TearDown() override {
-    std::error_code ignored;
-    fs::remove_all(root_, ignored);
-  }
-
   // Writes the supplies into `folder`, below the test's root, and gives its path.
   std::string supplies(const std::string& folder, const std::vector<Supply>& list) const {
-    const std::string path = root_ + "/" + folder;
+    const std::string path = base_ + "/" + folder;
     fs::create_directories(path);
     for (const Supply& supply : list) {
       fs::create_directories(path + "/" + supply.name);
@@ -390,8 +366,6 @@ class BackgroundActivityPowerSourceTest : public ::testing::Test {
     }
     return path;
   }
-
-  std::string root_;
 };
 
 TEST_F(BackgroundActivityPowerSourceTest, ReadsMainsFromTheSupplyFolder) {
@@ -417,11 +391,11 @@ TEST_F(BackgroundActivityPowerSourceTest, ReadsMainsFromTheSupplyFolder) {
     EXPECT_EQ(BackgroundActivityPowerSource::mainsPowerInSupplyFolder(folder),
               cases[index].onMains);
   }
-  EXPECT_TRUE(BackgroundActivityPowerSource::mainsPowerInSupplyFolder(root_ + "/missing"));
+  EXPECT_TRUE(BackgroundActivityPowerSource::mainsPowerInSupplyFolder(base_ + "/missing"));
 }
 
 TEST_F(BackgroundActivityPowerSourceTest, SystemSourceReadsBelowThePlatformRoot) {
-  ::setenv("LARDER_ROOT", root_.c_str(), 1);
+  ::setenv("LARDER_ROOT", base_.c_str(), 1);
   const auto source = BackgroundActivityPowerSource::system();
   supplies("sys/class/power_supply", {{"AC", "Mains", 0}, {"BAT0", "Battery", std::nullopt}});
   EXPECT_FALSE(source->isOnMainsPower());
@@ -444,7 +418,10 @@ TEST(BackgroundActivitySystemClock, WakesUpAtTheTimeAndNotAfterCancel) {
   std::atomic<bool> cancelledFired{false};
   clock->scheduleWakeUp(clock->now() + 30ms, [&] { cancelledFired = true; });
   clock->cancelWakeUp();
-  std::this_thread::sleep_for(80ms);
+  // Another clock's wake-up, due after the cancelled one, is the sign that its time has passed.
+  const auto yardstick = BackgroundActivityClock::system();
+  yardstick->scheduleWakeUp(clock->now() + 60ms, [&] { woke.signal(); });
+  ASSERT_TRUE(woke.waitFor(2s));
   EXPECT_FALSE(cancelledFired.load());
 }
 

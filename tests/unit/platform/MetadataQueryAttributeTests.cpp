@@ -2,14 +2,15 @@
 #include <sys/stat.h>
 
 #include <cstdint>
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <functional>
+#include <sstream>
 #include <string>
 
 #include "platform/metadata/MetadataAttributes.h"
 #include "platform/plist/PropertyListSerialization.h"
+#include "tests/unit/platform/TemporaryFolderTest.h"
 
 namespace larder {
 namespace {
@@ -17,9 +18,30 @@ namespace {
 namespace fs = std::filesystem;
 using Attributes = MetadataAttributes;
 
-const PlistValue& valueOf(const PlistDictionary& attributes, std::string_view name) {
-  auto found = attributes.find(name);
-  return found == attributes.end() ? PlistValue::null() : found->second;
+// The attributes named in `expected` ("Version=... WareID=...", without the common prefix), in
+// the same form: absent ones as "-", reals and dates marked, so that a wrong kind shows.
+std::string described(const PlistDictionary& attributes, std::string_view expected) {
+  std::string text;
+  std::istringstream names{std::string(expected)};
+  for (std::string word; names >> word;) {
+    const std::string name = word.substr(0, word.find('='));
+    const std::string key = (name.starts_with("_") ? "_kHostItem" : "kHostItem") +
+                            (name.starts_with("_") ? name.substr(1) : name);
+    const auto found = attributes.find(key);
+    const PlistValue& value = found == attributes.end() ? PlistValue::null() : found->second;
+    text += (text.empty() ? "" : " ") + name + "=";
+    if (value.isNull())
+      text += "-";
+    else if (value.string())
+      text += *value.string();
+    else if (value.isReal())
+      text += "real:" + std::to_string(value.int64Value());
+    else if (value.date())
+      text += "date:" + std::to_string(std::int64_t(value.date()->secondsSince1970));
+    else
+      text += std::to_string(value.int64Value());
+  }
+  return text;
 }
 
 PlistDictionary purchaseRecord() {
@@ -34,116 +56,79 @@ PlistDictionary bundleInfo() {
           {"HostBundleVersion", "210"}};
 }
 
-TEST(MetadataQueryAttributes, StoreBundleGivesEveryAttribute) {
-  const PlistDictionary attributes =
-      Attributes::fromPropertyLists("/A/Notes.app", bundleInfo(), purchaseRecord());
-  EXPECT_EQ(valueOf(attributes, Attributes::kPath), PlistValue("/A/Notes.app"));
-  EXPECT_EQ(valueOf(attributes, Attributes::kContentType),
-            PlistValue("com.orvane.application-bundle"));
-  EXPECT_EQ(valueOf(attributes, Attributes::kBundleIdentifier), PlistValue("com.example.Notes"));
-  EXPECT_EQ(valueOf(attributes, Attributes::kVersion), PlistValue("2.1"));
-  EXPECT_EQ(valueOf(attributes, Attributes::kIsDeveloperSigned), PlistValue(0));
-  EXPECT_EQ(valueOf(attributes, Attributes::kHasPurchaseRecord), PlistValue(1));
-  EXPECT_TRUE(valueOf(attributes, Attributes::kWareID).isReal());
-  EXPECT_EQ(valueOf(attributes, Attributes::kWareID).doubleValue(), 401000001.0);
-  EXPECT_EQ(valueOf(attributes, Attributes::kInstallerVersionID), PlistValue(7));
-  EXPECT_EQ(valueOf(attributes, Attributes::kAccountReference), PlistValue("account-1"));
-  EXPECT_EQ(valueOf(attributes, Attributes::kPurchaseDate), PlistValue(PlistDate{1600000000}));
+PlistDictionary with(PlistDictionary base, const PlistDictionary& changes) {
+  for (const auto& [key, value] : changes) base[key] = value;
+  return base;
 }
 
-TEST(MetadataQueryAttributes, VersionFallsBackToBundleVersion) {
-  PlistDictionary info = bundleInfo();
-  info.erase("HostBundleShortVersionString");
-  EXPECT_EQ(valueOf(Attributes::fromPropertyLists("/A/N.app", info, {}), Attributes::kVersion),
-            PlistValue("210"));
-  info["HostBundleShortVersionString"] = "";
-  EXPECT_EQ(valueOf(Attributes::fromPropertyLists("/A/N.app", info, {}), Attributes::kVersion),
-            PlistValue("210"));
-  info["HostBundleShortVersionString"] = 3;
-  EXPECT_EQ(valueOf(Attributes::fromPropertyLists("/A/N.app", info, {}), Attributes::kVersion),
-            PlistValue("210"));
-}
-
-TEST(MetadataQueryAttributes, NoPurchaseRecordGivesOnlyTheFlag) {
-  for (const PlistValue& purchase : {PlistValue(), PlistValue(PlistArray{1, 2}), PlistValue("x")}) {
-    const PlistDictionary attributes =
-        Attributes::fromPropertyLists("/A/N.app", bundleInfo(), purchase);
-    EXPECT_EQ(valueOf(attributes, Attributes::kHasPurchaseRecord), PlistValue(0));
-    EXPECT_TRUE(valueOf(attributes, Attributes::kWareID).isNull());
-    EXPECT_TRUE(valueOf(attributes, Attributes::kInstallerVersionID).isNull());
-    EXPECT_TRUE(valueOf(attributes, Attributes::kAccountReference).isNull());
-    EXPECT_TRUE(valueOf(attributes, Attributes::kPurchaseDate).isNull());
-  }
-}
-
-TEST(MetadataQueryAttributes, IdentifiersWrittenAsTextAreRead) {
-  PlistDictionary purchase = purchaseRecord();
-  purchase["wareID"] = "401000002";
-  purchase["installerVersionID"] = "12";
-  PlistDictionary attributes = Attributes::fromPropertyLists("/A/N.app", {}, purchase);
-  EXPECT_EQ(valueOf(attributes, Attributes::kWareID), PlistValue(401000002.0));
-  EXPECT_EQ(valueOf(attributes, Attributes::kInstallerVersionID), PlistValue(12));
-
-  purchase["wareID"] = "12abc";
-  purchase["installerVersionID"] = PlistData{1, 2};
-  attributes = Attributes::fromPropertyLists("/A/N.app", {}, purchase);
-  EXPECT_TRUE(valueOf(attributes, Attributes::kWareID).isNull());
-  EXPECT_TRUE(valueOf(attributes, Attributes::kInstallerVersionID).isNull());
-  EXPECT_EQ(valueOf(attributes, Attributes::kHasPurchaseRecord), PlistValue(1));
-}
-
-TEST(MetadataQueryAttributes, WrongTypesAreAbsent) {
-  const PlistDictionary info{{"HostBundleIdentifier", 5}, {"HostBundleVersion", PlistArray{}}};
-  const PlistDictionary purchase{{"opaqueAccountIDString", 9}, {"purchaseDate", "yesterday"}};
-  const PlistDictionary attributes = Attributes::fromPropertyLists("/A/N.app", info, purchase);
-  EXPECT_TRUE(valueOf(attributes, Attributes::kBundleIdentifier).isNull());
-  EXPECT_TRUE(valueOf(attributes, Attributes::kVersion).isNull());
-  EXPECT_TRUE(valueOf(attributes, Attributes::kAccountReference).isNull());
-  EXPECT_TRUE(valueOf(attributes, Attributes::kPurchaseDate).isNull());
-}
-
-TEST(MetadataQueryAttributes, DeveloperSignedOnlyWhenTrue) {
-  auto signedValue = [](PlistValue flag) {
-    PlistDictionary info = bundleInfo();
-    info["HostBundleDeveloperSigned"] = std::move(flag);
-    return valueOf(Attributes::fromPropertyLists("/A/N.app", info, {}),
-                   Attributes::kIsDeveloperSigned);
+TEST(MetadataQueryAttributes, ComeFromTheBundleInformationAndThePurchaseRecord) {
+  const char* const noPurchase =
+      "QuaymartHasPurchaseRecord=0 QuaymartWareID=- QuaymartInstallerVersionID=- "
+      "_QuaymartRefID=- QuaymartPurchaseDate=-";
+  PlistDictionary noShortVersion = bundleInfo();
+  noShortVersion.erase("HostBundleShortVersionString");
+  const auto signedBy = [](PlistValue flag) {
+    return with(bundleInfo(), {{"HostBundleDeveloperSigned", std::move(flag)}});
   };
-  EXPECT_EQ(signedValue(true), PlistValue(1));
-  EXPECT_EQ(signedValue(false), PlistValue(0));
-  EXPECT_EQ(signedValue("YES"), PlistValue(0));
-  EXPECT_EQ(signedValue(PlistValue()), PlistValue(0));
-}
-
-TEST(MetadataQueryAttributes, ContentTypeOnlyForBundleFolders) {
-  EXPECT_TRUE(valueOf(Attributes::fromPropertyLists("/A/Notes", {}, {}), Attributes::kContentType)
-                  .isNull());
+  const auto version = [](PlistValue text) {
+    return with(bundleInfo(), {{"HostBundleShortVersionString", std::move(text)}});
+  };
+  struct Case {
+    const char* name;
+    PlistValue info;
+    PlistValue purchase;
+    std::string expected;
+    std::string path = "/A/N.app";
+  };
+  const std::vector<Case> cases{
+      {"store bundle", bundleInfo(), purchaseRecord(),
+       "Path=/A/Notes.app ContentType=com.orvane.application-bundle "
+       "HostBundleIdentifier=com.example.Notes Version=2.1 QuaymartIsDeveloperSigned=0 "
+       "QuaymartHasPurchaseRecord=1 QuaymartWareID=real:401000001 "
+       "QuaymartInstallerVersionID=7 _QuaymartRefID=account-1 QuaymartPurchaseDate=date:1600000000",
+       "/A/Notes.app"},
+      {"no short version", noShortVersion, {}, "Version=210"},
+      {"empty short version", version(""), {}, "Version=210"},
+      {"short version a number", version(3), {}, "Version=210"},
+      {"no purchase record", bundleInfo(), {}, noPurchase},
+      {"purchase record an array", bundleInfo(), PlistArray{1, 2}, noPurchase},
+      {"purchase record a string", bundleInfo(), "x", noPurchase},
+      {"identifiers written as text",
+       {},
+       with(purchaseRecord(), {{"wareID", "401000002"}, {"installerVersionID", "12"}}),
+       "QuaymartWareID=real:401000002 QuaymartInstallerVersionID=12"},
+      {"identifiers that are no numbers",
+       {},
+       with(purchaseRecord(), {{"wareID", "12abc"}, {"installerVersionID", PlistData{1, 2}}}),
+       "QuaymartWareID=- QuaymartInstallerVersionID=- QuaymartHasPurchaseRecord=1"},
+      {"wrong types",
+       PlistDictionary{{"HostBundleIdentifier", 5}, {"HostBundleVersion", PlistArray{}}},
+       PlistDictionary{{"opaqueAccountIDString", 9}, {"purchaseDate", "yesterday"}},
+       "HostBundleIdentifier=- Version=- _QuaymartRefID=- QuaymartPurchaseDate=-"},
+      {"developer signed", signedBy(true), {}, "QuaymartIsDeveloperSigned=1"},
+      {"signed false", signedBy(false), {}, "QuaymartIsDeveloperSigned=0"},
+      {"signed as text", signedBy("YES"), {}, "QuaymartIsDeveloperSigned=0"},
+      {"not a bundle folder", {}, {}, "ContentType=-", "/A/Notes"},
+  };
+  for (const Case& c : cases) {
+    EXPECT_EQ(described(Attributes::fromPropertyLists(c.path, c.info, c.purchase), c.expected),
+              c.expected)
+        << c.name;
+  }
   EXPECT_FALSE(Attributes::isBundleName(".app"));
   EXPECT_TRUE(Attributes::isBundleName("x.app"));
   EXPECT_FALSE(Attributes::isBundleName("x.apps"));
 }
 
-class MetadataQueryBundleReading : public ::testing::Test {
+class MetadataQueryBundleReading : public TemporaryFolderTest {
  protected:
-  void SetUp() override {
-    std::string pattern = (fs::temp_directory_path() / "larder-mdattr-XXXXXX").string();
-    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
-    folder_ = pattern;
-  }
-  void TearDown() override {
-    std::error_code ignored;
-    fs::remove_all(folder_, ignored);
-  }
-
   static void writeFile(const std::string& path, std::string_view contents) {
     std::ofstream(path, std::ios::binary) << contents;
   }
-
-  std::string folder_;
 };
 
-TEST_F(MetadataQueryBundleReading, ReadsBothPropertyListsFromDisk) {
-  const std::string bundle = folder_ + "/Notes.app";
+TEST_F(MetadataQueryBundleReading, ReadsBothPropertyListsOfAFolderFromDisk) {
+  const std::string bundle = base_ + "/Notes.app";
   fs::create_directories(bundle);
   writeFile(bundle + "/bundle.plist", PropertyListSerialization::writeXml(bundleInfo()));
   const PlistData binary = PropertyListSerialization::writeBinary(PlistValue(purchaseRecord()));
@@ -153,6 +138,11 @@ TEST_F(MetadataQueryBundleReading, ReadsBothPropertyListsFromDisk) {
   EXPECT_TRUE(reading->hasInformationPropertyList);
   EXPECT_EQ(reading->attributes,
             Attributes::fromPropertyLists(bundle, bundleInfo(), purchaseRecord()));
+  EXPECT_FALSE(Attributes::readBundle(base_ + "/Missing.app").has_value());
+  std::ofstream(base_ + "/File.app") << "x";
+  EXPECT_FALSE(Attributes::readBundle(base_ + "/File.app").has_value());
+  fs::create_symlink(base_ + "/Loop.app", base_ + "/Loop.app");
+  EXPECT_FALSE(Attributes::readBundle(base_ + "/Loop.app").has_value());
 }
 
 // Every kind of damage, tried on each of the two files: the damaged one
@@ -184,7 +174,7 @@ TEST_F(MetadataQueryBundleReading, DamagedFilesCountAsAbsent) {
   for (const auto& [name, damage] : damages) {
     for (const bool damageInformation : {true, false}) {
       SCOPED_TRACE(std::string(name) + (damageInformation ? " bundle.plist" : " purchase.plist"));
-      const std::string bundle = folder_ + "/" + std::to_string(++count) + ".app";
+      const std::string bundle = base_ + "/" + std::to_string(++count) + ".app";
       fs::create_directories(bundle);
       // What reading should see: nothing in place of the damaged file.
       const PlistValue info = damageInformation ? PlistValue() : PlistValue(bundleInfo());
@@ -202,14 +192,6 @@ TEST_F(MetadataQueryBundleReading, DamagedFilesCountAsAbsent) {
       EXPECT_EQ(reading->attributes, Attributes::fromPropertyLists(bundle, info, purchase));
     }
   }
-}
-
-TEST_F(MetadataQueryBundleReading, NotAFolderIsNoBundle) {
-  EXPECT_FALSE(Attributes::readBundle(folder_ + "/Missing.app").has_value());
-  std::ofstream(folder_ + "/File.app") << "x";
-  EXPECT_FALSE(Attributes::readBundle(folder_ + "/File.app").has_value());
-  fs::create_symlink(folder_ + "/Loop.app", folder_ + "/Loop.app");
-  EXPECT_FALSE(Attributes::readBundle(folder_ + "/Loop.app").has_value());
 }
 
 }  // namespace

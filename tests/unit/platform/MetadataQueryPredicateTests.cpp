@@ -59,30 +59,9 @@ PlistDictionary legacyBundle(std::string identifier) {
           {"kHostItemQuaymartIsDeveloperSigned", std::int64_t{0}}};
 }
 
-TEST(MetadataQueryPredicate, StoreQueryTakesPurchasedSoftwareAndTheInstaller) {
-  EXPECT_TRUE(matches(kStoreQuery, storeBundle()));
-  EXPECT_TRUE(matches(kStoreQuery, legacyBundle("com.orvane.SetupHerald")));
-  EXPECT_TRUE(matches(kStoreQuery, legacyBundle("com.orvane.SetupHeraldBeta")));
-  EXPECT_FALSE(matches(kStoreQuery, legacyBundle("com.orvane.Setup")));
-  EXPECT_FALSE(matches(kStoreQuery, legacyBundle("com.example.Notes")));
-}
-
-TEST(MetadataQueryPredicate, LegacyQueryTakesListedBundlesWithoutPurchaseOrSignature) {
-  EXPECT_TRUE(matches(kLegacyQuery, legacyBundle("com.orvane.Snapbox")));
-  EXPECT_TRUE(matches(kLegacyQuery, legacyBundle("com.orvane.ReelcutApp")));
-  EXPECT_FALSE(matches(kLegacyQuery, legacyBundle("com.orvane.Darkbench")));
-
-  PlistDictionary purchased = legacyBundle("com.orvane.Snapbox");
-  purchased["kHostItemQuaymartHasPurchaseRecord"] = std::int64_t{1};
-  EXPECT_FALSE(matches(kLegacyQuery, purchased));
-
-  PlistDictionary signedByDeveloper = legacyBundle("com.orvane.Snapbox");
-  signedByDeveloper["kHostItemQuaymartIsDeveloperSigned"] = std::int64_t{1};
-  EXPECT_FALSE(matches(kLegacyQuery, signedByDeveloper));
-
-  PlistDictionary notABundle = legacyBundle("com.orvane.Snapbox");
-  notABundle["kHostItemContentType"] = "com.orvane.folder";
-  EXPECT_FALSE(matches(kLegacyQuery, notABundle));
+PlistDictionary with(PlistDictionary attributes, const std::string& name, PlistValue value) {
+  attributes[name] = std::move(value);
+  return attributes;
 }
 
 // Each row: a query, the attributes it is asked about, and whether it matches.
@@ -97,7 +76,21 @@ TEST(MetadataQueryPredicate, MatchesAsTheQuerySays) {
     PlistDictionary attributes;
     bool matches;
   };
+  const PlistDictionary snapbox = legacyBundle("com.orvane.Snapbox");
   const std::vector<Case> cases{
+      // The store's query takes purchased software and the installer.
+      {kStoreQuery, storeBundle(), true},
+      {kStoreQuery, legacyBundle("com.orvane.SetupHerald"), true},
+      {kStoreQuery, legacyBundle("com.orvane.SetupHeraldBeta"), true},
+      {kStoreQuery, legacyBundle("com.orvane.Setup"), false},
+      {kStoreQuery, legacyBundle("com.example.Notes"), false},
+      // The legacy query takes listed bundles without purchase or signature.
+      {kLegacyQuery, snapbox, true},
+      {kLegacyQuery, legacyBundle("com.orvane.ReelcutApp"), true},
+      {kLegacyQuery, legacyBundle("com.orvane.Darkbench"), false},
+      {kLegacyQuery, with(snapbox, "kHostItemQuaymartHasPurchaseRecord", std::int64_t{1}), false},
+      {kLegacyQuery, with(snapbox, "kHostItemQuaymartIsDeveloperSigned", std::int64_t{1}), false},
+      {kLegacyQuery, with(snapbox, "kHostItemContentType", "com.orvane.folder"), false},
       // && binds tighter than ||.
       {"a == 1 || b == 1 && a == 0", {{"a", std::int64_t{1}}, {"b", std::int64_t{0}}}, true},
       {"(a == 1 || b == 1) && a == 0", {{"a", std::int64_t{1}}, {"b", std::int64_t{0}}}, false},
@@ -176,9 +169,9 @@ TEST(MetadataQueryPredicate, MatchesAsTheQuerySays) {
       // Whitespace is free.
       {"  (\ta==1)\n&&b=='x'  ", {{"a", std::int64_t{1}}, {"b", "x"}}, true},
   };
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.query);
-    EXPECT_EQ(matches(c.query, c.attributes), c.matches);
+  for (std::size_t row = 0; row < cases.size(); ++row) {
+    SCOPED_TRACE(testing::Message() << "row " << row << ": " << cases[row].query);
+    EXPECT_EQ(matches(cases[row].query, cases[row].attributes), cases[row].matches);
   }
 }
 
@@ -203,38 +196,44 @@ TEST(MetadataQueryPredicate, CanonicalTextKeepsMeaningAndIsStable) {
   EXPECT_EQ(parsed(R"(s == 'a\*b*')").canonicalText(), R"(s == "a\*b*")");
 }
 
-TEST(MetadataQueryPredicate, RefusesMalformedQueries) {
-  EXPECT_THAT(refusal(""), HasSubstr("attribute"));
-  EXPECT_THAT(refusal("a =="), HasSubstr("value"));
-  EXPECT_THAT(refusal("a 1"), HasSubstr("operator"));
-  EXPECT_THAT(refusal("== 1"), HasSubstr("attribute"));
-  EXPECT_THAT(refusal("1 == a"), HasSubstr("attribute"));
-  EXPECT_THAT(refusal("a == 1 &&"), HasSubstr("attribute"));
-  EXPECT_THAT(refusal("a == 1 & b == 2"), HasSubstr("unexpected"));
-  EXPECT_THAT(refusal("a == 1 | b == 2"), HasSubstr("unexpected"));
-  EXPECT_THAT(refusal("!a"), HasSubstr("unexpected"));
-  EXPECT_THAT(refusal("(a == 1"), HasSubstr("')'"));
-  EXPECT_THAT(refusal("a == 1)"), HasSubstr("unexpected text"));
-  EXPECT_THAT(refusal("a == 'open"), HasSubstr("unterminated"));
-  EXPECT_THAT(refusal("a == 'x\\"), HasSubstr("unterminated"));
-  EXPECT_THAT(refusal("a == 'x'cd"), HasSubstr("unexpected text"));
-  EXPECT_THAT(refusal("a* == 1"), HasSubstr("attribute"));
-  EXPECT_THAT(refusal("a.b == 1"), HasSubstr("attribute"));
-  EXPECT_THAT(refusal("a == 1 b == 2"), HasSubstr("unexpected text"));
-  EXPECT_THAT(refusal("()"), HasSubstr("attribute"));
+// Each row: a query and what its refusal says.
+TEST(MetadataQueryPredicate, RefusesMalformedQueriesSayingWhy) {
+  const std::size_t limit = MetadataQueryPredicate::kMaxNestingDepth;
+  const std::string tooDeep = std::string(limit + 1, '(') + "a == 1" + std::string(limit + 1, ')');
+  const std::pair<std::string, std::string> cases[] = {
+      {"", "attribute"},
+      {"a ==", "value"},
+      {"a 1", "operator"},
+      {"== 1", "attribute"},
+      {"1 == a", "attribute"},
+      {"a == 1 &&", "attribute"},
+      {"a == 1 & b == 2", "unexpected"},
+      {"a == 1 | b == 2", "unexpected"},
+      {"!a", "unexpected"},
+      {"(a == 1", "')'"},
+      {"a == 1)", "unexpected text"},
+      {"a == 'open", "unterminated"},
+      {"a == 'x\\", "unterminated"},
+      {"a == 'x'cd", "unexpected text"},
+      {"a* == 1", "attribute"},
+      {"a.b == 1", "attribute"},
+      {"a == 1 b == 2", "unexpected text"},
+      {"()", "attribute"},
+      // Deep nesting, and long text, are refused before they cost a deep recursion.
+      {tooDeep, "nested too deeply"},
+      {std::string(100000, '('), "query longer"},
+      {std::string(5000, '('), "nested too deeply"},
+  };
+  for (const auto& [query, says] : cases) {
+    EXPECT_THAT(refusal(query), HasSubstr(says)) << query.substr(0, 60);
+  }
 }
 
-TEST(MetadataQueryPredicate, BoundsNestingDepth) {
+// The deepest nesting allowed, and a long flat query, are fine.
+TEST(MetadataQueryPredicate, TakesDeepAndLongQueriesWithinTheLimits) {
   const std::size_t limit = MetadataQueryPredicate::kMaxNestingDepth;
   const std::string deepest = std::string(limit, '(') + "a == 1" + std::string(limit, ')');
   EXPECT_TRUE(matches(deepest, {{"a", std::int64_t{1}}}));
-  const std::string tooDeep = std::string(limit + 1, '(') + "a == 1" + std::string(limit + 1, ')');
-  EXPECT_THAT(refusal(tooDeep), HasSubstr("nested too deeply"));
-  EXPECT_THAT(refusal(std::string(100000, '(')), HasSubstr("query longer"));
-  EXPECT_THAT(refusal(std::string(5000, '(')), HasSubstr("nested too deeply"));
-}
-
-TEST(MetadataQueryPredicate, LongFlatQueriesAreFine) {
   std::string text = "a == 0";
   for (int i = 1; i < 2000; ++i) text += " || a == " + std::to_string(i);
   EXPECT_TRUE(matches(text, {{"a", std::int64_t{1999}}}));
