@@ -104,7 +104,8 @@ TEST(VendChunkDigestVerifier, VerifiesGoodFilesAndNamesWhatIsWrongWithOthers) {
     if (c.outcome != kFailsOnUpdate && c.outcome != kBadManifest) {
       EXPECT_EQ(verifier.finish(), c.outcome == kVerifies) << verifier.failureDescription();
     }
-    EXPECT_EQ(verifier.failure(), c.outcome == kVerifies ? Failure::kNone : c.failure);
+    EXPECT_EQ(verifier.failure(), c.outcome == kVerifies ? Failure::kNone : c.failure)
+        << verifier.failureDescription();
     if (c.phrase) {
       EXPECT_NE(verifier.failureDescription().find(c.phrase), std::string::npos);
     }

@@ -132,12 +132,21 @@ RecordShape shapeOf(std::string name, const Made& record, Fields refused) {
           std::move(refused)};
 }
 
+void PrintTo(const RecordShape& shape, std::ostream* out) {
+  *out << shape.name;
+}
+
 class StoreRecordShape : public ::testing::TestWithParam<RecordShape> {};
 
 TEST_P(StoreRecordShape, WireAndArchiveGiveTheSameRecordBack) {
   const RecordShape& shape = GetParam();
-  EXPECT_EQ(shape.fromWire(shape.wire), shape.wire);
-  EXPECT_EQ(shape.fromArchive(throughArchive(shape.archive)), shape.wire);
+  const auto expectWire = [&](const std::optional<PlistDictionary>& back, const char* from) {
+    EXPECT_TRUE(back == shape.wire)
+        << "from the " << from << ":\n  " << (back ? describePlistValue(*back) : "refused")
+        << "\nexpected:\n  " << describePlistValue(shape.wire);
+  };
+  expectWire(shape.fromWire(shape.wire), "wire");
+  expectWire(shape.fromArchive(throughArchive(shape.archive)), "archive");
 }
 
 TEST_P(StoreRecordShape, OtherArchivesAndFieldsOfTheWrongTypeAreRefused) {
@@ -685,7 +694,6 @@ TEST(StoreRecordTillPurchase, WireDictionaryIsTheBuyRequestWithAbsentOptionalsLe
   EXPECT_EQ(wire.at("purchaseType"), PlistValue(std::int64_t{3}));
   EXPECT_EQ(wire.at("isUpdate"), PlistValue(true));
   EXPECT_EQ(wire.at("isRedownload"), PlistValue(false));
-  EXPECT_EQ(TillPurchase::fromDictionary(wire), fullPurchase());
 
   PlistDictionary plain = TillPurchase().toDictionary();
   for (const char* key : {"parentalControls", "accountLessOptions", "orvaneID"}) {
