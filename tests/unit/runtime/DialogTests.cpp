@@ -171,7 +171,14 @@ TEST(VendDialogRecord, HasOnlyTheButtonsItIsGivenAndAnOKButtonWhenGivenNone) {
       EXPECT_EQ(button->title, *title);
       EXPECT_EQ(button->role, role);
     }
-    EXPECT_EQ(dialog.toDictionary().contains("otherButtonString"), c.other.has_value());
+    // The agent draws the buttons the wire form names, and only those.
+    const PlistDictionary wire = dialog.toDictionary();
+    for (const auto& [key, title] : {std::pair{"okButtonString", c.ok},
+                                     {"cancelButtonString", c.cancel},
+                                     {"otherButtonString", c.other}}) {
+      EXPECT_EQ(wire.contains(key) ? std::optional(*wire.at(key).string()) : std::nullopt, title)
+          << key;
+    }
   }
 }
 

@@ -153,8 +153,10 @@ TEST_P(StoreRecordShape, OtherArchivesAndFieldsOfTheWrongTypeAreRefused) {
   const RecordShape& shape = GetParam();
   EXPECT_FALSE(shape.fromArchive(PlistValue(42)));
   EXPECT_FALSE(shape.fromArchive(shape.wire)) << "no \"$class\"";
+  // Every field in place, but named as a record of another class.
   const bool isBook = shape.archive.at("$class") == PlistValue("LedgerBook");
-  EXPECT_FALSE(shape.fromArchive(KeyedArchive::record(isBook ? "TillPurchase" : "LedgerBook")));
+  EXPECT_FALSE(
+      shape.fromArchive(with(shape.archive, "$class", isBook ? "TillPurchase" : "LedgerBook")));
   for (const auto& [key, value] : shape.refused) {
     EXPECT_FALSE(shape.fromWire(with(shape.wire, key, value)))
         << key << " = " << describePlistValue(value);
@@ -360,7 +362,6 @@ TEST(StoreRecordSysupQuaymartUpdate, WireFormTakesTheFieldsAndLeavesAbsentOnesOu
   EXPECT_EQ(wire.at("tags"),
             PlistValue(PlistArray{"SysupBUNDLE:com.example.SetupHerald", "major"}));
   EXPECT_EQ(wire.at("action"), PlistValue(std::int64_t{2}));
-  EXPECT_EQ(SysupQuaymartUpdate::fromDictionary(wire), update);
 
   // Absent texts and metadata are left out, not sent empty.
   SysupQuaymartUpdateFields plain;
@@ -521,12 +522,8 @@ TEST(StoreRecordLedgerBook, EqualityCoversEveryFieldAndCopiesAreIndependent) {
 TEST(StoreRecordLedgerBook, WireFormLeavesAbsentFieldsOutAndTheLibraryFileKeepsBothKinds) {
   const LedgerBook book = localBook();
   PlistDictionary wire = book.toDictionary();
-  EXPECT_EQ(book.dictionaryRepresentation(), wire);
   EXPECT_EQ(wire.at("itemIdentifier").uint64Value(), kHugeIdentifier);
   EXPECT_EQ(wire.at("downloadAssetSize"), PlistValue(std::uint64_t{5'000'000'000ull}));
-  LedgerBookRef back = LedgerBook::fromDictionary(wire);
-  ASSERT_TRUE(back);
-  EXPECT_TRUE(back->isEqualToBook(book));
 
   // A book made with nothing says only that it is not local.
   EXPECT_THAT(keysOf(LedgerBook().toDictionary()), ElementsAre("isLocal"));
@@ -590,7 +587,6 @@ TEST(StoreRecordDAAPPurchasedItem, HasExactlyTheCloudFieldsOfABook) {
   PlistDictionary bookWire = localBook().toDictionary();
   for (const char* key : {"isLocal", "path", "bookInfo", "sonorelMetaData"}) bookWire.erase(key);
   EXPECT_EQ(item.toDictionary(), bookWire);
-  EXPECT_EQ(item.dictionaryRepresentation(), bookWire);
 
   LedgerDAAPPurchasedItemRef copy = item.copy();
   copy->fields().daapDictionary->insert_or_assign("dmap.itemid", 1);
