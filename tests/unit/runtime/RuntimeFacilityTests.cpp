@@ -13,6 +13,7 @@
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
+#include <functional>
 #include <nlohmann/json.hpp>
 #include <set>
 #include <string>
@@ -155,27 +156,22 @@ TEST_F(RuntimeFacilityTest, GzipOutputIsReadByTheSystemGzipTool) {
 }
 
 TEST_F(RuntimeFacilityTest, GunzipRefusesDamagedTruncatedPaddedAndOversizedStreams) {
-  PlistData input = pseudoRandomBytes(20000, 11);
-  PlistData zipped = *VendCopyGzippedDataForData(input);
-
-  PlistData flipped = zipped;
-  flipped[flipped.size() / 2] ^= 0x55;
-  EXPECT_FALSE(VendCopyGunzippedDataForData(flipped));
-
-  PlistData badChecksum = zipped;
-  badChecksum[badChecksum.size() - 6] ^= 0x01;  // inside the CRC-32 of the trailer
-  EXPECT_FALSE(VendCopyGunzippedDataForData(badChecksum));
-
-  PlistData truncated(zipped.begin(), zipped.end() - 5);
-  EXPECT_FALSE(VendCopyGunzippedDataForData(truncated));
-
-  PlistData padded = zipped;
-  padded.push_back(0);
-  EXPECT_FALSE(VendCopyGunzippedDataForData(padded));
-
-  std::string plain = "not compressed at all";
-  EXPECT_FALSE(VendCopyGunzippedDataForData(PlistData(plain.begin(), plain.end())));
-  EXPECT_FALSE(VendCopyGunzippedDataForData(PlistData{}));
+  const PlistData zipped = *VendCopyGzippedDataForData(pseudoRandomBytes(20000, 11));
+  const auto changed = [&](const std::function<void(PlistData&)>& change) {
+    PlistData copy = zipped;
+    change(copy);
+    return copy;
+  };
+  const std::string plain = "not compressed at all";
+  const std::pair<const char*, PlistData> refused[] = {
+      {"a flipped byte", changed([](PlistData& d) { d[d.size() / 2] ^= 0x55; })},
+      {"a bad checksum", changed([](PlistData& d) { d[d.size() - 6] ^= 0x01; })},  // in the CRC-32
+      {"truncated", changed([](PlistData& d) { d.resize(d.size() - 5); })},
+      {"padded", changed([](PlistData& d) { d.push_back(0); })},
+      {"not compressed", PlistData(plain.begin(), plain.end())},
+      {"empty", PlistData{}},
+  };
+  for (const auto& [name, data] : refused) EXPECT_FALSE(VendCopyGunzippedDataForData(data)) << name;
 
   // A small body that expands beyond the limit is refused, at the limit it is fine.
   PlistData zeros(4u << 20u, 0);
@@ -718,8 +714,6 @@ TEST_F(RuntimeFacilityTest, DockRecordsIconsPlaceholdersAndMessages) {
 
   std::string location = LedgerIconLocationForIdentifier(store.identifier(), "061-12345");
   EXPECT_EQ(readFile(location), "PNGDATA");
-  EXPECT_FALSE(fs::exists(LedgerIconLocationForIdentifier(store.identifier(), "400100")))
-      << "remote icons are recorded, not fetched";
   std::string escaped = LedgerIconLocationForIdentifier(store.identifier(), "../../escape");
   EXPECT_EQ(fs::path(escaped).parent_path(), fs::path(location).parent_path());
   EXPECT_EQ(readFile(escaped), "PNGDATA");
@@ -736,8 +730,11 @@ TEST_F(RuntimeFacilityTest, DockRecordsIconsPlaceholdersAndMessages) {
   const std::string iconKey = store.identifier() + "/061-12345";
   EXPECT_EQ(state["icons"][iconKey]["url"], PlistValue("file://" + iconSource));
   EXPECT_EQ(state["icons"][iconKey]["location"], PlistValue(location));
+  // The remote icon is recorded, which is when a fetch would have written it.
   EXPECT_EQ(state["icons"][store.identifier() + "/400100"]["url"],
             PlistValue("https://store.test/icon.png"));
+  EXPECT_FALSE(fs::exists(LedgerIconLocationForIdentifier(store.identifier(), "400100")))
+      << "remote icons are recorded, not fetched";
   EXPECT_EQ(state["placeholders"]["Big Update"]["iconData"], PlistValue(PlistData{1, 2, 3}));
   EXPECT_TRUE(state["placeholders"]["Other"].isNull());
   EXPECT_EQ(state["messages"]["061-12345"]["status"]["percentComplete"], PlistValue(40.0));
