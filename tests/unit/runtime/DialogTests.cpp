@@ -1,11 +1,9 @@
 // Dialogs of the store runtime: the dialog record, the UI service's
 // promise of exactly one answer, and the operation that waits for one.
 #include <gtest/gtest.h>
-#include <unistd.h>
 
 #include <chrono>
 #include <condition_variable>
-#include <filesystem>
 #include <functional>
 #include <future>
 #include <map>
@@ -14,6 +12,7 @@
 #include <stdexcept>
 #include <vector>
 
+#include "RuntimeTestSupport.h"
 #include "store-runtime/dialogs/VendCancellingDialogPresenter.h"
 #include "store-runtime/dialogs/VendDialog.h"
 #include "store-runtime/dialogs/VendDialogPresenter.h"
@@ -24,7 +23,6 @@
 namespace larder {
 namespace {
 
-namespace fs = std::filesystem;
 using namespace std::chrono_literals;
 using Button = VendDialogButton;
 
@@ -106,29 +104,8 @@ std::optional<Button> buttonOf(const VendDialog& dialog, std::int64_t role) {
                                    : dialog.otherButton();
 }
 
-// Installs a runtime of the test's own as the shared one, so that
-// operations, whose services come from the shared runtime, reach the
-// test's presenter.
 class DialogTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    directory_ = fs::temp_directory_path() /
-                 ("larder-dialog-test-" + std::to_string(::getpid()) + "-" +
-                  ::testing::UnitTest::GetInstance()->current_test_info()->name());
-    fs::create_directories(directory_);
-    VendRuntimeConfiguration configuration;
-    configuration.stateDirectory = (directory_ / "state").string();
-    configuration.downloadsDirectory = (directory_ / "downloads").string();
-    runtime_ = std::make_shared<VendRuntime>(configuration);
-    VendRuntime::setShared(runtime_);
-  }
-  void TearDown() override {
-    // The next user makes a shared runtime from the environment again.
-    VendRuntime::setShared(nullptr);
-    std::error_code ignored;
-    fs::remove_all(directory_, ignored);
-  }
-
   std::shared_ptr<ScriptedPresenter> install(ScriptedPresenter::Behaviour behaviour,
                                              std::int64_t exitCode = 1,
                                              PlistDictionary values = {}) {
@@ -137,10 +114,8 @@ class DialogTest : public ::testing::Test {
     return presenter;
   }
 
-  std::shared_ptr<VendRuntime> runtime_;
-
- private:
-  fs::path directory_;
+  testing::SharedRuntime shared_;
+  const std::shared_ptr<VendRuntime>& runtime_ = shared_.get();
 };
 
 TEST(VendDialogRecord, HasOnlyTheButtonsItIsGivenAndAnOKButtonWhenGivenNone) {

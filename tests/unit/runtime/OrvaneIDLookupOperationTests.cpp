@@ -50,15 +50,10 @@ TEST(OrvaneIDLookupQuery, NamesTheWareIDAndTheEncodedAccountOrNothingWithoutAcco
 // A store whose bag points the lookup at "/who".
 class OrvaneIDLookupOperationTest : public ::testing::Test {
  protected:
-  void SetUp() override {
+  OrvaneIDLookupOperationTest() {
     store_.add("/bag.plist", PropertyListSerialization::writeXml(
                                  PlistDictionary{{"orvane-id-lookup", store_.url("/who")}}));
-    VendRuntimeConfiguration configuration = root_.configuration();
-    configuration.bagURL = store_.url("/bag.plist");
-    VendRuntime::setShared(std::make_shared<VendRuntime>(configuration));
   }
-  // The next user makes a shared runtime from the environment again.
-  void TearDown() override { VendRuntime::setShared(nullptr); }
 
   void answerWith(const PlistValue& answer, int status = 200) {
     store_.add("/who", PropertyListSerialization::writeXml(answer), StoreServer::Fault::kNone,
@@ -77,8 +72,8 @@ class OrvaneIDLookupOperationTest : public ::testing::Test {
     return lookup;
   }
 
-  PrivateRoot root_;
   StoreServer store_;
+  SharedRuntime runtime_{store_.url("/bag.plist")};
 };
 
 TEST_F(OrvaneIDLookupOperationTest, AnUnsignedGetOfTheBagsURLGivesTheName) {

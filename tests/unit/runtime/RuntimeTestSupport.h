@@ -232,6 +232,29 @@ class PrivateRoot {
   ScopedEnvironment environment_;
 };
 
+// A runtime of the test's own, in a private root, installed as the shared
+// one, so that operations, whose services come from the shared runtime,
+// reach what the test gives it. The next user makes a shared runtime from
+// the environment again.
+class SharedRuntime {
+ public:
+  explicit SharedRuntime(std::string bagURL = "") {
+    VendRuntimeConfiguration configuration = root_.configuration();
+    configuration.bagURL = std::move(bagURL);
+    runtime_ = std::make_shared<VendRuntime>(configuration);
+    VendRuntime::setShared(runtime_);
+  }
+  ~SharedRuntime() { VendRuntime::setShared(nullptr); }
+  SharedRuntime(const SharedRuntime&) = delete;
+  SharedRuntime& operator=(const SharedRuntime&) = delete;
+
+  [[nodiscard]] const std::shared_ptr<VendRuntime>& get() const { return runtime_; }
+
+ private:
+  PrivateRoot root_;
+  std::shared_ptr<VendRuntime> runtime_;
+};
+
 // Serves bodies on 127.0.0.1 with range requests, records every request
 // and can fail the ways a store fails.
 class StoreServer {
