@@ -105,26 +105,5 @@ TEST_F(OrvaneIDLookupOperationTest, AnAnswerWithoutAStringNameIsAnError) {
   }
 }
 
-TEST_F(OrvaneIDLookupOperationTest, AFailureOfTheStoreIsTheOperationsError) {
-  answerWith(
-      PlistDictionary{{"failureType", "unknown-account"}, {"customerMessage", "Who is that?"}},
-      404);
-  const auto lookup = runLookup(recordOf("3001", "opaque"));
-  EXPECT_FALSE(lookup->success());
-  ASSERT_TRUE(lookup->error());
-  EXPECT_EQ(lookup->error()->code, 404);
-  EXPECT_EQ(lookup->error()->description, "Who is that?");
-  EXPECT_FALSE(lookup->orvaneID());
-}
-
-TEST_F(OrvaneIDLookupOperationTest, ARecordWithoutAccountFailsWithoutAsking) {
-  const auto lookup = runLookup(recordOf("3001", std::nullopt));
-  EXPECT_FALSE(lookup->success());
-  ASSERT_TRUE(lookup->error());
-  EXPECT_EQ(lookup->error()->domain, VendOrvaneIDLookupOperation::kErrorDomain);
-  EXPECT_EQ(lookup->error()->code, VendOrvaneIDLookupOperation::kRecordNamesNoAccountCode);
-  EXPECT_TRUE(store_.requests("/who").empty());
-}
-
 }  // namespace
 }  // namespace larder::testing
