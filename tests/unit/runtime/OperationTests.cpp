@@ -167,17 +167,6 @@ TEST(VendOperation, CancellingTheOuterOperationReachesItsSubOperation) {
   EXPECT_FALSE(inner->isCancelled());  // only while it ran inside the cancelled one
 }
 
-TEST(VendOperationQueue, OperationsRunOffTheCallersThread) {
-  VendOperationQueue queue("test");
-  auto operation =
-      std::make_shared<ScriptedOperation>([](ScriptedOperation& self) { self.setSuccess(true); });
-  queue.addOperation(operation);
-  queue.waitUntilAllOperationsAreFinished();
-  EXPECT_EQ(operation->runs, 1);
-  EXPECT_NE(operation->thread.load(), std::this_thread::get_id());
-  EXPECT_EQ(queue.operationCount(), 0U);
-}
-
 // Every operation waits for one it adds to the same queue, twenty levels
 // deep, while other chains do the same: a queue with a fixed set of
 // threads would deadlock here.
@@ -205,7 +194,7 @@ TEST(VendOperationQueue, OperationsWaitingForOperationsOnTheSameQueueDoNotDeadlo
   EXPECT_EQ(completed, kChains * (kDepth + 1));
 }
 
-TEST(VendOperationQueue, IdleThreadsLeaveAndAreReplacedOnDemand) {
+TEST(VendOperationQueue, RunsOffTheCallersThreadOnThreadsThatLeaveWhenIdle) {
   VendOperationQueue queue("idle", 50ms);
   for (int i = 0; i < 4; ++i) {
     queue.addOperation(std::make_shared<ScriptedOperation>([](ScriptedOperation& self) {
@@ -224,9 +213,9 @@ TEST(VendOperationQueue, IdleThreadsLeaveAndAreReplacedOnDemand) {
   queue.addOperation(late);
   queue.waitUntilAllOperationsAreFinished();
   EXPECT_EQ(late->runs, 1);
+  EXPECT_NE(late->thread.load(), std::this_thread::get_id());
+  EXPECT_EQ(queue.operationCount(), 0U);
 }
-
-// ------------------------------------------------ the property list provider
 
 PlistData bytes(const std::string& text) {
   return {text.begin(), text.end()};

@@ -115,8 +115,6 @@ class RuntimeFacilityTest : public ::testing::Test {
   testing::ScopedEnvironment environment_;
 };
 
-// ---------------------------------------------------------------- gzip
-
 PlistData pseudoRandomBytes(std::size_t count, unsigned seed) {
   const std::string bytes = testing::randomBytes(count, seed);
   return {bytes.begin(), bytes.end()};
@@ -170,8 +168,6 @@ TEST_F(RuntimeFacilityTest, GunzipRefusesDamagedTruncatedPaddedAndOversizedStrea
   EXPECT_EQ(exact->size(), zeros.size());
 }
 
-// ---------------------------------------------------------------- errors
-
 // The named errors, and errors made from a title and a message (the
 // message is preferred as the description) or in another domain.
 TEST_F(RuntimeFacilityTest, ErrorsCarryTheirDomainsCodesAndTexts) {
@@ -224,8 +220,6 @@ TEST_F(RuntimeFacilityTest, ErrorsCarryTheirDomainsCodesAndTexts) {
   }
 }
 
-// ---------------------------------------------------------------- restrictions
-
 // Each state of the file in turn, read at every call: whether it requires
 // an administrator and whether it silences update notifications.
 TEST_F(RuntimeFacilityTest, RestrictionsFollowTheFileAtEveryCall) {
@@ -262,8 +256,6 @@ TEST_F(RuntimeFacilityTest, RestrictionsFollowTheFileAtEveryCall) {
     EXPECT_FALSE(VendManagedRestrictions::isRestrictedTo("SomethingElse"));
   }
 }
-
-// ---------------------------------------------------------------- deferred-install agent
 
 TEST_F(RuntimeFacilityTest, TwilightArmingIsPersistedAndUndone) {
   EXPECT_FALSE(LedgerTwilightAgent::isArmedForInstallLater());
@@ -330,8 +322,6 @@ TEST_F(RuntimeFacilityTest, RestartCountdownIsShownUntilTheUserAnswers) {
   EXPECT_FALSE(LedgerTwilightAgent::isRestartCountdownShown());
 }
 
-// ---------------------------------------------------------------- message trace
-
 TEST_F(RuntimeFacilityTest, TraceMessagesFromManyThreadsAreWholeLines) {
   constexpr int kThreads = 8;
   constexpr int kPerThread = 150;
@@ -390,8 +380,6 @@ TEST_F(RuntimeFacilityTest, TraceLinesKeepEveryValueKind) {
   EXPECT_EQ(record["message"]["list"], nlohmann::json::array({"a", 1}));
   EXPECT_TRUE(record["message"]["odd"].is_string());
 }
-
-// ---------------------------------------------------------------- localised text
 
 TEST_F(RuntimeFacilityTest, LocalizedTextComesFromTheClientsWordingThenTheDefaultThenTheKey) {
   const VendStoreClient store =
@@ -457,8 +445,6 @@ TEST_F(RuntimeFacilityTest, BundleOnDiskAnswersFromItsOwnTables) {
   EXPECT_EQ(onDisk.localizedStringForKey("CANCEL", "", std::nullopt), "CANCEL");
 }
 
-// ---------------------------------------------------------------- string helpers
-
 TEST_F(RuntimeFacilityTest, TildeExpandsAgainstTheRealHomeNotHOME) {
   const passwd* entry = ::getpwuid(::getuid());
   const std::string realHome = entry && entry->pw_dir ? entry->pw_dir : "";
@@ -504,8 +490,6 @@ TEST_F(RuntimeFacilityTest, QueryStringHelperPlacesSeparatorsAndKeepsTheFragment
         << c.url << " + " << c.text;
   }
 }
-
-// ---------------------------------------------------------------- system state
 
 TEST_F(RuntimeFacilityTest, LockedApplicationsMayNotLaunch) {
   const std::string path = platformState("locked-applications.plist");
@@ -572,8 +556,6 @@ TEST_F(RuntimeFacilityTest, CriticalUpdateTimeStampIsKeptPerUser) {
   EXPECT_FALSE(LedgerCriticalUpdateTimeStamp());
 }
 
-// ---------------------------------------------------------------- device
-
 TEST_F(RuntimeFacilityTest, OSMajorVersionComesFromOSReleaseElseTheKernel) {
   utsname name{};
   ASSERT_EQ(::uname(&name), 0);
@@ -628,8 +610,6 @@ TEST_F(RuntimeFacilityTest, AvailableDiskSpaceIsThatOfThePlatformRoot) {
   ::setenv("LARDER_ROOT", (temporary_ + "/missing-root").c_str(), 1);
   EXPECT_EQ(VendDevice::availableDiskSpace(), 0u);
 }
-
-// ---------------------------------------------------------------- privileged helper
 
 TEST_F(RuntimeFacilityTest, RootHelperWritesSystemPreferencesWithTheOSVersion) {
   writeText(rooted("/etc/os-release"), "VERSION_ID=\"13.1\"\n");
@@ -687,8 +667,6 @@ TEST_F(RuntimeFacilityTest, StateFileChangesFromManyThreadsAreNotLost) {
   for (auto& thread : threads) thread.join();
   EXPECT_EQ(PlistValue(file.readDictionary())["count"].int64Value(), kThreads * kIncrements);
 }
-
-// ---------------------------------------------------------------- launcher bar and store app
 
 TEST_F(RuntimeFacilityTest, DockRecordsIconsPlaceholdersAndMessages) {
   VendStoreClient store =
@@ -760,8 +738,6 @@ TEST_F(RuntimeFacilityTest, StoreApplicationLaunchIsRecordedAndStarted) {
   ::setenv("LARDER_STORE_APP", (temporary_ + "/no-such-program").c_str(), 1);
   EXPECT_FALSE(LedgerQuaymartLauncher::sharedInstance().launchQuaymartWithURL(url));
 }
-
-// ---------------------------------------------------------------- file manager
 
 TEST_F(RuntimeFacilityTest, StoreSoftwareIsTheBundleWithAPurchaseRecord) {
   const PlistDictionary info{{"HostBundleIdentifier", "com.example.store"}};
