@@ -539,15 +539,11 @@ TEST(StoreRecordLedgerBook, RedownloadPurchaseNeedsParametersAndIsARedownload) {
   LedgerBook book = localBook();
   std::optional<TillPurchase> purchase = book.redownloadPurchase();
   ASSERT_TRUE(purchase);
-  EXPECT_EQ(purchase->buyParameters(), "itemId=1234&pricingParameters=RDWN");
   // The record's own identifier wins over the one in the parameters.
-  EXPECT_EQ(purchase->itemIdentifier(), kHugeIdentifier);
-  EXPECT_TRUE(purchase->isRedownload());
-  EXPECT_FALSE(purchase->isUpdate());
-  std::optional<TillPurchase> ofItem = LedgerDAAPPurchasedItem(cloudFields()).redownloadPurchase();
-  ASSERT_TRUE(ofItem);
-  EXPECT_TRUE(ofItem->isRedownload());
-  EXPECT_EQ(ofItem->itemIdentifier(), kHugeIdentifier);
+  EXPECT_EQ(std::tuple(purchase->buyParameters(), purchase->itemIdentifier(),
+                       purchase->isRedownload(), purchase->isUpdate()),
+            std::tuple("itemId=1234&pricingParameters=RDWN", kHugeIdentifier, true, false));
+  EXPECT_EQ(LedgerDAAPPurchasedItem(cloudFields()).redownloadPurchase(), purchase);
 
   book.fields().itemIdentifier.reset();
   ASSERT_TRUE(book.redownloadPurchase());
