@@ -1,20 +1,18 @@
 // Dialogs of the store runtime: the dialog record, the UI service's
 // promise of exactly one answer, and the operation that waits for one.
 #include <gtest/gtest.h>
-#include <unistd.h>
 
-#include <atomic>
 #include <chrono>
 #include <condition_variable>
-#include <filesystem>
+#include <functional>
 #include <future>
 #include <map>
 #include <mutex>
 #include <set>
 #include <stdexcept>
-#include <thread>
 #include <vector>
 
+#include "RuntimeTestSupport.h"
 #include "store-runtime/dialogs/VendCancellingDialogPresenter.h"
 #include "store-runtime/dialogs/VendDialog.h"
 #include "store-runtime/dialogs/VendDialogPresenter.h"
@@ -25,8 +23,8 @@
 namespace larder {
 namespace {
 
-namespace fs = std::filesystem;
 using namespace std::chrono_literals;
+using Button = VendDialogButton;
 
 const VendStoreClient kClient = VendStoreClient::initWithStoreClientType(0);
 
@@ -48,20 +46,10 @@ class ScriptedPresenter final : public VendDialogPresenter {
       if (behaviour_ == Behaviour::kHold) held_.emplace(dialog.identifier(), std::move(reply));
     }
     presentedChanged_.notify_all();
-    switch (behaviour_) {
-      case Behaviour::kAnswer:
-        reply(VendDialogAnswer{exitCode_, values_});
-        return;
-      case Behaviour::kAnswerTwice:
-        reply(VendDialogAnswer{exitCode_, values_});
-        reply(VendDialogAnswer{exitCode_ + 1, {}});
-        return;
-      case Behaviour::kHold:
-      case Behaviour::kDropUnanswered:
-        return;
-      case Behaviour::kThrow:
-        throw std::runtime_error("no screen");
-    }
+    if (behaviour_ == Behaviour::kThrow) throw std::runtime_error("no screen");
+    if (behaviour_ == Behaviour::kAnswer || behaviour_ == Behaviour::kAnswerTwice)
+      reply(VendDialogAnswer{exitCode_, values_});
+    if (behaviour_ == Behaviour::kAnswerTwice) reply(VendDialogAnswer{exitCode_ + 1, {}});
   }
 
   void dismiss(std::string_view dialogIdentifier, std::int64_t exitCode) override {
@@ -77,10 +65,9 @@ class ScriptedPresenter final : public VendDialogPresenter {
     reply(VendDialogAnswer{exitCode, {}});
   }
 
-  // Waits until `count` dialogs have been presented.
-  bool waitForPresented(std::size_t count, std::chrono::milliseconds timeout = 5s) {
+  bool waitForPresented(std::size_t count) {
     std::unique_lock lock(mutex_);
-    return presentedChanged_.wait_for(lock, timeout, [&] { return presented_.size() >= count; });
+    return presentedChanged_.wait_for(lock, 5s, [&] { return presented_.size() >= count; });
   }
   std::vector<VendDialog> presented() {
     std::lock_guard lock(mutex_);
@@ -102,206 +89,172 @@ class ScriptedPresenter final : public VendDialogPresenter {
   std::vector<std::pair<std::string, std::int64_t>> dismissals_;
 };
 
-// Installs a runtime of the test's own as the shared one, so that
-// operations, whose services come from the shared runtime, reach the
-// test's presenter.
+VendDialog threeButtonDialog() {
+  return VendDialog::dialogWithDictionary({{"message", "Quit Foo?"},
+                                           {"explanation", "Foo must quit to be updated."},
+                                           {"okButtonString", "Quit"},
+                                           {"cancelButtonString", "Not Now"},
+                                           {"otherButtonString", "Skip"}});
+}
+
+// The dialog's own button of `role`, if it has one.
+std::optional<Button> buttonOf(const VendDialog& dialog, std::int64_t role) {
+  return role == Button::kOK       ? dialog.okButton()
+         : role == Button::kCancel ? dialog.cancelButton()
+                                   : dialog.otherButton();
+}
+
 class DialogTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    directory_ = fs::temp_directory_path() /
-                 ("larder-dialog-test-" + std::to_string(::getpid()) + "-" +
-                  ::testing::UnitTest::GetInstance()->current_test_info()->name());
-    fs::create_directories(directory_);
-    VendRuntimeConfiguration configuration;
-    configuration.stateDirectory = (directory_ / "state").string();
-    configuration.downloadsDirectory = (directory_ / "downloads").string();
-    runtime_ = std::make_shared<VendRuntime>(configuration);
-    VendRuntime::setShared(runtime_);
-  }
-
-  void TearDown() override {
-    // The next user makes a shared runtime from the environment again.
-    VendRuntime::setShared(nullptr);
-    std::error_code ignored;
-    fs::remove_all(directory_, ignored);
-  }
-
   std::shared_ptr<ScriptedPresenter> install(ScriptedPresenter::Behaviour behaviour,
-                                             std::int64_t exitCode = 1) {
-    auto presenter = std::make_shared<ScriptedPresenter>(behaviour, exitCode);
+                                             std::int64_t exitCode = 1,
+                                             PlistDictionary values = {}) {
+    auto presenter = std::make_shared<ScriptedPresenter>(behaviour, exitCode, std::move(values));
     runtime_->setDialogPresenter(presenter);
     return presenter;
   }
 
-  static VendDialog threeButtonDialog() {
-    return VendDialog::dialogWithDictionary({{"message", "Quit Foo?"},
-                                             {"explanation", "Foo must quit to be updated."},
-                                             {"okButtonString", "Quit"},
-                                             {"cancelButtonString", "Not Now"},
-                                             {"otherButtonString", "Skip"}});
-  }
-
-  std::shared_ptr<VendRuntime> runtime_;
-
- private:
-  fs::path directory_;
+  testing::SharedRuntime shared_;
+  const std::shared_ptr<VendRuntime>& runtime_ = shared_.get();
 };
 
-// The record.
-
-TEST(VendDialogRecord, TakesItsTextsAndOnlyTheButtonsItIsGiven) {
-  VendDialog dialog = VendDialog::dialogWithDictionary({{"message", "Restart?"},
-                                                        {"explanation", "Updates are ready."},
-                                                        {"okButtonString", "Restart"},
-                                                        {"cancelButtonString", "Later"}});
-  EXPECT_EQ(dialog.message(), "Restart?");
-  EXPECT_EQ(dialog.explanation(), "Updates are ready.");
-  ASSERT_TRUE(dialog.okButton());
-  EXPECT_EQ(dialog.okButton()->title, "Restart");
-  EXPECT_EQ(dialog.okButton()->role, VendDialogButton::kOK);
-  ASSERT_TRUE(dialog.cancelButton());
-  EXPECT_EQ(dialog.cancelButton()->title, "Later");
-  EXPECT_FALSE(dialog.otherButton()) << "no otherButtonString, no other button";
-  EXPECT_EQ(dialog.kind(), VendDialog::kAlert);
-
-  PlistDictionary wire = dialog.toDictionary();
-  EXPECT_EQ(wire.count("otherButtonString"), 0u);
-  EXPECT_EQ(*wire.at("okButtonString").string(), "Restart");
-  EXPECT_EQ(*wire.at("identifier").string(), dialog.identifier());
-  EXPECT_EQ(wire.at("kind").int64Value(), VendDialog::kAlert);
+TEST(VendDialogRecord, HasOnlyTheButtonsItIsGivenAndAnOKButtonWhenGivenNone) {
+  using Title = std::optional<std::string>;
+  constexpr std::nullopt_t none = std::nullopt;
+  const struct {
+    const char* name;
+    PlistDictionary fields;
+    Title ok, cancel, other;
+  } cases[] = {
+      {"two", {{"okButtonString", "Go"}, {"cancelButtonString", "No"}}, "Go", "No", none},
+      {"three buttons", threeButtonDialog().toDictionary(), "Quit", "Not Now", "Skip"},
+      {"no buttons", {{"message", "Done"}}, "OK", none, none},
+      {"a cancel button alone", {{"cancelButtonString", "Close"}}, none, "Close", none},
+      {"an empty title still asks for the button", {{"okButtonString", ""}}, "OK", none, none},
+      {"a number is no title", {{"cancelButtonString", std::int64_t{1}}}, "OK", none, none},
+      {"a dictionary is no title", {{"otherButtonString", PlistDictionary{}}}, "OK", none, none},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    const VendDialog dialog = VendDialog::dialogWithDictionary(c.fields);
+    const std::pair<std::int64_t, Title> expected[] = {
+        {Button::kOK, c.ok}, {Button::kCancel, c.cancel}, {Button::kOther, c.other}};
+    for (const auto& [role, title] : expected) {
+      const std::optional<Button> button = buttonOf(dialog, role);
+      ASSERT_EQ(button.has_value(), title.has_value()) << "role " << role;
+      if (!button) continue;
+      EXPECT_EQ(button->title, *title);
+      EXPECT_EQ(button->role, role);
+    }
+    // The agent draws the buttons the wire form names, and only those.
+    const PlistDictionary wire = dialog.toDictionary();
+    for (const auto& [key, title] : {std::pair{"okButtonString", c.ok},
+                                     {"cancelButtonString", c.cancel},
+                                     {"otherButtonString", c.other}}) {
+      EXPECT_EQ(wire.contains(key) ? std::optional(*wire.at(key).string()) : std::nullopt, title)
+          << key;
+    }
+  }
 }
 
-TEST(VendDialogRecord, ADialogWithoutButtonsGetsAnOKButton) {
-  VendDialog dialog = VendDialog::dialogWithDictionary({{"message", "Done"}});
-  ASSERT_TRUE(dialog.okButton());
-  EXPECT_EQ(dialog.okButton()->title, "OK");
-  EXPECT_FALSE(dialog.cancelButton());
-  EXPECT_FALSE(dialog.otherButton());
-
-  // Only a cancel button: no OK button is added.
-  VendDialog cancelOnly =
-      VendDialog::dialogWithDictionary({{"message", "x"}, {"cancelButtonString", "Close"}});
-  EXPECT_FALSE(cancelOnly.okButton());
-  ASSERT_TRUE(cancelOnly.cancelButton());
-}
-
-TEST(VendDialogRecord, HostileFieldsAreIgnoredAndEmptyTitlesGetTheTitleOfTheirRole) {
-  VendDialog dialog = VendDialog::dialogWithDictionary({{"message", std::int64_t{42}},
-                                                        {"explanation", PlistArray{"not", "text"}},
-                                                        {"okButtonString", ""},
-                                                        {"cancelButtonString", std::int64_t{1}},
-                                                        {"otherButtonString", PlistDictionary{}},
-                                                        {"kind", std::int64_t{99}},
-                                                        {"identifier", "CHOSEN-BY-CALLER"},
-                                                        {"accountName", "alice@example.com"}});
-  EXPECT_EQ(dialog.message(), "");
-  EXPECT_EQ(dialog.explanation(), "");
-  ASSERT_TRUE(dialog.okButton()) << "an empty string still asks for the button";
-  EXPECT_EQ(dialog.okButton()->title, "OK");
-  EXPECT_FALSE(dialog.cancelButton()) << "a number is not a button title";
-  EXPECT_FALSE(dialog.otherButton());
-  EXPECT_EQ(dialog.kind(), VendDialog::kAlert) << "an unknown kind is a plain alert";
-  EXPECT_NE(dialog.identifier(), "CHOSEN-BY-CALLER");
-  EXPECT_EQ(*dialog.toDictionary().at("accountName").string(), "alice@example.com")
-      << "keys the dialog does not know travel to the agent unchanged";
-}
-
-TEST(VendDialogRecord, EveryDialogHasAFreshIdentifier) {
-  const PlistDictionary fields{{"message", "Same"}};
-  std::set<std::string> identifiers;
-  for (int i = 0; i < 100; ++i)
-    identifiers.insert(VendDialog::dialogWithDictionary(fields).identifier());
-  EXPECT_EQ(identifiers.size(), 100u);
-  EXPECT_FALSE(identifiers.begin()->empty());
-}
-
-TEST(VendDialogRecord, ExitCodesMapToTheDialogsOwnButtons) {
-  VendDialog dialog = VendDialog::dialogWithDictionary({{"message", "m"},
-                                                        {"okButtonString", "Yes"},
-                                                        {"cancelButtonString", "No"},
-                                                        {"otherButtonString", "Skip"}});
-  ASSERT_TRUE(dialog.buttonForExitCode(1));
-  EXPECT_TRUE(dialog.buttonForExitCode(1)->isEqual(*dialog.okButton(), true));
-  EXPECT_TRUE(dialog.buttonForExitCode(0)->isEqual(*dialog.cancelButton(), true));
-  EXPECT_TRUE(dialog.buttonForExitCode(2)->isEqual(*dialog.otherButton(), true));
-  EXPECT_FALSE(dialog.buttonForExitCode(-1));
-  EXPECT_FALSE(dialog.buttonForExitCode(3));
-  EXPECT_FALSE(dialog.buttonForExitCode(1)->isEqual(*dialog.cancelButton(), true));
-
-  VendDialog okOnly = VendDialog::dialogWithDictionary({{"message", "m"}});
-  EXPECT_FALSE(okOnly.buttonForExitCode(0)) << "no cancel button to choose";
-  // Superficial comparison ignores the title; a full one does not.
-  VendDialogButton renamed{"Other title", VendDialogButton::kOK};
-  EXPECT_TRUE(renamed.isEqual(*okOnly.okButton(), true));
-  EXPECT_FALSE(renamed.isEqual(*okOnly.okButton(), false));
-}
-
-TEST(VendDialogRecord, KindAndContentTravelToTheAgent) {
-  VendDialog dialog =
+TEST(VendDialogRecord, TextsAndKindAreTakenOnlyWhenWellTyped) {
+  const VendDialog licence =
       VendDialog::dialogWithDictionary({{"message", "Licence"},
+                                        {"explanation", "Read it."},
                                         {"kind", std::int64_t{VendDialog::kLicenseAgreement}},
                                         {"content", "You agree."}});
-  EXPECT_EQ(dialog.kind(), VendDialog::kLicenseAgreement);
-  EXPECT_EQ(dialog.content(), "You agree.");
-  PlistDictionary wire = dialog.toDictionary();
-  EXPECT_EQ(wire.at("kind").int64Value(), VendDialog::kLicenseAgreement);
-  EXPECT_EQ(*wire.at("content").string(), "You agree.");
+  EXPECT_EQ(licence.message(), "Licence");
+  EXPECT_EQ(licence.explanation(), "Read it.");
+  EXPECT_EQ(licence.kind(), VendDialog::kLicenseAgreement);
+  EXPECT_EQ(licence.content(), "You agree.");
+  EXPECT_EQ(licence.toDictionary().at("kind").int64Value(), VendDialog::kLicenseAgreement);
+  EXPECT_EQ(licence.toDictionary().at("content"), PlistValue("You agree."));
+
+  const VendDialog hostile =
+      VendDialog::dialogWithDictionary({{"message", std::int64_t{42}},
+                                        {"explanation", PlistArray{"not", "text"}},
+                                        {"content", PlistData{1}},
+                                        {"kind", std::int64_t{99}}});
+  EXPECT_EQ(hostile.message(), "");
+  EXPECT_EQ(hostile.explanation(), "");
+  EXPECT_EQ(hostile.content(), "");
+  EXPECT_EQ(hostile.kind(), VendDialog::kAlert) << "an unknown kind is a plain alert";
+  EXPECT_EQ(hostile.toDictionary().at("kind").int64Value(), VendDialog::kAlert);
 }
 
-// The fallback presenter.
+TEST(VendDialogRecord, IdentifiersAreFreshAndUnknownKeysTravelToTheAgent) {
+  const PlistDictionary fields{{"message", "Same"},
+                               {"identifier", "CHOSEN-BY-CALLER"},
+                               {"accountName", "alice@example.com"}};
+  std::set<std::string> identifiers;
+  for (int i = 0; i < 100; ++i) {
+    const VendDialog dialog = VendDialog::dialogWithDictionary(fields);
+    identifiers.insert(dialog.identifier());
+    EXPECT_EQ(dialog.toDictionary().at("identifier"), PlistValue(dialog.identifier()));
+    EXPECT_EQ(dialog.toDictionary().at("accountName"), PlistValue("alice@example.com"));
+  }
+  EXPECT_EQ(identifiers.size(), 100u);
+  EXPECT_FALSE(identifiers.contains("CHOSEN-BY-CALLER"));
+  EXPECT_FALSE(identifiers.contains(""));
+}
 
-TEST(VendCancellingDialogPresenter, AnswersEveryDialogAsCancelledAtOnce) {
+TEST(VendDialogRecord, SuperficialButtonComparisonIgnoresOnlyTheTitle) {
+  const Button ok = *VendDialog::dialogWithDictionary({{"message", "m"}}).okButton();
+  const Button renamed{"Other title", Button::kOK};
+  const Button cancel{ok.title, Button::kCancel};
+  EXPECT_TRUE(renamed.isEqual(ok, true));
+  EXPECT_FALSE(renamed.isEqual(ok, false));
+  EXPECT_FALSE(cancel.isEqual(ok, true));
+}
+
+// With nobody to ask, every dialog is cancelled at once, by the fallback
+// presenter, by the UI service and by the operation alike.
+TEST_F(DialogTest, WithoutAPresenterEveryDialogIsCancelledAtOnce) {
   VendCancellingDialogPresenter presenter;
   std::vector<VendDialogAnswer> answers;
-  presenter.present(VendDialog::dialogWithDictionary({{"message", "m"}}),
-                    [&](VendDialogAnswer answer) { answers.push_back(std::move(answer)); });
+  presenter.present(threeButtonDialog(), [&](VendDialogAnswer a) { answers.push_back(a); });
   ASSERT_EQ(answers.size(), 1u) << "answered before present returned";
-  EXPECT_EQ(answers[0].exitCode, VendDialogButton::kCancel);
+  EXPECT_EQ(answers[0].exitCode, Button::kCancel);
   EXPECT_TRUE(answers[0].values.empty());
   presenter.dismiss("unknown", 1);  // nothing is up; must not fail
-}
 
-TEST_F(DialogTest, ARuntimeWithoutPresenterCancelsEveryDialog) {
   EXPECT_FALSE(runtime_->dialogPresenter());
   std::optional<std::int64_t> exitCode;
-  VendUIService(kClient, runtime_)
-      .displayDialog(threeButtonDialog(), nullptr, [&](std::int64_t code) { exitCode = code; });
-  EXPECT_EQ(exitCode, VendDialogButton::kCancel);
+  VendUIService(kClient, runtime_).displayDialog(threeButtonDialog(), nullptr, [&](auto code) {
+    exitCode = code;
+  });
+  EXPECT_EQ(exitCode, Button::kCancel);
+
+  auto operation = VendDialogOperation::operationWithDialog(threeButtonDialog(), kClient);
+  EXPECT_TRUE(operation->runSyncReturningError(nullptr));
+  ASSERT_TRUE(operation->selectedButton());
+  EXPECT_TRUE(operation->selectedButton()->isEqual(*operation->dialog().cancelButton(), true));
 }
 
-// The UI service.
-
 TEST_F(DialogTest, AReplyRunsExactlyOnceWhateverThePresenterDoes) {
-  for (auto behaviour :
-       {ScriptedPresenter::Behaviour::kAnswerTwice, ScriptedPresenter::Behaviour::kDropUnanswered,
-        ScriptedPresenter::Behaviour::kThrow}) {
+  using B = ScriptedPresenter::Behaviour;
+  const std::pair<B, std::int64_t> cases[] = {
+      {B::kAnswerTwice, 1}, {B::kDropUnanswered, Button::kCancel}, {B::kThrow, Button::kCancel}};
+  for (const auto& [behaviour, expected] : cases) {
     install(behaviour, 1);
     std::vector<std::int64_t> exitCodes;
-    VendUIService(kClient, runtime_)
-        .displayDialog(threeButtonDialog(), nullptr,
-                       [&](std::int64_t code) { exitCodes.push_back(code); });
-    ASSERT_EQ(exitCodes.size(), 1u) << "behaviour " << static_cast<int>(behaviour);
-    const std::int64_t expected = behaviour == ScriptedPresenter::Behaviour::kAnswerTwice
-                                      ? std::int64_t{1}
-                                      : std::int64_t{VendDialogButton::kCancel};
-    EXPECT_EQ(exitCodes[0], expected) << "behaviour " << static_cast<int>(behaviour);
+    VendUIService(kClient, runtime_).displayDialog(threeButtonDialog(), nullptr, [&](auto code) {
+      exitCodes.push_back(code);
+    });
+    EXPECT_EQ(exitCodes, std::vector<std::int64_t>{expected}) << static_cast<int>(behaviour);
   }
 }
 
 TEST_F(DialogTest, PresentDialogGivesTheWholeAnswer) {
-  auto presenter = std::make_shared<ScriptedPresenter>(
-      ScriptedPresenter::Behaviour::kAnswer, 1,
-      PlistDictionary{{"accountName", "alice"}, {"password", "secret"}});
-  runtime_->setDialogPresenter(presenter);
+  auto presenter = install(ScriptedPresenter::Behaviour::kAnswer, 1,
+                           {{"accountName", "alice"}, {"password", "secret"}});
   VendDialog signIn = VendDialog::dialogWithDictionary({{"message", "Sign in"}});
   signIn.setKind(VendDialog::kSignIn);
   std::optional<VendDialogAnswer> answer;
-  VendUIService(kClient, runtime_).presentDialog(signIn, [&](VendDialogAnswer given) {
-    answer = std::move(given);
-  });
+  VendUIService(kClient, runtime_).presentDialog(signIn, [&](VendDialogAnswer a) { answer = a; });
   ASSERT_TRUE(answer);
   EXPECT_EQ(answer->exitCode, 1);
-  EXPECT_EQ(*answer->values.at("accountName").string(), "alice");
+  EXPECT_EQ(answer->values.at("accountName"), PlistValue("alice"));
   EXPECT_EQ(presenter->presented().at(0).kind(), VendDialog::kSignIn);
 }
 
@@ -314,10 +267,8 @@ TEST_F(DialogTest, FirmwareWarningsAndLicencesAreAgreedToOnlyWithOK) {
                                             [&](bool yes) { agreed.push_back(yes); });
     service.displayLicenseAgreementWithTitle("Licence", "terms",
                                              [&](bool yes) { agreed.push_back(yes); });
-    ASSERT_EQ(agreed.size(), 2u);
-    EXPECT_EQ(agreed[0], exitCode == 1);
-    EXPECT_EQ(agreed[1], exitCode == 1);
-    std::vector<VendDialog> shown = presenter->presented();
+    EXPECT_EQ(agreed, std::vector<bool>(2, exitCode == 1)) << exitCode;
+    const std::vector<VendDialog> shown = presenter->presented();
     ASSERT_EQ(shown.size(), 2u);
     EXPECT_EQ(shown[0].kind(), VendDialog::kFirmwareWarning);
     EXPECT_EQ(shown[0].message(), "Firmware");
@@ -328,100 +279,98 @@ TEST_F(DialogTest, FirmwareWarningsAndLicencesAreAgreedToOnlyWithOK) {
   }
 }
 
-// The dialog operation.
-
-TEST_F(DialogTest, TheOperationSelectsTheButtonTheUserChose) {
-  const std::pair<std::int64_t, VendDialogButton::Role> cases[] = {
-      {1, VendDialogButton::kOK}, {0, VendDialogButton::kCancel}, {2, VendDialogButton::kOther}};
-  for (const auto& [exitCode, role] : cases) {
-    install(ScriptedPresenter::Behaviour::kAnswer, exitCode);
-    auto operation = VendDialogOperation::operationWithDialog(threeButtonDialog(), kClient);
+TEST_F(DialogTest, TheOperationSelectsTheButtonTheUserChoseOrFailsWithoutOne) {
+  const VendDialog noOther = VendDialog::dialogWithDictionary(
+      {{"message", "m"}, {"okButtonString", "OK"}, {"cancelButtonString", "Cancel"}});
+  const VendDialog okOnly = VendDialog::dialogWithDictionary({{"message", "m"}});
+  const struct {
+    VendDialog dialog;
+    std::int64_t exitCode;
+    bool selects;  // false: the answer names no button of the dialog
+  } cases[] = {{threeButtonDialog(), 1, true},
+               {threeButtonDialog(), 0, true},
+               {threeButtonDialog(), 2, true},
+               {threeButtonDialog(), 3, false},
+               {threeButtonDialog(), -1, false},
+               {noOther, 2, false},
+               {okOnly, 0, false}};
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.exitCode);
+    install(ScriptedPresenter::Behaviour::kAnswer, c.exitCode);
+    auto operation = VendDialogOperation::operationWithDialog(c.dialog, kClient);
     operation->setPerformDefaultActions(false);
     OptionalError error;
-    EXPECT_TRUE(operation->runSyncReturningError(&error)) << "exit code " << exitCode;
-    EXPECT_FALSE(error);
-    ASSERT_TRUE(operation->selectedButton()) << "exit code " << exitCode;
-    EXPECT_EQ(operation->selectedButton()->role, role);
-    const VendDialog& dialog = operation->dialog();
-    std::optional<VendDialogButton> expected = role == VendDialogButton::kOK ? dialog.okButton()
-                                               : role == VendDialogButton::kCancel
-                                                   ? dialog.cancelButton()
-                                                   : dialog.otherButton();
-    EXPECT_TRUE(operation->selectedButton()->isEqual(*expected, true));
+    EXPECT_EQ(operation->runSyncReturningError(&error), c.selects);
     EXPECT_FALSE(operation->performDefaultActions());
+    if (!c.selects) {
+      EXPECT_FALSE(operation->selectedButton());
+      ASSERT_TRUE(error);
+      EXPECT_TRUE(error->isCancellation());
+      continue;
+    }
+    EXPECT_FALSE(error);
+    ASSERT_TRUE(operation->selectedButton());
+    EXPECT_EQ(operation->selectedButton()->role, c.exitCode);
+    EXPECT_TRUE(
+        operation->selectedButton()->isEqual(*buttonOf(operation->dialog(), c.exitCode), true));
   }
 }
 
-TEST_F(DialogTest, WithNobodyToAskTheOperationSelectsCancel) {
-  auto operation = VendDialogOperation::operationWithDialog(threeButtonDialog(), kClient);
-  EXPECT_TRUE(operation->runSyncReturningError(nullptr));
-  ASSERT_TRUE(operation->selectedButton());
-  EXPECT_TRUE(operation->selectedButton()->isEqual(*operation->dialog().cancelButton(), true));
-}
-
-TEST_F(DialogTest, AnAnswerTheDialogHasNoButtonForFailsWithoutSelection) {
-  install(ScriptedPresenter::Behaviour::kAnswer, 2);
-  VendDialog noOther = VendDialog::dialogWithDictionary(
-      {{"message", "m"}, {"okButtonString", "OK"}, {"cancelButtonString", "Cancel"}});
-  VendDialogOperation operation(noOther, kClient);
-  OptionalError error;
-  EXPECT_FALSE(operation.runSyncReturningError(&error));
-  EXPECT_FALSE(operation.selectedButton());
-  ASSERT_TRUE(error);
-  EXPECT_TRUE(error->isCancellation());
-}
-
-TEST_F(DialogTest, ADialogDismissedFromOutsideEndsTheWaitWithoutAButton) {
-  auto presenter = install(ScriptedPresenter::Behaviour::kHold);
-  auto operation = VendDialogOperation::operationWithDialog(threeButtonDialog(), kClient);
-  auto finished = std::async(std::launch::async, [&] {
-    OptionalError error;
-    bool success = operation->runSyncReturningError(&error);
-    return std::make_pair(success, error);
-  });
-  ASSERT_TRUE(presenter->waitForPresented(1));
-  EXPECT_EQ(finished.wait_for(200ms), std::future_status::timeout)
-      << "the operation waits while the dialog is up";
-  EXPECT_FALSE(operation->selectedButton());
-
-  VendDialog::dismissDialogWithDictionary({{"identifier", operation->dialog().identifier()}});
-  ASSERT_EQ(finished.wait_for(5s), std::future_status::ready);
-  auto [success, error] = finished.get();
-  EXPECT_FALSE(success);
-  EXPECT_FALSE(operation->selectedButton()) << "taken down, not chosen";
-  ASSERT_TRUE(error);
-  EXPECT_TRUE(error->isCancellation());
-  ASSERT_EQ(presenter->dismissals().size(), 1u);
-  EXPECT_EQ(presenter->dismissals()[0].first, operation->dialog().identifier());
-}
-
-TEST_F(DialogTest, ADismissalWithAnExitCodeSelectsThatButton) {
-  auto presenter = install(ScriptedPresenter::Behaviour::kHold);
-  auto operation = VendDialogOperation::operationWithDialog(threeButtonDialog(), kClient);
-  auto finished =
-      std::async(std::launch::async, [&] { return operation->runSyncReturningError(nullptr); });
-  ASSERT_TRUE(presenter->waitForPresented(1));
-  // The UI service's dismissal, as a power-source change ends a dialog.
-  VendUIService(kClient, runtime_).dismissDialog(operation->dialog(), 1);
-  ASSERT_EQ(finished.wait_for(5s), std::future_status::ready);
-  EXPECT_TRUE(finished.get());
-  ASSERT_TRUE(operation->selectedButton());
-  EXPECT_EQ(operation->selectedButton()->role, VendDialogButton::kOK);
-}
-
-TEST_F(DialogTest, CancellingTheOperationTakesItsDialogDown) {
-  auto presenter = install(ScriptedPresenter::Behaviour::kHold);
-  auto operation = VendDialogOperation::operationWithDialog(threeButtonDialog(), kClient);
-  auto finished =
-      std::async(std::launch::async, [&] { return operation->runSyncReturningError(nullptr); });
-  ASSERT_TRUE(presenter->waitForPresented(1));
-  operation->cancel();
-  ASSERT_EQ(finished.wait_for(5s), std::future_status::ready);
-  EXPECT_TRUE(finished.get());
-  ASSERT_TRUE(operation->selectedButton());
-  EXPECT_EQ(operation->selectedButton()->role, VendDialogButton::kCancel);
-  ASSERT_EQ(presenter->dismissals().size(), 1u);
-  EXPECT_EQ(presenter->dismissals()[0].second, VendDialogButton::kCancel);
+// A dialog that is up ends in one of three ways while the operation waits.
+// The rows whose outcome is a button prove that the operation waited for
+// the end: that button exists only once the dialog has been taken down.
+TEST_F(DialogTest, ADialogTakenDownWhileUpEndsTheWaitWithItsOutcome) {
+  using Operation = VendDialogOperation;
+  const struct {
+    const char* name;
+    std::function<void(Operation&, const std::shared_ptr<VendRuntime>&)> takeDown;
+    bool success;
+    std::optional<std::int64_t> selected;
+    std::int64_t dismissalCode;
+  } cases[] = {
+      {"dismissed from outside without an answer",
+       [](Operation& o, const auto&) {
+         VendDialog::dismissDialogWithDictionary({{"identifier", o.dialog().identifier()}});
+       },
+       false, std::nullopt, Button::kCancel},
+      // The UI service's dismissal, as a power-source change ends a dialog.
+      {"dismissed with an exit code",
+       [](Operation& o, const std::shared_ptr<VendRuntime>& runtime) {
+         VendUIService(kClient, runtime).dismissDialog(o.dialog(), 1);
+       },
+       true, Button::kOK, 1},
+      {"operation cancelled", [](Operation& o, const auto&) { o.cancel(); }, true, Button::kCancel,
+       Button::kCancel},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    auto presenter = install(ScriptedPresenter::Behaviour::kHold);
+    auto operation = Operation::operationWithDialog(threeButtonDialog(), kClient);
+    auto finished = std::async(std::launch::async, [&] {
+      OptionalError error;
+      const bool success = operation->runSyncReturningError(&error);
+      return std::make_pair(success, error);
+    });
+    ASSERT_TRUE(presenter->waitForPresented(1));
+    c.takeDown(*operation, runtime_);
+    ASSERT_EQ(finished.wait_for(5s), std::future_status::ready);
+    const auto [success, error] = finished.get();
+    EXPECT_EQ(success, c.success);
+    if (c.selected) {
+      ASSERT_TRUE(operation->selectedButton());
+      EXPECT_EQ(operation->selectedButton()->role, *c.selected);
+    } else {
+      EXPECT_FALSE(operation->selectedButton()) << "taken down, not chosen";
+      ASSERT_TRUE(error);
+      EXPECT_TRUE(error->isCancellation());
+    }
+    const auto dismissals = presenter->dismissals();
+    ASSERT_EQ(dismissals.size(), 1u);
+    EXPECT_EQ(dismissals[0].first, operation->dialog().identifier());
+    if (c.selected) {
+      EXPECT_EQ(dismissals[0].second, c.dismissalCode);
+    }
+  }
 }
 
 TEST_F(DialogTest, ACancelledOperationShowsNothing) {
@@ -447,9 +396,8 @@ TEST_F(DialogTest, ManyDialogsAtOnceEachGetTheirOwnAnswer) {
     }));
   }
   ASSERT_TRUE(presenter->waitForPresented(kDialogs));
-  for (int i = 0; i < kDialogs; ++i) {
+  for (int i = 0; i < kDialogs; ++i)
     presenter->dismiss(operations[i]->dialog().identifier(), i % 3);
-  }
   for (int i = 0; i < kDialogs; ++i) {
     ASSERT_EQ(results[i].wait_for(5s), std::future_status::ready);
     EXPECT_TRUE(results[i].get());

@@ -3,12 +3,12 @@
 // many downloads at once, application locks and preflight checks.
 #include <gtest/gtest.h>
 
-#include <set>
+#include <future>
 #include <string>
 #include <thread>
 #include <vector>
 
-#include "DownloadTestSupport.h"
+#include "RuntimeTestSupport.h"
 #include "platform/log/TillLogManager.h"
 #include "store-runtime/download/VendApplicationLocks.h"
 #include "store-runtime/download/VendDownloadError.h"
@@ -20,45 +20,55 @@ namespace larder {
 namespace {
 
 namespace fs = std::filesystem;
+using namespace std::chrono_literals;
 using testing::assetFor;
 using testing::bundlePackage;
 using testing::downloadFor;
 using testing::installBundleDirectly;
-using testing::PackageServer;
-using testing::PrivateRoot;
 using testing::randomBytes;
 using testing::readFile;
 using testing::ReplyWaiter;
+using testing::StoreServer;
 using testing::treeOf;
-using Fault = PackageServer::Fault;
+using Fault = StoreServer::Fault;
 
 constexpr std::size_t kChunk = 16 * 1024;
 
-// Polls `condition` until it holds or `limit` has passed.
-template <typename Condition>
-bool eventually(Condition condition, std::chrono::milliseconds limit = std::chrono::seconds(20)) {
-  const auto deadline = std::chrono::steady_clock::now() + limit;
-  while (std::chrono::steady_clock::now() < deadline) {
-    if (condition()) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+// Runs `onLine` for every log line of level 2 or below that holds `phrase`,
+// for the lifetime of the watch: the manager and the installer say at
+// level 2 when a step the tests wait for has happened.
+class LogWatch {
+ public:
+  LogWatch(std::string phrase, std::function<void()> onLine)
+      : previousLevel_(TillLogManager::sharedManager().level()) {
+    TillLogManager::sharedManager().setLevel(std::max(previousLevel_, 2));
+    sink_ = TillLogManager::sharedManager().addSink(
+        [phrase = std::move(phrase), onLine = std::move(onLine)](int, const std::string& line) {
+          if (line.find(phrase) != std::string::npos) onLine();
+        });
   }
-  return condition();
-}
+  ~LogWatch() {
+    sink_.reset();
+    TillLogManager::sharedManager().setLevel(previousLevel_);
+  }
+
+ private:
+  int previousLevel_;
+  std::shared_ptr<void> sink_;
+};
 
 class DownloadManagerTest : public ::testing::Test {
  protected:
   // Serves a package for `name` and gives a download of it.
   std::shared_ptr<TillDownload> servedDownload(std::uint64_t item, const std::string& name,
                                                const std::string& identifier,
-                                               const std::string& version,
                                                std::size_t payload = 200'000,
                                                Fault fault = Fault::kNone,
                                                std::int64_t type = TillDownload::kInstall) {
     const std::string bytes =
-        bundlePackage(name, identifier, version, payload, static_cast<unsigned>(item));
+        bundlePackage(name, identifier, "2.0", payload, static_cast<unsigned>(item));
     packages_[item] = bytes;
-    const std::string path = "/assets/" + std::to_string(item) + "/" + name + ".tar";
-    const std::string url = server_.add(path, bytes, fault);
+    const std::string url = server_.add(assetPath(item, name), bytes, fault);
     return downloadFor(item, identifier, assetFor(url, bytes, kChunk), type);
   }
   static std::string assetPath(std::uint64_t item, const std::string& name) {
@@ -72,6 +82,18 @@ class DownloadManagerTest : public ::testing::Test {
     EXPECT_TRUE(answer) << "no reply";
     return answer.value_or(ReplyWaiter::Answer{false, std::nullopt});
   }
+  static void expectFailure(const ReplyWaiter::Answer& answer, std::int64_t code,
+                            std::string_view phrase) {
+    EXPECT_FALSE(answer.success);
+    ASSERT_TRUE(answer.error);
+    EXPECT_EQ(answer.error->domain, VendDownloadError::kDomain);
+    EXPECT_EQ(answer.error->code, code) << answer.error->description;
+    EXPECT_NE(answer.error->description.find(phrase), std::string::npos)
+        << answer.error->description;
+  }
+  std::string payloadOf(const std::string& name) const {
+    return readFile(root_.applications() / (name + ".app") / "resources/payload.bin");
+  }
 
   // Files left in the downloads folder (folders themselves do not count).
   std::vector<std::string> filesUnderDownloads() const {
@@ -82,69 +104,77 @@ class DownloadManagerTest : public ::testing::Test {
     return files;
   }
 
-  PrivateRoot root_;
-  PackageServer server_;
+  testing::PrivateRoot root_;
+  StoreServer server_;
   std::map<std::uint64_t, std::string> packages_;
 };
 
-TEST_F(DownloadManagerTest, InstallsANewBundleAndCleansUp) {
+TEST_F(DownloadManagerTest, ManyItemsInstallAtOnceEachWithOneReplyAndNothingLeft) {
+  constexpr int kItems = 12;
   VendDownloadManager manager(root_.configuration());
-  auto download = servedDownload(101, "Fresh", "com.example.fresh", "1.0");
-  const ReplyWaiter::Answer answer = run(manager, download);
-  ASSERT_TRUE(answer.success) << answer.error->description;
-  EXPECT_FALSE(answer.error);
-  const fs::path bundle = root_.applications() / "Fresh.app";
-  EXPECT_EQ(readFile(bundle / "resources/payload.bin"), randomBytes(200'000, 101));
-  EXPECT_EQ(download->progress(), 1.0);
-  EXPECT_FALSE(download->status().isFailed);
+  std::vector<std::shared_ptr<TillDownload>> downloads;
+  std::vector<ReplyWaiter> waiters(kItems);
+  for (int i = 0; i < kItems; ++i) {
+    downloads.push_back(servedDownload(600 + i, "Many" + std::to_string(i),
+                                       "com.example.many" + std::to_string(i), 300'000 + 1000 * i));
+    manager.performDownload(downloads[i], waiters[i].callback());
+  }
+  // The same item again while it is under way is refused.
+  ReplyWaiter duplicate;
+  manager.performDownload(downloads[kItems - 1], duplicate.callback());
+
+  for (int i = 0; i < kItems; ++i) {
+    SCOPED_TRACE(i);
+    std::optional<ReplyWaiter::Answer> answer = waiters[i].wait();
+    ASSERT_TRUE(answer);
+    EXPECT_TRUE(answer->success) << (answer->error ? answer->error->description : "");
+  }
+  std::optional<ReplyWaiter::Answer> refused = duplicate.wait();
+  ASSERT_TRUE(refused);
+  expectFailure(*refused, VendDownloadError::kAlreadyInProgress, "");
+  for (int i = 0; i < kItems; ++i) {
+    SCOPED_TRACE(i);
+    EXPECT_EQ(payloadOf("Many" + std::to_string(i)), randomBytes(300'000 + 1000 * i, 600 + i));
+    EXPECT_EQ(waiters[i].count(), 1u) << "exactly one reply";
+    EXPECT_EQ(downloads[i]->progress(), 1.0);
+    EXPECT_FALSE(downloads[i]->status().isFailed);
+    EXPECT_EQ(server_.requestCount(assetPath(600 + i, "Many" + std::to_string(i))), 1u);
+    EXPECT_FALSE(fs::exists(root_.downloads() / std::to_string(600 + i)))
+        << "the item's folder goes with its package";
+  }
   EXPECT_TRUE(filesUnderDownloads().empty());
-  EXPECT_FALSE(fs::exists(root_.downloads() / "101")) << "the item's folder goes with its package";
   EXPECT_TRUE(manager.downloadsWithTypeMask(3).empty());
-  EXPECT_EQ(server_.requestCount(assetPath(101, "Fresh")), 1);
 }
 
 TEST_F(DownloadManagerTest, ReplacesAnInstalledBundleWhileItsApplicationsAreLocked) {
   installBundleDirectly(root_.applications() / "Thing.app", "com.example.thing", "1.0");
   VendDownloadManager manager(root_.configuration());
+  // The installer's line comes while the bundle is being put in place;
+  // what the lock file says then is what a launch would see.
+  std::mutex mutex;
   std::vector<std::string> lockedDuringInstall;
-  std::mutex linesMutex;
-  // The installer's level 2 line comes while the bundle is being put in
-  // place; what the lock file says then is what a launch would see.
-  TillLogManager& log = TillLogManager::sharedManager();
-  const int previousLevel = log.level();
-  log.setLevel(std::max(previousLevel, 2));
-  auto sink = TillLogManager::sharedManager().addSink([&](int, const std::string& line) {
-    if (line.find("Installed") == std::string::npos) return;
-    std::lock_guard lock(linesMutex);
-    lockedDuringInstall = VendApplicationLocks::persistedIdentifiers();
-  });
-  const ReplyWaiter::Answer answer =
-      run(manager, servedDownload(102, "Thing", "com.example.thing", "2.0"));
-  ASSERT_TRUE(answer.success) << answer.error->description;
-  const fs::path bundle = root_.applications() / "Thing.app";
-  EXPECT_EQ(readFile(bundle / "resources/version.txt"), "2.0");
-  EXPECT_FALSE(fs::exists(bundle / "resources/only-in-old.txt"));
-  EXPECT_EQ(readFile(bundle / "resources/payload.bin"), randomBytes(200'000, 102));
-  for (const std::string& path : treeOf(root_.applications())) {
-    EXPECT_EQ(path.rfind("Thing.app", 0), 0u) << "left beside the bundle: " << path;
+  ReplyWaiter::Answer answer;
+  {
+    LogWatch watch("Installed", [&] {
+      std::lock_guard lock(mutex);
+      lockedDuringInstall = VendApplicationLocks::persistedIdentifiers();
+    });
+    answer = run(manager, servedDownload(102, "Thing", "com.example.thing"));
   }
-  sink.reset();
-  log.setLevel(previousLevel);
-  std::lock_guard lock(linesMutex);
+  ASSERT_TRUE(answer.success) << answer.error->description;
+  EXPECT_EQ(readFile(root_.applications() / "Thing.app/resources/version.txt"), "2.0");
   EXPECT_EQ(lockedDuringInstall, std::vector<std::string>{"com.example.thing"});
   EXPECT_TRUE(VendApplicationLocks::persistedIdentifiers().empty());
 }
 
-struct FailureCase {
-  std::string name;
-  Fault fault;
-  bool refusedPort;
-  VendDownloadError::Code code;
-  std::string phrase;
-};
-
 TEST_F(DownloadManagerTest, EveryFailedTransferSaysWhyAndLeavesNothing) {
-  const std::vector<FailureCase> cases = {
+  const struct {
+    const char* name;
+    Fault fault;
+    bool refusedPort;
+    VendDownloadError::Code code;
+    const char* phrase;
+  } cases[] = {
       {"digest mismatch", Fault::kCorrupt, false, VendDownloadError::kDigestMismatch,
        "does not match its manifest"},
       {"truncated", Fault::kTruncate, false, VendDownloadError::kTransferFailed,
@@ -158,32 +188,25 @@ TEST_F(DownloadManagerTest, EveryFailedTransferSaysWhyAndLeavesNothing) {
   const std::vector<std::string> applicationsBefore = treeOf(root_.applications());
   VendDownloadManager manager(root_.configuration(/*requestTimeout=*/1));
   std::uint64_t item = 200;
-  for (const FailureCase& failure : cases) {
-    ++item;
+  for (const auto& failure : cases) {
+    SCOPED_TRACE(failure.name);
     // Half of them would replace an installed bundle, half install anew.
-    const bool replacing = item % 2 == 0;
-    auto download = servedDownload(item, replacing ? "Kept" : "New" + std::to_string(item),
-                                   replacing ? "com.example.kept" : "com.example.new", "2.0",
-                                   300'000, failure.fault);
+    const bool replacing = ++item % 2 == 0;
+    auto download =
+        servedDownload(item, replacing ? "Kept" : "New" + std::to_string(item),
+                       replacing ? "com.example.kept" : "com.example.new", 300'000, failure.fault);
     if (failure.refusedPort) {
       auto assets = download->assets();
       assets[0].setURLRequest(VendURLRequest(
-          "http://127.0.0.1:" + std::to_string(PackageServer::refusingPort()) + "/assets/x.tar"));
+          "http://127.0.0.1:" + std::to_string(StoreServer::refusingPort()) + "/assets/x.tar"));
       download->setAssets(assets);
     }
     const auto started = std::chrono::steady_clock::now();
-    const ReplyWaiter::Answer answer = run(manager, download);
-    EXPECT_FALSE(answer.success) << failure.name;
-    ASSERT_TRUE(answer.error) << failure.name;
-    EXPECT_EQ(answer.error->domain, VendDownloadError::kDomain) << failure.name;
-    EXPECT_EQ(answer.error->code, failure.code)
-        << failure.name << ": " << answer.error->description;
-    EXPECT_NE(answer.error->description.find(failure.phrase), std::string::npos)
-        << failure.name << ": " << answer.error->description;
-    EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(10)) << failure.name;
-    EXPECT_TRUE(download->status().isFailed) << failure.name;
-    EXPECT_EQ(treeOf(root_.applications()), applicationsBefore) << failure.name;
-    EXPECT_TRUE(filesUnderDownloads().empty()) << failure.name;
+    expectFailure(run(manager, download), failure.code, failure.phrase);
+    EXPECT_LT(std::chrono::steady_clock::now() - started, 10s);
+    EXPECT_TRUE(download->status().isFailed);
+    EXPECT_EQ(treeOf(root_.applications()), applicationsBefore);
+    EXPECT_TRUE(filesUnderDownloads().empty());
   }
   EXPECT_EQ(readFile(root_.applications() / "Kept.app/resources/version.txt"), "1.0");
 }
@@ -195,81 +218,64 @@ TEST_F(DownloadManagerTest, ADigestMismatchStopsTheTransferEarly) {
   // hashing thread catches up (a few 4 MiB buffers).
   constexpr std::uint64_t kBufferedAllowance = 20u << 20u;
   VendDownloadManager manager(root_.configuration());
-  auto download = servedDownload(250, "Big", "com.example.big", "1.0", 48u << 20u, Fault::kCorrupt);
-  const ReplyWaiter::Answer answer = run(manager, download);
-  ASSERT_TRUE(answer.error);
-  EXPECT_EQ(answer.error->code, VendDownloadError::kDigestMismatch);
+  auto download = servedDownload(250, "Big", "com.example.big", 48u << 20u, Fault::kCorrupt);
   const std::uint64_t size = packages_[250].size();
   const std::uint64_t badChunk = size / 2 / kChunk;
-  EXPECT_NE(answer.error->description.find("chunk " + std::to_string(badChunk) + " "),
-            std::string::npos)
-      << answer.error->description;
+  expectFailure(run(manager, download), VendDownloadError::kDigestMismatch,
+                "chunk " + std::to_string(badChunk) + " ");
   const auto received =
       static_cast<std::uint64_t>(download->progress() * static_cast<double>(size));
   EXPECT_LT(received, (badChunk + 1) * kChunk + kBufferedAllowance);
   EXPECT_LT(received, size);
 }
 
-TEST_F(DownloadManagerTest, StagesThenInstallsWithoutASecondRequest) {
+// A staged package is installed without a second request, unless it no
+// longer matches its manifest, when it is fetched again.
+TEST_F(DownloadManagerTest, StagesThenInstallsFromTheStagedPackageWhileItMatches) {
   VendDownloadManager manager(root_.configuration());
-  auto download = servedDownload(301, "Staged", "com.example.staged", "1.0", 200'000, Fault::kNone,
-                                 TillDownload::kStageOnly);
-  ReplyWaiter::Answer answer = run(manager, download);
-  ASSERT_TRUE(answer.success) << answer.error->description;
-  EXPECT_EQ(filesUnderDownloads(), std::vector<std::string>{"301/0.pkg"});
-  EXPECT_EQ(readFile(root_.downloads() / "301/0.pkg"), packages_[301]);
-  EXPECT_FALSE(fs::exists(root_.applications() / "Staged.app")) << "staging installs nothing";
-  EXPECT_EQ(server_.requestCount(assetPath(301, "Staged")), 1);
+  for (const bool damaged : {false, true}) {
+    SCOPED_TRACE(damaged ? "damaged" : "intact");
+    const std::uint64_t item = damaged ? 302 : 301;
+    const std::string name = "Staged" + std::to_string(item);
+    auto download = servedDownload(item, name, "com.example." + name, 100'000, Fault::kNone,
+                                   TillDownload::kStageOnly);
+    ReplyWaiter::Answer answer = run(manager, download);
+    ASSERT_TRUE(answer.success) << answer.error->description;
+    const std::string staged = std::to_string(item) + "/0.pkg";
+    EXPECT_EQ(filesUnderDownloads(), std::vector<std::string>{staged});
+    EXPECT_EQ(readFile(root_.downloads() / staged), packages_[item]);
+    EXPECT_FALSE(fs::exists(root_.applications() / (name + ".app"))) << "staging installs nothing";
+    if (damaged)
+      testing::writeFile(root_.downloads() / staged, randomBytes(packages_[item].size(), 77));
 
-  download->setDownloadType(TillDownload::kInstall);
-  answer = run(manager, download);
-  ASSERT_TRUE(answer.success) << answer.error->description;
-  EXPECT_EQ(server_.requestCount(assetPath(301, "Staged")), 1) << "the staged package was used";
-  EXPECT_EQ(readFile(root_.applications() / "Staged.app/resources/payload.bin"),
-            randomBytes(200'000, 301));
-  EXPECT_TRUE(filesUnderDownloads().empty());
-}
-
-TEST_F(DownloadManagerTest, AStagedPackageThatNoLongerMatchesIsFetchedAgain) {
-  VendDownloadManager manager(root_.configuration());
-  auto download = servedDownload(302, "Stale", "com.example.stale", "1.0", 100'000, Fault::kNone,
-                                 TillDownload::kStageOnly);
-  ASSERT_TRUE(run(manager, download).success);
-  testing::writeFile(root_.downloads() / "302/0.pkg", randomBytes(packages_[302].size(), 77));
-
-  download->setDownloadType(TillDownload::kInstall);
-  const ReplyWaiter::Answer answer = run(manager, download);
-  ASSERT_TRUE(answer.success) << answer.error->description;
-  EXPECT_EQ(server_.requestCount(assetPath(302, "Stale")), 2);
-  EXPECT_EQ(readFile(root_.applications() / "Stale.app/resources/payload.bin"),
-            randomBytes(100'000, 302));
+    download->setDownloadType(TillDownload::kInstall);
+    answer = run(manager, download);
+    ASSERT_TRUE(answer.success) << answer.error->description;
+    EXPECT_EQ(server_.requestCount(assetPath(item, name)), damaged ? 2u : 1u);
+    EXPECT_EQ(payloadOf(name), randomBytes(100'000, item));
+    EXPECT_TRUE(filesUnderDownloads().empty());
+  }
 }
 
 TEST_F(DownloadManagerTest, SkippingTheDownloadWorksOnlyWithWhatIsOnDisk) {
   VendDownloadManager manager(root_.configuration());
   for (std::int64_t type : {TillDownload::kStageOnly, TillDownload::kInstall}) {
-    auto download =
-        servedDownload(401, "Skip", "com.example.skip", "1.0", 50'000, Fault::kNone, type);
+    auto download = servedDownload(401, "Skip", "com.example.skip", 50'000, Fault::kNone, type);
     download->setSkipAssetDownloadIfNotAlreadyOnDisk(true);
-    const ReplyWaiter::Answer answer = run(manager, download);
-    EXPECT_FALSE(answer.success);
-    ASSERT_TRUE(answer.error);
-    EXPECT_EQ(answer.error->code, VendDownloadError::kNotOnDisk) << answer.error->description;
-    EXPECT_NE(answer.error->description.find("not on disk"), std::string::npos)
-        << answer.error->description;
+    expectFailure(run(manager, download), VendDownloadError::kNotOnDisk, "not on disk");
   }
-  EXPECT_EQ(server_.totalRequests(), 0);
+  EXPECT_EQ(server_.totalRequests(), 0u);
   EXPECT_FALSE(fs::exists(root_.applications() / "Skip.app"));
 
   // Once staged, the same setting installs from disk.
-  auto stage = servedDownload(402, "Skip", "com.example.skip", "1.0", 50'000, Fault::kNone,
+  auto stage = servedDownload(402, "Skip", "com.example.skip", 50'000, Fault::kNone,
                               TillDownload::kStageOnly);
   ASSERT_TRUE(run(manager, stage).success);
   stage->setSkipAssetDownloadIfNotAlreadyOnDisk(true);
   stage->setDownloadType(TillDownload::kInstall);
   const ReplyWaiter::Answer answer = run(manager, stage);
   ASSERT_TRUE(answer.success) << answer.error->description;
-  EXPECT_EQ(server_.totalRequests(), 1);
+  EXPECT_EQ(server_.totalRequests(), 1u);
   EXPECT_TRUE(fs::exists(root_.applications() / "Skip.app/bin/run"));
 }
 
@@ -278,39 +284,25 @@ class PausedDownloadTest : public DownloadManagerTest {
   static constexpr std::size_t kPayload = 6u << 20u;
   static constexpr std::size_t kGate = 2'500'001;  // not on a chunk boundary
 
-  void SetUp() override {
-    // The manager says at level 2 when a paused transfer has stopped; a
-    // resume before that point would only let the transfer go on.
-    TillLogManager& log = TillLogManager::sharedManager();
-    previousLevel_ = log.level();
-    log.setLevel(std::max(previousLevel_, 2));
-    sink_ = log.addSink([this](int, const std::string& line) {
-      if (line.find("Paused download of 501") == std::string::npos) return;
-      std::lock_guard lock(mutex_);
-      ++parked_;
-      parkedChanged_.notify_all();
-    });
-  }
-  void TearDown() override {
-    sink_.reset();
-    TillLogManager::sharedManager().setLevel(previousLevel_);
-  }
-
   // Starts a download that stops at the gate, pauses it there and waits
-  // until its transfer has stopped; gives the size of its partial file.
+  // until its transfer has stopped (a resume before that point would only
+  // let the transfer go on); gives the size of its partial file.
   std::uint64_t startAndPause(VendDownloadManager& manager, ReplyWaiter& waiter,
                               std::int64_t type = TillDownload::kInstall) {
+    std::promise<void> parked;
+    std::once_flag once;
+    LogWatch watch("Paused download of 501",
+                   [&] { std::call_once(once, [&] { parked.set_value(); }); });
     server_.setGateBytes(kGate);
-    download_ =
-        servedDownload(501, "Paused", "com.example.paused", "1.0", kPayload, Fault::kGate, type);
+    download_ = servedDownload(501, "Paused", "com.example.paused", kPayload, Fault::kGate, type);
     manager.performDownload(download_, waiter.callback());
-    EXPECT_TRUE(server_.waitUntilGateReached(std::chrono::seconds(20)));
-    EXPECT_TRUE(eventually([&] { return download_->progress() > 0; }));
+    EXPECT_TRUE(server_.waitUntilGateReached(20s));
+    const auto deadline = std::chrono::steady_clock::now() + 20s;
+    while (download_->progress() == 0 && std::chrono::steady_clock::now() < deadline)
+      std::this_thread::sleep_for(10ms);
     manager.pauseDownloadWithItemIdentifier(501);
     EXPECT_TRUE(download_->status().isPaused);
-    std::unique_lock lock(mutex_);
-    EXPECT_TRUE(
-        parkedChanged_.wait_for(lock, std::chrono::seconds(20), [this] { return parked_ > 0; }));
+    EXPECT_EQ(parked.get_future().wait_for(20s), std::future_status::ready);
     std::error_code code;
     const std::uint64_t partial = fs::file_size(root_.downloads() / "501/0.partial", code);
     EXPECT_FALSE(code);
@@ -320,13 +312,6 @@ class PausedDownloadTest : public DownloadManagerTest {
   }
 
   std::shared_ptr<TillDownload> download_;
-
- private:
-  int previousLevel_ = 0;
-  std::shared_ptr<void> sink_;
-  std::mutex mutex_;
-  std::condition_variable parkedChanged_;
-  int parked_ = 0;
 };
 
 TEST_F(PausedDownloadTest, ResumesWithARangeRequestAndInstalls) {
@@ -347,8 +332,7 @@ TEST_F(PausedDownloadTest, ResumesWithARangeRequestAndInstalls) {
   ASSERT_TRUE(answer->success) << answer->error->description;
   EXPECT_EQ(server_.rangeHeaders(assetPath(501, "Paused")),
             (std::vector<std::string>{"", "bytes=" + std::to_string(partial) + "-"}));
-  EXPECT_EQ(readFile(root_.applications() / "Paused.app/resources/payload.bin"),
-            randomBytes(kPayload, 501));
+  EXPECT_EQ(payloadOf("Paused"), randomBytes(kPayload, 501));
   EXPECT_TRUE(filesUnderDownloads().empty());
   // The first answer was the success: the pause did not answer before it.
   // Once the manager's workers are joined no answer can still come.
@@ -368,7 +352,7 @@ TEST_F(PausedDownloadTest, AStoreThatIgnoresTheRangeMakesItStartOver) {
   std::optional<ReplyWaiter::Answer> answer = waiter.wait();
   ASSERT_TRUE(answer);
   ASSERT_TRUE(answer->success) << answer->error->description;
-  EXPECT_EQ(server_.requestCount(assetPath(501, "Paused")), 3)
+  EXPECT_EQ(server_.requestCount(assetPath(501, "Paused")), 3u)
       << "first part, refused resume, whole file";
   EXPECT_EQ(readFile(root_.downloads() / "501/0.pkg"), packages_[501]);
 }
@@ -390,55 +374,17 @@ TEST_F(PausedDownloadTest, StoppingTheManagerCancelsAPausedDownloadAndKeepsItsPa
   // A new manager goes on from the part on disk, after reading it back.
   server_.openGate();
   VendDownloadManager again(root_.configuration());
-  auto download =
-      downloadFor(501, "com.example.paused",
-                  assetFor(server_.url(assetPath(501, "Paused")), packages_[501], kChunk));
-  ReplyWaiter second;
-  again.performDownload(download, second.callback());
-  std::optional<ReplyWaiter::Answer> finished = second.wait();
-  ASSERT_TRUE(finished);
-  ASSERT_TRUE(finished->success) << finished->error->description;
+  const std::string url = server_.url(assetPath(501, "Paused"));
+  const ReplyWaiter::Answer finished =
+      run(again, downloadFor(501, "com.example.paused", assetFor(url, packages_[501], kChunk)));
+  ASSERT_TRUE(finished.success) << finished.error->description;
   EXPECT_EQ(server_.rangeHeaders(assetPath(501, "Paused")).back(),
             "bytes=" + std::to_string(partial) + "-");
 }
 
-TEST_F(DownloadManagerTest, ManyItemsDownloadAtOnce) {
-  constexpr int kItems = 12;
-  VendDownloadManager manager(root_.configuration());
-  std::vector<std::shared_ptr<TillDownload>> downloads;
-  for (int i = 0; i < kItems; ++i) {
-    downloads.push_back(servedDownload(600 + i, "Many" + std::to_string(i),
-                                       "com.example.many" + std::to_string(i), "1.0",
-                                       300'000 + 1000 * i));
-  }
-  std::vector<ReplyWaiter> waiters(kItems);
-  for (int i = 0; i < kItems; ++i) manager.performDownload(downloads[i], waiters[i].callback());
-  // The same item again while it is under way is refused.
-  ReplyWaiter duplicate;
-  manager.performDownload(downloads[kItems - 1], duplicate.callback());
-
-  for (int i = 0; i < kItems; ++i) {
-    std::optional<ReplyWaiter::Answer> answer = waiters[i].wait();
-    ASSERT_TRUE(answer) << i;
-    EXPECT_TRUE(answer->success) << i << ": " << (answer->error ? answer->error->description : "");
-  }
-  std::optional<ReplyWaiter::Answer> refused = duplicate.wait();
-  ASSERT_TRUE(refused);
-  EXPECT_FALSE(refused->success);
-  EXPECT_EQ(refused->error->code, VendDownloadError::kAlreadyInProgress);
-  for (int i = 0; i < kItems; ++i) {
-    EXPECT_EQ(readFile(root_.applications() / ("Many" + std::to_string(i) + ".app") /
-                       "resources/payload.bin"),
-              randomBytes(300'000 + 1000 * i, 600 + i))
-        << i;
-    EXPECT_EQ(waiters[i].count(), 1u) << "exactly one reply";
-  }
-  EXPECT_TRUE(filesUnderDownloads().empty());
-}
-
 TEST_F(DownloadManagerTest, UnusableDownloadsAreRefusedOnAnotherThread) {
   VendDownloadManager manager(root_.configuration());
-  auto download = servedDownload(701, "Bad", "com.example.bad", "1.0");
+  auto download = servedDownload(701, "Bad", "com.example.bad");
   auto assets = download->assets();
   auto hashes = assets[0].hashes();
   hashes.pop_back();
@@ -454,25 +400,19 @@ TEST_F(DownloadManagerTest, UnusableDownloadsAreRefusedOnAnotherThread) {
                           });
   std::optional<ReplyWaiter::Answer> answer = waiter.wait();
   ASSERT_TRUE(answer);
-  EXPECT_FALSE(answer->success);
-  EXPECT_EQ(answer->error->code, VendDownloadError::kInvalidDownload);
-  EXPECT_NE(answer->error->description.find("digests"), std::string::npos)
-      << answer->error->description;
+  expectFailure(*answer, VendDownloadError::kInvalidDownload, "digests");
   EXPECT_NE(replyThread, std::this_thread::get_id());
 
-  auto neither = servedDownload(702, "Bad", "com.example.bad", "1.0");
+  // Neither an install nor a staging.
+  auto neither = servedDownload(702, "Bad", "com.example.bad");
   neither->setDownloadType(4);
-  ReplyWaiter second;
-  manager.performDownload(neither, second.callback());
-  EXPECT_EQ(second.wait()->error->code, VendDownloadError::kInvalidDownload);
-  EXPECT_EQ(server_.totalRequests(), 0);
+  expectFailure(run(manager, neither), VendDownloadError::kInvalidDownload, "");
+  EXPECT_EQ(server_.totalRequests(), 0u);
 }
 
 TEST_F(DownloadManagerTest, LocksNestAndKeepOtherEntriesOfTheFile) {
   // An entry that another process wrote stays.
-  const std::string file =
-      (root_.root() / "var/lib/larder-platform/locked-applications.plist").string();
-  testing::writeFile(file,
+  testing::writeFile(root_.root() / "var/lib/larder-platform/locked-applications.plist",
                      PropertyListSerialization::writeXml(PlistArray{"com.example.elsewhere"}));
   VendDownloadManager manager(root_.configuration());
   manager.lockApplicationsForBundleID("com.example.a");
@@ -490,95 +430,81 @@ TEST_F(DownloadManagerTest, LocksNestAndKeepOtherEntriesOfTheFile) {
   EXPECT_EQ(manager.applicationLocks().lockCount("com.example.a"), 0u);
 }
 
-class PreflightTest : public DownloadManagerTest {
- protected:
-  struct Verdict {
-    bool allowed = false;
-    PlistValue object;
+TEST_F(DownloadManagerTest, PreflightComparesTheMinimumAndAnswersFalseOnEveryFailure) {
+  // The machine's own major version counts when no version is given.
+  testing::writeFile(root_.root() / "etc/os-release", "NAME=\"Test\"\nVERSION_ID=\"12\"\n");
+  const auto verdict = [](std::optional<bool> allowed, const char* minimum) {
+    PlistDictionary answer;
+    if (allowed) answer["allowed"] = *allowed;
+    if (minimum) answer["minimumSystemVersion"] = minimum;
+    return PropertyListSerialization::writeXml(answer);
   };
-
-  Verdict ask(const std::string& url, PlistValue info = {}) {
-    std::promise<Verdict> promise;
-    manager_.checkPreflight(9, url, std::move(info), [&](bool allowed, PlistValue object) {
+  const PlistValue none;
+  const struct {
+    const char* name;
+    std::string body;
+    int status;
+    PlistValue info;
+    bool allowed;
+    std::string domain, phrase;  // of the error given with a refusal
+  } cases[] = {
+      {"later minor", verdict(true, "12.2"), 200, PlistDictionary{{"SystemVersion", "12.10"}},
+       true},
+      {"same version", verdict(true, "12.2"), 200, PlistDictionary{{"ProductVersion", "12.2"}},
+       true},
+      {"version as text", verdict(true, "12.2"), 200, "13.0", true},
+      {"older", verdict(true, "12.2"), 200, PlistDictionary{{"SystemVersion", "12.1.9"}}, false,
+       std::string(VendDownloadError::kDomain), "12.2"},
+      {"no minimum", verdict(true, nullptr), 200, none, true},
+      {"forbidden", verdict(false, "1"), 200, none, false, std::string(VendDownloadError::kDomain)},
+      {"machine's major meets a minor", verdict(true, "12.4"), 200, none, true},
+      {"machine's major above", verdict(true, "11"), 200, none, true},
+      {"machine's major below", verdict(true, "13.0"), 200, none, false},
+      {"no verdict", verdict(std::nullopt, "1"), 200, none, false},
+      {"not a property list", "not a property list", 200, none, false},
+      {"server error", "x", 500, none, false, "", "HTTP 500"},
+  };
+  VendDownloadManager manager(root_.configuration());
+  const auto ask = [&](const std::string& url, const PlistValue& info) {
+    std::promise<std::pair<bool, PlistValue>> promise;
+    manager.checkPreflight(9, url, info, [&](bool allowed, PlistValue object) {
       promise.set_value({allowed, std::move(object)});
     });
     return promise.get_future().get();
+  };
+  int index = 0;
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    const std::string path = "/preflight/" + std::to_string(++index);
+    const auto [allowed, error] = ask(server_.add(path, c.body, Fault::kNone, c.status), c.info);
+    EXPECT_EQ(allowed, c.allowed);
+    if (allowed) {
+      EXPECT_TRUE(error.isNull());
+    }
+    if (!c.domain.empty()) {
+      EXPECT_EQ(error["domain"], PlistValue(c.domain));
+    }
+    if (c.domain == VendDownloadError::kDomain && !c.phrase.empty()) {
+      EXPECT_EQ(error["code"].int64Value(), VendDownloadError::kPreflightFailed);
+    }
+    if (!c.phrase.empty()) {
+      EXPECT_NE(error["description"].string()->find(c.phrase), std::string::npos);
+    }
   }
-  std::string servePreflight(const std::string& name, PlistDictionary answer) {
-    return server_.add("/preflight/" + name, PropertyListSerialization::writeXml(answer));
-  }
-
-  VendDownloadManager manager_{root_.configuration()};
-};
-
-TEST_F(PreflightTest, ComparesTheMinimumWithTheGivenSystemVersion) {
-  const std::string needs12 =
-      servePreflight("12", {{"allowed", true}, {"minimumSystemVersion", "12.2"}});
-  EXPECT_TRUE(ask(needs12, PlistDictionary{{"SystemVersion", "12.10"}}).allowed);
-  EXPECT_TRUE(ask(needs12, PlistDictionary{{"ProductVersion", "12.2"}}).allowed);
-  EXPECT_TRUE(ask(needs12, "13.0").allowed);
-  const Verdict older = ask(needs12, PlistDictionary{{"SystemVersion", "12.1.9"}});
-  EXPECT_FALSE(older.allowed);
-  EXPECT_EQ(older.object["code"].int64Value(), VendDownloadError::kPreflightFailed);
-  EXPECT_NE(older.object["description"].string()->find("12.2"), std::string::npos);
-
-  const Verdict allowedWithoutMinimum = ask(servePreflight("any", {{"allowed", true}}));
-  EXPECT_TRUE(allowedWithoutMinimum.allowed);
-  EXPECT_TRUE(allowedWithoutMinimum.object.isNull());
-  const Verdict forbidden =
-      ask(servePreflight("no", {{"allowed", false}, {"minimumSystemVersion", "1"}}));
-  EXPECT_FALSE(forbidden.allowed);
-  EXPECT_EQ(forbidden.object["domain"], PlistValue(VendDownloadError::kDomain));
+  const auto [refused, error] =
+      ask("http://127.0.0.1:" + std::to_string(StoreServer::refusingPort()) + "/preflight/1", none);
+  EXPECT_FALSE(refused);
+  EXPECT_EQ(error["domain"], PlistValue(VendHTTPTransfer::kErrorDomain));
+  EXPECT_NE(error["description"].string()->find("Preflight of item 9"), std::string::npos);
+  EXPECT_FALSE(ask("", none).first);
 }
 
-TEST_F(PreflightTest, WithoutVersionInfoTheMachinesMajorVersionCounts) {
-  testing::writeFile(root_.root() / "etc/os-release", "NAME=\"Test\"\nVERSION_ID=\"12\"\n");
-  EXPECT_TRUE(
-      ask(servePreflight("a", {{"allowed", true}, {"minimumSystemVersion", "12.4"}})).allowed);
-  EXPECT_TRUE(
-      ask(servePreflight("b", {{"allowed", true}, {"minimumSystemVersion", "11"}})).allowed);
-  EXPECT_FALSE(
-      ask(servePreflight("c", {{"allowed", true}, {"minimumSystemVersion", "13.0"}})).allowed);
-}
-
-TEST_F(PreflightTest, FetchFailuresAnswerFalseWithTheError) {
-  const Verdict refused =
-      ask("http://127.0.0.1:" + std::to_string(PackageServer::refusingPort()) + "/preflight/1");
-  EXPECT_FALSE(refused.allowed);
-  EXPECT_EQ(refused.object["domain"], PlistValue(VendHTTPTransfer::kErrorDomain));
-  EXPECT_NE(refused.object["description"].string()->find("Preflight of item 9"), std::string::npos);
-
-  server_.add("/preflight/broken", "x", Fault::kStatus500);
-  const Verdict broken = ask(server_.url("/preflight/broken"));
-  EXPECT_FALSE(broken.allowed);
-  EXPECT_NE(broken.object["description"].string()->find("HTTP 500"), std::string::npos);
-
-  server_.add("/preflight/garbage", "not a property list");
-  EXPECT_FALSE(ask(server_.url("/preflight/garbage")).allowed);
-  EXPECT_FALSE(ask(servePreflight("silent", {{"minimumSystemVersion", "1"}})).allowed)
-      << "no verdict";
-  EXPECT_FALSE(ask("").allowed);
-}
-
+// Downloads through the service are the service's store tests' business;
+// the locks and the list must reach the runtime's manager too.
 TEST_F(DownloadManagerTest, TheServiceOfAStoreClientReachesTheRuntimesManager) {
   auto runtime = std::make_shared<VendRuntime>(root_.configuration());
   VendDownloadService service(
       VendStoreClient::initWithStoreClientType(VendStoreClient::kStoreApplication), runtime);
-  std::promise<std::pair<std::int64_t, OptionalError>> result;
-  service.performDownload(servedDownload(801, "Serviced", "com.example.serviced", "1.0"), 0,
-                          [&](std::int64_t value, OptionalError error) {
-                            result.set_value({value, error});
-                          });
-  auto [value, error] = result.get_future().get();
-  EXPECT_EQ(value, 1) << (error ? error->description : "");
-  EXPECT_TRUE(fs::exists(root_.applications() / "Serviced.app/bundle.plist"));
-
-  std::promise<std::int64_t> failed;
-  auto bad = servedDownload(802, "Broken", "com.example.broken", "1.0", 10'000, Fault::kStatus500);
-  service.performDownload(bad, 0,
-                          [&](std::int64_t value, OptionalError) { failed.set_value(value); });
-  EXPECT_EQ(failed.get_future().get(), 0);
-
   service.lockApplicationsForBundleID("com.example.serviced");
   EXPECT_EQ(VendApplicationLocks::persistedIdentifiers(),
             std::vector<std::string>{"com.example.serviced"});

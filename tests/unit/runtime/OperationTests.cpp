@@ -1,3 +1,5 @@
+// Operations, their queue, and the provider that reads the store's
+// property list answers.
 #include <gtest/gtest.h>
 
 #include <atomic>
@@ -7,8 +9,11 @@
 #include <thread>
 
 #include "platform/dispatch/DispatchSemaphore.h"
+#include "platform/plist/PropertyListSerialization.h"
+#include "store-runtime/records/TillDownload.h"
 #include "store-runtime/services/VendOperation.h"
 #include "store-runtime/services/VendOperationQueue.h"
+#include "store-runtime/services/VendPropertyListProvider.h"
 
 namespace larder {
 namespace {
@@ -52,56 +57,76 @@ class RecordingDelegate : public VendOperationDelegate {
 };
 
 VendError errorWithCode(std::int64_t code) {
-  VendError error;
-  error.code = code;
-  error.description = "failure " + std::to_string(code);
-  return error;
+  return VendError{.code = code, .description = "failure " + std::to_string(code)};
 }
 
+// Whatever the run does, its outcome reaches the handler and the delegate
+// once, and a second run gives the recorded outcome without running again.
+// An exception is a failure, not a crash; whether it comes with an error is
+// left open here.
 TEST(VendOperation, OutcomeReachesHandlerAndDelegateOnceAndTheOperationNeverRunsTwice) {
-  auto operation =
-      std::make_shared<ScriptedOperation>([](ScriptedOperation& self) { self.setSuccess(true); });
-  auto delegate = std::make_shared<RecordingDelegate>();
-  operation->setDelegate(delegate);
-  int handlerCalls = 0;
-  operation->setCompletionHandler([&](VendOperation&, bool success, const OptionalError& error) {
-    ++handlerCalls;
-    EXPECT_TRUE(success);
-    EXPECT_FALSE(error);
-  });
-  OptionalError error;
-  EXPECT_TRUE(operation->runSyncReturningError(&error));
-  EXPECT_FALSE(error);
-  EXPECT_TRUE(operation->runSyncReturningError(&error));  // the recorded outcome, no second run
-  EXPECT_EQ(operation->runs, 1);
-  EXPECT_EQ(handlerCalls, 1);
-  EXPECT_EQ(delegate->finished, 1);
-  EXPECT_TRUE(delegate->failures.empty());
+  const struct {
+    const char* name;
+    std::function<void(ScriptedOperation&)> body;
+    bool success;
+    std::optional<std::int64_t> code;
+  } cases[] = {
+      {"success", [](ScriptedOperation& self) { self.setSuccess(true); }, true, std::nullopt},
+      {"error without success", [](ScriptedOperation& self) { self.setError(errorWithCode(9)); },
+       false, 9},
+      {"exception after success",
+       [](ScriptedOperation& self) {
+         self.setSuccess(true);
+         throw std::runtime_error("archive damaged");
+       },
+       false, std::nullopt},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    auto operation = std::make_shared<ScriptedOperation>(c.body);
+    auto delegate = std::make_shared<RecordingDelegate>();
+    operation->setDelegate(delegate);
+    std::vector<bool> handled;
+    operation->setCompletionHandler(
+        [&](VendOperation&, bool success, const OptionalError&) { handled.push_back(success); });
+    for (int run = 0; run < 2; ++run) {
+      OptionalError error;
+      EXPECT_EQ(operation->runSyncReturningError(&error), c.success);
+      if (c.success) {
+        EXPECT_FALSE(error);
+      }
+      if (c.code) {
+        ASSERT_TRUE(error);
+        EXPECT_EQ(error->code, *c.code);
+      }
+    }
+    EXPECT_EQ(operation->runs, 1);
+    EXPECT_EQ(handled, std::vector<bool>{c.success});
+    EXPECT_EQ(delegate->finished, 1);
+    if (c.success || c.code) {
+      EXPECT_EQ(delegate->failures.size(), c.code ? 1u : 0u);
+    }
+  }
 }
 
-TEST(VendOperation, RunWithoutSuccessFailsAndAnExceptionIsAFailureNotACrash) {
-  auto silent = std::make_shared<ScriptedOperation>(
-      [](ScriptedOperation& self) { self.setError(errorWithCode(9)); });
-  auto delegate = std::make_shared<RecordingDelegate>();
-  silent->setDelegate(delegate);
-  OptionalError error;
-  EXPECT_FALSE(silent->runSyncReturningError(&error));
-  ASSERT_TRUE(error);
-  EXPECT_EQ(error->code, 9);
-  ASSERT_EQ(delegate->failures.size(), 1U);
-  EXPECT_EQ(delegate->finished, 1);
-
-  auto throwing = std::make_shared<ScriptedOperation>([](ScriptedOperation& self) {
+// Fault: VendOperation::runOnce turns an exception into a failure without an
+// error, so callers see a failure they cannot explain and the delegate hears
+// only that the operation finished. Enable once the exception gives an error.
+TEST(VendOperation, DISABLED_AnExceptionAfterSuccessFailsWithAnError) {
+  auto operation = std::make_shared<ScriptedOperation>([](ScriptedOperation& self) {
     self.setSuccess(true);
     throw std::runtime_error("archive damaged");
   });
-  bool handled = false;
-  throwing->setCompletionHandler([&](VendOperation&, bool success, const OptionalError&) {
-    handled = true;
-    EXPECT_FALSE(success);
-  });
-  EXPECT_FALSE(throwing->runSyncReturningError(nullptr));
-  EXPECT_TRUE(handled);
+  auto delegate = std::make_shared<RecordingDelegate>();
+  operation->setDelegate(delegate);
+  OptionalError handled;
+  operation->setCompletionHandler(
+      [&](VendOperation&, bool, const OptionalError& error) { handled = error; });
+  OptionalError error;
+  EXPECT_FALSE(operation->runSyncReturningError(&error));
+  EXPECT_TRUE(error) << "a failure with no error";
+  EXPECT_TRUE(handled) << "the handler is told of a failure with no error";
+  EXPECT_EQ(delegate->failures.size(), 1u);
 }
 
 TEST(VendOperation, SubOperationGivesItsOutcomeWithoutChangingTheOuterOne) {
@@ -142,17 +167,6 @@ TEST(VendOperation, CancellingTheOuterOperationReachesItsSubOperation) {
   EXPECT_FALSE(inner->isCancelled());  // only while it ran inside the cancelled one
 }
 
-TEST(VendOperationQueue, OperationsRunOffTheCallersThread) {
-  VendOperationQueue queue("test");
-  auto operation =
-      std::make_shared<ScriptedOperation>([](ScriptedOperation& self) { self.setSuccess(true); });
-  queue.addOperation(operation);
-  queue.waitUntilAllOperationsAreFinished();
-  EXPECT_EQ(operation->runs, 1);
-  EXPECT_NE(operation->thread.load(), std::this_thread::get_id());
-  EXPECT_EQ(queue.operationCount(), 0U);
-}
-
 // Every operation waits for one it adds to the same queue, twenty levels
 // deep, while other chains do the same: a queue with a fixed set of
 // threads would deadlock here.
@@ -180,7 +194,7 @@ TEST(VendOperationQueue, OperationsWaitingForOperationsOnTheSameQueueDoNotDeadlo
   EXPECT_EQ(completed, kChains * (kDepth + 1));
 }
 
-TEST(VendOperationQueue, IdleThreadsLeaveAndAreReplacedOnDemand) {
+TEST(VendOperationQueue, RunsOffTheCallersThreadOnThreadsThatLeaveWhenIdle) {
   VendOperationQueue queue("idle", 50ms);
   for (int i = 0; i < 4; ++i) {
     queue.addOperation(std::make_shared<ScriptedOperation>([](ScriptedOperation& self) {
@@ -199,6 +213,92 @@ TEST(VendOperationQueue, IdleThreadsLeaveAndAreReplacedOnDemand) {
   queue.addOperation(late);
   queue.waitUntilAllOperationsAreFinished();
   EXPECT_EQ(late->runs, 1);
+  EXPECT_NE(late->thread.load(), std::this_thread::get_id());
+  EXPECT_EQ(queue.operationCount(), 0U);
+}
+
+PlistData bytes(const std::string& text) {
+  return {text.begin(), text.end()};
+}
+
+PlistData xml(const PlistValue& value) {
+  return bytes(PropertyListSerialization::writeXml(value));
+}
+
+PlistDictionary downloadEntry(std::uint64_t item) {
+  return PlistDictionary{
+      {"metadata",
+       PlistDictionary{
+           {"itemIdentifier", item}, {"bundleIdentifier", "com.example.A"}, {"title", "A"}}},
+      {"assets", PlistArray{PlistDictionary{{"type", 10},
+                                            {"URL", "http://127.0.0.1:1/assets/1/A.tar"},
+                                            {"fileSize", 4},
+                                            {"numberOfBytesToHash", 4},
+                                            {"hashes", PlistArray{std::string(64, 'a')}}}}}};
+}
+
+VendPropertyListProvider provider() {
+  VendPropertyListProvider made(VendStoreClient::initWithStoreClientType(0));
+  made.setShouldTriggerDownloads(false);
+  return made;
+}
+
+TEST(VendPropertyListProvider, AnswersThatAreNotPropertyListsGiveAnErrorAndNoOutput) {
+  for (const std::string& text :
+       {std::string(), std::string("<html>busy</html>"), std::string("bplist00\xff\xff"),
+        std::string("<plist><dict><key>a</key></plist>")}) {
+    auto parser = provider();
+    OptionalError error;
+    EXPECT_FALSE(parser.parseData(bytes(text), &error)) << text;
+    ASSERT_TRUE(error) << text;
+    EXPECT_FALSE(error->description.empty());
+    EXPECT_TRUE(parser.output().isNull());
+  }
+}
+
+TEST(VendPropertyListProvider, TheProtocolSwitchDecidesWhetherAStoreFailureFailsTheParse) {
+  const PlistData answer = xml(PlistDictionary{{"failureType", "item-unavailable"},
+                                               {"customerMessage", "This item is gone."}});
+  auto obeying = provider();
+  OptionalError error;
+  EXPECT_FALSE(obeying.parseData(answer, &error));
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->description, "This item is gone.");
+  EXPECT_EQ(*PlistValue(error->userInfo)["failureType"].string(), "item-unavailable");
+
+  auto ignoring = provider();
+  ignoring.setShouldProcessProtocol(false);
+  error.reset();
+  EXPECT_TRUE(ignoring.parseData(answer, &error));
+  EXPECT_FALSE(error);
+  EXPECT_EQ(*ignoring.output()["customerMessage"].string(), "This item is gone.");
+}
+
+TEST(VendPropertyListProvider, DownloadsAreTakenUpOnlyWhenAskedAndMalformedOnesAreSkipped) {
+  const PlistData answer = xml(PlistDictionary{
+      {"downloads", PlistArray{downloadEntry(11), PlistValue("junk"),
+                               PlistDictionary{{"metadata", 3}}, downloadEntry(12)}}});
+  auto taking = provider();
+  ASSERT_TRUE(taking.parseData(answer, nullptr));
+  ASSERT_EQ(taking.downloads().size(), 2U);
+  EXPECT_EQ(taking.downloads()[0]->metadata().itemIdentifier(), 11U);
+  EXPECT_EQ(taking.downloads()[1]->metadata().itemIdentifier(), 12U);
+
+  auto leaving = provider();
+  leaving.setShouldProcessDownloads(false);
+  ASSERT_TRUE(leaving.parseData(answer, nullptr));
+  EXPECT_TRUE(leaving.downloads().empty());
+  EXPECT_EQ(leaving.output()["downloads"].array()->size(), 4U);  // the output is the whole answer
+
+  // A provider configured from another takes its switches, and migrating
+  // takes over its results.
+  auto configured = provider();
+  configured.configureFromProvider(leaving);
+  EXPECT_FALSE(configured.shouldProcessDownloads());
+  EXPECT_FALSE(configured.shouldTriggerDownloads());
+  configured.migrateOutputFromSubProvider(taking);
+  EXPECT_EQ(configured.downloads().size(), 2U);
+  EXPECT_EQ(configured.output(), taking.output());
 }
 
 }  // namespace

@@ -11,15 +11,11 @@
 
 #include <atomic>
 #include <chrono>
-#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
+#include <functional>
 #include <nlohmann/json.hpp>
-#include <optional>
-#include <random>
 #include <set>
-#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
@@ -43,7 +39,7 @@
 #include "store-runtime/host/VendManagedRestrictions.h"
 #include "store-runtime/http/VendGzip.h"
 #include "store-runtime/http/VendHTTPTransfer.h"
-#include "tests/unit/ScopedEnvironment.h"
+#include "tests/unit/runtime/RuntimeTestSupport.h"
 #include "tests/unit/runtime/UnprivilegedUser.h"
 
 namespace larder {
@@ -52,53 +48,28 @@ namespace {
 namespace fs = std::filesystem;
 using namespace std::chrono_literals;
 
-void writeText(const std::string& path, std::string_view text) {
-  fs::create_directories(fs::path(path).parent_path());
-  std::ofstream file(path, std::ios::binary | std::ios::trunc);
-  file.write(text.data(), static_cast<std::streamsize>(text.size()));
-  file.close();
-  ASSERT_TRUE(file) << "cannot write " << path;
-}
+using testing::readFile;
 
+void writeText(const std::string& path, std::string_view text) {
+  testing::writeFile(path, text);
+}
 void writePlist(const std::string& path, const PlistValue& value) {
   writeText(path, PropertyListSerialization::writeXml(value));
 }
-
-std::string readText(const std::string& path) {
-  std::ifstream file(path, std::ios::binary);
-  std::stringstream contents;
-  contents << file.rdbuf();
-  return contents.str();
-}
-
 PlistValue readPlist(const std::string& path) {
   std::optional<PlistData> bytes = FileIO::read(path).optional();
   if (!bytes) return {};
   std::optional<PlistValue> value = PropertyListSerialization::read(*bytes);
-  return value ? *value : PlistValue();
+  return value.value_or(PlistValue());
 }
 
 double secondsNow() {
   return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
 }
 
-std::string realHomeOfCurrentUser() {
-  const passwd* entry = ::getpwuid(::getuid());
-  return entry && entry->pw_dir ? std::string(entry->pw_dir) : std::string();
-}
-
 class RuntimeFacilityTest : public ::testing::Test {
  protected:
-  static constexpr const char* kVariables[] = {"LARDER_ROOT",
-                                               "HOME",
-                                               "XDG_CACHE_HOME",
-                                               "XDG_STATE_HOME",
-                                               "XDG_CONFIG_HOME",
-                                               "LARDER_STORE_APP",
-                                               "__OSINSTALL_ENVIRONMENT"};
-
   void SetUp() override {
-    for (const char* name : kVariables) environment_.save(name);
     std::string pattern = (fs::temp_directory_path() / "larder-facilities-XXXXXX").string();
     ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
     temporary_ = pattern;
@@ -106,13 +77,12 @@ class RuntimeFacilityTest : public ::testing::Test {
     home_ = temporary_ + "/home";
     fs::create_directories(root_);
     fs::create_directories(home_);
-    ::setenv("LARDER_ROOT", root_.c_str(), 1);
-    ::setenv("HOME", home_.c_str(), 1);
-    ::setenv("XDG_CACHE_HOME", (temporary_ + "/cache").c_str(), 1);
-    ::setenv("XDG_STATE_HOME", (temporary_ + "/state").c_str(), 1);
-    ::setenv("XDG_CONFIG_HOME", (temporary_ + "/config").c_str(), 1);
-    ::unsetenv("LARDER_STORE_APP");
-    ::unsetenv("__OSINSTALL_ENVIRONMENT");
+    environment_.set("LARDER_ROOT", root_);
+    environment_.set("HOME", home_);
+    for (const char* kind : {"CACHE", "STATE", "CONFIG"})
+      environment_.set(std::string("XDG_") + kind + "_HOME", temporary_ + "/" + kind);
+    environment_.unset("LARDER_STORE_APP");
+    environment_.unset("__OSINSTALL_ENVIRONMENT");
   }
 
   void TearDown() override {
@@ -138,13 +108,6 @@ class RuntimeFacilityTest : public ::testing::Test {
     return path;
   }
 
-  static std::string purchaseRecordText(std::string_view bundleIdentifier) {
-    PlistDictionary record{{"bundleIdentifier", PlistValue(bundleIdentifier)},
-                           {"bundleVersion", "1.0"},
-                           {"wareID", PlistValue(std::int64_t{4242})}};
-    return PropertyListSerialization::writeXml(PlistValue(record));
-  }
-
   std::string temporary_;
   std::string root_;
   std::string home_;
@@ -152,13 +115,9 @@ class RuntimeFacilityTest : public ::testing::Test {
   testing::ScopedEnvironment environment_;
 };
 
-// ---------------------------------------------------------------- gzip
-
-PlistData pseudoRandomBytes(std::size_t count, std::uint32_t seed) {
-  std::mt19937 generator(seed);
-  PlistData bytes(count);
-  for (auto& byte : bytes) byte = static_cast<std::uint8_t>(generator());
-  return bytes;
+PlistData pseudoRandomBytes(std::size_t count, unsigned seed) {
+  const std::string bytes = testing::randomBytes(count, seed);
+  return {bytes.begin(), bytes.end()};
 }
 
 TEST_F(RuntimeFacilityTest, GzipRoundTripsEmptySmallRandomAndLargeInputs) {
@@ -182,40 +141,23 @@ TEST_F(RuntimeFacilityTest, GzipRoundTripsEmptySmallRandomAndLargeInputs) {
   EXPECT_LT(VendCopyGzippedDataForData(inputs[3])->size(), 100000u);
 }
 
-TEST_F(RuntimeFacilityTest, GzipOutputIsReadByTheSystemGzipTool) {
-  if (std::system("command -v gzip >/dev/null 2>&1") != 0) GTEST_SKIP() << "no gzip tool";
-  PlistData input = pseudoRandomBytes(5000, 3);
-  std::string zippedPath = temporary_ + "/body.gz";
-  std::optional<PlistData> zipped = VendCopyGzippedDataForData(input);
-  ASSERT_TRUE(zipped);
-  ASSERT_TRUE(FileIO::writeAtomically(zippedPath, *zipped));
-  std::string command = "gzip -dc '" + zippedPath + "' > '" + temporary_ + "/body'";
-  ASSERT_EQ(std::system(command.c_str()), 0);
-  EXPECT_EQ(FileIO::read(temporary_ + "/body"), input);
-}
-
 TEST_F(RuntimeFacilityTest, GunzipRefusesDamagedTruncatedPaddedAndOversizedStreams) {
-  PlistData input = pseudoRandomBytes(20000, 11);
-  PlistData zipped = *VendCopyGzippedDataForData(input);
-
-  PlistData flipped = zipped;
-  flipped[flipped.size() / 2] ^= 0x55;
-  EXPECT_FALSE(VendCopyGunzippedDataForData(flipped));
-
-  PlistData badChecksum = zipped;
-  badChecksum[badChecksum.size() - 6] ^= 0x01;  // inside the CRC-32 of the trailer
-  EXPECT_FALSE(VendCopyGunzippedDataForData(badChecksum));
-
-  PlistData truncated(zipped.begin(), zipped.end() - 5);
-  EXPECT_FALSE(VendCopyGunzippedDataForData(truncated));
-
-  PlistData padded = zipped;
-  padded.push_back(0);
-  EXPECT_FALSE(VendCopyGunzippedDataForData(padded));
-
-  std::string plain = "not compressed at all";
-  EXPECT_FALSE(VendCopyGunzippedDataForData(PlistData(plain.begin(), plain.end())));
-  EXPECT_FALSE(VendCopyGunzippedDataForData(PlistData{}));
+  const PlistData zipped = *VendCopyGzippedDataForData(pseudoRandomBytes(20000, 11));
+  const auto changed = [&](const std::function<void(PlistData&)>& change) {
+    PlistData copy = zipped;
+    change(copy);
+    return copy;
+  };
+  const std::string plain = "not compressed at all";
+  const std::pair<const char*, PlistData> refused[] = {
+      {"a flipped byte", changed([](PlistData& d) { d[d.size() / 2] ^= 0x55; })},
+      {"a bad checksum", changed([](PlistData& d) { d[d.size() - 6] ^= 0x01; })},  // in the CRC-32
+      {"truncated", changed([](PlistData& d) { d.resize(d.size() - 5); })},
+      {"padded", changed([](PlistData& d) { d.push_back(0); })},
+      {"not compressed", PlistData(plain.begin(), plain.end())},
+      {"empty", PlistData{}},
+  };
+  for (const auto& [name, data] : refused) EXPECT_FALSE(VendCopyGunzippedDataForData(data)) << name;
 
   // A small body that expands beyond the limit is refused, at the limit it is fine.
   PlistData zeros(4u << 20u, 0);
@@ -226,66 +168,57 @@ TEST_F(RuntimeFacilityTest, GunzipRefusesDamagedTruncatedPaddedAndOversizedStrea
   EXPECT_EQ(exact->size(), zeros.size());
 }
 
-// ---------------------------------------------------------------- errors
-
-TEST_F(RuntimeFacilityTest, NamedErrorsCarryTheirCodesAndTexts) {
-  struct Expected {
+// The named errors, and errors made from a title and a message (the
+// message is preferred as the description) or in another domain.
+TEST_F(RuntimeFacilityTest, ErrorsCarryTheirDomainsCodesAndTexts) {
+  using Text = std::optional<std::string>;
+  const struct {
     VendError error;
+    std::string_view domain;
     std::int64_t code;
-    std::optional<std::string> title;
-    std::optional<std::string> message;
+    Text title, message;
     std::string description;
-  };
-  const std::vector<Expected> table = {
-      {VendError::cancelledByUser(), -128, "AC check failed",
+  } table[] = {
+      {VendError::cancelledByUser(), VendErrorDomain, -128, "AC check failed",
        "Can't start because the user canceled the dialog.",
        "Can't start because the user canceled the dialog."},
-      {VendError::notAuthorized(), 4, "Authorization failed",
+      {VendError::notAuthorized(), VendErrorDomain, 4, "Authorization failed",
        "Not authorized to proceed with updates.", "Not authorized to proceed with updates."},
-      {VendError::alreadyInstalled(), 7, std::nullopt, "Skipping download", "Skipping download"},
-      {VendError::notEnoughDiskSpace(), 11, "Disk check failed",
+      {VendError::alreadyInstalled(), VendErrorDomain, 7, std::nullopt, "Skipping download",
+       "Skipping download"},
+      {VendError::notEnoughDiskSpace(), VendErrorDomain, 11, "Disk check failed",
        "Can't start because there is not enough disk space.",
        "Can't start because there is not enough disk space."},
-      {VendError::noUniqueTaggedUpdate(), 27, std::nullopt, std::nullopt, ""},
-      {VendError::urlBagKeyMissing(), 30, "DAAP Key not in Bag", std::nullopt,
+      {VendError::noUniqueTaggedUpdate(), VendErrorDomain, 27, std::nullopt, std::nullopt, ""},
+      {VendError::urlBagKeyMissing(), VendErrorDomain, 30, "DAAP Key not in Bag", std::nullopt,
        "DAAP Key not in Bag"},
+      {VendError::make(99, "Title", "Message"), VendErrorDomain, 99, "Title", "Message", "Message"},
+      {VendError::make(99, "Title", std::nullopt), VendErrorDomain, 99, "Title", std::nullopt,
+       "Title"},
+      {VendError::make(99), VendErrorDomain, 99, std::nullopt, std::nullopt, ""},
+      {VendError::withDomain("NSURLErrorDomain", -1001, "timed out"), "NSURLErrorDomain", -1001,
+       std::nullopt, std::nullopt, "timed out"},
+      {VendError::withDomain("D", 1), "D", 1, std::nullopt, std::nullopt, ""},
   };
-  for (const Expected& expected : table) {
+  for (const auto& expected : table) {
     SCOPED_TRACE(expected.code);
-    EXPECT_EQ(expected.error.domain, VendErrorDomain);
+    EXPECT_EQ(expected.error.domain, expected.domain);
     EXPECT_EQ(expected.error.code, expected.code);
     EXPECT_EQ(expected.error.title(), expected.title);
-    EXPECT_EQ(expected.error.message(), expected.message);
     EXPECT_EQ(expected.error.description, expected.description);
+    EXPECT_EQ(expected.error.isCancellation(), expected.code == -128);
+    // What an error of another domain keeps beside its description is its own matter.
+    if (expected.domain == VendErrorDomain) {
+      EXPECT_EQ(expected.error.message(), expected.message);
+      EXPECT_EQ(expected.error.userInfo.empty(), !expected.title && !expected.message);
+    }
     // Title and message survive the wire form.
     std::optional<VendError> back = VendError::fromDictionary(expected.error.toDictionary());
     ASSERT_TRUE(back);
     EXPECT_EQ(*back, expected.error);
     EXPECT_EQ(back->title(), expected.title);
   }
-  EXPECT_TRUE(VendError::cancelledByUser().isCancellation());
-  EXPECT_FALSE(VendError::notAuthorized().isCancellation());
 }
-
-TEST_F(RuntimeFacilityTest, ErrorConstructorsPreferTheMessageAndTakeAnyDomain) {
-  VendError both = VendError::make(99, "Title", "Message");
-  EXPECT_EQ(both.description, "Message");
-  VendError titleOnly = VendError::make(99, "Title", std::nullopt);
-  EXPECT_EQ(titleOnly.description, "Title");
-  EXPECT_EQ(titleOnly.message(), std::nullopt);
-  VendError neither = VendError::make(99);
-  EXPECT_EQ(neither.description, "");
-  EXPECT_TRUE(neither.userInfo.empty());
-
-  VendError foreign = VendError::withDomain("NSURLErrorDomain", -1001, "timed out");
-  EXPECT_EQ(foreign.domain, "NSURLErrorDomain");
-  EXPECT_EQ(foreign.code, -1001);
-  EXPECT_EQ(foreign.description, "timed out");
-  EXPECT_EQ(foreign.title(), std::nullopt);
-  EXPECT_EQ(VendError::withDomain("D", 1).description, "");
-}
-
-// ---------------------------------------------------------------- restrictions
 
 // Each state of the file in turn, read at every call: whether it requires
 // an administrator and whether it silences update notifications.
@@ -323,8 +256,6 @@ TEST_F(RuntimeFacilityTest, RestrictionsFollowTheFileAtEveryCall) {
     EXPECT_FALSE(VendManagedRestrictions::isRestrictedTo("SomethingElse"));
   }
 }
-
-// ---------------------------------------------------------------- deferred-install agent
 
 TEST_F(RuntimeFacilityTest, TwilightArmingIsPersistedAndUndone) {
   EXPECT_FALSE(LedgerTwilightAgent::isArmedForInstallLater());
@@ -391,8 +322,6 @@ TEST_F(RuntimeFacilityTest, RestartCountdownIsShownUntilTheUserAnswers) {
   EXPECT_FALSE(LedgerTwilightAgent::isRestartCountdownShown());
 }
 
-// ---------------------------------------------------------------- message trace
-
 TEST_F(RuntimeFacilityTest, TraceMessagesFromManyThreadsAreWholeLines) {
   constexpr int kThreads = 8;
   constexpr int kPerThread = 150;
@@ -413,7 +342,7 @@ TEST_F(RuntimeFacilityTest, TraceMessagesFromManyThreadsAreWholeLines) {
   for (auto& thread : threads) thread.join();
   LedgerTraceMessageWaitUntilWritten();
 
-  const std::string path = temporary_ + "/state/larder/messagetrace.log";
+  const std::string path = temporary_ + "/STATE/larder/messagetrace.log";
   EXPECT_EQ(LedgerTraceMessageLogPath(), path);
   std::ifstream log(path);
   std::set<std::pair<int, int>> seen;
@@ -452,64 +381,48 @@ TEST_F(RuntimeFacilityTest, TraceLinesKeepEveryValueKind) {
   EXPECT_TRUE(record["message"]["odd"].is_string());
 }
 
-// ---------------------------------------------------------------- localised text
-
-TEST_F(RuntimeFacilityTest, LocalizedLookupFallsBackToDefaultThenKey) {
-  VendStoreClient store =
+TEST_F(RuntimeFacilityTest, LocalizedTextComesFromTheClientsWordingThenTheDefaultThenTheKey) {
+  const VendStoreClient store =
       VendStoreClient::initWithStoreClientType(VendStoreClient::kStoreApplication);
-  LocalizedStringBundle framework = LocalizedStringBundle::tradelineFramework();
-  EXPECT_EQ(LedgerLocalizedStringFromTableInBundle("UPDATE_NOTIFICATION_LATER_BUTTON", std::nullopt,
-                                                   framework, "", &store),
-            "Later");
-  EXPECT_EQ(LedgerLocalizedString("SOFTWARE_LICENSE_AGREEMENT_TITLE", nullptr),
-            "Software License Agreement");
-  EXPECT_EQ(LedgerLocalizedStringFromTableInBundle("NO_SUCH_KEY", std::nullopt, framework,
-                                                   "Fallback", &store),
-            "Fallback");
-  EXPECT_EQ(
-      LedgerLocalizedStringFromTableInBundle("NO_SUCH_KEY", std::nullopt, framework, "", &store),
-      "NO_SUCH_KEY");
-  // The runtime's own bundle answers the texts of its dialogs.
-  LocalizedStringBundle dialogBundle = LocalizedStringBundle::forVendDialog();
-  EXPECT_EQ(dialogBundle.localizedStringForKey("AUTOUPDATE_OPTIN_OK", "", std::nullopt), "Turn On");
-  EXPECT_EQ(dialogBundle.localizedStringForKey("NOPE", "", std::nullopt), "NOPE");
-  EXPECT_EQ(dialogBundle.localizedStringForKey("NOPE", "given", std::nullopt), "given");
-}
-
-TEST_F(RuntimeFacilityTest, BookClientHasWordingOfItsOwn) {
-  VendStoreClient store =
-      VendStoreClient::initWithStoreClientType(VendStoreClient::kStoreApplication);
-  VendStoreClient books =
+  const VendStoreClient books =
       VendStoreClient::initWithStoreClientType(VendStoreClient::kBookApplication);
-  std::string storeTitle = LedgerLocalizedString("UPDATES_AVAILABLE_NOTIFICATION_TITLE", &store);
-  std::string bookTitle = LedgerLocalizedString("UPDATES_AVAILABLE_NOTIFICATION_TITLE", &books);
-  EXPECT_EQ(storeTitle, "Updates Available");
-  EXPECT_EQ(bookTitle, "Book Updates Available");
+  const LocalizedStringBundle framework = LocalizedStringBundle::tradelineFramework();
+  const LocalizedStringBundle dialogs = LocalizedStringBundle::forVendDialog();
+  const auto inFramework = [&](std::string_view key, std::string_view given) {
+    return LedgerLocalizedStringFromTableInBundle(key, std::nullopt, framework, given, &store);
+  };
+  const std::pair<std::string, std::string_view> cases[] = {
+      {inFramework("UPDATE_NOTIFICATION_LATER_BUTTON", ""), "Later"},
+      {inFramework("NO_SUCH_KEY", "Fallback"), "Fallback"},
+      {inFramework("NO_SUCH_KEY", ""), "NO_SUCH_KEY"},
+      {LedgerLocalizedString("SOFTWARE_LICENSE_AGREEMENT_TITLE", nullptr),
+       "Software License Agreement"},
+      // The book client has wording of its own; the client-free lookup of
+      // the bundle ignores it.
+      {LedgerLocalizedString("UPDATES_AVAILABLE_NOTIFICATION_TITLE", &store), "Updates Available"},
+      {LedgerLocalizedString("UPDATES_AVAILABLE_NOTIFICATION_TITLE", &books),
+       "Book Updates Available"},
+      {framework.localizedStringForKey("UPDATES_AVAILABLE_NOTIFICATION_TITLE", "", std::nullopt),
+       "Updates Available"},
+      // The runtime's own bundle answers the texts of its dialogs.
+      {dialogs.localizedStringForKey("AUTOUPDATE_OPTIN_OK", "", std::nullopt), "Turn On"},
+      {dialogs.localizedStringForKey("NOPE", "", std::nullopt), "NOPE"},
+      {dialogs.localizedStringForKey("NOPE", "given", std::nullopt), "given"},
+  };
+  for (const auto& [text, expected] : cases) EXPECT_EQ(text, expected);
   // Texts the book client does not override are the common ones.
   EXPECT_EQ(LedgerLocalizedString("UPDATE_NOTIFICATION_DETAILS_BUTTON", &books),
             LedgerLocalizedString("UPDATE_NOTIFICATION_DETAILS_BUTTON", &store));
-  // The client-free lookup of the bundle ignores the overrides.
-  EXPECT_EQ(LocalizedStringBundle::tradelineFramework().localizedStringForKey(
-                "UPDATES_AVAILABLE_NOTIFICATION_TITLE", "", std::nullopt),
-            storeTitle);
-}
 
-TEST_F(RuntimeFacilityTest, EveryTextKeyTheServiceUsesHasEnglishText) {
-  // Each key must give text of its own, not the key back.
-  const std::vector<std::string_view> keys = {
-      "AC_POWER_MESSAGE",
-      "CANCEL",
-      "CANNOT_UPDATE_BODY",
-      "CONFIRM_RESTART_TITLE_DOWNLOAD",
-      "CRITICAL_UPDATES_INSTALL_NOW_RESTART_TEXT",
-      "DOITLATER_HELPER_POWER_TEXT",
-      "INSTALL_QUIT_APP_MULTIPLE_MESSAGE_FORMAT",
-      "OVP_INVITE_NOTIFICATION_TITLE_FORMAT",
-      "UPDATES_AVAILABLE_HEARTHANVIL_NOTIFICATION_TEXT_AND_OTHERS_FORMAT",
-      "UPDATE_NOTIFICATION_LATER_OPTION_AUTOUPDATE_RESTART_REQUIRED_OPTIN",
-      "UPDATEFAILED_DIALOG_AVAILABLE_UPDATES_SHOW_DETAILS_BUTTON"};
-  for (std::string_view key : keys) {
-    std::string text = LedgerLocalizedString(key, nullptr);
+  // Each key the service uses must give text of its own, not the key back.
+  for (std::string_view key :
+       {"AC_POWER_MESSAGE", "CANCEL", "CANNOT_UPDATE_BODY", "CONFIRM_RESTART_TITLE_DOWNLOAD",
+        "CRITICAL_UPDATES_INSTALL_NOW_RESTART_TEXT", "DOITLATER_HELPER_POWER_TEXT",
+        "INSTALL_QUIT_APP_MULTIPLE_MESSAGE_FORMAT", "OVP_INVITE_NOTIFICATION_TITLE_FORMAT",
+        "UPDATES_AVAILABLE_HEARTHANVIL_NOTIFICATION_TEXT_AND_OTHERS_FORMAT",
+        "UPDATE_NOTIFICATION_LATER_OPTION_AUTOUPDATE_RESTART_REQUIRED_OPTIN",
+        "UPDATEFAILED_DIALOG_AVAILABLE_UPDATES_SHOW_DETAILS_BUTTON"}) {
+    const std::string text = LedgerLocalizedString(key, nullptr);
     EXPECT_NE(text, key);
     EXPECT_FALSE(text.empty()) << key;
   }
@@ -532,26 +445,25 @@ TEST_F(RuntimeFacilityTest, BundleOnDiskAnswersFromItsOwnTables) {
   EXPECT_EQ(onDisk.localizedStringForKey("CANCEL", "", std::nullopt), "CANCEL");
 }
 
-// ---------------------------------------------------------------- string helpers
-
 TEST_F(RuntimeFacilityTest, TildeExpandsAgainstTheRealHomeNotHOME) {
-  std::string realHome = realHomeOfCurrentUser();
+  const passwd* entry = ::getpwuid(::getuid());
+  const std::string realHome = entry && entry->pw_dir ? entry->pw_dir : "";
   ASSERT_FALSE(realHome.empty());
   ASSERT_NE(realHome, home_);  // the fixture points HOME elsewhere
-  std::string expected = realHome == "/" ? "" : realHome;
-  EXPECT_EQ(
-      stringByExpandingTildeInPathOutsideOfSandbox("~/Library/Application Support/Bindery/Books"),
-      expected + "/Library/Application Support/Bindery/Books");
-  EXPECT_EQ(stringByExpandingTildeInPathOutsideOfSandbox("~"), realHome);
+  const std::string base = realHome == "/" ? "" : realHome;
   const passwd* rootEntry = ::getpwnam("root");
   ASSERT_NE(rootEntry, nullptr);
-  EXPECT_EQ(stringByExpandingTildeInPathOutsideOfSandbox("~root/notes"),
-            std::string(rootEntry->pw_dir) + "/notes");
-  EXPECT_EQ(stringByExpandingTildeInPathOutsideOfSandbox("~no-such-user-x9/a"),
-            "~no-such-user-x9/a");
-  EXPECT_EQ(stringByExpandingTildeInPathOutsideOfSandbox("/srv/~/x"), "/srv/~/x");
-  EXPECT_EQ(stringByExpandingTildeInPathOutsideOfSandbox("relative/~"), "relative/~");
-  EXPECT_EQ(stringByExpandingTildeInPathOutsideOfSandbox(""), "");
+  const std::pair<std::string, std::string> cases[] = {
+      {"~/Library/Application Support/Books", base + "/Library/Application Support/Books"},
+      {"~", realHome},
+      {"~root/notes", std::string(rootEntry->pw_dir) + "/notes"},
+      {"~no-such-user-x9/a", "~no-such-user-x9/a"},
+      {"/srv/~/x", "/srv/~/x"},
+      {"relative/~", "relative/~"},
+      {"", ""},
+  };
+  for (const auto& [path, expanded] : cases)
+    EXPECT_EQ(stringByExpandingTildeInPathOutsideOfSandbox(path), expanded) << path;
 }
 
 TEST_F(RuntimeFacilityTest, QueryStringHelperPlacesSeparatorsAndKeepsTheFragment) {
@@ -578,8 +490,6 @@ TEST_F(RuntimeFacilityTest, QueryStringHelperPlacesSeparatorsAndKeepsTheFragment
         << c.url << " + " << c.text;
   }
 }
-
-// ---------------------------------------------------------------- system state
 
 TEST_F(RuntimeFacilityTest, LockedApplicationsMayNotLaunch) {
   const std::string path = platformState("locked-applications.plist");
@@ -640,13 +550,11 @@ TEST_F(RuntimeFacilityTest, CriticalUpdateTimeStampIsKeptPerUser) {
   ASSERT_TRUE(stamp);
   EXPECT_GE(stamp->secondsSince1970, before - 1);
   EXPECT_LE(stamp->secondsSince1970, secondsNow() + 1);
-  EXPECT_TRUE(fs::exists(temporary_ + "/config/larder/CriticalUpdate.plist"));
+  EXPECT_TRUE(fs::exists(temporary_ + "/CONFIG/larder/CriticalUpdate.plist"));
   // Another user's configuration folder has none.
   ::setenv("XDG_CONFIG_HOME", (temporary_ + "/other-config").c_str(), 1);
   EXPECT_FALSE(LedgerCriticalUpdateTimeStamp());
 }
-
-// ---------------------------------------------------------------- device
 
 TEST_F(RuntimeFacilityTest, OSMajorVersionComesFromOSReleaseElseTheKernel) {
   utsname name{};
@@ -684,7 +592,7 @@ TEST_F(RuntimeFacilityTest, GuidPrefersMachineIdAndOtherwiseKeepsOneItMade) {
   EXPECT_EQ(made.size(), 32u);
   EXPECT_NE(made, machineId);
   EXPECT_EQ(VendDevice::guid(), made) << "the identifier stays the same";
-  EXPECT_EQ(readText(platformState("machine-guid")), made + "\n");
+  EXPECT_EQ(readFile(platformState("machine-guid")), made + "\n");
 
   fs::remove(rooted("/etc/machine-id"));
   EXPECT_EQ(VendDevice::guid(), made);
@@ -702,8 +610,6 @@ TEST_F(RuntimeFacilityTest, AvailableDiskSpaceIsThatOfThePlatformRoot) {
   ::setenv("LARDER_ROOT", (temporary_ + "/missing-root").c_str(), 1);
   EXPECT_EQ(VendDevice::availableDiskSpace(), 0u);
 }
-
-// ---------------------------------------------------------------- privileged helper
 
 TEST_F(RuntimeFacilityTest, RootHelperWritesSystemPreferencesWithTheOSVersion) {
   writeText(rooted("/etc/os-release"), "VERSION_ID=\"13.1\"\n");
@@ -762,8 +668,6 @@ TEST_F(RuntimeFacilityTest, StateFileChangesFromManyThreadsAreNotLost) {
   EXPECT_EQ(PlistValue(file.readDictionary())["count"].int64Value(), kThreads * kIncrements);
 }
 
-// ---------------------------------------------------------------- launcher bar and store app
-
 TEST_F(RuntimeFacilityTest, DockRecordsIconsPlaceholdersAndMessages) {
   VendStoreClient store =
       VendStoreClient::initWithStoreClientType(VendStoreClient::kStoreApplication);
@@ -775,12 +679,10 @@ TEST_F(RuntimeFacilityTest, DockRecordsIconsPlaceholdersAndMessages) {
   dock.loadIconForIdentifier("../../escape", iconSource, store);
 
   std::string location = LedgerIconLocationForIdentifier(store.identifier(), "061-12345");
-  EXPECT_EQ(readText(location), "PNGDATA");
-  EXPECT_FALSE(fs::exists(LedgerIconLocationForIdentifier(store.identifier(), "400100")))
-      << "remote icons are recorded, not fetched";
+  EXPECT_EQ(readFile(location), "PNGDATA");
   std::string escaped = LedgerIconLocationForIdentifier(store.identifier(), "../../escape");
   EXPECT_EQ(fs::path(escaped).parent_path(), fs::path(location).parent_path());
-  EXPECT_EQ(readText(escaped), "PNGDATA");
+  EXPECT_EQ(readFile(escaped), "PNGDATA");
 
   LedgerRootHelper::sharedInstance().proxy().createPlaceholderWithName("Big Update", 0,
                                                                        PlistData{1, 2, 3});
@@ -794,8 +696,11 @@ TEST_F(RuntimeFacilityTest, DockRecordsIconsPlaceholdersAndMessages) {
   const std::string iconKey = store.identifier() + "/061-12345";
   EXPECT_EQ(state["icons"][iconKey]["url"], PlistValue("file://" + iconSource));
   EXPECT_EQ(state["icons"][iconKey]["location"], PlistValue(location));
+  // The remote icon is recorded, which is when a fetch would have written it.
   EXPECT_EQ(state["icons"][store.identifier() + "/400100"]["url"],
             PlistValue("https://store.test/icon.png"));
+  EXPECT_FALSE(fs::exists(LedgerIconLocationForIdentifier(store.identifier(), "400100")))
+      << "remote icons are recorded, not fetched";
   EXPECT_EQ(state["placeholders"]["Big Update"]["iconData"], PlistValue(PlistData{1, 2, 3}));
   EXPECT_TRUE(state["placeholders"]["Other"].isNull());
   EXPECT_EQ(state["messages"]["061-12345"]["status"]["percentComplete"], PlistValue(40.0));
@@ -825,7 +730,7 @@ TEST_F(RuntimeFacilityTest, StoreApplicationLaunchIsRecordedAndStarted) {
   while (!fs::exists(output) && std::chrono::steady_clock::now() < deadline) {
     std::this_thread::sleep_for(20ms);
   }
-  EXPECT_EQ(readText(output), url);
+  EXPECT_EQ(readFile(output), url);
   state = readPlist(LedgerQuaymartLauncher::stateFilePath());
   ASSERT_EQ(state["launches"].array()->size(), 2u);
   EXPECT_TRUE(state["launches"].array()->at(1)["launched"].boolValue());
@@ -834,12 +739,13 @@ TEST_F(RuntimeFacilityTest, StoreApplicationLaunchIsRecordedAndStarted) {
   EXPECT_FALSE(LedgerQuaymartLauncher::sharedInstance().launchQuaymartWithURL(url));
 }
 
-// ---------------------------------------------------------------- file manager
-
 TEST_F(RuntimeFacilityTest, StoreSoftwareIsTheBundleWithAPurchaseRecord) {
   const PlistDictionary info{{"HostBundleIdentifier", "com.example.store"}};
-  std::string store =
-      makeBundle(rooted("/Applications/Store.app"), info, purchaseRecordText("com.example.store"));
+  std::string store = makeBundle(
+      rooted("/Applications/Store.app"), info,
+      PropertyListSerialization::writeXml(PlistDictionary{{"bundleIdentifier", "com.example.store"},
+                                                          {"bundleVersion", "1.0"},
+                                                          {"wareID", std::int64_t{4242}}}));
   EXPECT_TRUE(VendFileManager::isQuaymartAppAtPath(store));
   for (const std::string& path :
        {makeBundle(rooted("/Applications/Plain.app"), info),

@@ -1,5 +1,5 @@
-// Scaffolding of the download layer's tests: a private platform root,
-// packages built as tar archives, their manifests, and a package server on
+// Scaffolding of the runtime's network tests: a private platform root,
+// packages built as tar archives, their manifests, and a store server on
 // 127.0.0.1 with range support and the failures a store can have.
 #pragma once
 
@@ -9,18 +9,15 @@
 #include <httplib.h>
 #include <netinet/in.h>
 #include <openssl/evp.h>
-#include <stdlib.h>
 #include <sys/socket.h>
 #include <sys/sysmacros.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
-#include <future>
 #include <map>
 #include <mutex>
 #include <optional>
@@ -31,7 +28,6 @@
 
 #include "platform/error/VendError.h"
 #include "platform/plist/PropertyListSerialization.h"
-#include "platform/value/PlistValue.h"
 #include "store-runtime/records/TillDownload.h"
 #include "store-runtime/runtime/VendRuntime.h"
 #include "tests/unit/ScopedEnvironment.h"
@@ -49,12 +45,11 @@ inline std::vector<std::string> chunkDigests(std::string_view bytes, std::size_t
     unsigned char digest[EVP_MAX_MD_SIZE];
     unsigned int length = 0;
     EVP_Digest(chunk.data(), chunk.size(), digest, &length, EVP_sha256(), nullptr);
-    std::string hex;
+    std::string& hex = digests.emplace_back();
     for (unsigned int i = 0; i < length; ++i) {
       hex += "0123456789abcdef"[digest[i] >> 4u];
       hex += "0123456789abcdef"[digest[i] & 0xfu];
     }
-    digests.push_back(std::move(hex));
   }
   return digests;
 }
@@ -67,6 +62,10 @@ inline std::string randomBytes(std::size_t size, unsigned seed) {
     std::memcpy(bytes.data() + offset, &word, std::min<std::size_t>(8, size - offset));
   }
   return bytes;
+}
+
+inline std::span<const std::uint8_t> bytesOf(std::string_view text) {
+  return {reinterpret_cast<const std::uint8_t*>(text.data()), text.size()};
 }
 
 inline std::string readFile(const fs::path& path) {
@@ -97,20 +96,18 @@ inline std::vector<std::string> treeOf(const fs::path& root) {
 // archive writer keeps names and link targets exactly as given.
 class TarBuilder {
  public:
-  TarBuilder& directory(const std::string& name) { return add(name, AE_IFDIR, 0755, "", "", ""); }
+  TarBuilder& directory(const std::string& name) { return add({name, AE_IFDIR, 0755}); }
   TarBuilder& file(const std::string& name, std::string contents, int mode = 0644) {
-    return add(name, AE_IFREG, mode, std::move(contents), "", "");
+    return add({name, AE_IFREG, mode, std::move(contents)});
   }
   TarBuilder& symlink(const std::string& name, const std::string& target) {
-    return add(name, AE_IFLNK, 0777, "", target, "");
+    return add({name, AE_IFLNK, 0777, "", target});
   }
   TarBuilder& hardlink(const std::string& name, const std::string& target) {
-    return add(name, AE_IFREG, 0644, "", "", target);
+    return add({name, AE_IFREG, 0644, "", "", target});
   }
-  TarBuilder& fifo(const std::string& name) { return add(name, AE_IFIFO, 0644, "", "", ""); }
-  TarBuilder& characterDevice(const std::string& name) {
-    return add(name, AE_IFCHR, 0644, "", "", "");
-  }
+  TarBuilder& fifo(const std::string& name) { return add({name, AE_IFIFO, 0644}); }
+  TarBuilder& characterDevice(const std::string& name) { return add({name, AE_IFCHR, 0644}); }
 
   [[nodiscard]] std::string bytes() const {
     archive* writer = archive_write_new();
@@ -144,15 +141,11 @@ class TarBuilder {
     std::string name;
     unsigned type;
     int mode;
-    std::string contents;
-    std::string linkTarget;
-    std::string hardlinkTarget;
+    std::string contents, linkTarget, hardlinkTarget;
   };
 
-  TarBuilder& add(std::string name, unsigned type, int mode, std::string contents,
-                  std::string target, std::string hardlinkTarget) {
-    entries_.push_back({std::move(name), type, mode, std::move(contents), std::move(target),
-                        std::move(hardlinkTarget)});
+  TarBuilder& add(Entry entry) {
+    entries_.push_back(std::move(entry));
     return *this;
   }
 
@@ -165,11 +158,11 @@ class TarBuilder {
 };
 
 inline std::string bundleInfo(const std::string& identifier, const std::string& version) {
-  PlistDictionary info{{"HostBundleIdentifier", identifier},
-                       {"HostBundleVersion", version},
-                       {"HostBundleShortVersionString", version},
-                       {"HostBundleExecutable", "run"}};
-  return PropertyListSerialization::writeXml(info);
+  return PropertyListSerialization::writeXml(
+      PlistDictionary{{"HostBundleIdentifier", identifier},
+                      {"HostBundleVersion", version},
+                      {"HostBundleShortVersionString", version},
+                      {"HostBundleExecutable", "run"}});
 }
 
 // A well-formed package: "<name>.app" with its information list, an
@@ -207,10 +200,10 @@ class PrivateRoot {
   PrivateRoot() {
     std::string pattern = (fs::temp_directory_path() / "larder-download-XXXXXX").string();
     base_ = fs::path(::mkdtemp(pattern.data()));
-    fs::create_directories(root() / "Applications");
-    fs::create_directories(home());
+    fs::create_directories(applications());
+    fs::create_directories(base_ / "home");
     environment_.set("LARDER_ROOT", root().string());
-    environment_.set("HOME", home().string());
+    environment_.set("HOME", (base_ / "home").string());
   }
   ~PrivateRoot() {
     environment_.restore();
@@ -221,7 +214,6 @@ class PrivateRoot {
   PrivateRoot& operator=(const PrivateRoot&) = delete;
 
   [[nodiscard]] fs::path root() const { return base_ / "root"; }
-  [[nodiscard]] fs::path home() const { return base_ / "home"; }
   [[nodiscard]] fs::path applications() const { return root() / "Applications"; }
   [[nodiscard]] fs::path downloads() const { return base_ / "cache/Downloads"; }
   [[nodiscard]] fs::path scratch() const { return base_ / "scratch"; }
@@ -240,9 +232,32 @@ class PrivateRoot {
   ScopedEnvironment environment_;
 };
 
-// Serves files on 127.0.0.1 with range requests, counts requests and can
-// fail the ways a store fails.
-class PackageServer {
+// A runtime of the test's own, in a private root, installed as the shared
+// one, so that operations, whose services come from the shared runtime,
+// reach what the test gives it. The next user makes a shared runtime from
+// the environment again.
+class SharedRuntime {
+ public:
+  explicit SharedRuntime(std::string bagURL = "") {
+    VendRuntimeConfiguration configuration = root_.configuration();
+    configuration.bagURL = std::move(bagURL);
+    runtime_ = std::make_shared<VendRuntime>(configuration);
+    VendRuntime::setShared(runtime_);
+  }
+  ~SharedRuntime() { VendRuntime::setShared(nullptr); }
+  SharedRuntime(const SharedRuntime&) = delete;
+  SharedRuntime& operator=(const SharedRuntime&) = delete;
+
+  [[nodiscard]] const std::shared_ptr<VendRuntime>& get() const { return runtime_; }
+
+ private:
+  PrivateRoot root_;
+  std::shared_ptr<VendRuntime> runtime_;
+};
+
+// Serves bodies on 127.0.0.1 with range requests, records every request
+// and can fail the ways a store fails.
+class StoreServer {
  public:
   enum class Fault {
     kNone,
@@ -253,8 +268,12 @@ class PackageServer {
     kGate,         // `gateBytes` of the file, then the rest once the gate opens
     kIgnoreRange,  // always the whole file with 200
   };
+  struct Seen {
+    std::string target;  // with the query
+    httplib::Headers headers;
+  };
 
-  PackageServer() {
+  StoreServer() {
     server_.Get(R"(/(.*))", [this](const httplib::Request& request, httplib::Response& response) {
       serve(request, response);
     });
@@ -263,22 +282,22 @@ class PackageServer {
     // `stop` is lost on a server whose accept loop has not begun yet.
     while (!server_.is_running()) std::this_thread::sleep_for(std::chrono::milliseconds(1));
   }
-  ~PackageServer() {
+  ~StoreServer() {
     {
       std::lock_guard lock(mutex_);
-      stopping_ = true;
-      gateOpen_ = true;
+      stopping_ = gateOpen_ = true;
     }
     changed_.notify_all();
     server_.stop();
     thread_.join();
   }
-  PackageServer(const PackageServer&) = delete;
-  PackageServer& operator=(const PackageServer&) = delete;
+  StoreServer(const StoreServer&) = delete;
+  StoreServer& operator=(const StoreServer&) = delete;
 
-  std::string add(const std::string& path, std::string bytes, Fault fault = Fault::kNone) {
+  std::string add(const std::string& path, std::string bytes, Fault fault = Fault::kNone,
+                  int status = 200) {
     std::lock_guard lock(mutex_);
-    resources_[path] = {std::move(bytes), fault};
+    resources_[path] = {std::move(bytes), fault, status};
     return url(path);
   }
   void setFault(const std::string& path, Fault fault) {
@@ -296,7 +315,7 @@ class PackageServer {
     }
     changed_.notify_all();
   }
-  // Waits until a gated transfer has sent its first part.
+  // Waits until a gated or stalled transfer has sent its first part.
   bool waitUntilGateReached(std::chrono::milliseconds limit) {
     std::unique_lock lock(mutex_);
     return changed_.wait_for(lock, limit, [this] { return gateReached_; });
@@ -305,22 +324,28 @@ class PackageServer {
   [[nodiscard]] std::string url(const std::string& path) const {
     return "http://127.0.0.1:" + std::to_string(port_) + path;
   }
-  [[nodiscard]] int requestCount(const std::string& path) const {
+  [[nodiscard]] std::vector<Seen> requests(const std::string& path) const {
     std::lock_guard lock(mutex_);
-    const auto found = counts_.find(path);
-    return found == counts_.end() ? 0 : found->second;
+    const auto found = seen_.find(path);
+    return found == seen_.end() ? std::vector<Seen>{} : found->second;
   }
-  [[nodiscard]] int totalRequests() const {
+  [[nodiscard]] std::size_t requestCount(const std::string& path) const {
+    return requests(path).size();
+  }
+  [[nodiscard]] std::size_t totalRequests() const {
     std::lock_guard lock(mutex_);
-    int total = 0;
-    for (const auto& [path, count] : counts_) total += count;
+    std::size_t total = 0;
+    for (const auto& [path, seen] : seen_) total += seen.size();
     return total;
   }
   // The Range header of each request for `path`, "" when there was none.
   [[nodiscard]] std::vector<std::string> rangeHeaders(const std::string& path) const {
-    std::lock_guard lock(mutex_);
-    const auto found = ranges_.find(path);
-    return found == ranges_.end() ? std::vector<std::string>{} : found->second;
+    std::vector<std::string> ranges;
+    for (const Seen& seen : requests(path)) {
+      const auto found = seen.headers.find("Range");
+      ranges.push_back(found == seen.headers.end() ? "" : found->second);
+    }
+    return ranges;
   }
 
   // A port on which nothing listens: connections to it are refused.
@@ -340,14 +365,14 @@ class PackageServer {
   struct Resource {
     std::string bytes;
     Fault fault = Fault::kNone;
+    int status = 200;
   };
 
   void serve(const httplib::Request& request, httplib::Response& response) {
     Resource resource;
     {
       std::lock_guard lock(mutex_);
-      counts_[request.path]++;
-      ranges_[request.path].push_back(request.get_header_value("Range"));
+      seen_[request.path].push_back({request.target, request.headers});
       const auto found = resources_.find(request.path);
       if (found == resources_.end()) {
         response.status = 404;
@@ -355,79 +380,59 @@ class PackageServer {
       }
       resource = found->second;
     }
+    auto shared = std::make_shared<std::string>(std::move(resource.bytes));
     switch (resource.fault) {
+      case Fault::kNone:
+      case Fault::kCorrupt:
+        if (resource.fault == Fault::kCorrupt) (*shared)[shared->size() / 2] ^= 0x5a;
+        response.status = resource.status;
+        response.set_content(*shared, "application/octet-stream");
+        return;
       case Fault::kStatus500:
         response.status = 500;
         response.set_content("the store is broken", "text/plain");
         return;
-      case Fault::kCorrupt:
-        resource.bytes[resource.bytes.size() / 2] ^= 0x5a;
-        break;
       case Fault::kIgnoreRange:
-        serveWhole(std::move(resource.bytes), response);
+        // A provider without length, which httplib does not cut to ranges.
+        response.set_chunked_content_provider(
+            "application/octet-stream", [shared](size_t offset, httplib::DataSink& sink) {
+              if (offset < shared->size())
+                sink.write(shared->data() + offset, shared->size() - offset);
+              else
+                sink.done();
+              return true;
+            });
         return;
       case Fault::kTruncate:
       case Fault::kStall:
       case Fault::kGate:
-        serveWithFault(std::move(resource), response);
-        return;
-      case Fault::kNone:
         break;
     }
-    response.set_content(std::move(resource.bytes), "application/octet-stream");
-  }
-
-  // The whole body from a provider that httplib does not cut to ranges.
-  static void serveWhole(std::string bytes, httplib::Response& response) {
-    auto shared = std::make_shared<std::string>(std::move(bytes));
-    response.set_chunked_content_provider(
-        "application/octet-stream", [shared](size_t offset, httplib::DataSink& sink) {
-          if (offset < shared->size())
-            sink.write(shared->data() + offset, shared->size() - offset);
-          else
-            sink.done();
-          return true;
-        });
-  }
-
-  void serveWithFault(Resource resource, httplib::Response& response) {
-    auto shared = std::make_shared<std::string>(std::move(resource.bytes));
-    const std::size_t size = shared->size();
     const Fault fault = resource.fault;
-    std::size_t gateBytes = 0;
-    {
-      std::lock_guard lock(mutex_);
-      gateBytes = gateBytes_;
-    }
+    const std::size_t cut = fault == Fault::kGate ? gateBytes() : shared->size() / 2;
     response.set_content_provider(
-        size, "application/octet-stream",
-        [this, shared, fault, gateBytes](size_t offset, size_t length, httplib::DataSink& sink) {
+        shared->size(), "application/octet-stream",
+        [this, shared, fault, cut](size_t offset, size_t length, httplib::DataSink& sink) {
           const std::size_t end = offset + length;
-          std::size_t cut = end;
-          if (fault == Fault::kTruncate || fault == Fault::kStall) cut = shared->size() / 2;
-          if (fault == Fault::kGate) cut = gateBytes;
           if (offset < cut) {
-            const std::size_t piece = std::min(end, cut) - offset;
-            sink.write(shared->data() + offset, piece);
-            return true;  // asked again from offset + piece
+            sink.write(shared->data() + offset, std::min(end, cut) - offset);
+            return true;  // asked again from where this piece ends
           }
           if (fault == Fault::kTruncate) return false;
-          if (fault == Fault::kStall || (fault == Fault::kGate && !isGateOpen())) {
-            std::unique_lock lock(mutex_);
-            gateReached_ = true;
-            changed_.notify_all();
-            changed_.wait(
-                lock, [this, fault] { return stopping_ || (fault == Fault::kGate && gateOpen_); });
-            if (stopping_) return false;
-          }
+          std::unique_lock lock(mutex_);
+          gateReached_ = true;
+          changed_.notify_all();
+          changed_.wait(lock, [&] { return stopping_ || (fault == Fault::kGate && gateOpen_); });
+          if (stopping_) return false;
+          lock.unlock();
           sink.write(shared->data() + offset, end - offset);
           return true;
         });
   }
 
-  bool isGateOpen() {
+  std::size_t gateBytes() {
     std::lock_guard lock(mutex_);
-    return gateOpen_;
+    return gateBytes_;
   }
 
   httplib::Server server_;
@@ -436,8 +441,7 @@ class PackageServer {
   mutable std::mutex mutex_;
   std::condition_variable changed_;
   std::map<std::string, Resource> resources_;
-  std::map<std::string, int> counts_;
-  std::map<std::string, std::vector<std::string>> ranges_;
+  std::map<std::string, std::vector<Seen>> seen_;
   std::size_t gateBytes_ = 0;
   bool gateOpen_ = false;
   bool gateReached_ = false;
@@ -470,7 +474,7 @@ inline std::shared_ptr<TillDownload> downloadFor(std::uint64_t itemIdentifier,
   return download;
 }
 
-// The one reply of a download, waited for.
+// The replies of a download, waited for.
 struct ReplyWaiter {
   struct Answer {
     bool success = false;
