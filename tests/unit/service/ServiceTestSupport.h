@@ -61,11 +61,6 @@ class LogCapture {
     });
   }
 
-  [[nodiscard]] std::vector<Line> lines() const {
-    std::lock_guard lock(mutex_);
-    return lines_;
-  }
-
   void clear() {
     std::lock_guard lock(mutex_);
     lines_.clear();
@@ -282,6 +277,34 @@ class ServiceTest : public ::testing::Test {
     result.liveQueries = false;
     result.periodicReload = false;
     return result;
+  }
+
+  // A record as discovery keeps it for an installed bundle; fields not
+  // given stay absent.
+  static LedgerSoftwareProductFields storedRecord(
+      const std::string& path, std::optional<std::string> identifier = std::nullopt,
+      std::optional<std::string> version = std::nullopt,
+      std::optional<std::uint64_t> item = std::nullopt,
+      std::optional<std::int64_t> versionIdentifier = std::nullopt) {
+    return {.bundlePath = path,
+            .bundleIdentifier = std::move(identifier),
+            .bundleVersion = std::move(version),
+            .itemIdentifier = item,
+            .versionIdentifier = versionIdentifier,
+            .installed = true,
+            .source = LedgerSoftwareProduct::kSourceRegistryOrPurchaseRecord};
+  }
+
+  // A map that holds exactly `records`, from its persisted store, and
+  // never looks at the application folders.
+  std::unique_ptr<SoftwareMap> mapWithRecords(
+      const std::vector<LedgerSoftwareProductFields>& records) {
+    std::string path = storePath("records");
+    writeBytes(path, archivedStore(records));
+    auto map = std::make_unique<SoftwareMap>(options(path, false));
+    map->waitUntilIdle();
+    EXPECT_EQ(map->allProducts().size(), records.size());
+    return map;
   }
 
   // An archived store holding `records` keyed by their paths.

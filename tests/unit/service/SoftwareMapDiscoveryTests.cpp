@@ -222,15 +222,9 @@ TEST_F(SoftwareMapDiscoveryTest, OnlyTheSourceDifferingIsNoChange) {
   std::string app =
       makeStoreBundle(rootApplications(), "Known", "com.example.known", "3.0", 21, 2100);
   // What discovery would read, but as the metadata query found it.
-  LedgerSoftwareProductFields remembered;
-  remembered.bundlePath = app;
-  remembered.bundleIdentifier = "com.example.known";
-  remembered.bundleVersion = "3.0";
-  remembered.itemIdentifier = 21;
-  remembered.versionIdentifier = 2100;
+  LedgerSoftwareProductFields remembered = storedRecord(app, "com.example.known", "3.0", 21, 2100);
   remembered.accountOpaqueID = "account-Known";
   remembered.purchaseDate = PlistDate{1600000000.0};
-  remembered.installed = true;
   remembered.source = LedgerSoftwareProduct::kSourceMetadataQuery;
   writeBytes(storePath(), archivedStore({remembered}));
 

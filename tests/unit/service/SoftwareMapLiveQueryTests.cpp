@@ -66,12 +66,9 @@ TEST_F(SoftwareMapLiveQueryTest, AnAnnouncedReplacementBringsTheNewVersionWithou
 TEST_F(SoftwareMapLiveQueryTest, AnOverflowRestartsTheQueriesAndTheirResultsRepairTheMap) {
   makeStoreBundle(rootApplications(), "Before", "com.example.before", "1.0", 31);
   LogCapture log;
-  SoftwareMap::Options options = this->options(storePath("live"), true);
-  options.liveQueries = true;
-  SoftwareMap map(options);
-  ASSERT_TRUE(
-      eventually([&] { return log.countContaining("MetadataQuery initial load took") >= 2; }));
-
+  std::unique_ptr<SoftwareMap> live = startLiveMap(log);
+  ASSERT_FALSE(HasFailure());
+  SoftwareMap& map = *live;
   map.simulateMetadataQueryOverflowForTesting();
   ASSERT_TRUE(eventually([&] {
     return log.countContaining("Received serverPortInvalid from MetadataQuery. Reinitializing.") >=

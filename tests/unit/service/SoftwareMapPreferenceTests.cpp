@@ -216,25 +216,17 @@ TEST_F(SoftwareMapPreferenceTest, RememberedCopyThatIsGoneLosesToUpdatableLowerV
     std::string present = makeStoreBundle(volumeApplications("D"), "G" + std::to_string(i),
                                           identifier, "1.0", 500 + i);
     std::string gone = rootApplications() + "/G" + std::to_string(i) + ".app";
-    for (const auto& [path, version] : {std::pair{present, "1.0"}, std::pair{gone, "8.0"}}) {
-      LedgerSoftwareProductFields fields;
-      fields.bundlePath = path;
-      fields.bundleIdentifier = identifier;
-      fields.bundleVersion = version;
-      fields.itemIdentifier = static_cast<std::uint64_t>(500 + i);
-      fields.installed = true;
-      fields.source = LedgerSoftwareProduct::kSourceRegistryOrPurchaseRecord;
-      records.push_back(fields);
-    }
+    const auto item = static_cast<std::uint64_t>(500 + i);
+    records.push_back(storedRecord(present, identifier, "1.0", item));
+    records.push_back(storedRecord(gone, identifier, "8.0", item));
     winnerAndLoser.emplace_back(present, gone);
   }
-  writeBytes(storePath(), archivedStore(records));
-  SoftwareMap map(options(storePath(), false));
+  std::unique_ptr<SoftwareMap> map = mapWithRecords(records);
   for (int i = 0; i < kPairsPerLayout; ++i) {
     const auto& [present, gone] = winnerAndLoser[static_cast<std::size_t>(i)];
     LogCapture log;
     LedgerSoftwareProductRef byBundle =
-        map.productForBundleIdentifier("com.example.gone" + std::to_string(i));
+        map->productForBundleIdentifier("com.example.gone" + std::to_string(i));
     ASSERT_NE(byBundle, nullptr);
     EXPECT_EQ(byBundle->bundlePath(), present);
     EXPECT_TRUE(log.hasOnce("SoftwareMap: Preferring (updatable) app version 1.0 at " + present +
@@ -242,7 +234,7 @@ TEST_F(SoftwareMapPreferenceTest, RememberedCopyThatIsGoneLosesToUpdatableLowerV
                             1));
     // The item identifier index follows the same preference.
     LedgerSoftwareProductRef byItem =
-        map.productForItemIdentifier(static_cast<std::uint64_t>(500 + i));
+        map->productForItemIdentifier(static_cast<std::uint64_t>(500 + i));
     ASSERT_NE(byItem, nullptr);
     EXPECT_EQ(byItem->bundlePath(), present);
     EXPECT_EQ(log.countContaining("multiple matches for " + std::to_string(500 + i) + " found", 1),

@@ -26,16 +26,12 @@ constexpr const char* kEmptySummaryLine =
 class SoftwareMapStoreTest : public ServiceTest {
  protected:
   LedgerSoftwareProductFields record(int index) const {
-    LedgerSoftwareProductFields fields;
-    fields.bundlePath = rootApplications() + "/Stored" + std::to_string(index) + ".app";
-    fields.bundleIdentifier = "com.example.stored" + std::to_string(index);
-    fields.bundleVersion = "1." + std::to_string(index);
-    fields.itemIdentifier = static_cast<std::uint64_t>(7000 + index);
-    fields.versionIdentifier = 100 + index;
-    fields.accountOpaqueID = "acct" + std::to_string(index);
+    const std::string n = std::to_string(index);
+    LedgerSoftwareProductFields fields =
+        storedRecord(rootApplications() + "/Stored" + n + ".app", "com.example.stored" + n,
+                     "1." + n, static_cast<std::uint64_t>(7000 + index), 100 + index);
+    fields.accountOpaqueID = "acct" + n;
     fields.purchaseDate = PlistDate{1400000000.0 + index};
-    fields.installed = true;
-    fields.source = LedgerSoftwareProduct::kSourceRegistryOrPurchaseRecord;
     return fields;
   }
 

@@ -58,14 +58,9 @@ TEST_F(UpdateQueueTest, ACheckReportsTheInstalledSoftwareAndTheAnswerSurvivesARe
   ASSERT_TRUE(result.incompatible);
   EXPECT_EQ(identifiersOf(*result.incompatible), (std::vector<std::uint64_t>{103}));
 
+  // The body's installed list and headers are the bag's business, below.
   ASSERT_EQ(store_.requestCount(), 1U);
-  const UpdateStoreStub::Request request = store_.requests().front();
-  // No compression switch in the bag: a plain body without the headers.
-  EXPECT_EQ(request.contentEncoding, "");
-  EXPECT_EQ(request.contentType, "");
-  const PlistDictionary body = parseBody(request.body);
-  EXPECT_EQ(reportedWareIDs(body), (std::vector<std::string>{"101", "102"}));
-  EXPECT_FALSE(body.contains("bundled-software"));
+  EXPECT_FALSE(parseBody(store_.requests().front().body).contains("bundled-software"));
 
   auto restarted = makeQueue();
   EXPECT_EQ(identifiersOf(*restarted->availableUpdates()), (std::vector<std::uint64_t>{101, 102}));
@@ -356,7 +351,12 @@ TEST_F(CachedUpdateQueueTest, LookupsAndMarksFollowTheListOrder) {
   const auto firstDate =
       queue->availableUpdateWithItemIdentifier(103)->firstAutoUpdateAttemptDate();
   ASSERT_TRUE(firstDate);
-  std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  // A second attempt stamped with the clock must be able to differ from
+  // the first, or keeping the first date would be indistinguishable.
+  ASSERT_TRUE(eventually([&] {
+    return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch())
+               .count() > firstDate->secondsSince1970;
+  }));
   queue->setAutoUpdateAbortCode(2, 103);
   auto record = queue->availableUpdateWithItemIdentifier(103);
   EXPECT_EQ(record->autoUpdateAbortCode(), 2);
