@@ -135,55 +135,53 @@ TEST_F(SoftwareMapStoreTest, LaterMapAnswersFromWhatDiscoveryStored) {
 TEST_F(SoftwareMapStoreTest, DamagedStoresGiveAnEmptyMap) {
   PlistData good = archivedStore(records(3));
   ASSERT_GT(good.size(), 64U);
-  for (std::size_t length : {std::size_t{1}, std::size_t{8}, std::size_t{9}, good.size() / 3,
-                             good.size() / 2, good.size() - 33, good.size() - 1}) {
-    PlistData truncated(good.begin(), good.begin() + static_cast<std::ptrdiff_t>(length));
-    expectEmptyMapFrom(truncated, "truncated-" + std::to_string(length), kNoDictionaryLine, 1);
-  }
-
+  auto archived = [](const PlistValue& root) { return KeyedArchive::archivedData(root); };
+  auto bytesOf = [](const std::string& text) { return PlistData(text.begin(), text.end()); };
   std::mt19937 generator(20240611);
   PlistData noise(4096);
   for (auto& byte : noise) byte = static_cast<std::uint8_t>(generator());
-  expectEmptyMapFrom(noise, "noise", kNoDictionaryLine, 1);
-  // Noise behind a valid header and a valid trailer's worth of bytes.
+  // Noise behind a valid header.
   PlistData headed = noise;
   std::copy_n(good.begin(), 8, headed.begin());
-  expectEmptyMapFrom(headed, "headed-noise", kNoDictionaryLine, 1);
   // The real store with its middle scrambled.
   PlistData scrambled = good;
   for (std::size_t i = scrambled.size() / 4; i < scrambled.size() / 2; ++i) {
     scrambled[i] = static_cast<std::uint8_t>(generator());
   }
-  expectEmptyMapFrom(scrambled, "scrambled", kNoDictionaryLine, 1);
-
   PlistDictionary evil = KeyedArchive::record("Evil");
   evil.emplace("bundlePath", rootApplications() + "/Evil.app");
-  PlistDictionary byPath;
-  byPath.emplace(record(0).bundlePath, LedgerSoftwareProduct(record(0)).encodeWithCoder());
-  byPath.emplace(rootApplications() + "/Evil.app", evil);
-  expectEmptyMapFrom(KeyedArchive::archivedData(KeyedArchive::dictionary(
-                         {{"appsByPath", KeyedArchive::dictionary(std::move(byPath))}})),
-                     "evil-class", kNoDictionaryLine, 1);
+  PlistDictionary byPath{{record(0).bundlePath, LedgerSoftwareProduct(record(0)).encodeWithCoder()},
+                         {rootApplications() + "/Evil.app", evil}};
 
-  expectEmptyMapFrom(KeyedArchive::archivedData(
-                         KeyedArchive::array({LedgerSoftwareProduct(record(0)).encodeWithCoder()})),
-                     "array-root", kNoDictionaryLine, 1);
-  expectEmptyMapFrom(KeyedArchive::archivedData(PlistArray{"plain"}), "plain-array-root",
-                     kNoDictionaryLine, 1);
-  expectEmptyMapFrom(KeyedArchive::archivedData(KeyedArchive::dictionary({{"appsByPath", "text"}})),
-                     "string-entry", kNoDictionaryLine, 1);
-  expectEmptyMapFrom(KeyedArchive::archivedData(KeyedArchive::dictionary({{"other", "text"}})),
-                     "no-entry", kNoDictionaryLine, 1);
-  expectEmptyMapFrom(
-      PropertyListSerialization::writeBinary(PlistDictionary{{"appsByPath", PlistDictionary{}}}),
-      "not-an-archive", kNoDictionaryLine, 1);
-  PlistData xml;
-  std::string text = PropertyListSerialization::writeXml(PlistDictionary{{"appsByPath", 1}});
-  xml.assign(text.begin(), text.end());
-  expectEmptyMapFrom(xml, "xml", kNoDictionaryLine, 1);
-
-  expectEmptyMapFrom(PlistData{}, "empty", kNotFoundLine, 2);
-  expectEmptyMapFrom(std::nullopt, "missing", kNotFoundLine, 2);
+  struct Case {
+    std::string name;
+    std::optional<PlistData> bytes;  // nullopt: no file
+    const char* line = kNoDictionaryLine;
+    int level = 1;
+  };
+  std::vector<Case> cases{
+      {"noise", noise},
+      {"headed-noise", headed},
+      {"scrambled", scrambled},
+      {"evil-class", archived(KeyedArchive::dictionary(
+                         {{"appsByPath", KeyedArchive::dictionary(std::move(byPath))}}))},
+      {"array-root",
+       archived(KeyedArchive::array({LedgerSoftwareProduct(record(0)).encodeWithCoder()}))},
+      {"plain-array-root", archived(PlistArray{"plain"})},
+      {"string-entry", archived(KeyedArchive::dictionary({{"appsByPath", "text"}}))},
+      {"no-entry", archived(KeyedArchive::dictionary({{"other", "text"}}))},
+      {"not-an-archive",
+       PropertyListSerialization::writeBinary(PlistDictionary{{"appsByPath", PlistDictionary{}}})},
+      {"xml", bytesOf(PropertyListSerialization::writeXml(PlistDictionary{{"appsByPath", 1}}))},
+      {"empty", PlistData{}, kNotFoundLine, 2},
+      {"missing", std::nullopt, kNotFoundLine, 2},
+  };
+  for (std::size_t length : {std::size_t{1}, std::size_t{8}, std::size_t{9}, good.size() / 3,
+                             good.size() / 2, good.size() - 33, good.size() - 1}) {
+    cases.push_back({"truncated-" + std::to_string(length),
+                     PlistData(good.begin(), good.begin() + static_cast<std::ptrdiff_t>(length))});
+  }
+  for (const Case& c : cases) expectEmptyMapFrom(c.bytes, c.name, c.line, c.level);
 }
 
 TEST_F(SoftwareMapStoreTest, DamagedStoreIsReplacedByTheNextDiscovery) {
