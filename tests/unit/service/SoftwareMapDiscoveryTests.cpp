@@ -285,8 +285,7 @@ TEST_F(SoftwareMapDiscoveryTest, IconComesFromTheChosenBundlesResources) {
 
 // The service makes its map and starts accepting clients at once; a client
 // that registers while the store is still loading must still hear about
-// what the first discovery finds. Disabled while the load still empties
-// the observer table when it starts.
+// what the first discovery finds.
 TEST_F(SoftwareMapDiscoveryTest, ObserverAddedDuringTheLoadHearsTheDiscovery) {
   std::vector<LedgerSoftwareProductFields> stored;
   for (int i = 0; i < 2000; ++i) {

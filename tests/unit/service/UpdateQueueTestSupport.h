@@ -100,7 +100,7 @@ class UpdateQueueTest : public ServiceTest {
                                          std::move(delegate), *map_);
   }
 
-  static CheckResult check(UpdateQueue& queue) {
+  static std::future<CheckResult> startCheck(UpdateQueue& queue) {
     auto result = std::make_shared<std::promise<CheckResult>>();
     std::future<CheckResult> future = result->get_future();
     queue.checkForUpdatesWithCompletionHandler(
@@ -109,6 +109,11 @@ class UpdateQueueTest : public ServiceTest {
                  const OptionalError& error) {
           result->set_value({success, available, incompatible, error});
         });
+    return future;
+  }
+
+  static CheckResult check(UpdateQueue& queue) {
+    std::future<CheckResult> future = startCheck(queue);
     if (future.wait_for(std::chrono::seconds(20)) != std::future_status::ready) {
       ADD_FAILURE() << "the check never ended";
       return {};

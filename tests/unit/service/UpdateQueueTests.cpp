@@ -121,19 +121,10 @@ TEST_F(UpdateQueueTest, CallersDuringACheckJoinItAndShareItsAnswer) {
   store_.hold();
   auto queue = makeQueue();
   constexpr int kCallers = 10;
-  std::vector<std::future<CheckResult>> results;
+  std::vector<std::future<CheckResult>> results(kCallers);
   std::vector<std::thread> callers;
-  for (int i = 0; i < kCallers; ++i) {
-    auto promise = std::make_shared<std::promise<CheckResult>>();
-    results.push_back(promise->get_future());
-    callers.emplace_back([queue, promise] {
-      queue->checkForUpdatesWithCompletionHandler(
-          [promise](bool success, const UpdateQueue::UpdateList& available,
-                    const std::optional<UpdateQueue::UpdateList>& incompatible,
-                    const OptionalError& error) {
-            promise->set_value({success, available, incompatible, error});
-          });
-    });
+  for (auto& result : results) {
+    callers.emplace_back([queue, &result] { result = startCheck(*queue); });
   }
   for (std::thread& caller : callers) caller.join();
   // A caller without a handler joins too and starts nothing.
