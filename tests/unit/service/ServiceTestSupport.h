@@ -60,54 +60,44 @@ class LogCapture {
       lines_.push_back({level, line});
     });
   }
-
   void clear() {
     std::lock_guard lock(mutex_);
     lines_.clear();
   }
-
-  // Lines equal to `text`, at `level` (any level when 0).
+  // Lines equal to / holding `text`, at `level` (any level when 0).
   [[nodiscard]] std::size_t countExactly(std::string_view text, int level = 0) const {
-    std::lock_guard lock(mutex_);
-    return static_cast<std::size_t>(std::count_if(lines_.begin(), lines_.end(), [&](const Line& l) {
-      return l.text == text && (level == 0 || l.level == level);
-    }));
+    return linesWhere([&](const Line& l) { return l.text == text; }, level).size();
   }
-
-  // Exactly one line equal to `text` (at `level`, any when 0); on failure
-  // the message shows the whole log.
+  [[nodiscard]] std::size_t countContaining(std::string_view fragment, int level = 0) const {
+    return linesContaining(fragment, level).size();
+  }
+  [[nodiscard]] std::vector<Line> linesContaining(std::string_view fragment, int level = 0) const {
+    return linesWhere([&](const Line& l) { return l.text.find(fragment) != l.text.npos; }, level);
+  }
+  // Exactly one line equal to `text`; on failure the message shows the log.
   [[nodiscard]] ::testing::AssertionResult hasOnce(std::string_view text, int level = 0) const {
     const std::size_t count = countExactly(text, level);
     if (count == 1) return ::testing::AssertionSuccess();
     return ::testing::AssertionFailure() << count << " lines \"" << text << "\" in:\n" << dump();
   }
-
-  [[nodiscard]] std::size_t countContaining(std::string_view fragment, int level = 0) const {
-    std::lock_guard lock(mutex_);
-    return static_cast<std::size_t>(std::count_if(lines_.begin(), lines_.end(), [&](const Line& l) {
-      return l.text.find(fragment) != std::string::npos && (level == 0 || l.level == level);
-    }));
-  }
-
-  [[nodiscard]] std::vector<Line> linesContaining(std::string_view fragment) const {
-    std::lock_guard lock(mutex_);
-    std::vector<Line> found;
-    for (const Line& line : lines_) {
-      if (line.text.find(fragment) != std::string::npos) found.push_back(line);
-    }
-    return found;
-  }
-
-  // For failure messages.
   [[nodiscard]] std::string dump() const {
-    std::lock_guard lock(mutex_);
     std::string text;
-    for (const Line& line : lines_)
+    for (const Line& line : linesWhere([](const Line&) { return true; }, 0))
       text += "[" + std::to_string(line.level) + "] " + line.text + "\n";
     return text;
   }
 
  private:
+  template <typename Predicate>
+  std::vector<Line> linesWhere(Predicate predicate, int level) const {
+    std::lock_guard lock(mutex_);
+    std::vector<Line> found;
+    for (const Line& line : lines_) {
+      if (predicate(line) && (level == 0 || line.level == level)) found.push_back(line);
+    }
+    return found;
+  }
+
   mutable std::mutex mutex_;
   std::vector<Line> lines_;
   std::shared_ptr<void> handle_;
@@ -133,11 +123,6 @@ class RecordingObserver final : public VendSoftwareMapObserver {
   [[nodiscard]] std::vector<Call> calls() const {
     std::lock_guard lock(mutex_);
     return calls_;
-  }
-
-  void clear() {
-    std::lock_guard lock(mutex_);
-    calls_.clear();
   }
 
  private:
@@ -166,8 +151,7 @@ struct Purchase {
   }
 };
 
-// Plain writes: the fixtures need no crash safety, and flushing every
-// file to disk would cost more than the tests themselves.
+// Plain writes: the fixtures need no crash safety.
 inline void writeText(const std::string& path, std::string_view text) {
   fs::create_directories(fs::path(path).parent_path());
   std::ofstream file(path, std::ios::binary | std::ios::trunc);
