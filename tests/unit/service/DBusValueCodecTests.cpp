@@ -114,36 +114,32 @@ std::map<std::string, std::string> variantTypes(const PlistDictionary& dictionar
   return types;
 }
 
-TEST(DBusValueCodec, UnsignedFieldsOfRecordsTravelAsUInt64) {
-  const auto types = variantTypes({{"itemIdentifier", 5},
+// Identifiers of records travel as uint64, store versions as int64, dates
+// as seconds.
+TEST(DBusValueCodec, VariantsCarryNaturalTypesAndIdentifiersAreUnsigned) {
+  const PlistDictionary dictionary{{"itemIdentifier", 5},
                                    {"accountID", std::uint64_t{7}},
                                    {"ware-id", 409183694},
                                    {"versionIdentifier", 5},
-                                   {"itemIdentifierText", 5}});
-  EXPECT_EQ(types.at("itemIdentifier"), "t");
-  EXPECT_EQ(types.at("accountID"), "t");
-  EXPECT_EQ(types.at("ware-id"), "t");
-  EXPECT_EQ(types.at("versionIdentifier"), "x") << "store versions are int64";
-  EXPECT_EQ(types.at("itemIdentifierText"), "x");
-  // The values read back unchanged.
-  const PlistDictionary product{{"itemIdentifier", 5}, {"bundleIdentifier", "com.example.a"}};
-  const PlistArray products{PlistValue(PlistArray{product})};
-  EXPECT_EQ(roundTrip("aa{sv}", products), products);
-}
-
-TEST(DBusValueCodec, VariantsCarryNaturalTypes) {
-  PlistDictionary dictionary{{"date", PlistDate{1700000000.5}},
-                             {"small", std::uint64_t{5}},
-                             {"integer", 5},
-                             {"real", 5.0},
-                             {"flag", false}};
+                                   {"itemIdentifierText", 5},
+                                   {"date", PlistDate{1700000000.5}},
+                                   {"real", 5.0},
+                                   {"flag", false}};
+  EXPECT_EQ(variantTypes(dictionary),
+            (std::map<std::string, std::string>{{"itemIdentifier", "t"},
+                                                {"accountID", "t"},
+                                                {"ware-id", "t"},
+                                                {"versionIdentifier", "x"},
+                                                {"itemIdentifierText", "x"},
+                                                {"date", "d"},
+                                                {"real", "d"},
+                                                {"flag", "b"}}));
   PlistArray read = roundTrip("a{sv}", {dictionary});
-  ASSERT_EQ(read.size(), 1U);
-  EXPECT_EQ(read[0]["date"], PlistValue(1700000000.5)) << "dates travel as seconds";
-  EXPECT_EQ(read[0]["small"].type(), PlistValue::Type::Integer);
-  EXPECT_EQ(read[0]["integer"], PlistValue(5));
-  EXPECT_EQ(read[0]["real"].type(), PlistValue::Type::Real);
-  EXPECT_EQ(read[0]["flag"], PlistValue(false));
+  EXPECT_EQ(read[0]["date"], PlistValue(1700000000.5));
+  // A small unsigned value that is no identifier reads back as an integer.
+  EXPECT_EQ(roundTrip("a{sv}", {PlistDictionary{{"small", std::uint64_t{5}}}})[0]["small"].type(),
+            PlistValue::Type::Integer);
+  EXPECT_EQ(read[0]["itemIdentifier"], PlistValue(5));
 
   for (const auto& [value, signature] :
        {std::pair{PlistValue("s"), "s"}, std::pair{PlistValue(), "s"},

@@ -80,53 +80,35 @@ TEST_F(SoftwareMapStoreTest, LaterMapAnswersFromWhatDiscoveryStored) {
       makeBundle(rootApplications() + "/Utilities", "Setup", "com.orvane.SetupHerald.Helper", "5.0",
                  std::nullopt, "512");
 
-  std::vector<LedgerSoftwareProductFields> discovered;
+  LedgerSoftwareProductFields n =
+      storedRecord(numericPath, "com.example.numeric", "2.4.1", 5551, 88);
+  n.accountOpaqueID = "opaque-numeric";
+  n.purchaseDate = PlistDate{1300000000.0};
+  std::vector<LedgerSoftwareProductFields> expected{
+      storedRecord(installerPath, "com.orvane.SetupHerald.Helper", "512"), n,
+      storedRecord(textualPath, "com.example.textual", "1.0", 1234567890123U, 42)};
+  const auto byPath = [](const auto& a, const auto& b) { return a.bundlePath < b.bundlePath; };
+  std::sort(expected.begin(), expected.end(), byPath);
+  const auto snapshots = [&](SoftwareMap& map) {
+    std::vector<LedgerSoftwareProductFields> fields;
+    for (const auto& product : map.allProducts()) fields.push_back(product->snapshot());
+    std::sort(fields.begin(), fields.end(), byPath);
+    return fields;
+  };
   {
     SoftwareMap first(options(storePath(), true));
     first.waitUntilIdle();
-    ASSERT_EQ(first.allProducts().size(), 3U);
-    for (const auto& product : first.allProducts()) discovered.push_back(product->snapshot());
+    ASSERT_TRUE(snapshots(first) == expected) << "discovery read other values";
   }
-  ASSERT_TRUE(std::filesystem::exists(storePath()));
-
-  // What discovery read, field by field.
-  auto fieldsAt = [&](const std::string& path) {
-    auto found = std::find_if(discovered.begin(), discovered.end(),
-                              [&](const auto& fields) { return fields.bundlePath == path; });
-    return found == discovered.end() ? LedgerSoftwareProductFields{} : *found;
-  };
-  LedgerSoftwareProductFields n = fieldsAt(numericPath);
-  EXPECT_EQ(n.bundleIdentifier, "com.example.numeric");
-  EXPECT_EQ(n.bundleVersion, "2.4.1");
-  EXPECT_EQ(n.itemIdentifier, 5551U);
-  EXPECT_EQ(n.versionIdentifier, 88);
-  EXPECT_EQ(n.accountOpaqueID, "opaque-numeric");
-  EXPECT_EQ(n.purchaseDate, PlistDate{1300000000.0});
-  EXPECT_TRUE(n.installed);
-  EXPECT_EQ(n.source, LedgerSoftwareProduct::kSourceRegistryOrPurchaseRecord);
-  LedgerSoftwareProductFields t = fieldsAt(textualPath);
-  EXPECT_EQ(t.itemIdentifier, 1234567890123U);
-  EXPECT_EQ(t.versionIdentifier, 42);
-  EXPECT_EQ(t.accountOpaqueID, std::nullopt);
-  EXPECT_EQ(t.purchaseDate, std::nullopt);
-  LedgerSoftwareProductFields s = fieldsAt(installerPath);
-  EXPECT_EQ(s.bundleIdentifier, "com.orvane.SetupHerald.Helper");
-  EXPECT_EQ(s.bundleVersion, "512");
-  EXPECT_EQ(s.itemIdentifier, std::nullopt);
-
   // A second process, without discovery, gives the same answers.
   SoftwareMap second(options(storePath(), false));
-  std::vector<std::string> expectedPaths{installerPath, numericPath, textualPath};
-  std::sort(expectedPaths.begin(), expectedPaths.end());
-  EXPECT_EQ(pathsOf(second.allProducts()), expectedPaths);
-  for (const LedgerSoftwareProductFields& fields : discovered) {
-    ASSERT_TRUE(fields.bundleIdentifier);
+  EXPECT_TRUE(snapshots(second) == expected);
+  for (const LedgerSoftwareProductFields& fields : expected) {
     LedgerSoftwareProductRef loaded = second.productForBundleIdentifier(*fields.bundleIdentifier);
     ASSERT_NE(loaded, nullptr) << *fields.bundleIdentifier;
-    EXPECT_EQ(loaded->snapshot(), fields) << loaded->description();
     if (fields.itemIdentifier) {
-      LedgerSoftwareProductRef byItem = second.productForItemIdentifier(*fields.itemIdentifier);
-      EXPECT_EQ(byItem, loaded) << "both indexes hold the same record";
+      EXPECT_EQ(second.productForItemIdentifier(*fields.itemIdentifier), loaded)
+          << "both indexes hold the same record";
     }
   }
   EXPECT_EQ(second.productForItemIdentifier(0), nullptr);
@@ -300,15 +282,10 @@ TEST_F(SoftwareMapStoreTest, StartRemovesStaleTemporariesAndAFailedWriteIsNotRep
 TEST_F(SoftwareMapStoreTest, LookupRightAfterConstructionWaitsForTheLoad) {
   constexpr int kRecords = 5000;
   std::vector<LedgerSoftwareProductFields> many;
-  many.reserve(kRecords);
   for (int i = 0; i < kRecords; ++i) {
-    LedgerSoftwareProductFields fields;
-    fields.bundlePath = "/Applications/Bulk" + std::to_string(i) + ".app";
-    fields.bundleIdentifier = "com.example.bulk" + std::to_string(i);
-    fields.bundleVersion = "1.0";
-    fields.itemIdentifier = static_cast<std::uint64_t>(900000 + i);
-    fields.installed = true;
-    many.push_back(std::move(fields));
+    const std::string n = std::to_string(i);
+    many.push_back(
+        storedRecord("/Applications/Bulk" + n + ".app", "com.example.bulk" + n, "1.0", 900000 + i));
   }
   writeBytes(storePath(), archivedStore(many));
   // Detail logging would describe every record; the barrier is the subject.
