@@ -36,6 +36,10 @@ struct PreferenceCase {
   std::vector<Layout> layouts;
 };
 
+void PrintTo(const PreferenceCase& preference, std::ostream* out) {
+  *out << preference.name;
+}
+
 constexpr int kPairsPerLayout = 6;
 
 class PreferenceRuleTest : public ServiceTest,

@@ -368,49 +368,29 @@ TEST_F(SoftwareMapUpdateBodyTest, TheConditionAloneAlsoBringsTheBundledList) {
   auto map = mapWithRecords({record});
   const PlistArray local{
       PlistDictionary{{"ware-id", "42"}, {"HostBundleIdentifier", "com.example.only"}}};
-  const PlistArray bundled = manifestEntries();
+  const PlistArray bundledList = manifestEntries();
 
-  struct Case {
-    BodyRequest request;
+  // The condition brings the bundled list as asking for it does.
+  const std::tuple<bool, bool, bool> rows[] = {{false, false, true}, {true, false, true},
+                                               {true, true, true},   {true, true, false},
+                                               {true, false, false}, {false, false, false}};
+  for (const auto& [installed, bundled, conditionally] : rows) {
+    const std::string flags = "installed: " + std::to_string(installed) +
+                              "; bundled: " + std::to_string(bundled) +
+                              "; conditional: " + std::to_string(conditionally);
+    SCOPED_TRACE(flags);
     PlistDictionary expected;
-    bool touchesHadBundledApps;
-    std::string logLine;
-  };
-  const std::vector<Case> cases{
-      {{.conditionally = true},
-       {{"bundled-software", bundled}},
-       true,
-       "installed: 0; bundled: 0; conditional: 1"},
-      {{.installed = true, .conditionally = true},
-       {{"local-software", local}, {"bundled-software", bundled}},
-       true,
-       "installed: 1; bundled: 0; conditional: 1"},
-      {{.installed = true, .bundled = true, .conditionally = true},
-       {{"local-software", local}, {"bundled-software", bundled}},
-       true,
-       "installed: 1; bundled: 1; conditional: 1"},
-      {{.installed = true, .bundled = true},
-       {{"local-software", local}, {"bundled-software", bundled}},
-       true,
-       "installed: 1; bundled: 1; conditional: 0"},
-      {{.installed = true},
-       {{"local-software", local}},
-       false,
-       "installed: 1; bundled: 0; conditional: 0"},
-      {{}, {}, false, "installed: 0; bundled: 0; conditional: 0"},
-  };
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.logLine);
+    if (installed) expected.emplace("local-software", local);
+    if (bundled || conditionally) expected.emplace("bundled-software", bundledList);
     LogCapture log;
     Body body;
     body.hadBundledApps = false;
-    body.data =
-        map->updateRequestBodyData(&body.compressed, c.request.installed, c.request.bundled,
-                                   c.request.conditionally, &body.hadBundledApps, false, {});
-    EXPECT_EQ(parsedBody(body), c.expected);
-    EXPECT_EQ(body.hadBundledApps, c.touchesHadBundledApps)
+    body.data = map->updateRequestBodyData(&body.compressed, installed, bundled, conditionally,
+                                           &body.hadBundledApps, false, {});
+    EXPECT_EQ(parsedBody(body), expected);
+    EXPECT_EQ(body.hadBundledApps, bundled || conditionally)
         << "set to true when the list is made, and only then";
-    EXPECT_TRUE(log.hasOnce("SoftwareMap: " + c.logLine, 2));
+    EXPECT_TRUE(log.hasOnce("SoftwareMap: " + flags, 2));
   }
 }
 
