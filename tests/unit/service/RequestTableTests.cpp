@@ -2,6 +2,7 @@
 // run against.
 #include <gtest/gtest.h>
 
+#include <array>
 #include <fstream>
 #include <map>
 #include <set>
@@ -127,17 +128,19 @@ std::string attributeOf(const std::string& line, const std::string& attribute) {
   return line.substr(at, line.find('"', at) - at);
 }
 
-struct CommittedMethod {
-  std::string inTypes, outTypes, inNames, outNames;
-};
+// A method as "in types (in names) -> out types (out names)".
+std::string methodText(std::string_view inTypes, std::string_view inNames,
+                       std::string_view outTypes, std::string_view outNames) {
+  return std::string(inTypes) + " (" + std::string(inNames) + ") -> " + std::string(outTypes) +
+         " (" + std::string(outNames) + ")";
+}
 
-// The methods of the service interface as the committed file declares
-// them: argument types run together, argument names comma separated.
-std::map<std::string, CommittedMethod> committedServiceMethods(const std::string& xml) {
-  std::map<std::string, CommittedMethod> methods;
+// The methods of the service interface as the committed file declares them.
+std::map<std::string, std::string> committedServiceMethods(const std::string& xml) {
+  std::map<std::string, std::array<std::string, 4>> methods;  // types and names, in and out
   std::stringstream lines(xml);
   bool inService = false;
-  CommittedMethod* method = nullptr;
+  std::array<std::string, 4>* method = nullptr;
   for (std::string line; std::getline(lines, line);) {
     if (line.find("<interface ") != std::string::npos) {
       inService = attributeOf(line, "name") == ServiceRequests::kInterfaceName;
@@ -146,13 +149,15 @@ std::map<std::string, CommittedMethod> committedServiceMethods(const std::string
       EXPECT_FALSE(methods.contains(name)) << name << " declared twice";
       method = &methods[name];
     } else if (inService && method && line.find("<arg ") != std::string::npos) {
-      const bool in = attributeOf(line, "direction") == "in";
-      std::string& names = in ? method->inNames : method->outNames;
+      const std::size_t out = attributeOf(line, "direction") == "in" ? 0 : 2;
+      (*method)[out] += attributeOf(line, "type");
+      std::string& names = (*method)[out + 1];
       names += (names.empty() ? "" : ",") + attributeOf(line, "name");
-      (in ? method->inTypes : method->outTypes) += attributeOf(line, "type");
     }
   }
-  return methods;
+  std::map<std::string, std::string> texts;
+  for (const auto& [name, m] : methods) texts[name] = methodText(m[0], m[1], m[2], m[3]);
+  return texts;
 }
 
 TEST(RequestTable, IntrospectionMatchesTheCommittedInterfaceFile) {
@@ -162,19 +167,14 @@ TEST(RequestTable, IntrospectionMatchesTheCommittedInterfaceFile) {
 
   // The committed file is the contract clients build against: it declares
   // the listed requests, and the table serves each as declared.
-  const std::map<std::string, CommittedMethod> methods = committedServiceMethods(committed);
-  std::set<std::string_view> declared;
-  for (const auto& [name, method] : methods) declared.insert(name);
-  EXPECT_EQ(declared, allRequestNames());
-  std::set<std::string_view> served;
+  const std::map<std::string, std::string> declared = committedServiceMethods(committed);
+  std::set<std::string_view> names;
+  for (const auto& [name, method] : declared) names.insert(name);
+  EXPECT_EQ(names, allRequestNames());
+  std::map<std::string, std::string> served;
   for (const RequestDescriptor& request : RequestTable::requests()) {
-    served.insert(request.member);
-    auto method = methods.find(std::string(request.member));
-    if (method == methods.end()) continue;
-    EXPECT_EQ(request.inSignature, method->second.inTypes) << request.member;
-    EXPECT_EQ(request.outSignature, method->second.outTypes) << request.member;
-    EXPECT_EQ(request.inNames, method->second.inNames) << request.member;
-    EXPECT_EQ(request.outNames, method->second.outNames) << request.member;
+    served[std::string(request.member)] =
+        methodText(request.inSignature, request.inNames, request.outSignature, request.outNames);
   }
   EXPECT_EQ(served, declared);
   EXPECT_NE(committed.find("<interface name=\"com.orvane.larderd.VendSoftwareMapObserver\">\n"
