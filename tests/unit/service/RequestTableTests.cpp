@@ -176,7 +176,13 @@ TEST(RequestTable, IntrospectionMatchesTheCommittedInterfaceFile) {
     served[std::string(request.member)] =
         methodText(request.inSignature, request.inNames, request.outSignature, request.outNames);
   }
-  EXPECT_EQ(served, declared);
+  // As text, so that a failure shows the methods that differ.
+  const auto text = [](const std::map<std::string, std::string>& methods) {
+    std::string lines;
+    for (const auto& [name, method] : methods) lines += name + ": " + method + "\n";
+    return lines;
+  };
+  EXPECT_EQ(text(served), text(declared));
   EXPECT_NE(committed.find("<interface name=\"com.orvane.larderd.VendSoftwareMapObserver\">\n"
                            "    <method name=\"SoftwareProductUpdatedState\">\n"
                            "      <arg name=\"product\" type=\"a{sv}\" direction=\"in\"/>\n"
