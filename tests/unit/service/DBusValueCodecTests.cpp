@@ -67,10 +67,7 @@ TEST(DBusValueCodec, NestedValuesSurviveAMessage) {
       PlistArray{"first", "", "third"},
   };
   PlistArray read = roundTrip(kSignature, values);
-  ASSERT_EQ(read.size(), values.size());
-  for (std::size_t i = 0; i < values.size(); ++i) {
-    EXPECT_EQ(read[i], values[i]) << "argument " << i;
-  }
+  EXPECT_EQ(read, values);
   EXPECT_EQ(read[3].type(), PlistValue::Type::UnsignedInteger);
   EXPECT_EQ(read[1]["huge"].type(), PlistValue::Type::UnsignedInteger);
 }

@@ -12,7 +12,6 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -188,7 +187,6 @@ class ServiceTest : public ::testing::Test {
 
   void TearDown() override {
     TillLogManager::sharedManager().setLevel(savedLevel_);
-    for (const std::string& folder : lockedFolders_) ::chmod(folder.c_str(), 0755);
     std::error_code code;
     fs::remove_all(temporary_, code);
     environment_.restore();
@@ -247,12 +245,6 @@ class ServiceTest : public ::testing::Test {
     return makeBundle(folder, name, identifier, version, purchase);
   }
 
-  // Takes write permission away from `folder` until the test ends.
-  void lockFolder(const std::string& folder) {
-    ASSERT_EQ(::chmod(folder.c_str(), 0555), 0) << folder;
-    lockedFolders_.push_back(folder);
-  }
-
   static SoftwareMap::Options options(const std::string& store, bool discover) {
     SoftwareMap::Options result;
     result.persistedStorePath = store;
@@ -307,7 +299,6 @@ class ServiceTest : public ::testing::Test {
   std::string home_;
   int savedLevel_ = 2;
   ScopedEnvironment environment_;
-  std::vector<std::string> lockedFolders_;
 };
 
 inline std::vector<std::string> pathsOf(const SoftwareMap::ProductList& products) {

@@ -1,6 +1,7 @@
 // Which record answers a bundle identifier that several installed copies
 // share.
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <set>
@@ -157,9 +158,7 @@ using SoftwareMapPreferenceTest = ServiceTest;
 // The higher version sits in /Applications, on the boot volume, with the
 // shorter path: only its folder having become read-only can make it lose.
 TEST_F(SoftwareMapPreferenceTest, UpdatableCopyBeatsHigherVersionThatCannotBeReplaced) {
-  Layout layout{"root", "home", "Locked"};
-  useLayout(layout.rootName, layout.homeName);
-  const std::string locked = rootApplications() + "/" + layout.subfolderName;
+  const std::string locked = rootApplications() + "/Locked";
   std::string higher = makeStoreBundle(locked, "Tool", "com.example.tool", "9.0", 77);
   std::string lower =
       makeStoreBundle(volumeApplications("D"), "Tool", "com.example.tool", "1.0", 77);
@@ -170,7 +169,9 @@ TEST_F(SoftwareMapPreferenceTest, UpdatableCopyBeatsHigherVersionThatCannotBeRep
   ASSERT_EQ(user.failure(), "");
   ASSERT_EQ(map.productForBundleIdentifier("com.example.tool")->bundlePath(), higher)
       << "while its folder can be written, the higher version wins";
-  lockFolder(locked);
+  ASSERT_EQ(::chmod(locked.c_str(), 0555), 0);
+  // Writable again before the temporary tree is removed, whatever happens.
+  std::shared_ptr<void> unlock(nullptr, [&](void*) { ::chmod(locked.c_str(), 0755); });
 
   LogCapture log;
   LedgerSoftwareProductRef found = map.productForBundleIdentifier("com.example.tool");
