@@ -11,6 +11,7 @@
 
 #include "client/DBusValueCodec.h"
 #include "client/ServiceError.h"
+#include "platform/log/TillLogManager.h"
 
 // sdbus-c++ 1.2 builds its own variants on a message made without any bus
 // connection; the function is exported but not declared in its headers.
@@ -23,10 +24,15 @@ namespace {
 
 constexpr std::string_view kSignature = "sa{sv}xtbdayaa{sv}as";
 
-PlistArray roundTrip(std::string_view signature, const PlistArray& values) {
+sdbus::PlainMessage sealed(std::string_view signature, const PlistArray& values) {
   sdbus::PlainMessage message = sdbus::createPlainMessage();
   DBusValueCodec::writeAll(message, signature, values);
   message.seal();
+  return message;
+}
+
+PlistArray roundTrip(std::string_view signature, const PlistArray& values) {
+  sdbus::PlainMessage message = sealed(signature, values);
   return DBusValueCodec::readAll(message, signature);
 }
 
@@ -61,10 +67,7 @@ TEST(DBusValueCodec, NestedValuesSurviveAMessage) {
       PlistArray{"first", "", "third"},
   };
   PlistArray read = roundTrip(kSignature, values);
-  ASSERT_EQ(read.size(), values.size());
-  for (std::size_t i = 0; i < values.size(); ++i) {
-    EXPECT_EQ(read[i], values[i]) << "argument " << i;
-  }
+  EXPECT_EQ(read, values);
   EXPECT_EQ(read[3].type(), PlistValue::Type::UnsignedInteger);
   EXPECT_EQ(read[1]["huge"].type(), PlistValue::Type::UnsignedInteger);
 }
@@ -108,43 +111,40 @@ std::map<std::string, std::string> variantTypes(const PlistDictionary& dictionar
   return types;
 }
 
-TEST(DBusValueCodec, UnsignedFieldsOfRecordsTravelAsUInt64) {
-  const auto types = variantTypes({{"itemIdentifier", 5},
+// Identifiers of records travel as uint64, store versions as int64, dates
+// as seconds.
+TEST(DBusValueCodec, VariantsCarryNaturalTypesAndIdentifiersAreUnsigned) {
+  const PlistDictionary dictionary{{"itemIdentifier", 5},
                                    {"accountID", std::uint64_t{7}},
                                    {"ware-id", 409183694},
                                    {"versionIdentifier", 5},
-                                   {"itemIdentifierText", 5}});
-  EXPECT_EQ(types.at("itemIdentifier"), "t");
-  EXPECT_EQ(types.at("accountID"), "t");
-  EXPECT_EQ(types.at("ware-id"), "t");
-  EXPECT_EQ(types.at("versionIdentifier"), "x") << "store versions are int64";
-  EXPECT_EQ(types.at("itemIdentifierText"), "x");
-  // The values read back unchanged.
-  const PlistDictionary product{{"itemIdentifier", 5}, {"bundleIdentifier", "com.example.a"}};
-  const PlistArray products{PlistValue(PlistArray{product})};
-  EXPECT_EQ(roundTrip("aa{sv}", products), products);
-}
-
-TEST(DBusValueCodec, VariantsCarryNaturalTypes) {
-  PlistDictionary dictionary{{"date", PlistDate{1700000000.5}},
-                             {"small", std::uint64_t{5}},
-                             {"integer", 5},
-                             {"real", 5.0},
-                             {"flag", false}};
+                                   {"itemIdentifierText", 5},
+                                   {"date", PlistDate{1700000000.5}},
+                                   {"real", 5.0},
+                                   {"flag", false}};
+  EXPECT_EQ(variantTypes(dictionary),
+            (std::map<std::string, std::string>{{"itemIdentifier", "t"},
+                                                {"accountID", "t"},
+                                                {"ware-id", "t"},
+                                                {"versionIdentifier", "x"},
+                                                {"itemIdentifierText", "x"},
+                                                {"date", "d"},
+                                                {"real", "d"},
+                                                {"flag", "b"}}));
   PlistArray read = roundTrip("a{sv}", {dictionary});
-  ASSERT_EQ(read.size(), 1U);
-  EXPECT_EQ(read[0]["date"], PlistValue(1700000000.5)) << "dates travel as seconds";
-  EXPECT_EQ(read[0]["small"].type(), PlistValue::Type::Integer);
-  EXPECT_EQ(read[0]["integer"], PlistValue(5));
-  EXPECT_EQ(read[0]["real"].type(), PlistValue::Type::Real);
-  EXPECT_EQ(read[0]["flag"], PlistValue(false));
+  EXPECT_EQ(read[0]["date"], PlistValue(1700000000.5));
+  // A small unsigned value that is no identifier reads back as an integer.
+  EXPECT_EQ(roundTrip("a{sv}", {PlistDictionary{{"small", std::uint64_t{5}}}})[0]["small"].type(),
+            PlistValue::Type::Integer);
+  EXPECT_EQ(read[0]["itemIdentifier"], PlistValue(5));
 
-  EXPECT_EQ(DBusValueCodec::naturalSignature(PlistValue("s")), "s");
-  EXPECT_EQ(DBusValueCodec::naturalSignature(PlistValue()), "s");
-  EXPECT_EQ(DBusValueCodec::naturalSignature(PlistValue(PlistUid{1})), "t");
-  EXPECT_EQ(DBusValueCodec::naturalSignature(PlistValue(PlistArray{})), "av");
-  EXPECT_EQ(DBusValueCodec::naturalSignature(PlistValue(PlistDictionary{})), "a{sv}");
-  EXPECT_EQ(DBusValueCodec::naturalSignature(PlistValue(PlistData{})), "ay");
+  for (const auto& [value, signature] :
+       {std::pair{PlistValue("s"), "s"}, std::pair{PlistValue(), "s"},
+        std::pair{PlistValue(PlistUid{1}), "t"}, std::pair{PlistValue(PlistArray{}), "av"},
+        std::pair{PlistValue(PlistDictionary{}), "a{sv}"},
+        std::pair{PlistValue(PlistData{}), "ay"}}) {
+    EXPECT_EQ(DBusValueCodec::naturalSignature(value), signature) << describePlistValue(value);
+  }
 }
 
 TEST(DBusValueCodec, OtherBasicTypesAndObjectPaths) {
@@ -166,42 +166,34 @@ PlistValue nestedDictionaries(int levels) {
 TEST(DBusValueCodec, DeepNestingIsRefused) {
   EXPECT_EQ(roundTrip("a{sv}", {nestedDictionaries(8)}), PlistArray{nestedDictionaries(8)});
 
-  sdbus::PlainMessage message = sdbus::createPlainMessage();
-  DBusValueCodec::writeAll(message, "a{sv}", {nestedDictionaries(20)});
-  message.seal();
+  sdbus::PlainMessage message = sealed("a{sv}", {nestedDictionaries(20)});
   EXPECT_THROW(DBusValueCodec::readAll(message, "a{sv}"), ServiceError);
 
   // Arrays of variants count as well.
   PlistValue arrays = "leaf";
   for (int i = 0; i < 20; ++i) arrays = PlistArray{arrays};
-  sdbus::PlainMessage arrayMessage = sdbus::createPlainMessage();
-  DBusValueCodec::writeAll(arrayMessage, "av", {arrays});
-  arrayMessage.seal();
+  sdbus::PlainMessage arrayMessage = sealed("av", {arrays});
   EXPECT_THROW(DBusValueCodec::readAll(arrayMessage, "av"), ServiceError);
 }
 
 TEST(DBusValueCodec, BodiesThatDoNotMatchTheSignatureAreRefused) {
-  {
-    sdbus::PlainMessage message = sdbus::createPlainMessage();
-    DBusValueCodec::writeAll(message, "x", {5});
-    message.seal();
-    EXPECT_THROW(DBusValueCodec::readAll(message, "s"), sdbus::Error);
-  }
-  {
-    sdbus::PlainMessage message = sdbus::createPlainMessage();
-    DBusValueCodec::writeAll(message, "s", {"only one"});
-    message.seal();
-    EXPECT_THROW(DBusValueCodec::readAll(message, "ss"), sdbus::Error);
-  }
-  {
-    sdbus::PlainMessage message = sdbus::createPlainMessage();
-    DBusValueCodec::writeAll(message, "as", {PlistArray{"a"}});
-    message.seal();
-    EXPECT_THROW(DBusValueCodec::readAll(message, "a{sv}"), sdbus::Error);
-  }
-  {
-    sdbus::PlainMessage message = sdbus::createPlainMessage();
-    EXPECT_THROW(DBusValueCodec::writeAll(message, "(ss)", {PlistArray{"a", "b"}}), sdbus::Error);
+  struct Case {
+    const char* written;
+    PlistArray values;
+    const char* read;  // nullptr: refused already when written
+  };
+  const Case cases[] = {{"x", {5}, "s"},
+                        {"s", {"only one"}, "ss"},
+                        {"as", {PlistArray{"a"}}, "a{sv}"},
+                        {"(ss)", {PlistArray{"a", "b"}}, nullptr}};
+  for (const Case& c : cases) {
+    SCOPED_TRACE(std::string(c.written) + " read as " + (c.read ? c.read : "nothing"));
+    if (!c.read) {
+      EXPECT_THROW(sealed(c.written, c.values), sdbus::Error);
+      continue;
+    }
+    sdbus::PlainMessage message = sealed(c.written, c.values);
+    EXPECT_THROW(DBusValueCodec::readAll(message, c.read), sdbus::Error);
   }
 }
 
@@ -209,8 +201,9 @@ TEST(DBusValueCodec, SplitSignature) {
   EXPECT_EQ(DBusValueCodec::splitSignature("sa{sv}xaa{sv}(si)as"),
             (std::vector<std::string>{"s", "a{sv}", "x", "aa{sv}", "(si)", "as"}));
   EXPECT_TRUE(DBusValueCodec::splitSignature("").empty());
-  EXPECT_THROW(DBusValueCodec::splitSignature("(si"), sdbus::Error);
-  EXPECT_THROW(DBusValueCodec::splitSignature("aa"), sdbus::Error);
+  for (const char* bad : {"(si", "aa", "a", "a{sv"}) {
+    EXPECT_THROW(DBusValueCodec::splitSignature(bad), sdbus::Error) << bad;
+  }
 }
 
 }  // namespace

@@ -1,9 +1,8 @@
 // The service's request table and the per-connection object its requests
 // run against.
-#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <cctype>
+#include <array>
 #include <fstream>
 #include <map>
 #include <set>
@@ -24,195 +23,25 @@
 namespace larder::testing {
 namespace {
 
-// The D-Bus member of a keyword selector: the keywords without a final
-// reply keyword, and without a reply suffix on the last of them,
-// capitalised and run together.
-std::string memberNameForSelector(std::string_view selector) {
-  std::vector<std::string> keywords;
-  std::string current;
-  for (char c : selector) {
-    if (c == ':') {
-      keywords.push_back(current);
-      current.clear();
-    } else {
-      current += c;
-    }
-  }
-  if (!current.empty()) keywords.push_back(current);
-  if (keywords.size() > 1) {
-    const std::string& last = keywords.back();
-    if (last == "replyBlock" || last == "withReplyBlock" || last == "reply") keywords.pop_back();
-  }
-  std::string& last = keywords.back();
-  for (std::string_view suffix : {"WithReplyBlock", "ReplyBlock"}) {
-    if (last.size() > suffix.size() && last.ends_with(suffix)) {
-      last.resize(last.size() - suffix.size());
-      break;
-    }
-  }
-  std::string member;
-  for (std::string keyword : keywords) {
-    keyword[0] = static_cast<char>(std::toupper(static_cast<unsigned char>(keyword[0])));
-    member += keyword;
-  }
-  return member;
-}
-
-// Whether the selector's last argument is the reply block.
-bool selectorTakesReply(std::string_view selector) {
-  for (std::string_view ending : {":replyBlock:", ":withReplyBlock:", ":reply:", "ReplyBlock:"}) {
-    if (selector.ends_with(ending)) return true;
-  }
-  return false;
-}
-
-// A D-Bus signature checker written from the D-Bus rules, independent of
-// the codec's own splitting.
-class SignatureChecker {
- public:
-  static bool valid(std::string_view signature, std::size_t* completeTypes) {
-    if (signature.size() > 255) return false;
-    SignatureChecker checker(signature);
-    std::size_t count = 0;
-    while (checker.position_ < signature.size()) {
-      if (!checker.completeType(0, 0)) return false;
-      ++count;
-    }
-    if (completeTypes) *completeTypes = count;
-    return true;
-  }
-
- private:
-  explicit SignatureChecker(std::string_view signature) : signature_(signature) {}
-
-  static bool isBasic(char c) {
-    return std::string_view("ybnqiuxtdsogh").find(c) != std::string_view::npos;
-  }
-
-  bool completeType(int arrays, int structs) {
-    if (position_ >= signature_.size()) return false;
-    char c = signature_[position_++];
-    if (isBasic(c) || c == 'v') return true;
-    if (c == 'a') {
-      if (arrays + 1 > 32) return false;
-      if (position_ < signature_.size() && signature_[position_] == '{') {
-        ++position_;
-        if (position_ >= signature_.size() || !isBasic(signature_[position_++])) return false;
-        if (!completeType(arrays + 1, structs + 1)) return false;
-        return position_ < signature_.size() && signature_[position_++] == '}';
-      }
-      return completeType(arrays + 1, structs);
-    }
-    if (c == '(') {
-      if (structs + 1 > 32) return false;
-      std::size_t fields = 0;
-      while (position_ < signature_.size() && signature_[position_] != ')') {
-        if (!completeType(arrays, structs + 1)) return false;
-        ++fields;
-      }
-      if (position_ >= signature_.size() || fields == 0) return false;
-      ++position_;
-      return true;
-    }
-    return false;
-  }
-
-  std::string_view signature_;
-  std::size_t position_ = 0;
-};
-
-std::size_t nameCount(std::string_view names) {
-  if (names.empty()) return 0;
-  return static_cast<std::size_t>(std::count(names.begin(), names.end(), ',')) + 1;
-}
-
-bool isValidMemberName(std::string_view name) {
-  if (name.empty() || name.size() > 255 || std::isdigit(static_cast<unsigned char>(name[0]))) {
-    return false;
-  }
-  return std::all_of(name.begin(), name.end(), [](char c) {
-    return std::isalnum(static_cast<unsigned char>(c)) || c == '_';
-  });
-}
-
-TEST(RequestTable, NamingRuleOfTheChecker) {
-  // The rule as stated, on the examples that define it.
-  EXPECT_EQ(memberNameForSelector("productForBundleIdentifier:replyBlock:"),
-            "ProductForBundleIdentifier");
-  EXPECT_EQ(memberNameForSelector("allProductsWithReplyBlock:"), "AllProducts");
-  EXPECT_EQ(memberNameForSelector("addSoftwareMapObserver:reply:"), "AddSoftwareMapObserver");
-  EXPECT_EQ(memberNameForSelector("hideOSUpdatesWithProductKeys:withReplyBlock:"),
-            "HideOSUpdatesWithProductKeys");
-  EXPECT_EQ(memberNameForSelector("setStoreClient:"), "SetStoreClient");
-  EXPECT_EQ(memberNameForSelector("checkSHDownloadStatus:"), "CheckSHDownloadStatus");
-  EXPECT_EQ(memberNameForSelector("startService"), "StartService");
-  EXPECT_EQ(memberNameForSelector("nowIsLaterWithMode:countdownDeferred:"),
-            "NowIsLaterWithModeCountdownDeferred");
-}
-
-TEST(RequestTable, EveryMemberFollowsFromItsSelector) {
+TEST(RequestTable, MembersAreUniqueFoundByNameAndTheirArgumentsNamed) {
   std::set<std::string_view> members;
-  std::set<std::string_view> selectors;
-  ASSERT_GT(RequestTable::requests().size(), 50U);
   for (const RequestDescriptor& request : RequestTable::requests()) {
-    EXPECT_EQ(request.member, memberNameForSelector(request.selector)) << request.selector;
-    EXPECT_TRUE(isValidMemberName(request.member)) << request.member;
     EXPECT_TRUE(members.insert(request.member).second) << "member twice: " << request.member;
-    EXPECT_TRUE(selectors.insert(request.selector).second)
-        << "selector twice: " << request.selector;
     EXPECT_EQ(RequestTable::find(request.member), &request) << request.member;
+    for (const auto& [signature, names] : {std::pair{request.inSignature, request.inNames},
+                                           std::pair{request.outSignature, request.outNames}}) {
+      std::vector<std::string> split;
+      EXPECT_NO_THROW(split = DBusValueCodec::splitSignature(signature)) << request.member;
+      const auto commas = static_cast<std::size_t>(std::count(names.begin(), names.end(), ','));
+      EXPECT_EQ(names.empty() ? 0 : commas + 1, split.size()) << request.member << " " << names;
+    }
+    if (request.withoutTarget == WithoutTarget::kEmptyReply) {
+      EXPECT_FALSE(request.outSignature.empty()) << request.member << " has no reply to empty";
+    }
   }
   EXPECT_EQ(RequestTable::find("NoSuchMember"), nullptr);
-  EXPECT_EQ(RequestTable::find(""), nullptr);
   EXPECT_EQ(RequestTable::find("productForBundleIdentifier:replyBlock:"), nullptr)
       << "lookups are by member, not selector";
-}
-
-TEST(RequestTable, SignaturesAreValidAndMatchTheirNamesAndSelectors) {
-  for (const RequestDescriptor& request : RequestTable::requests()) {
-    for (const auto& [signature, names, direction] :
-         {std::tuple{request.inSignature, request.inNames, "in"},
-          std::tuple{request.outSignature, request.outNames, "out"}}) {
-      std::size_t types = 0;
-      EXPECT_TRUE(SignatureChecker::valid(signature, &types))
-          << request.selector << " " << direction << ": \"" << signature << '"';
-      std::vector<std::string> split;
-      EXPECT_NO_THROW(split = DBusValueCodec::splitSignature(signature)) << request.selector;
-      EXPECT_EQ(split.size(), types) << request.selector << " " << direction;
-      EXPECT_EQ(nameCount(names), split.size())
-          << request.selector << " " << direction << " names \"" << names << '"';
-      std::string joined;
-      for (const std::string& type : split) joined += type;
-      EXPECT_EQ(joined, signature) << request.selector;
-    }
-    // Every argument of the selector is an in argument, except the reply.
-    std::size_t selectorArguments =
-        static_cast<std::size_t>(std::count(request.selector.begin(), request.selector.end(), ':'));
-    bool reply = selectorTakesReply(request.selector) || !request.outSignature.empty();
-    if (reply) {
-      EXPECT_GE(selectorArguments, 1U) << request.selector << " answers without a reply block";
-      --selectorArguments;
-    }
-    EXPECT_EQ(DBusValueCodec::splitSignature(request.inSignature).size(), selectorArguments)
-        << request.selector;
-    if (request.withoutTarget == WithoutTarget::kEmptyReply) {
-      EXPECT_FALSE(request.outSignature.empty()) << request.selector << " has no reply to empty";
-    }
-  }
-}
-
-TEST(RequestTable, SignatureCheckerRefusesMalformedSignatures) {
-  std::size_t count = 0;
-  EXPECT_TRUE(SignatureChecker::valid("", &count));
-  EXPECT_EQ(count, 0U);
-  EXPECT_TRUE(SignatureChecker::valid("sa{sv}x(ias)", &count));
-  EXPECT_EQ(count, 4U);
-  for (const char* bad :
-       {"a", "a{", "{sv}", "a{vs}", "a{sv", "()", "(s", "s)", "z", "a{s}", "a{svv}"}) {
-    EXPECT_FALSE(SignatureChecker::valid(bad, nullptr)) << bad;
-  }
-  EXPECT_THROW(DBusValueCodec::splitSignature("a"), sdbus::Error);
-  EXPECT_THROW(DBusValueCodec::splitSignature("a{sv"), sdbus::Error);
 }
 
 // The words of `text`, split at spaces.
@@ -299,17 +128,19 @@ std::string attributeOf(const std::string& line, const std::string& attribute) {
   return line.substr(at, line.find('"', at) - at);
 }
 
-struct CommittedMethod {
-  std::string inTypes, outTypes, inNames, outNames;
-};
+// A method as "in types (in names) -> out types (out names)".
+std::string methodText(std::string_view inTypes, std::string_view inNames,
+                       std::string_view outTypes, std::string_view outNames) {
+  return std::string(inTypes) + " (" + std::string(inNames) + ") -> " + std::string(outTypes) +
+         " (" + std::string(outNames) + ")";
+}
 
-// The methods of the service interface as the committed file declares
-// them: argument types run together, argument names comma separated.
-std::map<std::string, CommittedMethod> committedServiceMethods(const std::string& xml) {
-  std::map<std::string, CommittedMethod> methods;
+// The methods of the service interface as the committed file declares them.
+std::map<std::string, std::string> committedServiceMethods(const std::string& xml) {
+  std::map<std::string, std::array<std::string, 4>> methods;  // types and names, in and out
   std::stringstream lines(xml);
   bool inService = false;
-  CommittedMethod* method = nullptr;
+  std::array<std::string, 4>* method = nullptr;
   for (std::string line; std::getline(lines, line);) {
     if (line.find("<interface ") != std::string::npos) {
       inService = attributeOf(line, "name") == ServiceRequests::kInterfaceName;
@@ -318,13 +149,15 @@ std::map<std::string, CommittedMethod> committedServiceMethods(const std::string
       EXPECT_FALSE(methods.contains(name)) << name << " declared twice";
       method = &methods[name];
     } else if (inService && method && line.find("<arg ") != std::string::npos) {
-      const bool in = attributeOf(line, "direction") == "in";
-      std::string& names = in ? method->inNames : method->outNames;
+      const std::size_t out = attributeOf(line, "direction") == "in" ? 0 : 2;
+      (*method)[out] += attributeOf(line, "type");
+      std::string& names = (*method)[out + 1];
       names += (names.empty() ? "" : ",") + attributeOf(line, "name");
-      (in ? method->inTypes : method->outTypes) += attributeOf(line, "type");
     }
   }
-  return methods;
+  std::map<std::string, std::string> texts;
+  for (const auto& [name, m] : methods) texts[name] = methodText(m[0], m[1], m[2], m[3]);
+  return texts;
 }
 
 TEST(RequestTable, IntrospectionMatchesTheCommittedInterfaceFile) {
@@ -334,21 +167,22 @@ TEST(RequestTable, IntrospectionMatchesTheCommittedInterfaceFile) {
 
   // The committed file is the contract clients build against: it declares
   // the listed requests, and the table serves each as declared.
-  const std::map<std::string, CommittedMethod> methods = committedServiceMethods(committed);
-  std::set<std::string_view> declared;
-  for (const auto& [name, method] : methods) declared.insert(name);
-  EXPECT_EQ(declared, allRequestNames());
-  std::set<std::string_view> served;
+  const std::map<std::string, std::string> declared = committedServiceMethods(committed);
+  std::set<std::string_view> names;
+  for (const auto& [name, method] : declared) names.insert(name);
+  EXPECT_EQ(names, allRequestNames());
+  std::map<std::string, std::string> served;
   for (const RequestDescriptor& request : RequestTable::requests()) {
-    served.insert(request.member);
-    auto method = methods.find(std::string(request.member));
-    if (method == methods.end()) continue;
-    EXPECT_EQ(request.inSignature, method->second.inTypes) << request.member;
-    EXPECT_EQ(request.outSignature, method->second.outTypes) << request.member;
-    EXPECT_EQ(request.inNames, method->second.inNames) << request.member;
-    EXPECT_EQ(request.outNames, method->second.outNames) << request.member;
+    served[std::string(request.member)] =
+        methodText(request.inSignature, request.inNames, request.outSignature, request.outNames);
   }
-  EXPECT_EQ(served, declared);
+  // As text, so that a failure shows the methods that differ.
+  const auto text = [](const std::map<std::string, std::string>& methods) {
+    std::string lines;
+    for (const auto& [name, method] : methods) lines += name + ": " + method + "\n";
+    return lines;
+  };
+  EXPECT_EQ(text(served), text(declared));
   EXPECT_NE(committed.find("<interface name=\"com.orvane.larderd.VendSoftwareMapObserver\">\n"
                            "    <method name=\"SoftwareProductUpdatedState\">\n"
                            "      <arg name=\"product\" type=\"a{sv}\" direction=\"in\"/>\n"
@@ -360,134 +194,51 @@ TEST(RequestTable, IntrospectionMatchesTheCommittedInterfaceFile) {
 
 // MARK: the connection object
 
-class FakeRemoteObjects final : public RemoteObjectFactory {
+class NoRemoteObjects final : public RemoteObjectFactory {
  public:
-  std::shared_ptr<VendSoftwareMapObserver> softwareMapObserver(
-      const std::string& peer, const std::string& objectPath) override {
-    requests.emplace_back(peer, objectPath);
-    return observer;
+  std::shared_ptr<VendSoftwareMapObserver> softwareMapObserver(const std::string&,
+                                                               const std::string&) override {
+    return nullptr;
   }
-  std::vector<std::pair<std::string, std::string>> requests;
-  std::shared_ptr<RecordingObserver> observer = std::make_shared<RecordingObserver>();
 };
 
 class AssetServiceInterfaceTest : public ServiceTest {
  protected:
   void SetUp() override {
     ServiceTest::SetUp();
-    if (HasFatalFailure()) return;
-    remote_ = std::make_shared<FakeRemoteObjects>();
-  }
-  void TearDown() override {
-    interface_.reset();
-    map_.reset();
-    ServiceTest::TearDown();
-  }
-  AssetServiceInterface& connect(bool discover = false) {
-    map_.emplace(options(storePath(), discover));
+    map_.emplace(options(storePath(), false));
     map_->waitUntilIdle();
-    interface_ = std::make_unique<AssetServiceInterface>(":1.42", *map_, remote_);
-    return *interface_;
   }
-
-  std::shared_ptr<FakeRemoteObjects> remote_;
+  AssetServiceInterface connection(const std::string& peer = ":1.42") {
+    return AssetServiceInterface(peer, *map_, std::make_shared<NoRemoteObjects>());
+  }
   std::optional<SoftwareMap> map_;
-  std::unique_ptr<AssetServiceInterface> interface_;
 };
 
-TEST_F(AssetServiceInterfaceTest, ClientTypeOfARequestOnlyFillsAnEmptySlot) {
-  AssetServiceInterface& connection = connect();
-  EXPECT_EQ(connection.storeClient(), std::nullopt);
-  connection.setStoreClientFromTypeIfNeeded(VendStoreClient::kBookApplication);
-  ASSERT_TRUE(connection.storeClient());
-  EXPECT_EQ(*connection.storeClient(),
+// A request that names a client type only fills an empty slot; setting
+// the client replaces whatever is there.
+TEST_F(AssetServiceInterfaceTest, RequestsNamingAClientTypeOnlyFillAnEmptySlot) {
+  AssetServiceInterface first = connection();
+  auto perform = [&](std::string_view member, const PlistArray& arguments) {
+    RequestTable::perform(*RequestTable::find(member), first, arguments, {});
+    return first.storeClient();
+  };
+  EXPECT_EQ(first.storeClient(), std::nullopt);
+  EXPECT_EQ(perform("RedownloadWithItemIdentifierBundleIdentifierStoreClientType",
+                    {12, "com.example.x", 1}),
             VendStoreClient::initWithStoreClientType(VendStoreClient::kBookApplication));
-  EXPECT_EQ(connection.storeClient()->clientType(), VendStoreClient::kBookApplication);
-  EXPECT_EQ(connection.storeClient()->identifier(), "com.orvane.books");
+  EXPECT_EQ(perform("ShowInviteOrganizationNameStoreClientType", {"https://invite", "Org", 0}),
+            VendStoreClient::initWithStoreClientType(VendStoreClient::kBookApplication));
+  const auto set = perform(
+      "SetStoreClient", {PlistDictionary{{"identifier", "com.example.client"}, {"clientType", 4}}});
+  EXPECT_EQ(set->identifier(), "com.example.client");
+  EXPECT_EQ(set->clientType(), 4);
+  first.setStoreClientFromTypeIfNeeded(VendStoreClient::kBookApplication);
+  EXPECT_EQ(first.storeClient()->clientType(), 4);
 
-  // An existing client stays, whatever type the next request names.
-  connection.setStoreClientFromTypeIfNeeded(VendStoreClient::kStoreApplication);
-  EXPECT_EQ(connection.storeClient()->clientType(), VendStoreClient::kBookApplication);
-
-  AssetServiceInterface other(":1.43", *map_, remote_);
-  other.setStoreClient(
-      VendStoreClient::initWithStoreClientType(VendStoreClient::kStoreApplication));
-  other.setStoreClientFromTypeIfNeeded(VendStoreClient::kBookApplication);
-  EXPECT_EQ(other.storeClient()->clientType(), VendStoreClient::kStoreApplication);
+  AssetServiceInterface other = connection(":1.43");
+  other.setStoreClientFromTypeIfNeeded(VendStoreClient::kStoreApplication);
   EXPECT_EQ(other.storeClient()->identifier(), "com.orvane.quaymart");
-}
-
-TEST_F(AssetServiceInterfaceTest, RequestsNamingAClientTypeSetItThroughTheTable) {
-  AssetServiceInterface& connection = connect();
-  const RequestDescriptor* redownload =
-      RequestTable::find("RedownloadWithItemIdentifierBundleIdentifierStoreClientType");
-  ASSERT_NE(redownload, nullptr);
-  RequestTable::perform(*redownload, connection, {12, "com.example.x", 1}, {});
-  ASSERT_TRUE(connection.storeClient());
-  EXPECT_EQ(connection.storeClient()->clientType(), 1);
-  RequestTable::perform(*RequestTable::find("ShowInviteOrganizationNameStoreClientType"),
-                        connection, {"https://invite", "Org", 0}, {});
-  EXPECT_EQ(connection.storeClient()->clientType(), 1);
-
-  const RequestDescriptor* setClient = RequestTable::find("SetStoreClient");
-  ASSERT_NE(setClient, nullptr);
-  RequestTable::perform(*setClient, connection,
-                        {PlistDictionary{{"identifier", "com.example.client"}, {"clientType", 4}}},
-                        {});
-  EXPECT_EQ(connection.storeClient()->identifier(), "com.example.client");
-  EXPECT_EQ(connection.storeClient()->clientType(), 4);
-}
-
-TEST_F(AssetServiceInterfaceTest, ObserverAtTheRootPathIsNoObserver) {
-  AssetServiceInterface& connection = connect();
-  LogCapture log;
-  std::string rootToken = connection.addSoftwareMapObserver("/");
-  std::string emptyToken = connection.addSoftwareMapObserver("");
-  EXPECT_FALSE(rootToken.empty());
-  EXPECT_NE(rootToken, emptyToken);
-  EXPECT_TRUE(remote_->requests.empty()) << "a handle was made for no object";
-  connection.removeSoftwareMapObserver(rootToken);
-  EXPECT_EQ(
-      log.countExactly("SoftwareMap: Could not find SoftwareMap observer to remove for token: " +
-                       rootToken),
-      1U)
-      << log.dump();
-
-  std::string realToken = connection.addSoftwareMapObserver("/com/example/Observer");
-  ASSERT_EQ(remote_->requests.size(), 1U);
-  EXPECT_EQ(remote_->requests[0],
-            (std::pair<std::string, std::string>{":1.42", "/com/example/Observer"}));
-  auto product = std::make_shared<LedgerSoftwareProduct>(
-      LedgerSoftwareProductFields{.bundlePath = "/Applications/Seen.app"});
-  map_->notifyObserversAboutProduct(product, kSoftwareProductAdded);
-  ASSERT_EQ(remote_->observer->calls().size(), 1U);
-  EXPECT_EQ(remote_->observer->calls()[0].product, product);
-  connection.removeSoftwareMapObserver(realToken);
-  EXPECT_EQ(log.countExactly("SoftwareMap: Removed SoftwareMap observer for token: " + realToken),
-            1U);
-}
-
-TEST_F(AssetServiceInterfaceTest, InstalledSoftwareRequestsAnswerInWireForm) {
-  std::string app =
-      makeStoreBundle(rootApplications(), "Wire", "com.example.wire", "5.1", 71, 7100);
-  AssetServiceInterface& connection = connect(true);
-  std::vector<PlistArray> replies;
-  ReplyHandler collect = [&](PlistArray out) { replies.push_back(std::move(out)); };
-
-  RequestTable::perform(*RequestTable::find("ProductForBundleIdentifier"), connection,
-                        {"com.example.wire"}, collect);
-  RequestTable::perform(*RequestTable::find("ProductForItemIdentifier"), connection,
-                        {std::int64_t{71}}, collect);
-  RequestTable::perform(*RequestTable::find("ProductForBundleIdentifier"), connection,
-                        {"com.example.none"}, collect);
-  RequestTable::perform(*RequestTable::find("AllProducts"), connection, {}, collect);
-  ASSERT_EQ(replies.size(), 4U);
-  PlistDictionary expected = map_->productForBundleIdentifier("com.example.wire")->toDictionary();
-  EXPECT_EQ(replies[0], PlistArray{expected});
-  EXPECT_EQ(replies[1], PlistArray{expected});
-  EXPECT_EQ(PlistValue(expected)["bundlePath"], PlistValue(app));
-  EXPECT_EQ(replies[2], PlistArray{PlistDictionary{}}) << "nothing found answers an empty record";
-  EXPECT_EQ(replies[3], PlistArray{PlistArray{expected}});
 }
 
 // The name of the error that performing `request` answers with, or "".
@@ -502,7 +253,7 @@ std::string refusal(const RequestDescriptor& request, AssetServiceInterface& con
 }
 
 TEST_F(AssetServiceInterfaceTest, RequestsWithoutTargetAnswerEmptyRefuseOrStaySilent) {
-  AssetServiceInterface& connection = connect();
+  AssetServiceInterface connection = this->connection();
   std::set<std::string_view> unlisted;
   for (const RequestDescriptor& request : RequestTable::requests()) unlisted.insert(request.member);
   for (const auto& [list, outcome] :
@@ -527,16 +278,6 @@ TEST_F(AssetServiceInterfaceTest, RequestsWithoutTargetAnswerEmptyRefuseOrStaySi
   }
   for (std::string_view member : words(kHandledRequests)) unlisted.erase(member);
   EXPECT_TRUE(unlisted.empty()) << "requests nobody listed, e.g. " << *unlisted.begin();
-}
-
-TEST_F(AssetServiceInterfaceTest, AnUpdateCheckWithoutStoreClientIsRefusedAtOnce) {
-  AssetServiceInterface& connection = connect();
-  const RequestDescriptor& check = *RequestTable::find("CheckForUpdatesWithUserHasSeenUpdates");
-  bool replied = false;
-  EXPECT_EQ(refusal(check, connection, {false}, [&](PlistArray) { replied = true; }),
-            ServiceError::kNoStoreClient);
-  EXPECT_FALSE(replied);
-  EXPECT_EQ(refusal(check, connection, {false}, {}), "") << "nobody waits for an answer";
 }
 
 }  // namespace

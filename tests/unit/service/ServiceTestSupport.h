@@ -12,7 +12,6 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -60,59 +59,44 @@ class LogCapture {
       lines_.push_back({level, line});
     });
   }
-
-  [[nodiscard]] std::vector<Line> lines() const {
-    std::lock_guard lock(mutex_);
-    return lines_;
-  }
-
   void clear() {
     std::lock_guard lock(mutex_);
     lines_.clear();
   }
-
-  // Lines equal to `text`, at `level` (any level when 0).
+  // Lines equal to / holding `text`, at `level` (any level when 0).
   [[nodiscard]] std::size_t countExactly(std::string_view text, int level = 0) const {
-    std::lock_guard lock(mutex_);
-    return static_cast<std::size_t>(std::count_if(lines_.begin(), lines_.end(), [&](const Line& l) {
-      return l.text == text && (level == 0 || l.level == level);
-    }));
+    return linesWhere([&](const Line& l) { return l.text == text; }, level).size();
   }
-
-  // Exactly one line equal to `text` (at `level`, any when 0); on failure
-  // the message shows the whole log.
+  [[nodiscard]] std::size_t countContaining(std::string_view fragment, int level = 0) const {
+    return linesContaining(fragment, level).size();
+  }
+  [[nodiscard]] std::vector<Line> linesContaining(std::string_view fragment, int level = 0) const {
+    return linesWhere([&](const Line& l) { return l.text.find(fragment) != l.text.npos; }, level);
+  }
+  // Exactly one line equal to `text`; on failure the message shows the log.
   [[nodiscard]] ::testing::AssertionResult hasOnce(std::string_view text, int level = 0) const {
     const std::size_t count = countExactly(text, level);
     if (count == 1) return ::testing::AssertionSuccess();
     return ::testing::AssertionFailure() << count << " lines \"" << text << "\" in:\n" << dump();
   }
-
-  [[nodiscard]] std::size_t countContaining(std::string_view fragment, int level = 0) const {
-    std::lock_guard lock(mutex_);
-    return static_cast<std::size_t>(std::count_if(lines_.begin(), lines_.end(), [&](const Line& l) {
-      return l.text.find(fragment) != std::string::npos && (level == 0 || l.level == level);
-    }));
-  }
-
-  [[nodiscard]] std::vector<Line> linesContaining(std::string_view fragment) const {
-    std::lock_guard lock(mutex_);
-    std::vector<Line> found;
-    for (const Line& line : lines_) {
-      if (line.text.find(fragment) != std::string::npos) found.push_back(line);
-    }
-    return found;
-  }
-
-  // For failure messages.
   [[nodiscard]] std::string dump() const {
-    std::lock_guard lock(mutex_);
     std::string text;
-    for (const Line& line : lines_)
+    for (const Line& line : linesWhere([](const Line&) { return true; }, 0))
       text += "[" + std::to_string(line.level) + "] " + line.text + "\n";
     return text;
   }
 
  private:
+  template <typename Predicate>
+  std::vector<Line> linesWhere(Predicate predicate, int level) const {
+    std::lock_guard lock(mutex_);
+    std::vector<Line> found;
+    for (const Line& line : lines_) {
+      if (predicate(line) && (level == 0 || line.level == level)) found.push_back(line);
+    }
+    return found;
+  }
+
   mutable std::mutex mutex_;
   std::vector<Line> lines_;
   std::shared_ptr<void> handle_;
@@ -138,11 +122,6 @@ class RecordingObserver final : public VendSoftwareMapObserver {
   [[nodiscard]] std::vector<Call> calls() const {
     std::lock_guard lock(mutex_);
     return calls_;
-  }
-
-  void clear() {
-    std::lock_guard lock(mutex_);
-    calls_.clear();
   }
 
  private:
@@ -171,8 +150,7 @@ struct Purchase {
   }
 };
 
-// Plain writes: the fixtures need no crash safety, and flushing every
-// file to disk would cost more than the tests themselves.
+// Plain writes: the fixtures need no crash safety.
 inline void writeText(const std::string& path, std::string_view text) {
   fs::create_directories(fs::path(path).parent_path());
   std::ofstream file(path, std::ios::binary | std::ios::trunc);
@@ -209,7 +187,6 @@ class ServiceTest : public ::testing::Test {
 
   void TearDown() override {
     TillLogManager::sharedManager().setLevel(savedLevel_);
-    for (const std::string& folder : lockedFolders_) ::chmod(folder.c_str(), 0755);
     std::error_code code;
     fs::remove_all(temporary_, code);
     environment_.restore();
@@ -268,12 +245,6 @@ class ServiceTest : public ::testing::Test {
     return makeBundle(folder, name, identifier, version, purchase);
   }
 
-  // Takes write permission away from `folder` until the test ends.
-  void lockFolder(const std::string& folder) {
-    ASSERT_EQ(::chmod(folder.c_str(), 0555), 0) << folder;
-    lockedFolders_.push_back(folder);
-  }
-
   static SoftwareMap::Options options(const std::string& store, bool discover) {
     SoftwareMap::Options result;
     result.persistedStorePath = store;
@@ -282,6 +253,34 @@ class ServiceTest : public ::testing::Test {
     result.liveQueries = false;
     result.periodicReload = false;
     return result;
+  }
+
+  // A record as discovery keeps it for an installed bundle; fields not
+  // given stay absent.
+  static LedgerSoftwareProductFields storedRecord(
+      const std::string& path, std::optional<std::string> identifier = std::nullopt,
+      std::optional<std::string> version = std::nullopt,
+      std::optional<std::uint64_t> item = std::nullopt,
+      std::optional<std::int64_t> versionIdentifier = std::nullopt) {
+    return {.bundlePath = path,
+            .bundleIdentifier = std::move(identifier),
+            .bundleVersion = std::move(version),
+            .itemIdentifier = item,
+            .versionIdentifier = versionIdentifier,
+            .installed = true,
+            .source = LedgerSoftwareProduct::kSourceRegistryOrPurchaseRecord};
+  }
+
+  // A map that holds exactly `records`, from its persisted store, and
+  // never looks at the application folders.
+  std::unique_ptr<SoftwareMap> mapWithRecords(
+      const std::vector<LedgerSoftwareProductFields>& records) {
+    std::string path = storePath("records");
+    writeBytes(path, archivedStore(records));
+    auto map = std::make_unique<SoftwareMap>(options(path, false));
+    map->waitUntilIdle();
+    EXPECT_EQ(map->allProducts().size(), records.size());
+    return map;
   }
 
   // An archived store holding `records` keyed by their paths.
@@ -300,7 +299,6 @@ class ServiceTest : public ::testing::Test {
   std::string home_;
   int savedLevel_ = 2;
   ScopedEnvironment environment_;
-  std::vector<std::string> lockedFolders_;
 };
 
 inline std::vector<std::string> pathsOf(const SoftwareMap::ProductList& products) {

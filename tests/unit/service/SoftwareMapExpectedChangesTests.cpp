@@ -13,16 +13,13 @@ class SoftwareMapExpectedChangesTest : public ServiceTest {
  protected:
   void SetUp() override {
     ServiceTest::SetUp();
-    if (HasFatalFailure()) return;
     path_ = makeStoreBundle(rootApplications(), "Updating", "com.example.updating", "1.0", 61, 610);
     map_.emplace(options(storePath(), true));
     map_->waitUntilIdle();
     record_ = map_->productForBundleIdentifier("com.example.updating");
     ASSERT_NE(record_, nullptr);
-    observer_ = std::make_shared<RecordingObserver>();
     map_->addObserver(observer_);
   }
-
   void TearDown() override {
     map_.reset();
     ServiceTest::TearDown();
@@ -35,73 +32,118 @@ class SoftwareMapExpectedChangesTest : public ServiceTest {
                         PlistValue(installerVersion), "account-Updating", 1600000000.0}
                    .toDictionary());
   }
-
-  static void expectNoExpectation(const LedgerSoftwareProductFields& fields) {
-    EXPECT_FALSE(fields.metadataChangeIsExpected);
-    EXPECT_EQ(fields.expectedBundleVersion, std::nullopt);
-    EXPECT_EQ(fields.expectedStoreVersion, std::nullopt);
+  void reportDone(bool success, const std::string& version, std::int64_t storeVersion) {
+    map_->productAtPathWasUpdatedToBundleVersionStoreVersion(path_, success, version, storeVersion);
+    map_->waitUntilIdle();
+  }
+  // The version, the expectation and what observers heard, in one line.
+  std::string state() const {
+    const LedgerSoftwareProductFields fields = record_->snapshot();
+    std::string text = fields.bundleVersion.value_or("-") + " " +
+                       std::to_string(fields.versionIdentifier.value_or(0)) + " expecting " +
+                       std::to_string(fields.metadataChangeIsExpected) + " " +
+                       fields.expectedBundleVersion.value_or("-") + " " +
+                       std::to_string(fields.expectedStoreVersion.value_or(0)) + "; told";
+    for (const auto& call : observer_->calls()) {
+      text += " " + std::to_string(call.state) + (call.product == record_ ? "" : " of another") +
+              " at " + call.fieldsAtCall.bundleVersion.value_or("-");
+    }
+    return text;
   }
 
   std::string path_;
   std::optional<SoftwareMap> map_;
   LedgerSoftwareProductRef record_;
-  std::shared_ptr<RecordingObserver> observer_;
+  std::shared_ptr<RecordingObserver> observer_ = std::make_shared<RecordingObserver>();
 };
 
 TEST_F(SoftwareMapExpectedChangesTest, CompletedUpdateIsAnnouncedOnceAndClearsTheExpectation) {
   LogCapture log;
   map_->productAtPathWillBeUpdatedToBundleVersionStoreVersion(path_, "2.0", 620);
-  LedgerSoftwareProductFields expecting = record_->snapshot();
-  EXPECT_TRUE(expecting.metadataChangeIsExpected);
-  EXPECT_EQ(expecting.expectedBundleVersion, "2.0");
-  EXPECT_EQ(expecting.expectedStoreVersion, 620);
-  EXPECT_EQ(expecting.bundleVersion, "1.0") << "the notice alone changes no version";
-
+  EXPECT_EQ(state(), "1.0 610 expecting 1 2.0 620; told") << "the notice alone changes no version";
   replaceBundleWith("2.0", 620);
-  map_->productAtPathWasUpdatedToBundleVersionStoreVersion(path_, true, "2.0", 620);
-  map_->waitUntilIdle();
-
-  LedgerSoftwareProductFields updated = record_->snapshot();
-  EXPECT_EQ(updated.bundleVersion, "2.0");
-  EXPECT_EQ(updated.versionIdentifier, 620);
-  expectNoExpectation(updated);
-  std::vector<RecordingObserver::Call> calls = observer_->calls();
-  ASSERT_EQ(calls.size(), 1U);
-  EXPECT_EQ(calls[0].product, record_);
-  EXPECT_EQ(calls[0].state, kSoftwareProductChanged);
-  EXPECT_EQ(calls[0].fieldsAtCall.bundleVersion, "2.0");
+  reportDone(true, "2.0", 620);
+  EXPECT_EQ(state(), "2.0 620 expecting 0 - 0; told 2 at 2.0");
   EXPECT_EQ(log.countContaining("does not match expected value"), 0U) << log.dump();
 
-  // The next scan finds what the update already merged.
+  // Neither the next scan nor a second report announces it again.
   map_->reloadFromApplicationRegistry();
   map_->waitUntilIdle();
-  EXPECT_EQ(observer_->calls().size(), 1U);
-
-  // A second completion report for the same update has nothing to do.
   log.clear();
-  map_->productAtPathWasUpdatedToBundleVersionStoreVersion(path_, true, "2.0", 620);
-  map_->waitUntilIdle();
-  EXPECT_EQ(observer_->calls().size(), 1U);
+  reportDone(true, "2.0", 620);
+  EXPECT_EQ(state(), "2.0 620 expecting 0 - 0; told 2 at 2.0");
   EXPECT_EQ(log.countContaining("Expected metadata change was already seen for product", 3), 1U)
       << log.dump();
 }
 
-TEST_F(SoftwareMapExpectedChangesTest, UpdateThatDidNotHappenOnlyClearsTheExpectation) {
-  LogCapture log;
+TEST_F(SoftwareMapExpectedChangesTest, ScanThatSeesTheNewVersionFirstEndsTheExpectation) {
   map_->productAtPathWillBeUpdatedToBundleVersionStoreVersion(path_, "2.0", 620);
-  // Even with a changed record on disk, a failed update is not merged.
   replaceBundleWith("2.0", 620);
-  map_->productAtPathWasUpdatedToBundleVersionStoreVersion(path_, false, "2.0", 620);
+  map_->reloadFromApplicationRegistry();
   map_->waitUntilIdle();
-  LedgerSoftwareProductFields fields = record_->snapshot();
-  expectNoExpectation(fields);
-  EXPECT_EQ(fields.bundleVersion, "1.0");
-  EXPECT_TRUE(observer_->calls().empty());
-  EXPECT_TRUE(
-      log.hasOnce("SoftwareMap: Update did not happen, removed expectations of a product "
-                  "change at path: " +
-                      path_,
-                  3));
+  EXPECT_EQ(state(), "2.0 620 expecting 0 - 0; told 2 at 2.0");
+  LogCapture log;
+  reportDone(true, "2.0", 620);
+  EXPECT_EQ(state(), "2.0 620 expecting 0 - 0; told 2 at 2.0") << "the update was announced twice";
+  EXPECT_EQ(log.countContaining("Expected metadata change was already seen", 3), 1U) << log.dump();
+}
+
+TEST_F(SoftwareMapExpectedChangesTest, OtherOutcomesClearTheExpectationAndSaySo) {
+  struct Case {
+    std::string name;
+    std::string expectedVersion;
+    std::int64_t expectedStoreVersion;
+    std::optional<std::pair<std::string, std::int64_t>> onDisk;
+    bool success;
+    std::string state;
+    std::vector<std::pair<std::string, int>> lines;
+  };
+  const std::vector<Case> cases{
+      // Even with a changed record on disk, a failed update is not merged.
+      {"failed",
+       "2.0",
+       620,
+       std::pair{"2.0", 620},
+       false,
+       "1.0 610 expecting 0 - 0; told",
+       {{"SoftwareMap: Update did not happen, removed expectations of a product change at path: " +
+             path_,
+         3}}},
+      {"nothing changed",
+       "1.0",
+       610,
+       std::nullopt,
+       true,
+       "1.0 610 expecting 0 - 0; told",
+       {{"SoftwareMap: Warning: No change identified in reported product", 1}}},
+      {"other versions",
+       "3.0",
+       630,
+       std::pair{"2.5", 625},
+       true,
+       "2.5 625 expecting 0 - 0; told 2 at 2.5",
+       {{"SoftwareMap: Changed product bundle version (2.5) does not match expected value (3.0)",
+         1},
+        {"SoftwareMap: Changed product bundle version (625) does not match expected value (630)",
+         1}}},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    replaceBundleWith("1.0", 610);
+    map_->reloadFromApplicationRegistry();
+    map_->waitUntilIdle();
+    observer_ = std::make_shared<RecordingObserver>();
+    map_->addObserver(observer_);
+    LogCapture log;
+    map_->productAtPathWillBeUpdatedToBundleVersionStoreVersion(path_, c.expectedVersion,
+                                                                c.expectedStoreVersion);
+    if (c.onDisk) replaceBundleWith(c.onDisk->first, c.onDisk->second);
+    reportDone(c.success, c.expectedVersion, c.expectedStoreVersion);
+    EXPECT_EQ(state(), c.state);
+    for (const auto& [line, level] : c.lines) {
+      EXPECT_EQ(log.countContaining(line, level), 1U) << line << "\n" << log.dump();
+    }
+  }
 }
 
 TEST_F(SoftwareMapExpectedChangesTest, ReportsAboutUnknownPathsAreLoggedAndIgnored) {
@@ -118,55 +160,7 @@ TEST_F(SoftwareMapExpectedChangesTest, ReportsAboutUnknownPathsAreLoggedAndIgnor
                   "update reported at path: " +
                       unknown,
                   3));
-  expectNoExpectation(record_->snapshot());
-  EXPECT_TRUE(observer_->calls().empty());
-}
-
-TEST_F(SoftwareMapExpectedChangesTest, VersionsOtherThanExpectedAreReported) {
-  LogCapture log;
-  map_->productAtPathWillBeUpdatedToBundleVersionStoreVersion(path_, "3.0", 630);
-  replaceBundleWith("2.5", 625);
-  map_->productAtPathWasUpdatedToBundleVersionStoreVersion(path_, true, "3.0", 630);
-  map_->waitUntilIdle();
-  EXPECT_TRUE(
-      log.hasOnce("SoftwareMap: Changed product bundle version (2.5) does not match "
-                  "expected value (3.0)",
-                  1));
-  EXPECT_TRUE(
-      log.hasOnce("SoftwareMap: Changed product bundle version (625) does not match "
-                  "expected value (630)",
-                  1));
-  LedgerSoftwareProductFields fields = record_->snapshot();
-  EXPECT_EQ(fields.bundleVersion, "2.5");
-  expectNoExpectation(fields);
-  ASSERT_EQ(observer_->calls().size(), 1U);
-  EXPECT_EQ(observer_->calls()[0].state, kSoftwareProductChanged);
-}
-
-TEST_F(SoftwareMapExpectedChangesTest, CompletedUpdateThatChangedNothingIsNotAnnounced) {
-  LogCapture log;
-  map_->productAtPathWillBeUpdatedToBundleVersionStoreVersion(path_, "1.0", 610);
-  map_->productAtPathWasUpdatedToBundleVersionStoreVersion(path_, true, "1.0", 610);
-  map_->waitUntilIdle();
-  EXPECT_TRUE(observer_->calls().empty());
-  expectNoExpectation(record_->snapshot());
-  EXPECT_EQ(log.countContaining("Warning: No change identified in reported product", 1), 1U)
-      << log.dump();
-}
-
-TEST_F(SoftwareMapExpectedChangesTest, ScanThatSeesTheNewVersionFirstEndsTheExpectation) {
-  map_->productAtPathWillBeUpdatedToBundleVersionStoreVersion(path_, "2.0", 620);
-  replaceBundleWith("2.0", 620);
-  map_->reloadFromApplicationRegistry();
-  map_->waitUntilIdle();
-  expectNoExpectation(record_->snapshot());
-  EXPECT_EQ(record_->snapshot().bundleVersion, "2.0");
-  LogCapture log;
-  map_->productAtPathWasUpdatedToBundleVersionStoreVersion(path_, true, "2.0", 620);
-  map_->waitUntilIdle();
-  ASSERT_EQ(observer_->calls().size(), 1U) << "the update was announced twice";
-  EXPECT_EQ(observer_->calls()[0].state, kSoftwareProductChanged);
-  EXPECT_EQ(log.countContaining("Expected metadata change was already seen", 3), 1U) << log.dump();
+  EXPECT_EQ(state(), "1.0 610 expecting 0 - 0; told");
 }
 
 }  // namespace

@@ -1,6 +1,7 @@
 // Which record answers a bundle identifier that several installed copies
 // share.
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <set>
@@ -24,11 +25,8 @@ struct Copy {
 // Folder names of one arrangement. Two arrangements per case make the
 // winner's path sort before the loser's in one and after it in the other,
 // so that either copy is met first whatever order the map keeps.
-// Every layout has folders of its own.
 struct Layout {
-  std::string rootName;
-  std::string homeName;
-  std::string subfolderName;
+  std::string rootName, homeName, subfolderName;
 };
 
 struct PreferenceCase {
@@ -39,9 +37,14 @@ struct PreferenceCase {
   std::vector<Layout> layouts;
 };
 
+void PrintTo(const PreferenceCase& preference, std::ostream* out) {
+  *out << preference.name;
+}
+
 constexpr int kPairsPerLayout = 6;
 
-class SoftwareMapPreferenceTest : public ServiceTest {
+class PreferenceRuleTest : public ServiceTest,
+                           public ::testing::WithParamInterface<PreferenceCase> {
  protected:
   std::string folderFor(Place place, const Layout& layout) const {
     switch (place) {
@@ -56,134 +59,106 @@ class SoftwareMapPreferenceTest : public ServiceTest {
     }
     return {};
   }
-
-  // Installs kPairsPerLayout pairs of copies per layout and checks every
-  // lookup. Even layouts install the loser first and the winner with a later
-  // scan, odd ones the other way round, so that the map takes the records in
-  // both orders; the test checks that the lookups did meet the winner first
-  // as well as second.
-  void runCase(const PreferenceCase& preference) {
-    std::set<bool> winnerFirstSeen;
-    int layoutIndex = 0;
-    for (const Layout& layout : preference.layouts) {
-      useLayout(layout.rootName, layout.homeName);
-      struct Pair {
-        std::string identifier;
-        std::string winnerPath;
-        std::string loserPath;
-      };
-      const bool winnerFirst = layoutIndex % 2 == 1;
-      auto install = [&](const Copy& copy) {
-        std::vector<std::string> paths;
-        for (int i = 0; i < kPairsPerLayout; ++i) {
-          paths.push_back(makeStoreBundle(
-              folderFor(copy.place, layout), "P" + std::to_string(i),
-              "com.example.preference" + std::to_string(layoutIndex) + "." + std::to_string(i),
-              copy.version, 1000 + i));
-        }
-        return paths;
-      };
-      std::vector<std::string> firstPaths =
-          install(winnerFirst ? preference.winner : preference.loser);
-      SoftwareMap map(options(storePath("layout" + std::to_string(layoutIndex)), true));
-      map.waitUntilIdle();
-      std::vector<std::string> secondPaths =
-          install(winnerFirst ? preference.loser : preference.winner);
-      map.reloadFromApplicationRegistry();
-      map.waitUntilIdle();
-      ASSERT_EQ(map.allProducts().size(), static_cast<std::size_t>(kPairsPerLayout) * 2)
-          << "discovery missed a copy";
-      std::vector<Pair> pairs;
-      for (int i = 0; i < kPairsPerLayout; ++i) {
-        auto index = static_cast<std::size_t>(i);
-        pairs.push_back(
-            {"com.example.preference" + std::to_string(layoutIndex) + "." + std::to_string(i),
-             winnerFirst ? firstPaths[index] : secondPaths[index],
-             winnerFirst ? secondPaths[index] : firstPaths[index]});
-      }
-
-      // The order in which the map holds the records is the order in which
-      // the lookup meets them.
-      std::vector<std::string> order;
-      for (const auto& product : map.allProducts()) order.push_back(product->bundlePath());
-      auto position = [&](const std::string& path) {
-        return std::find(order.begin(), order.end(), path) - order.begin();
-      };
-
-      for (const Pair& pair : pairs) {
-        LogCapture log;
-        LedgerSoftwareProductRef found = map.productForBundleIdentifier(pair.identifier);
-        ASSERT_NE(found, nullptr) << pair.identifier;
-        EXPECT_EQ(found->bundlePath(), pair.winnerPath)
-            << preference.name << ": " << pair.identifier << "\n"
-            << log.dump();
-        std::string decidingLine =
-            std::string("SoftwareMap: Preferring (") + preference.rule + ") app version " +
-            preference.winner.version + " at " + pair.winnerPath + " over " +
-            (std::string_view(preference.rule) == "updatable" ? "non-updatable " : "") +
-            "version " + preference.loser.version + " at " + pair.loserPath;
-        EXPECT_EQ(log.countExactly(decidingLine, 1), 1U) << "expected: " << decidingLine << "\n"
-                                                         << log.dump();
-        std::vector<LogCapture::Line> warnings =
-            log.linesContaining("multiple matches for " + pair.identifier + " found");
-        ASSERT_EQ(warnings.size(), 1U) << log.dump();
-        EXPECT_EQ(warnings[0].level, 1);
-        EXPECT_NE(warnings[0].text.find("returning preferred result <LedgerSoftwareProduct:"),
-                  std::string::npos);
-        EXPECT_NE(warnings[0].text.find("bundlePath=" + pair.winnerPath + " "), std::string::npos)
-            << warnings[0].text;
-        winnerFirstSeen.insert(position(pair.winnerPath) < position(pair.loserPath));
-      }
-      ++layoutIndex;
-    }
-    EXPECT_EQ(winnerFirstSeen.size(), 2U)
-        << preference.name << ": the lookups never met the copies in both orders";
-  }
 };
 
-TEST_F(SoftwareMapPreferenceTest, CopyInApplicationsBeatsCopyInHomeWithEqualVersions) {
-  // The home copy has the shorter path, so only the folder rule can pick
-  // the other one.
-  runCase({"applications folder",
-           {Place::kRootApplications, "3.2"},
-           {Place::kHomeApplications, "3.2"},
-           "in /Applications",
-           {{"zz-platform-root", "h", "Sub"}, {"aa-platform-root", "i", "Sub"}}});
+// Even layouts install the loser first and the winner with a later scan,
+// odd ones the other way round, so that the map takes the records in both
+// orders; the test checks that the lookups did meet the winner first as
+// well as second.
+TEST_P(PreferenceRuleTest, TheRuleDecidesWhenTheEarlierOnesTie) {
+  const PreferenceCase& preference = GetParam();
+  std::set<bool> winnerFirstSeen;
+  for (std::size_t layoutIndex = 0; layoutIndex < preference.layouts.size(); ++layoutIndex) {
+    const Layout& layout = preference.layouts[layoutIndex];
+    useLayout(layout.rootName, layout.homeName);
+    const bool winnerFirst = layoutIndex % 2 == 1;
+    const auto identifier = [&](int i) {
+      return "com.example.preference" + std::to_string(layoutIndex) + "." + std::to_string(i);
+    };
+    auto install = [&](const Copy& copy) {
+      std::vector<std::string> paths;
+      for (int i = 0; i < kPairsPerLayout; ++i) {
+        paths.push_back(makeStoreBundle(folderFor(copy.place, layout), "P" + std::to_string(i),
+                                        identifier(i), copy.version, 1000 + i));
+      }
+      return paths;
+    };
+    std::vector<std::string> first = install(winnerFirst ? preference.winner : preference.loser);
+    SoftwareMap map(options(storePath("layout" + std::to_string(layoutIndex)), true));
+    map.waitUntilIdle();
+    std::vector<std::string> second = install(winnerFirst ? preference.loser : preference.winner);
+    map.reloadFromApplicationRegistry();
+    map.waitUntilIdle();
+    ASSERT_EQ(map.allProducts().size(), static_cast<std::size_t>(kPairsPerLayout) * 2);
+    // The order in which the map holds the records is the order in which
+    // the lookup meets them.
+    std::vector<std::string> order;
+    for (const auto& product : map.allProducts()) order.push_back(product->bundlePath());
+
+    for (int i = 0; i < kPairsPerLayout; ++i) {
+      const std::string& winner = (winnerFirst ? first : second)[static_cast<std::size_t>(i)];
+      const std::string& loser = (winnerFirst ? second : first)[static_cast<std::size_t>(i)];
+      LogCapture log;
+      LedgerSoftwareProductRef found = map.productForBundleIdentifier(identifier(i));
+      ASSERT_NE(found, nullptr) << identifier(i);
+      EXPECT_EQ(found->bundlePath(), winner) << log.dump();
+      const bool updatable = std::string_view(preference.rule) == "updatable";
+      EXPECT_TRUE(log.hasOnce(std::string("SoftwareMap: Preferring (") + preference.rule +
+                                  ") app version " + preference.winner.version + " at " + winner +
+                                  " over " + (updatable ? "non-updatable " : "") + "version " +
+                                  preference.loser.version + " at " + loser,
+                              1));
+      std::vector<LogCapture::Line> warnings =
+          log.linesContaining("multiple matches for " + identifier(i) + " found");
+      ASSERT_EQ(warnings.size(), 1U) << log.dump();
+      EXPECT_EQ(warnings[0].level, 1);
+      EXPECT_NE(warnings[0].text.find("returning preferred result <LedgerSoftwareProduct:"),
+                std::string::npos);
+      EXPECT_NE(warnings[0].text.find("bundlePath=" + winner + " "), std::string::npos)
+          << warnings[0].text;
+      winnerFirstSeen.insert(std::find(order.begin(), order.end(), winner) <
+                             std::find(order.begin(), order.end(), loser));
+    }
+  }
+  EXPECT_EQ(winnerFirstSeen.size(), 2U) << "the lookups never met the copies in both orders";
 }
 
-TEST_F(SoftwareMapPreferenceTest, CopyOnBootVolumeBeatsCopyOnOtherVolume) {
-  // The volume's copy has the shorter path; neither lies in /Applications.
-  runCase({"boot volume",
-           {Place::kHomeApplications, "1.0"},
-           {Place::kVolume, "1.0"},
-           "on boot volume",
-           {{"r", "a-rather-long-home-folder-name", "Sub"},
-            {"s", "zz-rather-long-home-folder-name", "Sub"}}});
-}
+INSTANTIATE_TEST_SUITE_P(
+    SoftwareMap, PreferenceRuleTest,
+    ::testing::Values(
+        // The home copy has the shorter path, so only the folder rule can
+        // pick the other one.
+        PreferenceCase{"CopyInApplicationsBeatsCopyInHome",
+                       {Place::kRootApplications, "3.2"},
+                       {Place::kHomeApplications, "3.2"},
+                       "in /Applications",
+                       {{"zz-platform-root", "h", "Sub"}, {"aa-platform-root", "i", "Sub"}}},
+        // The volume's copy has the shorter path; neither lies in /Applications.
+        PreferenceCase{"CopyOnBootVolumeBeatsCopyOnOtherVolume",
+                       {Place::kHomeApplications, "1.0"},
+                       {Place::kVolume, "1.0"},
+                       "on boot volume",
+                       {{"r", "a-rather-long-home-folder-name", "Sub"},
+                        {"s", "zz-rather-long-home-folder-name", "Sub"}}},
+        // "1.9" sorts after "1.10" as text and sits in /Applications.
+        PreferenceCase{"HigherVersionWinsNumerically",
+                       {Place::kHomeApplications, "1.10"},
+                       {Place::kRootApplications, "1.9"},
+                       "newer/higher",
+                       {{"r", "a-home", "Sub"}, {"s", "zz-home", "Sub"}}},
+        PreferenceCase{"WithEverythingElseEqualTheShorterPathWins",
+                       {Place::kRootApplications, "2.0"},
+                       {Place::kRootSubfolder, "2.0"},
+                       "shortest path",
+                       {{"root", "home", "Utilities"}, {"root2", "home2", "Apps"}}}),
+    [](const auto& info) { return std::string(info.param.name); });
 
-TEST_F(SoftwareMapPreferenceTest, HigherVersionWinsNumericallyNotAlphabetically) {
-  // "1.9" sorts after "1.10" as text and sits in /Applications.
-  runCase({"version",
-           {Place::kHomeApplications, "1.10"},
-           {Place::kRootApplications, "1.9"},
-           "newer/higher",
-           {{"r", "a-home", "Sub"}, {"s", "zz-home", "Sub"}}});
-}
-
-TEST_F(SoftwareMapPreferenceTest, WithEverythingElseEqualTheShorterPathWins) {
-  runCase({"shortest path",
-           {Place::kRootApplications, "2.0"},
-           {Place::kRootSubfolder, "2.0"},
-           "shortest path",
-           {{"root", "home", "Utilities"}, {"root2", "home2", "Apps"}}});
-}
+using SoftwareMapPreferenceTest = ServiceTest;
 
 // The higher version sits in /Applications, on the boot volume, with the
 // shorter path: only its folder having become read-only can make it lose.
 TEST_F(SoftwareMapPreferenceTest, UpdatableCopyBeatsHigherVersionThatCannotBeReplaced) {
-  Layout layout{"root", "home", "Locked"};
-  useLayout(layout.rootName, layout.homeName);
-  const std::string locked = rootApplications() + "/" + layout.subfolderName;
+  const std::string locked = rootApplications() + "/Locked";
   std::string higher = makeStoreBundle(locked, "Tool", "com.example.tool", "9.0", 77);
   std::string lower =
       makeStoreBundle(volumeApplications("D"), "Tool", "com.example.tool", "1.0", 77);
@@ -194,7 +169,9 @@ TEST_F(SoftwareMapPreferenceTest, UpdatableCopyBeatsHigherVersionThatCannotBeRep
   ASSERT_EQ(user.failure(), "");
   ASSERT_EQ(map.productForBundleIdentifier("com.example.tool")->bundlePath(), higher)
       << "while its folder can be written, the higher version wins";
-  lockFolder(locked);
+  ASSERT_EQ(::chmod(locked.c_str(), 0555), 0);
+  // Writable again before the temporary tree is removed, whatever happens.
+  std::shared_ptr<void> unlock(nullptr, [&](void*) { ::chmod(locked.c_str(), 0755); });
 
   LogCapture log;
   LedgerSoftwareProductRef found = map.productForBundleIdentifier("com.example.tool");
@@ -216,25 +193,17 @@ TEST_F(SoftwareMapPreferenceTest, RememberedCopyThatIsGoneLosesToUpdatableLowerV
     std::string present = makeStoreBundle(volumeApplications("D"), "G" + std::to_string(i),
                                           identifier, "1.0", 500 + i);
     std::string gone = rootApplications() + "/G" + std::to_string(i) + ".app";
-    for (const auto& [path, version] : {std::pair{present, "1.0"}, std::pair{gone, "8.0"}}) {
-      LedgerSoftwareProductFields fields;
-      fields.bundlePath = path;
-      fields.bundleIdentifier = identifier;
-      fields.bundleVersion = version;
-      fields.itemIdentifier = static_cast<std::uint64_t>(500 + i);
-      fields.installed = true;
-      fields.source = LedgerSoftwareProduct::kSourceRegistryOrPurchaseRecord;
-      records.push_back(fields);
-    }
+    const auto item = static_cast<std::uint64_t>(500 + i);
+    records.push_back(storedRecord(present, identifier, "1.0", item));
+    records.push_back(storedRecord(gone, identifier, "8.0", item));
     winnerAndLoser.emplace_back(present, gone);
   }
-  writeBytes(storePath(), archivedStore(records));
-  SoftwareMap map(options(storePath(), false));
+  std::unique_ptr<SoftwareMap> map = mapWithRecords(records);
   for (int i = 0; i < kPairsPerLayout; ++i) {
     const auto& [present, gone] = winnerAndLoser[static_cast<std::size_t>(i)];
     LogCapture log;
     LedgerSoftwareProductRef byBundle =
-        map.productForBundleIdentifier("com.example.gone" + std::to_string(i));
+        map->productForBundleIdentifier("com.example.gone" + std::to_string(i));
     ASSERT_NE(byBundle, nullptr);
     EXPECT_EQ(byBundle->bundlePath(), present);
     EXPECT_TRUE(log.hasOnce("SoftwareMap: Preferring (updatable) app version 1.0 at " + present +
@@ -242,27 +211,13 @@ TEST_F(SoftwareMapPreferenceTest, RememberedCopyThatIsGoneLosesToUpdatableLowerV
                             1));
     // The item identifier index follows the same preference.
     LedgerSoftwareProductRef byItem =
-        map.productForItemIdentifier(static_cast<std::uint64_t>(500 + i));
+        map->productForItemIdentifier(static_cast<std::uint64_t>(500 + i));
     ASSERT_NE(byItem, nullptr);
     EXPECT_EQ(byItem->bundlePath(), present);
     EXPECT_EQ(log.countContaining("multiple matches for " + std::to_string(500 + i) + " found", 1),
               1U)
         << log.dump();
   }
-}
-
-TEST_F(SoftwareMapPreferenceTest, SingleMatchNeedsNoDecision) {
-  std::string only = makeStoreBundle(rootApplications(), "Solo", "com.example.solo", "1.0", 9);
-  SoftwareMap map(options(storePath(), true));
-  map.waitUntilIdle();
-  LogCapture log;
-  LedgerSoftwareProductRef found = map.productForBundleIdentifier("com.example.solo");
-  ASSERT_NE(found, nullptr);
-  EXPECT_EQ(found->bundlePath(), only);
-  EXPECT_EQ(map.productForBundleIdentifier("com.example.absent"), nullptr);
-  EXPECT_EQ(map.productForItemIdentifier(424242), nullptr);
-  EXPECT_EQ(log.countContaining("Preferring"), 0U) << log.dump();
-  EXPECT_EQ(log.countContaining("multiple matches"), 0U) << log.dump();
 }
 
 }  // namespace

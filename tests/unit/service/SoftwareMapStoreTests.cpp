@@ -26,16 +26,12 @@ constexpr const char* kEmptySummaryLine =
 class SoftwareMapStoreTest : public ServiceTest {
  protected:
   LedgerSoftwareProductFields record(int index) const {
-    LedgerSoftwareProductFields fields;
-    fields.bundlePath = rootApplications() + "/Stored" + std::to_string(index) + ".app";
-    fields.bundleIdentifier = "com.example.stored" + std::to_string(index);
-    fields.bundleVersion = "1." + std::to_string(index);
-    fields.itemIdentifier = static_cast<std::uint64_t>(7000 + index);
-    fields.versionIdentifier = 100 + index;
-    fields.accountOpaqueID = "acct" + std::to_string(index);
+    const std::string n = std::to_string(index);
+    LedgerSoftwareProductFields fields =
+        storedRecord(rootApplications() + "/Stored" + n + ".app", "com.example.stored" + n,
+                     "1." + n, static_cast<std::uint64_t>(7000 + index), 100 + index);
+    fields.accountOpaqueID = "acct" + n;
     fields.purchaseDate = PlistDate{1400000000.0 + index};
-    fields.installed = true;
-    fields.source = LedgerSoftwareProduct::kSourceRegistryOrPurchaseRecord;
     return fields;
   }
 
@@ -84,53 +80,35 @@ TEST_F(SoftwareMapStoreTest, LaterMapAnswersFromWhatDiscoveryStored) {
       makeBundle(rootApplications() + "/Utilities", "Setup", "com.orvane.SetupHerald.Helper", "5.0",
                  std::nullopt, "512");
 
-  std::vector<LedgerSoftwareProductFields> discovered;
+  LedgerSoftwareProductFields n =
+      storedRecord(numericPath, "com.example.numeric", "2.4.1", 5551, 88);
+  n.accountOpaqueID = "opaque-numeric";
+  n.purchaseDate = PlistDate{1300000000.0};
+  std::vector<LedgerSoftwareProductFields> expected{
+      storedRecord(installerPath, "com.orvane.SetupHerald.Helper", "512"), n,
+      storedRecord(textualPath, "com.example.textual", "1.0", 1234567890123U, 42)};
+  const auto byPath = [](const auto& a, const auto& b) { return a.bundlePath < b.bundlePath; };
+  std::sort(expected.begin(), expected.end(), byPath);
+  const auto snapshots = [&](SoftwareMap& map) {
+    std::vector<LedgerSoftwareProductFields> fields;
+    for (const auto& product : map.allProducts()) fields.push_back(product->snapshot());
+    std::sort(fields.begin(), fields.end(), byPath);
+    return fields;
+  };
   {
     SoftwareMap first(options(storePath(), true));
     first.waitUntilIdle();
-    ASSERT_EQ(first.allProducts().size(), 3U);
-    for (const auto& product : first.allProducts()) discovered.push_back(product->snapshot());
+    ASSERT_TRUE(snapshots(first) == expected) << "discovery read other values";
   }
-  ASSERT_TRUE(std::filesystem::exists(storePath()));
-
-  // What discovery read, field by field.
-  auto fieldsAt = [&](const std::string& path) {
-    auto found = std::find_if(discovered.begin(), discovered.end(),
-                              [&](const auto& fields) { return fields.bundlePath == path; });
-    return found == discovered.end() ? LedgerSoftwareProductFields{} : *found;
-  };
-  LedgerSoftwareProductFields n = fieldsAt(numericPath);
-  EXPECT_EQ(n.bundleIdentifier, "com.example.numeric");
-  EXPECT_EQ(n.bundleVersion, "2.4.1");
-  EXPECT_EQ(n.itemIdentifier, 5551U);
-  EXPECT_EQ(n.versionIdentifier, 88);
-  EXPECT_EQ(n.accountOpaqueID, "opaque-numeric");
-  EXPECT_EQ(n.purchaseDate, PlistDate{1300000000.0});
-  EXPECT_TRUE(n.installed);
-  EXPECT_EQ(n.source, LedgerSoftwareProduct::kSourceRegistryOrPurchaseRecord);
-  LedgerSoftwareProductFields t = fieldsAt(textualPath);
-  EXPECT_EQ(t.itemIdentifier, 1234567890123U);
-  EXPECT_EQ(t.versionIdentifier, 42);
-  EXPECT_EQ(t.accountOpaqueID, std::nullopt);
-  EXPECT_EQ(t.purchaseDate, std::nullopt);
-  LedgerSoftwareProductFields s = fieldsAt(installerPath);
-  EXPECT_EQ(s.bundleIdentifier, "com.orvane.SetupHerald.Helper");
-  EXPECT_EQ(s.bundleVersion, "512");
-  EXPECT_EQ(s.itemIdentifier, std::nullopt);
-
   // A second process, without discovery, gives the same answers.
   SoftwareMap second(options(storePath(), false));
-  std::vector<std::string> expectedPaths{installerPath, numericPath, textualPath};
-  std::sort(expectedPaths.begin(), expectedPaths.end());
-  EXPECT_EQ(pathsOf(second.allProducts()), expectedPaths);
-  for (const LedgerSoftwareProductFields& fields : discovered) {
-    ASSERT_TRUE(fields.bundleIdentifier);
+  EXPECT_TRUE(snapshots(second) == expected);
+  for (const LedgerSoftwareProductFields& fields : expected) {
     LedgerSoftwareProductRef loaded = second.productForBundleIdentifier(*fields.bundleIdentifier);
     ASSERT_NE(loaded, nullptr) << *fields.bundleIdentifier;
-    EXPECT_EQ(loaded->snapshot(), fields) << loaded->description();
     if (fields.itemIdentifier) {
-      LedgerSoftwareProductRef byItem = second.productForItemIdentifier(*fields.itemIdentifier);
-      EXPECT_EQ(byItem, loaded) << "both indexes hold the same record";
+      EXPECT_EQ(second.productForItemIdentifier(*fields.itemIdentifier), loaded)
+          << "both indexes hold the same record";
     }
   }
   EXPECT_EQ(second.productForItemIdentifier(0), nullptr);
@@ -139,55 +117,53 @@ TEST_F(SoftwareMapStoreTest, LaterMapAnswersFromWhatDiscoveryStored) {
 TEST_F(SoftwareMapStoreTest, DamagedStoresGiveAnEmptyMap) {
   PlistData good = archivedStore(records(3));
   ASSERT_GT(good.size(), 64U);
-  for (std::size_t length : {std::size_t{1}, std::size_t{8}, std::size_t{9}, good.size() / 3,
-                             good.size() / 2, good.size() - 33, good.size() - 1}) {
-    PlistData truncated(good.begin(), good.begin() + static_cast<std::ptrdiff_t>(length));
-    expectEmptyMapFrom(truncated, "truncated-" + std::to_string(length), kNoDictionaryLine, 1);
-  }
-
+  auto archived = [](const PlistValue& root) { return KeyedArchive::archivedData(root); };
+  auto bytesOf = [](const std::string& text) { return PlistData(text.begin(), text.end()); };
   std::mt19937 generator(20240611);
   PlistData noise(4096);
   for (auto& byte : noise) byte = static_cast<std::uint8_t>(generator());
-  expectEmptyMapFrom(noise, "noise", kNoDictionaryLine, 1);
-  // Noise behind a valid header and a valid trailer's worth of bytes.
+  // Noise behind a valid header.
   PlistData headed = noise;
   std::copy_n(good.begin(), 8, headed.begin());
-  expectEmptyMapFrom(headed, "headed-noise", kNoDictionaryLine, 1);
   // The real store with its middle scrambled.
   PlistData scrambled = good;
   for (std::size_t i = scrambled.size() / 4; i < scrambled.size() / 2; ++i) {
     scrambled[i] = static_cast<std::uint8_t>(generator());
   }
-  expectEmptyMapFrom(scrambled, "scrambled", kNoDictionaryLine, 1);
-
   PlistDictionary evil = KeyedArchive::record("Evil");
   evil.emplace("bundlePath", rootApplications() + "/Evil.app");
-  PlistDictionary byPath;
-  byPath.emplace(record(0).bundlePath, LedgerSoftwareProduct(record(0)).encodeWithCoder());
-  byPath.emplace(rootApplications() + "/Evil.app", evil);
-  expectEmptyMapFrom(KeyedArchive::archivedData(KeyedArchive::dictionary(
-                         {{"appsByPath", KeyedArchive::dictionary(std::move(byPath))}})),
-                     "evil-class", kNoDictionaryLine, 1);
+  PlistDictionary byPath{{record(0).bundlePath, LedgerSoftwareProduct(record(0)).encodeWithCoder()},
+                         {rootApplications() + "/Evil.app", evil}};
 
-  expectEmptyMapFrom(KeyedArchive::archivedData(
-                         KeyedArchive::array({LedgerSoftwareProduct(record(0)).encodeWithCoder()})),
-                     "array-root", kNoDictionaryLine, 1);
-  expectEmptyMapFrom(KeyedArchive::archivedData(PlistArray{"plain"}), "plain-array-root",
-                     kNoDictionaryLine, 1);
-  expectEmptyMapFrom(KeyedArchive::archivedData(KeyedArchive::dictionary({{"appsByPath", "text"}})),
-                     "string-entry", kNoDictionaryLine, 1);
-  expectEmptyMapFrom(KeyedArchive::archivedData(KeyedArchive::dictionary({{"other", "text"}})),
-                     "no-entry", kNoDictionaryLine, 1);
-  expectEmptyMapFrom(
-      PropertyListSerialization::writeBinary(PlistDictionary{{"appsByPath", PlistDictionary{}}}),
-      "not-an-archive", kNoDictionaryLine, 1);
-  PlistData xml;
-  std::string text = PropertyListSerialization::writeXml(PlistDictionary{{"appsByPath", 1}});
-  xml.assign(text.begin(), text.end());
-  expectEmptyMapFrom(xml, "xml", kNoDictionaryLine, 1);
-
-  expectEmptyMapFrom(PlistData{}, "empty", kNotFoundLine, 2);
-  expectEmptyMapFrom(std::nullopt, "missing", kNotFoundLine, 2);
+  struct Case {
+    std::string name;
+    std::optional<PlistData> bytes;  // nullopt: no file
+    const char* line = kNoDictionaryLine;
+    int level = 1;
+  };
+  std::vector<Case> cases{
+      {"noise", noise},
+      {"headed-noise", headed},
+      {"scrambled", scrambled},
+      {"evil-class", archived(KeyedArchive::dictionary(
+                         {{"appsByPath", KeyedArchive::dictionary(std::move(byPath))}}))},
+      {"array-root",
+       archived(KeyedArchive::array({LedgerSoftwareProduct(record(0)).encodeWithCoder()}))},
+      {"plain-array-root", archived(PlistArray{"plain"})},
+      {"string-entry", archived(KeyedArchive::dictionary({{"appsByPath", "text"}}))},
+      {"no-entry", archived(KeyedArchive::dictionary({{"other", "text"}}))},
+      {"not-an-archive",
+       PropertyListSerialization::writeBinary(PlistDictionary{{"appsByPath", PlistDictionary{}}})},
+      {"xml", bytesOf(PropertyListSerialization::writeXml(PlistDictionary{{"appsByPath", 1}}))},
+      {"empty", PlistData{}, kNotFoundLine, 2},
+      {"missing", std::nullopt, kNotFoundLine, 2},
+  };
+  for (std::size_t length : {std::size_t{1}, std::size_t{8}, std::size_t{9}, good.size() / 3,
+                             good.size() / 2, good.size() - 33, good.size() - 1}) {
+    cases.push_back({"truncated-" + std::to_string(length),
+                     PlistData(good.begin(), good.begin() + static_cast<std::ptrdiff_t>(length))});
+  }
+  for (const Case& c : cases) expectEmptyMapFrom(c.bytes, c.name, c.line, c.level);
 }
 
 TEST_F(SoftwareMapStoreTest, DamagedStoreIsReplacedByTheNextDiscovery) {
@@ -228,40 +204,30 @@ TEST_F(SoftwareMapStoreTest, RecordsThatBreakTheirOwnRulesAreDroppedAlone) {
 
 TEST_F(SoftwareMapStoreTest, SmallStoreIsDescribedInTheLogLineLargeOneInASideFile) {
   const std::string sideFile = stateFolder() + "/appsByPath.plist";
-  {
-    writeBytes(storePath("five"), archivedStore(records(5)));
-    LogCapture log;
-    SoftwareMap map(options(storePath("five"), false));
-    map.waitUntilIdle();
+  for (int count : {5, 6}) {
+    SCOPED_TRACE(count);
     PlistDictionary described;
-    for (const auto& fields : records(5)) {
+    for (const auto& fields : records(count)) {
       described.emplace(fields.bundlePath, LedgerSoftwareProduct(fields).toDictionary());
     }
-    std::string expected = "SoftwareMap: After loading persisted store, SoftwareMap is " +
-                           describePlistValue(PlistValue(described));
-    EXPECT_TRUE(log.hasOnce(expected, 2));
-    EXPECT_NE(expected.find("bundleIdentifier = \"com.example.stored4\";"), std::string::npos);
-    EXPECT_EQ(log.countContaining("items"), 0U);
-    EXPECT_FALSE(std::filesystem::exists(sideFile));
-  }
-  {
-    writeBytes(storePath("six"), archivedStore(records(6)));
+    const std::string path = storePath(std::to_string(count));
+    writeBytes(path, archivedStore(records(count)));
     LogCapture log;
-    SoftwareMap map(options(storePath("six"), false));
+    SoftwareMap map(options(path, false));
     map.waitUntilIdle();
-    EXPECT_TRUE(
-        log.hasOnce("SoftwareMap: After loading persisted store, SoftwareMap has 6 items", 2));
-    EXPECT_EQ(log.countContaining("After loading persisted store, SoftwareMap is"), 0U);
+    const std::string prefix = "SoftwareMap: After loading persisted store, SoftwareMap ";
+    if (count == 5) {
+      const std::string description = describePlistValue(PlistValue(described));
+      EXPECT_NE(description.find("bundleIdentifier = \"com.example.stored4\";"), std::string::npos);
+      EXPECT_TRUE(log.hasOnce(prefix + "is " + description, 2));
+      EXPECT_FALSE(std::filesystem::exists(sideFile));
+      continue;
+    }
+    EXPECT_TRUE(log.hasOnce(prefix + "has 6 items", 2));
+    EXPECT_EQ(log.countContaining(prefix + "is"), 0U);
     std::optional<PlistData> bytes = FileIO::read(sideFile).optional();
     ASSERT_TRUE(bytes) << sideFile;
-    std::optional<PlistValue> side = PropertyListSerialization::read(*bytes);
-    ASSERT_TRUE(side && side->dictionary());
-    ASSERT_EQ(side->dictionary()->size(), 6U);
-    for (const auto& fields : records(6)) {
-      EXPECT_EQ((*side)[fields.bundlePath],
-                PlistValue(LedgerSoftwareProduct(fields).toDictionary()))
-          << fields.bundlePath;
-    }
+    EXPECT_EQ(PropertyListSerialization::read(*bytes), PlistValue(described));
   }
 }
 
@@ -306,15 +272,10 @@ TEST_F(SoftwareMapStoreTest, StartRemovesStaleTemporariesAndAFailedWriteIsNotRep
 TEST_F(SoftwareMapStoreTest, LookupRightAfterConstructionWaitsForTheLoad) {
   constexpr int kRecords = 5000;
   std::vector<LedgerSoftwareProductFields> many;
-  many.reserve(kRecords);
   for (int i = 0; i < kRecords; ++i) {
-    LedgerSoftwareProductFields fields;
-    fields.bundlePath = "/Applications/Bulk" + std::to_string(i) + ".app";
-    fields.bundleIdentifier = "com.example.bulk" + std::to_string(i);
-    fields.bundleVersion = "1.0";
-    fields.itemIdentifier = static_cast<std::uint64_t>(900000 + i);
-    fields.installed = true;
-    many.push_back(std::move(fields));
+    const std::string n = std::to_string(i);
+    many.push_back(
+        storedRecord("/Applications/Bulk" + n + ".app", "com.example.bulk" + n, "1.0", 900000 + i));
   }
   writeBytes(storePath(), archivedStore(many));
   // Detail logging would describe every record; the barrier is the subject.
