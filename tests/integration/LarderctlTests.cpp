@@ -14,9 +14,6 @@ std::string firstLine(const std::string& text) {
   return text.substr(0, text.find('\n'));
 }
 
-// A port on loopback with nobody behind it.
-constexpr char kClosedStoreURL[] = "http://127.0.0.1:9/bag";
-
 using LarderctlTest = StoreAndServiceTest;
 
 TEST_F(LarderctlTest, BadCommandLinesAreUsageErrorsThatNameWhatIsWrong) {
@@ -77,7 +74,7 @@ TEST_F(LarderctlTest, AStoreThatIsAwayOrFailsIsNamedAndAFailedCheckClaimsNothing
   for (const bool away : {true, false}) {
     SCOPED_TRACE(away ? "away" : "failing");
     if (away) {
-      startService(kClosedStoreURL);
+      startService(kNoStoreURL);
     } else {
       start({"available-software-updates=500"});
     }
@@ -86,8 +83,7 @@ TEST_F(LarderctlTest, AStoreThatIsAwayOrFailsIsNamedAndAFailedCheckClaimsNothing
     EXPECT_TRUE(firstLine(ran.errors).starts_with("larderctl: the update check failed: "))
         << ran.errors;
     if (away) {
-      EXPECT_NE(firstLine(ran.errors).find(std::string("(") + kClosedStoreURL + ")"),
-                std::string::npos)
+      EXPECT_NE(firstLine(ran.errors).find(std::string("(") + kNoStoreURL + ")"), std::string::npos)
           << ran.errors;
     }
     EXPECT_EQ(ran.output.find("No updates available"), std::string::npos) << ran.output;
@@ -106,10 +102,10 @@ TEST_F(LarderctlTest, NothingToUpdateHasItsOwnExitStatus) {
 }
 
 TEST_F(LarderctlTest, WatchRegistersAgainWhenTheServiceRestarts) {
-  startService(kClosedStoreURL);
+  startService(kNoStoreURL);
   Larderctl watch(platform_, bus_, std::vector<std::string>{"watch"}, "watch");
   ASSERT_TRUE(watch.waitForError("watching the software map")) << watch.errors();
-  startService(kClosedStoreURL);
+  startService(kNoStoreURL);
   ASSERT_TRUE(watch.waitForError("larderd restarted; watching again", 20s)) << watch.errors();
   platform_.installBundle({applications(), "Birch", "com.example.birch", "1.0", 102});
   EXPECT_TRUE(eventually(

@@ -454,14 +454,8 @@ TEST_F(ServiceTest, LarderctlWatchPrintsObserverCallbacks) {
   updater->call("ProductAtPathWasUpdatedToBundleVersionStoreVersion",
                 {foo, true, "1.5", std::int64_t{3}});
 
-  auto printed = [&] {
-    std::ifstream file(output);
-    std::string line;
-    std::getline(file, line);
-    return line;
-  };
-  ASSERT_TRUE(eventually([&] { return !printed().empty(); }));
-  auto line = nlohmann::json::parse(printed());
+  ASSERT_TRUE(eventually([&] { return readFile(output).find('\n') != std::string::npos; }));
+  const auto line = nlohmann::json::parse(readFile(output).substr(0, readFile(output).find('\n')));
   EXPECT_EQ(line["stateName"], "Changed");
   EXPECT_EQ(line["product"]["bundleVersion"], "1.5");
   EXPECT_EQ(watch.stop(SIGINT), 0);

@@ -15,6 +15,9 @@
 
 namespace larder::testing {
 
+// A store URL on loopback with nobody behind it (the discard port).
+constexpr char kNoStoreURL[] = "http://127.0.0.1:9/bag.plist";
+
 // Speaking to the store over HTTP with the runtime's own transport.
 inline std::string text(const PlistValue& value) {
   return value.string() ? *value.string() : "<absent>";
