@@ -17,7 +17,7 @@
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
 #include "store-runtime/http/VendGzip.h"
-#include "tests/integration/ServiceHarness.h"
+#include "tests/integration/LarderctlProcess.h"
 
 namespace larder::testing {
 namespace {
@@ -322,10 +322,14 @@ struct Heard {
   }
 };
 
+// Observers on the bus, `larderctl --json watch` among them, hear an
+// announced update once.
 TEST_F(ServiceTest, ObserversHearChangesAndAGoneClientCostsNothing) {
   std::string foo = installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
   auto service = startService();
   ASSERT_TRUE(service->waitForLog("Software map rebuild took"));
+  Larderctl watch(platform, bus, std::vector<std::string>{"--json", "watch"}, "watch");
+  ASSERT_TRUE(service->waitForLog("SoftwareMap added observer with token"));
 
   auto staying = connectClient(bus);
   Heard heard;
@@ -352,6 +356,15 @@ TEST_F(ServiceTest, ObserversHearChangesAndAGoneClientCostsNothing) {
       field(ask(*updater, "ProductForBundleIdentifier", {"com.example.foo"}), "bundleVersion"),
       "2.0");
   EXPECT_TRUE(service->logLines("does not match expected value").empty());
+  ASSERT_TRUE(eventually([&] { return watch.output().find('\n') != std::string::npos; }));
+  const auto printed = nlohmann::json::parse(watch.output().substr(0, watch.output().find('\n')));
+  EXPECT_EQ(printed["stateName"], "Changed");
+  EXPECT_EQ(printed["product"]["bundleVersion"], "2.0");
+  const auto removed = service->logLines("Removed SoftwareMap observer for token").size();
+  EXPECT_EQ(watch.process().stop(SIGINT), 0);
+  EXPECT_TRUE(eventually([&] {
+    return service->logLines("Removed SoftwareMap observer for token").size() > removed;
+  })) << "SIGINT unregisters the watch";
 
   staying->call("RemoveSoftwareMapObserver", {token});
   staying->call("RemoveSoftwareMapObserver", {emptyToken});
@@ -436,30 +449,6 @@ TEST_F(ServiceTest, OlderSoftwareOfTheMakerIsFoundFromItsMinimumVersionOn) {
       << "exactly the minimum version is enough";
   EXPECT_TRUE(ask(*client, "ProductForBundleIdentifier", {"com.orvane.Anvil.Tally"}).empty());
   EXPECT_TRUE(ask(*client, "ProductForBundleIdentifier", {"com.orvane.Unlisted"}).empty());
-}
-
-TEST_F(ServiceTest, LarderctlWatchPrintsObserverCallbacks) {
-  std::string foo = installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
-  auto service = startService();
-  ASSERT_TRUE(service->waitForLog("Software map rebuild took"));
-  std::string output = platform.directory() + "/watch.out";
-  ChildProcess watch({LARDERCTL_PATH, "--json", "watch"}, platform.environment(bus), output,
-                     platform.directory() + "/watch.err");
-  ASSERT_TRUE(service->waitForLog("SoftwareMap added observer with token"));
-
-  auto updater = connectClient(bus);
-  updater->call("ProductAtPathWillBeUpdatedToBundleVersionStoreVersion",
-                {foo, "1.5", std::int64_t{3}});
-  TemporaryPlatform::writePurchaseRecord(foo, "com.example.foo", "1.5", 5, 3);
-  updater->call("ProductAtPathWasUpdatedToBundleVersionStoreVersion",
-                {foo, true, "1.5", std::int64_t{3}});
-
-  ASSERT_TRUE(eventually([&] { return readFile(output).find('\n') != std::string::npos; }));
-  const auto line = nlohmann::json::parse(readFile(output).substr(0, readFile(output).find('\n')));
-  EXPECT_EQ(line["stateName"], "Changed");
-  EXPECT_EQ(line["product"]["bundleVersion"], "1.5");
-  EXPECT_EQ(watch.stop(SIGINT), 0);
-  EXPECT_TRUE(service->waitForLog("Removed SoftwareMap observer for token"));
 }
 
 }  // namespace
