@@ -36,14 +36,6 @@ inline VendHTTPTransfer::Result get(const std::string& url, double timeout = 10)
   request.setTimeoutInterval(timeout);
   return VendHTTPTransfer::perform(request);
 }
-inline VendURLRequest postRequest(const std::string& url, const PlistValue& body) {
-  VendURLRequest request(url);
-  request.setMethod("POST");
-  request.setValue("application/x-plist", "Content-Type");
-  request.setBody(dataOf(PropertyListSerialization::writeXml(body)));
-  request.setTimeoutInterval(10);
-  return request;
-}
 
 // larder-store serving a catalogue on a free port of 127.0.0.1, for as long
 // as the object lives. Its standard output and error go to files of a
