@@ -380,17 +380,17 @@ TEST_F(DmapDumpTest, PrintsTheDecodedDocumentAsJson) {
 }
 
 TEST_F(DmapDumpTest, RefusesWhatItCannotReadOrDecode) {
-  const LarderctlRun missing = larderctl({"dmap-dump", platform_.directory() + "/absent.dmap"});
-  EXPECT_EQ(missing.status, 1);
-  EXPECT_NE(missing.errors.find("cannot read"), std::string::npos) << missing.errors;
-  EXPECT_TRUE(missing.output.empty());
-
   PlistData truncated = sampleDocument();
   truncated.resize(truncated.size() - 3);
-  const LarderctlRun cut = larderctl({"dmap-dump", writeDocument("cut.dmap", truncated)});
-  EXPECT_EQ(cut.status, 1);
-  EXPECT_NE(cut.errors.find("is not a DMAP document"), std::string::npos) << cut.errors;
-  EXPECT_TRUE(cut.output.empty());
+  for (const auto& [path, error] :
+       {std::pair{platform_.directory() + "/absent.dmap", "cannot read"},
+        std::pair{writeDocument("cut.dmap", truncated), "is not a DMAP document"}}) {
+    SCOPED_TRACE(error);
+    const LarderctlRun run = larderctl({"dmap-dump", path});
+    EXPECT_EQ(run.status, 1);
+    EXPECT_NE(run.errors.find(error), std::string::npos) << run.errors;
+    EXPECT_TRUE(run.output.empty());
+  }
 }
 
 }  // namespace

@@ -16,6 +16,7 @@
 #include "tests/integration/ServiceHarness.h"
 #include "tests/integration/StoreCatalogueBuilder.h"
 #include "tests/integration/StoreServerProcess.h"
+#include "tests/unit/ScopedEnvironment.h"
 
 namespace larder::testing {
 
@@ -61,6 +62,10 @@ class LogLines {
 // 127.0.0.1, with a private platform root.
 class InProcessRuntimeTest : public ::testing::Test {
  protected:
+  InProcessRuntimeTest() {
+    environment_.set("LARDER_ROOT", platform_.root());
+    environment_.set("XDG_CONFIG_HOME", platform_.home() + "/.config");
+  }
   void TearDown() override { VendRuntime::setShared(nullptr); }
 
   // Starts the store with these faults and a runtime that talks to it.
@@ -99,8 +104,7 @@ class InProcessRuntimeTest : public ::testing::Test {
   }
 
   TemporaryPlatform platform_;
-  ScopedEnvironment environment_{
-      {{"LARDER_ROOT", platform_.root()}, {"XDG_CONFIG_HOME", platform_.home() + "/.config"}}};
+  ScopedEnvironment environment_;
   StoreCatalogueBuilder catalogue_;
   std::unique_ptr<StoreServerProcess> store_;
   std::shared_ptr<VendRuntime> runtime_;

@@ -75,12 +75,4 @@ inline LarderctlRun runLarderctl(const std::string& filesPrefix,
   return run;
 }
 
-// The same against the service on `bus`; `name` names its files.
-inline LarderctlRun runLarderctl(const TemporaryPlatform& platform, const PrivateBus& bus,
-                                 const std::vector<std::string>& arguments, const std::string& name,
-                                 std::chrono::milliseconds timeout = std::chrono::seconds(90)) {
-  return runLarderctl(platform.directory() + "/" + name, arguments, platform.environment(bus),
-                      timeout);
-}
-
 }  // namespace larder::testing

@@ -3,85 +3,33 @@
 // exit status and the first line of what was said.
 #include <gtest/gtest.h>
 
-#include <filesystem>
-#include <memory>
-
-#include "tests/integration/LarderctlProcess.h"
-#include "tests/integration/ServiceHarness.h"
-#include "tests/integration/StoreCatalogueBuilder.h"
-#include "tests/integration/StoreServerProcess.h"
+#include "tests/integration/StoreAndService.h"
 
 namespace larder::testing {
 namespace {
 
-namespace fs = std::filesystem;
 using namespace std::chrono_literals;
-
-constexpr char kShopper[] = "shopper@example.org";
-constexpr char kPassword[] = "open sesame";
 
 std::string firstLine(const std::string& text) {
   return text.substr(0, text.find('\n'));
 }
 
-// A port on loopback with nobody behind it.
-std::string closedStoreURL() {
-  return "http://127.0.0.1:9/bag";
-}
-
-class LarderctlTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    catalogue_.addAccount({.accountID = 8123, .orvaneID = kShopper, .password = kPassword});
-    catalogue_.addItem(
-        {.wareID = 901, .bundleID = "com.example.Atlas", .title = "Atlas", .version = "3.1"});
-  }
-
-  void startService(const std::string& storeURL, std::vector<std::string> arguments = {}) {
-    service_.reset();
-    service_ = std::make_unique<ServiceProcess>(
-        platform_, bus_, std::move(arguments),
-        std::map<std::string, std::string>{{"LARDER_STORE_URL", storeURL},
-                                           {"LARDER_STORE_TIMEOUT", "5"}});
-    ASSERT_TRUE(service_->waitUntilServing()) << service_->log();
-  }
-
-  void startStoreAndService(const std::vector<std::string>& faults = {}) {
-    store_ = std::make_unique<StoreServerProcess>(catalogue_.directory(), faults);
-    startService(store_->bagURL());
-  }
-
-  LarderctlRun run(const std::vector<std::string>& arguments,
-                   std::map<std::string, std::string> environment = {}) {
-    auto merged = platform_.environment(bus_);
-    for (auto& [name, value] : environment) merged[name] = std::move(value);
-    return runLarderctl(platform_.directory() + "/larderctl-" + std::to_string(++runs_), arguments,
-                        merged);
-  }
-
-  StoreCatalogueBuilder catalogue_;
-  std::unique_ptr<StoreServerProcess> store_;
-  TemporaryPlatform platform_;
-  PrivateBus bus_;
-  std::unique_ptr<ServiceProcess> service_;
-  int runs_ = 0;
-};
+using LarderctlTest = StoreAndServiceTest;
 
 TEST_F(LarderctlTest, BadCommandLinesAreUsageErrorsThatNameWhatIsWrong) {
   struct Row {
     std::vector<std::string> arguments;
     std::string firstLine;
   };
+  const std::string kTimeout = "larderctl: --timeout: seconds to wait are a number above 0";
   const std::vector<Row> rows{
       {{"purchase", "-5"},
        "larderctl: item: a store item identifier is a whole number from 1 to "
        "18446744073709551615, not '-5'; see `larderctl purchase --help`"},
       {{"product", "--item-id", "0"}, "larderctl: --item-id: a store item identifier"},
       {{"--client-type", "9", "products"}, "larderctl: --client-type: Value 9 not in range 0 to 4"},
-      {{"--timeout", "-1", "products"},
-       "larderctl: --timeout: seconds to wait are a number above 0"},
-      {{"--timeout", "0", "products"},
-       "larderctl: --timeout: seconds to wait are a number above 0"},
+      {{"--timeout", "-1", "products"}, kTimeout},
+      {{"--timeout", "0", "products"}, kTimeout},
       {{"downloads", "--mask", "4"}, "larderctl: --mask: Value 4 not in range 1 to 3"},
       {{"call", "ProductForItemIdentifier", "notanumber"},
        "larderctl: argument 1 of ProductForItemIdentifier (t) must be a whole number from 0 to "
@@ -123,85 +71,46 @@ TEST_F(LarderctlTest, WithoutServiceOrBusTheErrorSaysWhatToLookAt) {
 }
 
 TEST_F(LarderctlTest, AStoreThatIsAwayOrFailsIsNamedAndAFailedCheckClaimsNothing) {
-  startService(closedStoreURL());
-  LarderctlRun ran = run({"updates", "--check"});
-  EXPECT_EQ(ran.status, 1);
-  EXPECT_TRUE(firstLine(ran.errors).starts_with("larderctl: the update check failed: "))
-      << ran.errors;
-  EXPECT_NE(firstLine(ran.errors).find("(" + closedStoreURL() + ")"), std::string::npos)
-      << ran.errors;
-  EXPECT_EQ(ran.output.find("No updates available"), std::string::npos) << ran.output;
-
-  startStoreAndService({"available-software-updates=500"});
-  ran = run({"updates", "--check"});
-  EXPECT_EQ(ran.status, 1);
-  EXPECT_TRUE(firstLine(ran.errors).starts_with("larderctl: the update check failed: "))
-      << ran.errors;
-  EXPECT_EQ(ran.output.find("No updates available"), std::string::npos) << ran.output;
+  for (const bool away : {true, false}) {
+    SCOPED_TRACE(away ? "away" : "failing");
+    if (away) {
+      startService(kNoStoreURL);
+    } else {
+      start({"available-software-updates=500"});
+    }
+    const LarderctlRun ran = run({"updates", "--check"});
+    EXPECT_EQ(ran.status, 1);
+    EXPECT_TRUE(firstLine(ran.errors).starts_with("larderctl: the update check failed: "))
+        << ran.errors;
+    if (away) {
+      EXPECT_NE(firstLine(ran.errors).find(std::string("(") + kNoStoreURL + ")"), std::string::npos)
+          << ran.errors;
+    }
+    EXPECT_EQ(ran.output.find("No updates available"), std::string::npos) << ran.output;
+  }
 }
 
 TEST_F(LarderctlTest, NothingToUpdateHasItsOwnExitStatus) {
-  startStoreAndService();
+  start();
   const LarderctlRun ran = run({"updates", "--check"});
   EXPECT_EQ(ran.status, 3) << ran.errors << service_->log();
   EXPECT_EQ(firstLine(ran.output), "No updates available.");
-  const LarderctlRun nobody = run({"account"});
+  EXPECT_EQ(run({"account"}).status, 1);
   const LarderctlRun nobodyAsJSON = run({"--json", "account"});
-  EXPECT_EQ(nobody.status, 1);
   EXPECT_EQ(nobodyAsJSON.status, 1);
   EXPECT_EQ(firstLine(nobodyAsJSON.output), "null");
 }
 
-TEST_F(LarderctlTest, ASignInThatNobodyWasAskedForSaysHowToRunAnAgent) {
-  startStoreAndService();
-  const LarderctlRun ran = run({"purchase", "901"});
-  EXPECT_EQ(ran.status, 1);
-  EXPECT_TRUE(firstLine(ran.errors)
-                  .starts_with("larderctl: the purchase of item 901 failed: No one was asked to "
-                               "sign in: no dialog agent "
-                               "is registered with the service. Run `larderctl agent`"))
-      << ran.errors;
-}
-
-// An older copy of the item stays installed when the new download fails its
-// digests: success must come from the download, not from finding a bundle of
-// the item on disk.
-TEST_F(LarderctlTest, APurchaseWhoseDownloadFailsIsAFailureEvenWithAnOlderCopyInstalled) {
-  const std::string applications = platform_.root() + "/Applications";
-  const std::string installed =
-      platform_.installBundle({applications, "Atlas", "com.example.Atlas", "2.0", 901});
-  startStoreAndService({"assets=corrupt"});
-  ASSERT_EQ(run({"signin", kShopper, "--password", kPassword}).status, 0) << service_->log();
-  const LarderctlRun ran = run({"purchase", "901"});
-  EXPECT_EQ(ran.status, 1) << ran.output << ran.errors;
-  EXPECT_TRUE(firstLine(ran.errors)
-                  .starts_with("larderctl: the download of Atlas (item 901) "
-                               "failed: "))
-      << ran.errors;
-  EXPECT_EQ(ran.output.find("installed Atlas"), std::string::npos) << ran.output;
-  EXPECT_NE(readFile(installed + "/bundle.plist").find("2.0"), std::string::npos);
-}
-
 TEST_F(LarderctlTest, WatchRegistersAgainWhenTheServiceRestarts) {
-  startService(closedStoreURL());
+  startService(kNoStoreURL);
   Larderctl watch(platform_, bus_, std::vector<std::string>{"watch"}, "watch");
   ASSERT_TRUE(watch.waitForError("watching the software map")) << watch.errors();
-  startService(closedStoreURL());
+  startService(kNoStoreURL);
   ASSERT_TRUE(watch.waitForError("larderd restarted; watching again", 20s)) << watch.errors();
-  platform_.installBundle(
-      {platform_.root() + "/Applications", "Birch", "com.example.birch", "1.0", 102});
+  platform_.installBundle({applications(), "Birch", "com.example.birch", "1.0", 102});
   EXPECT_TRUE(eventually(
       [&] { return watch.output().find("com.example.birch") != std::string::npos; }, 20s))
       << watch.output() << watch.errors() << service_->log();
-}
-
-TEST_F(LarderctlTest, LarderdSaysWhichArgumentItIgnoresAndServesAllTheSame) {
-  startService(closedStoreURL(), {"--help"});
-  EXPECT_TRUE(
-      service_->waitForLog("larderd " LARDER_VERSION
-                           ": ignoring \"--help\" (the only argument is \"daemon\"); serving "
-                           "as com.orvane.larderd."))
-      << service_->log();
 }
 
 }  // namespace

@@ -3,10 +3,6 @@
 // 127.0.0.1 and against no store at all.
 #include <gtest/gtest.h>
 
-#include <netinet/in.h>
-#include <sys/socket.h>
-#include <unistd.h>
-
 #include <optional>
 #include <string>
 #include <vector>
@@ -28,19 +24,6 @@ constexpr char kOddAccount[] = "an id/with spaces & more=signs";
 constexpr std::uint64_t kItemID = 3001;
 constexpr char kWrongEnvironment[] = "SoftwareMap: App may be from wrong environment!";
 
-// A loopback port on which nothing listens: bound, then closed.
-int closedPort() {
-  const int socket = ::socket(AF_INET, SOCK_STREAM, 0);
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t length = sizeof(address);
-  ::bind(socket, reinterpret_cast<sockaddr*>(&address), length);
-  ::getsockname(socket, reinterpret_cast<sockaddr*>(&address), &length);
-  ::close(socket);
-  return ntohs(address.sin_port);
-}
-
 class OrvaneIDLookupTest : public InProcessRuntimeTest {
  protected:
   void SetUp() override {
@@ -54,7 +37,7 @@ class OrvaneIDLookupTest : public InProcessRuntimeTest {
                            .opaqueID = kOddAccount});
   }
 
-  void useNoStore() { useBag("http://127.0.0.1:" + std::to_string(closedPort()) + "/bag.plist"); }
+  void useNoStore() { useBag(kNoStoreURL); }
 
   // An installed application whose purchase record names `account`; no
   // record without one.

@@ -17,7 +17,7 @@
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
 #include "store-runtime/http/VendGzip.h"
-#include "tests/integration/ServiceHarness.h"
+#include "tests/integration/LarderctlProcess.h"
 
 namespace larder::testing {
 namespace {
@@ -40,6 +40,13 @@ class ServiceTest : public ::testing::Test {
         std::make_unique<ServiceProcess>(platform, bus, std::move(arguments), std::move(env));
     EXPECT_TRUE(service->waitUntilServing()) << service->log();
     return service;
+  }
+
+  // Runs the service once, to its first write of the map.
+  void persistTheMap() {
+    auto first = startService();
+    ASSERT_TRUE(first->waitForLog("Updated persisted SoftwareMap at")) << first->log();
+    first->stop();
   }
 
   TemporaryPlatform platform;
@@ -111,28 +118,6 @@ TEST_F(ServiceTest, PrefersTheCopyInTheApplicationsFolder) {
   EXPECT_FALSE(service->logLines("Preferring (in /Applications)").empty());
 }
 
-TEST_F(ServiceTest, RecoveryModeAnswersFromThePersistedStoreAndNeverChangesIt) {
-  std::string foo = installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
-  {
-    auto first = startService();
-    ASSERT_TRUE(first->waitForLog("Updated persisted SoftwareMap at"));
-    first->stop();
-  }
-  fs::remove_all(foo);
-  auto before = FileIO::read(platform.persistedStorePath());
-  ASSERT_TRUE(before);
-
-  auto service = startService({}, {{"__OSINSTALL_ENVIRONMENT", "1"}});
-  auto client = connectClient(bus);
-  PlistDictionary product = ask(*client, "ProductForBundleIdentifier", {"com.example.foo"});
-  EXPECT_EQ(field(product, "bundlePath"), foo) << "the persisted record answers";
-  EXPECT_EQ(
-      service->logLines("Running in recovery mode (1) - Disabling all software map sources").size(),
-      1u);
-  EXPECT_TRUE(service->logLines("Software map rebuild took").empty());
-  EXPECT_EQ(FileIO::read(platform.persistedStorePath()), before);
-}
-
 // systemd and the end of a session stop the service with SIGTERM, a
 // terminal with SIGINT: the change the map has just taken reaches the disk
 // before the service exits 0. The fillers make the write take a while.
@@ -175,40 +160,50 @@ TEST_F(ServiceTest, AnIdleServiceMapsNeitherTheTransportNorTheUnpacker) {
   }
 }
 
-TEST_F(ServiceTest, DamagedStoreFilesCostOneLineAndAnEmptyMap) {
-  installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
-  {
-    auto first = startService();
-    ASSERT_TRUE(first->waitForLog("Updated persisted SoftwareMap at"));
-    first->stop();
-  }
-  PlistData good = *FileIO::read(platform.persistedStorePath());
-  PlistData wrongRoot = KeyedArchive::archivedData(KeyedArchive::array({PlistValue("x")}));
-  std::vector<std::pair<std::string, PlistData>> damaged{
+// In recovery mode the persisted store alone answers and is never written;
+// a damaged one costs one line and leaves the map empty.
+TEST_F(ServiceTest, RecoveryModeAnswersFromThePersistedStoreAndNeverChangesIt) {
+  const std::string foo = installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
+  persistTheMap();
+  fs::remove_all(foo);
+  const PlistData good = *FileIO::read(platform.persistedStorePath());
+  const std::vector<std::pair<std::string, PlistData>> stores{
+      {"intact", good},
       {"truncated", PlistData(good.begin(), good.begin() + static_cast<long>(good.size() / 2))},
       {"garbage", PlistData(300, 0xA5)},
-      {"wrong root", wrongRoot},
+      {"wrong root", KeyedArchive::archivedData(KeyedArchive::array({PlistValue("x")}))},
   };
-  for (const auto& [name, bytes] : damaged) {
+  for (const auto& [name, bytes] : stores) {
     SCOPED_TRACE(name);
     ASSERT_TRUE(FileIO::writeAtomically(platform.persistedStorePath(), bytes));
     auto service = startService({}, {{"__OSINSTALL_ENVIRONMENT", "1"}});
     auto client = connectClient(bus);
-    PlistArray all = client->call("AllProducts", {});
+    const PlistArray all = client->call("AllProducts", {});
     ASSERT_TRUE(all.at(0).array());
-    EXPECT_TRUE(all.at(0).array()->empty());
-    // Recovery mode keeps the discovery from refilling the map; its own
-    // line aside, the damage costs exactly one level 1 line.
-    EXPECT_EQ(service->logLines("<3>").size() - service->logLines("recovery mode").size(), 1u)
-        << service->log();
-    EXPECT_EQ(
-        service->logLines("Persisted SoftwareMap did not contain appsByPath dictionary.").size(),
-        1u);
+    EXPECT_EQ(all.at(0).array()->size(), bytes == good ? 1u : 0u);
+    if (bytes == good) {
+      EXPECT_EQ(
+          field(ask(*client, "ProductForBundleIdentifier", {"com.example.foo"}), "bundlePath"),
+          foo);
+    } else {
+      // Its own line aside, the damage costs exactly one level 1 line.
+      EXPECT_EQ(service->logLines("<3>").size() - service->logLines("recovery mode").size(), 1u)
+          << service->log();
+      EXPECT_EQ(
+          service->logLines("Persisted SoftwareMap did not contain appsByPath dictionary.").size(),
+          1u);
+    }
+    EXPECT_EQ(service->logLines("Running in recovery mode (1) - Disabling all software map sources")
+                  .size(),
+              1u);
+    EXPECT_TRUE(service->logLines("Software map rebuild took").empty());
     EXPECT_TRUE(service->process().isRunning());
+    service.reset();
+    EXPECT_EQ(FileIO::read(platform.persistedStorePath()), bytes);
   }
 }
 
-TEST_F(ServiceTest, BadArgumentsGetADBusErrorAndTheServiceGoesOn) {
+TEST_F(ServiceTest, BadRequestsGetAnEmptyAnswerOrANamedErrorAndTheServiceGoesOn) {
   installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
   auto service = startService();
   auto connection = bus.connect();
@@ -222,7 +217,7 @@ TEST_F(ServiceTest, BadArgumentsGetADBusErrorAndTheServiceGoesOn) {
                    .withArguments(std::string("x")),
                sdbus::Error);
   EXPECT_THROW(proxy->callMethod("NoSuchRequest").onInterface(interface), sdbus::Error);
-  // A store client of the wrong shape is taken as it comes: no crash.
+  // A store client of the wrong shape is taken as it comes.
   std::map<std::string, sdbus::Variant> odd{{"identifier", sdbus::Variant(std::int32_t{7})},
                                             {"clientType", sdbus::Variant(std::string("x"))}};
   EXPECT_NO_THROW(proxy->callMethod("SetStoreClient").onInterface(interface).withArguments(odd));
@@ -232,20 +227,12 @@ TEST_F(ServiceTest, BadArgumentsGetADBusErrorAndTheServiceGoesOn) {
   EXPECT_EQ(
       field(ask(*client, "ProductForBundleIdentifier", {"com.example.foo"}), "itemIdentifier"),
       "5");
-  EXPECT_TRUE(service->process().isRunning());
-}
-
-TEST_F(ServiceTest, RequestsWithoutTargetAnswerEmptyOrWithANamedError) {
-  auto service = startService();
-  auto client = connectClient(bus);
   client->presentStoreClient(0);
-  PlistArray badge = client->call("AvailableUpdatesBadgeCount", {});
-  EXPECT_EQ(badge.at(0).uint64Value(), 0u);
+  EXPECT_EQ(client->call("AvailableUpdatesBadgeCount", {}).at(0).uint64Value(), 0u);
   PlistArray incompatible = client->call("IncompatibleUpdates", {});
   ASSERT_EQ(incompatible.size(), 1u);
   EXPECT_TRUE(incompatible.at(0).array() && incompatible.at(0).array()->empty());
-  // Replies that belong to an object that cannot exist come at once, as
-  // errors; a short timeout tells them from silence.
+  // A short timeout tells an error that comes at once from silence.
   auto quick = std::make_unique<ServiceClient>(bus.connect(), "com.orvane.larderd", 2'000'000);
   const auto errorOf = [](const std::function<void()>& call) {
     try {
@@ -292,18 +279,26 @@ TEST_F(ServiceTest, TheUpdateRequestBodyListsTheInstalledStoreSoftware) {
   EXPECT_FALSE((*body)["bundled-software"].array());
 }
 
-TEST_F(ServiceTest, ModeFollowsTheArguments) {
+TEST_F(ServiceTest, ModeFollowsTheArgumentsAndAnIgnoredOneIsNamed) {
   struct Case {
     std::vector<std::string> arguments;
     std::string busName;
+    std::string logLine;
   };
+  const std::string kStarted = "int main(int, const char **)";
   for (const Case& c :
-       {Case{{"daemon"}, "com.orvane.larderd.daemon"},
-        Case{{"daemon", "extra"}, "com.orvane.larderd"}, Case{{"Daemon"}, "com.orvane.larderd"}}) {
-    SCOPED_TRACE(c.busName + " for " + std::to_string(c.arguments.size()) + " argument(s)");
+       {Case{{"daemon"}, "com.orvane.larderd.daemon", kStarted},
+        Case{{"daemon", "extra"}, "com.orvane.larderd", kStarted},
+        Case{{"Daemon"}, "com.orvane.larderd", kStarted},
+        Case{{"--help"},
+             "com.orvane.larderd",
+             "larderd " LARDER_VERSION ": ignoring \"--help\" (the only argument is \"daemon\"); "
+             "serving as com.orvane.larderd."}}) {
+    SCOPED_TRACE(::testing::PrintToString(c.arguments));
     ServiceProcess service(platform, bus, c.arguments);
     EXPECT_TRUE(service.waitUntilServing(c.busName)) << service.log();
-    EXPECT_EQ(service.logLines("int main(int, const char **)").size(), 1u);
+    EXPECT_TRUE(eventually([&] { return service.logLines(c.logLine).size() == 1; }))
+        << service.log();
     service.stop();
   }
 }
@@ -327,10 +322,14 @@ struct Heard {
   }
 };
 
+// Observers on the bus, `larderctl --json watch` among them, hear an
+// announced update once.
 TEST_F(ServiceTest, ObserversHearChangesAndAGoneClientCostsNothing) {
   std::string foo = installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
   auto service = startService();
   ASSERT_TRUE(service->waitForLog("Software map rebuild took"));
+  Larderctl watch(platform, bus, std::vector<std::string>{"--json", "watch"}, "watch");
+  ASSERT_TRUE(service->waitForLog("SoftwareMap added observer with token"));
 
   auto staying = connectClient(bus);
   Heard heard;
@@ -357,6 +356,15 @@ TEST_F(ServiceTest, ObserversHearChangesAndAGoneClientCostsNothing) {
       field(ask(*updater, "ProductForBundleIdentifier", {"com.example.foo"}), "bundleVersion"),
       "2.0");
   EXPECT_TRUE(service->logLines("does not match expected value").empty());
+  ASSERT_TRUE(eventually([&] { return watch.output().find('\n') != std::string::npos; }));
+  const auto printed = nlohmann::json::parse(watch.output().substr(0, watch.output().find('\n')));
+  EXPECT_EQ(printed["stateName"], "Changed");
+  EXPECT_EQ(printed["product"]["bundleVersion"], "2.0");
+  const auto removed = service->logLines("Removed SoftwareMap observer for token").size();
+  EXPECT_EQ(watch.process().stop(SIGINT), 0);
+  EXPECT_TRUE(eventually([&] {
+    return service->logLines("Removed SoftwareMap observer for token").size() > removed;
+  })) << "SIGINT unregisters the watch";
 
   staying->call("RemoveSoftwareMapObserver", {token});
   staying->call("RemoveSoftwareMapObserver", {emptyToken});
@@ -441,36 +449,6 @@ TEST_F(ServiceTest, OlderSoftwareOfTheMakerIsFoundFromItsMinimumVersionOn) {
       << "exactly the minimum version is enough";
   EXPECT_TRUE(ask(*client, "ProductForBundleIdentifier", {"com.orvane.Anvil.Tally"}).empty());
   EXPECT_TRUE(ask(*client, "ProductForBundleIdentifier", {"com.orvane.Unlisted"}).empty());
-}
-
-TEST_F(ServiceTest, LarderctlWatchPrintsObserverCallbacks) {
-  std::string foo = installStoreApp(applications(), "Foo", "com.example.foo", "1.0", 5);
-  auto service = startService();
-  ASSERT_TRUE(service->waitForLog("Software map rebuild took"));
-  std::string output = platform.directory() + "/watch.out";
-  ChildProcess watch({LARDERCTL_PATH, "--json", "watch"}, platform.environment(bus), output,
-                     platform.directory() + "/watch.err");
-  ASSERT_TRUE(service->waitForLog("SoftwareMap added observer with token"));
-
-  auto updater = connectClient(bus);
-  updater->call("ProductAtPathWillBeUpdatedToBundleVersionStoreVersion",
-                {foo, "1.5", std::int64_t{3}});
-  TemporaryPlatform::writePurchaseRecord(foo, "com.example.foo", "1.5", 5, 3);
-  updater->call("ProductAtPathWasUpdatedToBundleVersionStoreVersion",
-                {foo, true, "1.5", std::int64_t{3}});
-
-  auto printed = [&] {
-    std::ifstream file(output);
-    std::string line;
-    std::getline(file, line);
-    return line;
-  };
-  ASSERT_TRUE(eventually([&] { return !printed().empty(); }));
-  auto line = nlohmann::json::parse(printed());
-  EXPECT_EQ(line["stateName"], "Changed");
-  EXPECT_EQ(line["product"]["bundleVersion"], "1.5");
-  EXPECT_EQ(watch.stop(SIGINT), 0);
-  EXPECT_TRUE(service->waitForLog("Removed SoftwareMap observer for token"));
 }
 
 }  // namespace

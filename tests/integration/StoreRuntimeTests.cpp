@@ -35,23 +35,37 @@ constexpr std::uint64_t kNotesItem = 501;
 constexpr char kAccountName[] = "reader@example.org";
 constexpr char kPassword[] = "correct horse";
 
-// Answers every sign-in dialog with what it was given, and counts them.
+// Answers every dialog with what it was given and counts them; or, when
+// holding, keeps every dialog unanswered until the test cancels them all.
 class ScriptedPresenter : public VendDialogPresenter {
  public:
-  ScriptedPresenter(std::int64_t exitCode, PlistDictionary values)
-      : exitCode_(exitCode), values_(std::move(values)) {}
+  ScriptedPresenter(std::int64_t exitCode, PlistDictionary values, bool holding = false)
+      : exitCode_(exitCode), values_(std::move(values)), holding_(holding) {}
   void present(const VendDialog& dialog, Reply reply) override {
     ++shown;
     lastKind = dialog.kind();
-    reply({exitCode_, values_});
+    if (!holding_) return reply({exitCode_, values_});
+    std::lock_guard lock(mutex_);
+    held_.push_back(std::move(reply));
   }
   void dismiss(std::string_view, std::int64_t) override {}
+  void cancelAll() {
+    std::vector<Reply> held;
+    {
+      std::lock_guard lock(mutex_);
+      held.swap(held_);
+    }
+    for (Reply& reply : held) reply({VendDialogButton::kCancel, {}});
+  }
   std::atomic<int> shown{0};
   std::atomic<std::int64_t> lastKind{-1};
 
  private:
   std::int64_t exitCode_;
   PlistDictionary values_;
+  bool holding_;
+  std::mutex mutex_;
+  std::vector<Reply> held_;
 };
 
 class StoreRuntimeTest : public InProcessRuntimeTest {
@@ -491,32 +505,6 @@ TEST_F(StoreRuntimeTest, ItemLookupFindsTheItemByIdentifierAndByBundle) {
   EXPECT_EQ(byBundle["results"].dictionary()->size(), 1U);
 }
 
-// Holds every dialog unanswered until the test lets them go as cancelled.
-class HoldingPresenter : public VendDialogPresenter {
- public:
-  void present(const VendDialog&, Reply reply) override {
-    std::lock_guard lock(mutex_);
-    held_.push_back(std::move(reply));
-  }
-  void dismiss(std::string_view, std::int64_t) override {}
-  std::size_t heldCount() {
-    std::lock_guard lock(mutex_);
-    return held_.size();
-  }
-  void cancelAll() {
-    std::vector<Reply> held;
-    {
-      std::lock_guard lock(mutex_);
-      held.swap(held_);
-    }
-    for (Reply& reply : held) reply({VendDialogButton::kCancel, {}});
-  }
-
- private:
-  std::mutex mutex_;
-  std::vector<Reply> held_;
-};
-
 // More purchases than any fixed pool of workers, each waiting for a sign-in
 // that is itself a service call: all of them end, and the account service
 // still answers at once. Once with no dialog agent (every sign-in is
@@ -526,7 +514,8 @@ TEST_F(StoreRuntimeTest, PurchasesWaitingForSignInNeverStarveOtherServiceCalls) 
   for (const bool holdDialogs : {false, true}) {
     SCOPED_TRACE(holdDialogs ? "dialogs held" : "no dialog agent");
     startStore({"bag=slow"});
-    auto holding = std::make_shared<HoldingPresenter>();
+    auto holding =
+        std::make_shared<ScriptedPresenter>(VendDialogButton::kCancel, PlistDictionary{}, true);
     if (holdDialogs) runtime_->setDialogPresenter(holding);
     // Shared with the replies, which may outlive a failed assertion.
     struct Tally {
@@ -555,8 +544,8 @@ TEST_F(StoreRuntimeTest, PurchasesWaitingForSignInNeverStarveOtherServiceCalls) 
       return answered->waitFor(limit);
     };
     if (holdDialogs) {
-      eventually([&] { return holding->heldCount() >= kPurchases; }, 30s);
-      ASSERT_EQ(holding->heldCount(), static_cast<std::size_t>(kPurchases));
+      eventually([&] { return holding->shown >= kPurchases; }, 30s);
+      ASSERT_EQ(holding->shown, kPurchases);
       EXPECT_TRUE(answersWithin(1s)) << "a held dialog held up the account service";
       holding->cancelAll();
     }
