@@ -4,8 +4,10 @@
 #include <stdlib.h>
 
 #include <filesystem>
+#include <optional>
 #include <string>
-#include <system_error>
+
+#include "tests/unit/TemporaryFolder.h"
 
 namespace larder {
 
@@ -13,16 +15,11 @@ namespace larder {
 class TemporaryFolderTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    std::string pattern =
-        (std::filesystem::temp_directory_path() / "larder-platform-XXXXXX").string();
-    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
-    base_ = pattern;
+    folder_.emplace("larder-platform");
+    base_ = folder_->path();
   }
 
-  void TearDown() override {
-    std::error_code ignored;
-    std::filesystem::remove_all(base_, ignored);
-  }
+  void TearDown() override { folder_.reset(); }
 
   // Makes <base>/root the platform root and <base>/home the home folder, where the code under
   // test looks for them.
@@ -35,6 +32,7 @@ class TemporaryFolderTest : public ::testing::Test {
     ::setenv("HOME", home_.c_str(), 1);
   }
 
+  std::optional<testing::TemporaryFolder> folder_;
   std::string base_;
   std::string root_;
   std::string home_;

@@ -109,10 +109,9 @@ TEST(VendOperation, OutcomeReachesHandlerAndDelegateOnceAndTheOperationNeverRuns
   }
 }
 
-// Fault: VendOperation::runOnce turns an exception into a failure without an
-// error, so callers see a failure they cannot explain and the delegate hears
-// only that the operation finished. Enable once the exception gives an error.
-TEST(VendOperation, DISABLED_AnExceptionAfterSuccessFailsWithAnError) {
+// An exception thrown after the operation declared success must still leave an error that
+// names it, for callers and for the delegate.
+TEST(VendOperation, AnExceptionAfterSuccessFailsWithAnError) {
   auto operation = std::make_shared<ScriptedOperation>([](ScriptedOperation& self) {
     self.setSuccess(true);
     throw std::runtime_error("archive damaged");
@@ -124,7 +123,8 @@ TEST(VendOperation, DISABLED_AnExceptionAfterSuccessFailsWithAnError) {
       [&](VendOperation&, bool, const OptionalError& error) { handled = error; });
   OptionalError error;
   EXPECT_FALSE(operation->runSyncReturningError(&error));
-  EXPECT_TRUE(error) << "a failure with no error";
+  ASSERT_TRUE(error) << "a failure with no error";
+  EXPECT_NE(error->description.find("archive damaged"), std::string::npos);
   EXPECT_TRUE(handled) << "the handler is told of a failure with no error";
   EXPECT_EQ(delegate->failures.size(), 1u);
 }
