@@ -3,11 +3,16 @@
 #include "client/ServiceError.h"
 #include "platform/log/TillLogManager.h"
 #include "software-map/SoftwareMap.h"
+#include "update-controller/UpdateController.h"
 #include "update-queue/UpdateQueue.h"
 
 namespace larder {
 
 namespace {
+
+bool namesAnObject(const std::string& objectPath) {
+  return !objectPath.empty() && objectPath != "/";
+}
 
 PlistDictionary wireForm(const LedgerSoftwareProductRef& product) {
   return product ? product->toDictionary() : PlistDictionary{};
@@ -82,7 +87,7 @@ PlistData AssetServiceInterface::iconForApplicationWithBundeID(
 
 std::string AssetServiceInterface::addSoftwareMapObserver(const std::string& objectPath) {
   std::shared_ptr<VendSoftwareMapObserver> observer;
-  if (!objectPath.empty() && objectPath != "/" && remoteObjects_) {
+  if (namesAnObject(objectPath) && remoteObjects_) {
     observer = remoteObjects_->softwareMapObserver(peer_, objectPath);
   }
   return softwareMap_.addObserver(std::move(observer));
@@ -110,7 +115,30 @@ std::optional<std::string> AssetServiceInterface::lookupOrvaneIDForApp(
 
 std::shared_ptr<UpdateQueue> AssetServiceInterface::updateQueue() const {
   std::optional<VendStoreClient> client = storeClient();
-  return UpdateQueue::updateQueueForStoreClient(client ? &*client : nullptr);
+  return UpdateController::updateQueueForStoreClient(client ? &*client : nullptr);
+}
+
+std::shared_ptr<UpdateController> AssetServiceInterface::updateController() const {
+  std::optional<VendStoreClient> client = storeClient();
+  return UpdateController::updateControllerForStoreClient(client ? &*client : nullptr);
+}
+
+std::shared_ptr<VendAvailableUpdatesObserver> AssetServiceInterface::availableUpdatesObserver(
+    const std::string& objectPath) const {
+  if (!namesAnObject(objectPath) || !remoteObjects_) return nullptr;
+  return remoteObjects_->availableUpdatesObserver(peer_, objectPath);
+}
+
+std::shared_ptr<VendOSUpdateScanObserver> AssetServiceInterface::osUpdateScanObserver(
+    const std::string& objectPath) const {
+  if (!namesAnObject(objectPath) || !remoteObjects_) return nullptr;
+  return remoteObjects_->osUpdateScanObserver(peer_, objectPath);
+}
+
+std::shared_ptr<VendOSUpdateProgressObserver> AssetServiceInterface::osUpdateProgressObserver(
+    const std::string& objectPath) const {
+  if (!namesAnObject(objectPath) || !remoteObjects_) return nullptr;
+  return remoteObjects_->osUpdateProgressObserver(peer_, objectPath);
 }
 
 bool AssetServiceInterface::isBookClient() const {

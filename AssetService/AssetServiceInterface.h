@@ -15,6 +15,7 @@
 namespace larder {
 
 class SoftwareMap;
+class UpdateController;
 class UpdateQueue;
 
 // One client connection: the client's store client and the queue its
@@ -50,6 +51,16 @@ class AssetServiceInterface {
   [[nodiscard]] std::optional<std::string> lookupOrvaneIDForApp(const PlistValue& product) const;
 
   [[nodiscard]] SoftwareMap& softwareMap() const { return softwareMap_; }
+  // The update controller of the connection's store client; nullptr without one.
+  [[nodiscard]] std::shared_ptr<UpdateController> updateController() const;
+  // Handles on the callback objects the client exported; nullptr for no
+  // object ("/" or empty) or without a bus.
+  [[nodiscard]] std::shared_ptr<VendAvailableUpdatesObserver> availableUpdatesObserver(
+      const std::string& objectPath) const;
+  [[nodiscard]] std::shared_ptr<VendOSUpdateScanObserver> osUpdateScanObserver(
+      const std::string& objectPath) const;
+  [[nodiscard]] std::shared_ptr<VendOSUpdateProgressObserver> osUpdateProgressObserver(
+      const std::string& objectPath) const;
   // The update queue of the connection's store client; nullptr without one.
   [[nodiscard]] std::shared_ptr<UpdateQueue> updateQueue() const;
   // Book clients ask for book updates where others ask for app updates.

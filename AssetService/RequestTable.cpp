@@ -9,6 +9,7 @@
 #include "client/ServiceError.h"
 #include "platform/log/TillLogManager.h"
 #include "software-map/SoftwareMap.h"
+#include "update-controller/UpdateController.h"
 #include "update-queue/UpdateQueue.h"
 
 namespace larder {
@@ -29,6 +30,49 @@ const std::string& text(const Arguments& arguments, std::size_t index) {
   const std::string* value = arguments.at(index).string();
   return value ? *value : kEmptyText;
 }
+
+PlistArray wireForms(const std::vector<SysupQuaymartUpdate>& updates) {
+  PlistArray wire;
+  wire.reserve(updates.size());
+  for (const SysupQuaymartUpdate& update : updates) wire.emplace_back(update.toDictionary());
+  return wire;
+}
+
+std::vector<std::string> texts(const Arguments& arguments, std::size_t index) {
+  std::vector<std::string> values;
+  if (const PlistArray* array = arguments.at(index).array()) {
+    for (const PlistValue& value : *array) {
+      if (value.string()) values.push_back(*value.string());
+    }
+  }
+  return values;
+}
+
+// Runs `work` with the update controller of the connection's client. Without
+// a client there is none: a caller that waits for a reply hears why.
+template <typename Work>
+void withController(AssetServiceInterface& interface, std::string_view member,
+                    const ReplyHandler& reply, Work&& work) {
+  std::shared_ptr<UpdateController> controller = interface.updateController();
+  if (!controller) {
+    if (reply) throw ServiceError::noStoreClient(member);
+    return;
+  }
+  work(*controller);
+}
+
+// A request answered by the controller with one value.
+#define CONTROLLER_REPLY(member, expression)                                  \
+  [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {   \
+    (void)a;                                                                  \
+    withController(i, member, r, [&](UpdateController& c) { answer(r, {expression}); }); \
+  }
+// A request the controller carries out without a reply.
+#define CONTROLLER_CALL(member, statement)                                   \
+  [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {  \
+    (void)a;                                                                 \
+    withController(i, member, r, [&](UpdateController& c) { statement; });   \
+  }
 
 // Requests that carry a client type of their own set up the connection's
 // store client before anything else; their targets come with later parts
@@ -115,7 +159,16 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
    }},
 
   // Available updates and installs.
-  {"AvailableUpdatesBadgeCount", false, nullptr, kEmpty},
+  {"AvailableUpdatesBadgeCount", false,
+   [](AssetServiceInterface& i, const Arguments&, const ReplyHandler& r) {
+     // A book client's badge counts book updates, which come with the book library.
+     if (i.isBookClient()) {
+       if (r) throw ServiceError::notAvailable("AvailableUpdatesBadgeCount");
+       return;
+     }
+     withController(i, "AvailableUpdatesBadgeCount", r,
+                    [&](UpdateController& c) { answer(r, {c.availableUpdatesBadgeCount()}); });
+   }},
   {"AvailableUpdates", false,
    [](AssetServiceInterface& i, const Arguments&, const ReplyHandler& r) {
      answer(r, {i.availableUpdates()});
@@ -129,8 +182,9 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
      answer(r, {i.incompatibleUpdates()});
    }},
   {"AddAvailableUpdatesObserver", false,
-   nullptr, kNothing},
-  {"RemoveAvailableUpdatesObserver", false, nullptr, kNothing},
+   CONTROLLER_CALL("AddAvailableUpdatesObserver", c.addAvailableUpdatesObserver(i.availableUpdatesObserver(text(a, 0))))},
+  {"RemoveAvailableUpdatesObserver", false,
+   CONTROLLER_CALL("RemoveAvailableUpdatesObserver", c.removeAvailableUpdatesObserver(i.availableUpdatesObserver(text(a, 0))))},
   {"StartAppUpdatesAndOSUpdatesWithDelegate", false, nullptr, kErrorReply},
   {"StartAppInstallWithTagsFallbackPurchase", false,
    nullptr, kErrorReply},
@@ -152,30 +206,36 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
      }
    }},
   {"UpdatesForTags", false,
-   nullptr, kErrorReply},
+   CONTROLLER_CALL("UpdatesForTags", c.updatesForTags(texts(a, 0), [r](const std::vector<SysupQuaymartUpdate>& updates) { answer(r, {wireForms(updates)}); }))},
   {"WillInteractivelyPurchaseItemIdentifier", false, nullptr, kEmpty},
   {"DidInteractivelyPurchaseItemIdentifierSuccess", false, nullptr, kNothing},
 
   // OS updates.
   {"AddOSUpdateProgressObserver", false,
-   nullptr, kNothing},
-  {"RemoveOSUpdateProgressObserver", false, nullptr, kNothing},
+   CONTROLLER_CALL("AddOSUpdateProgressObserver", c.addOSUpdateProgressObserver(i.osUpdateProgressObserver(text(a, 0))))},
+  {"RemoveOSUpdateProgressObserver", false,
+   CONTROLLER_CALL("RemoveOSUpdateProgressObserver", c.removeOSUpdateProgressObserver(i.osUpdateProgressObserver(text(a, 0))))},
   {"CancelOSUpdates", true, nullptr, kNothing},
   {"CancelOSUpdatesWithProductKeys", true, nullptr, kNothing},
-  {"OsUpdateScanInProgress", true, nullptr, kEmpty},
-  {"HideOSUpdatesWithProductKeys", false, nullptr, kErrorReply},
+  {"OsUpdateScanInProgress", true,
+   CONTROLLER_REPLY("OsUpdateScanInProgress", c.osUpdateScanInProgress())},
+  {"HideOSUpdatesWithProductKeys", false,
+   CONTROLLER_CALL("HideOSUpdatesWithProductKeys", c.hideOSUpdatesWithProductKeys(texts(a, 0), [r](bool success) { answer(r, {success}); }))},
   {"UnhideAllOSUpdates", false,
-   nullptr, kErrorReply},
-  {"StartOSUpdateScanWithForceFullScanReportProgressImmediatelyLaunchedFromNotificationUserHasSeenAllUpdatesCheckForOtherUpdates", true, nullptr, kNothing},
-  {"AddOSUpdateScanObserver", true, nullptr,
-   kNothing},
+   CONTROLLER_CALL("UnhideAllOSUpdates", c.unhideAllOSUpdates([r](bool success) { answer(r, {success}); }))},
+  {"StartOSUpdateScanWithForceFullScanReportProgressImmediatelyLaunchedFromNotificationUserHasSeenAllUpdatesCheckForOtherUpdates", true,
+   CONTROLLER_CALL("StartOSUpdateScan", c.startOSUpdateScanWithForceFullScan(a.at(0).boolValue(), a.at(1).boolValue(), a.at(2).boolValue(), a.at(3).boolValue(), a.at(4).boolValue()))},
+  {"AddOSUpdateScanObserver", true,
+   CONTROLLER_CALL("AddOSUpdateScanObserver", c.addOSUpdateScanObserver(i.osUpdateScanObserver(text(a, 0))))},
   {"RemoveOSUpdateScanObserver", true,
-   nullptr, kNothing},
-  {"SoftwareUpdateDidFinishBackgroundScanWithInfo", false, nullptr, kNothing},
+   CONTROLLER_CALL("RemoveOSUpdateScanObserver", c.removeOSUpdateScanObserver(i.osUpdateScanObserver(text(a, 0))))},
+  {"SoftwareUpdateDidFinishBackgroundScanWithInfo", false,
+   CONTROLLER_CALL("SoftwareUpdateDidFinishBackgroundScanWithInfo", c.softwareUpdateDidFinishBackgroundScanWithInfo(a.at(0).dictionary() ? *a.at(0).dictionary() : PlistDictionary{}))},
 
   // Install later, automatic updates, major OS update.
   {"RemoveUpdateFromInstallLaterWithBundleID", false, nullptr, kNothing},
-  {"ShouldOfferDoItLaterForAvailableUpdates", false, nullptr, kEmpty},
+  {"ShouldOfferDoItLaterForAvailableUpdates", false,
+   CONTROLLER_REPLY("ShouldOfferDoItLaterForAvailableUpdates", UpdateController::shouldOfferDoItLaterForAppUpdates(*c.updateQueue()->availableUpdates(), SysupQuaymartUpdateController::sharedUpdateController().availableUpdates()))},
   {"InstallAvailableUpdatesLaterWithMode", false, nullptr, kNothing},
   {"AppUpdatesToInstallLater", false, nullptr, kEmpty},
   {"CancelUpdatesToBeInstalledLater", false,
@@ -184,10 +244,11 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
   {"LaterDidNotOccurWithDueToACPower", false, nullptr, kNothing},
   {"InstalledUpdatesJournal", false, nullptr, kEmpty},
   {"IsAutoUpdateEnabled", false,
-   nullptr, kEmpty},
-  {"ShouldPromptForAutoUpdateOptIn", false, nullptr, kEmpty},
+   CONTROLLER_REPLY("IsAutoUpdateEnabled", UpdateController::isAutoUpdatedEnabled())},
+  {"ShouldPromptForAutoUpdateOptIn", false,
+   CONTROLLER_REPLY("ShouldPromptForAutoUpdateOptIn", UpdateController::shouldPromptForAutoUpdateOptIn())},
   {"PromptUserToOptInForAutoUpdateWithShowNotification", false,
-   nullptr, kNothing},
+   CONTROLLER_CALL("PromptUserToOptInForAutoUpdateWithShowNotification", c.promptUserToOptInForAutoUpdateWithShowNotification(a.at(0).boolValue()))},
   {"UpdateAutoInfoWithToken", false, nullptr, kEmpty},
   {"MajorOSUpdateHasDownloadedToPath", false, nullptr, kEmpty},
   {"ManagedOSInstallWakeUpReceived", false,
@@ -227,6 +288,9 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
 
 });
 // clang-format on
+
+#undef CONTROLLER_REPLY
+#undef CONTROLLER_CALL
 
 // Joins the two tables once; a request without handling, or handling of a
 // request clients do not know, is a fault of this file, found at start.

@@ -6,10 +6,12 @@
 #include "AssetService/DialogAgentRegistry.h"
 #include "AssetService/StoreRuntimeInterface.h"
 #include "client/DBusValueCodec.h"
+#include "client/DistributedNotificationProtocol.h"
 #include "client/ServiceError.h"
 #include "platform/log/TillLogManager.h"
 #include "platform/system/Environment.h"
 #include "software-map/SoftwareMap.h"
+#include "store-runtime/host/LedgerDistributedNotificationCenter.h"
 
 namespace larder {
 
@@ -22,30 +24,98 @@ std::unique_ptr<sdbus::IConnection> connectToBus() {
   return sdbus::createSessionBusConnection();
 }
 
-// An observer that lives in a client: each call is sent without waiting
-// for an answer, and a client that has gone simply never receives it.
-class DBusSoftwareMapObserver final : public VendSoftwareMapObserver {
+// An object that lives in a client: each call is sent without waiting for
+// an answer, so that a slow or vanished client holds up nobody, and a client
+// that has gone simply never receives it.
+class DBusCallbackObject {
  public:
-  DBusSoftwareMapObserver(sdbus::IConnection& connection, const std::string& peer,
-                          const std::string& objectPath)
-      : proxy_(sdbus::createProxy(connection, peer, objectPath)) {}
+  DBusCallbackObject(sdbus::IConnection& connection, std::string peer, std::string objectPath,
+                     std::string_view protocol)
+      : peer_(std::move(peer)),
+        objectPath_(std::move(objectPath)),
+        interfaceName_(std::string(ServiceRequests::kCallbackInterfacePrefix) +
+                       std::string(protocol)),
+        proxy_(sdbus::createProxy(connection, peer_, objectPath_)) {}
 
-  void softwareProductUpdatedState(const LedgerSoftwareProductRef& product,
-                                   std::int64_t state) override {
+  void send(std::string_view member, std::string_view signature, const PlistArray& values) const {
     try {
-      sdbus::MethodCall call = proxy_->createMethodCall(
-          std::string(ServiceRequests::kCallbackInterfacePrefix) + "VendSoftwareMapObserver",
-          "SoftwareProductUpdatedState");
-      DBusValueCodec::writeAll(call, "a{sv}x", {product->toDictionary(), state});
+      sdbus::MethodCall call = proxy_->createMethodCall(interfaceName_, std::string(member));
+      DBusValueCodec::writeAll(call, signature, values);
       call.dontExpectReply();
       proxy_->callMethod(call);
     } catch (const sdbus::Error& error) {
-      TILL_LOG(3, "%@: observer call dropped: %@", kSpeaker, error.what());
+      TILL_LOG(3, "%@: call to %@ %@ dropped: %@", kSpeaker, peer_, objectPath_, error.what());
     }
   }
 
+  [[nodiscard]] bool isSameObjectAs(const DBusCallbackObject* other) const {
+    return other && other->peer_ == peer_ && other->objectPath_ == objectPath_;
+  }
+
  private:
+  std::string peer_;
+  std::string objectPath_;
+  std::string interfaceName_;
   std::unique_ptr<sdbus::IProxy> proxy_;
+};
+
+PlistArray wireForms(const std::vector<SysupQuaymartUpdate>& updates) {
+  PlistArray wire;
+  for (const SysupQuaymartUpdate& update : updates) wire.emplace_back(update.toDictionary());
+  return wire;
+}
+
+class DBusSoftwareMapObserver final : public VendSoftwareMapObserver, DBusCallbackObject {
+ public:
+  using DBusCallbackObject::DBusCallbackObject;
+  void softwareProductUpdatedState(const LedgerSoftwareProductRef& product,
+                                   std::int64_t state) override {
+    send("SoftwareProductUpdatedState", "a{sv}x", {product->toDictionary(), state});
+  }
+};
+
+class DBusAvailableUpdatesObserver final : public VendAvailableUpdatesObserver,
+                                           DBusCallbackObject {
+ public:
+  using DBusCallbackObject::DBusCallbackObject;
+  void availableUpdatesDidChangedWithUpdates(const std::vector<LedgerUpdateRef>& updates,
+                                             const std::vector<SysupQuaymartUpdate>& osUpdates,
+                                             std::uint64_t badgeCount) override {
+    PlistArray appUpdates;
+    for (const LedgerUpdateRef& update : updates) appUpdates.emplace_back(update->toDictionary());
+    send("AvailableUpdatesDidChangedWithUpdatesOsUpdatesBadgeCount", "aa{sv}aa{sv}t",
+         {std::move(appUpdates), wireForms(osUpdates), badgeCount});
+  }
+  [[nodiscard]] bool isSameObserverAs(const VendAvailableUpdatesObserver& other) const override {
+    return isSameObjectAs(dynamic_cast<const DBusAvailableUpdatesObserver*>(&other));
+  }
+};
+
+class DBusOSUpdateScanObserver final : public VendOSUpdateScanObserver, DBusCallbackObject {
+ public:
+  using DBusCallbackObject::DBusCallbackObject;
+  void osUpdateScanForTags(const std::vector<std::string>& tags, float percentComplete,
+                           bool isFinished, const OptionalError& error) override {
+    send("OsUpdateScanForTagsDidProgressWithPercentCompleteIsFinishedError", "asdba{sv}",
+         {PlistArray(tags.begin(), tags.end()), static_cast<double>(percentComplete), isFinished,
+          error ? error->toDictionary() : PlistDictionary{}});
+  }
+  [[nodiscard]] bool isSameObserverAs(const VendOSUpdateScanObserver& other) const override {
+    return isSameObjectAs(dynamic_cast<const DBusOSUpdateScanObserver*>(&other));
+  }
+};
+
+class DBusOSUpdateProgressObserver final : public VendOSUpdateProgressObserver,
+                                           DBusCallbackObject {
+ public:
+  using DBusCallbackObject::DBusCallbackObject;
+  void osUpdatesChangedProgress(const std::vector<SysupQuaymartUpdate>& osUpdates,
+                                const LedgerSoftwareUpdateStatus& progress) override {
+    send("OsUpdatesChangedProgress", "aa{sv}a{sv}", {wireForms(osUpdates), progress.toDictionary()});
+  }
+  [[nodiscard]] bool isSameObserverAs(const VendOSUpdateProgressObserver& other) const override {
+    return isSameObjectAs(dynamic_cast<const DBusOSUpdateProgressObserver*>(&other));
+  }
 };
 
 }  // namespace
@@ -56,7 +126,23 @@ class ServiceListener::RemoteObjects final : public RemoteObjectFactory {
 
   std::shared_ptr<VendSoftwareMapObserver> softwareMapObserver(
       const std::string& peer, const std::string& objectPath) override {
-    return std::make_shared<DBusSoftwareMapObserver>(connection_, peer, objectPath);
+    return std::make_shared<DBusSoftwareMapObserver>(connection_, peer, objectPath,
+                                                     "VendSoftwareMapObserver");
+  }
+  std::shared_ptr<VendAvailableUpdatesObserver> availableUpdatesObserver(
+      const std::string& peer, const std::string& objectPath) override {
+    return std::make_shared<DBusAvailableUpdatesObserver>(connection_, peer, objectPath,
+                                                          "VendAvailableUpdatesObserver");
+  }
+  std::shared_ptr<VendOSUpdateScanObserver> osUpdateScanObserver(
+      const std::string& peer, const std::string& objectPath) override {
+    return std::make_shared<DBusOSUpdateScanObserver>(connection_, peer, objectPath,
+                                                      "VendOSUpdateScanObserver");
+  }
+  std::shared_ptr<VendOSUpdateProgressObserver> osUpdateProgressObserver(
+      const std::string& peer, const std::string& objectPath) override {
+    return std::make_shared<DBusOSUpdateProgressObserver>(connection_, peer, objectPath,
+                                                          "VendOSUpdateProgressObserver");
   }
 
  private:
@@ -67,6 +153,7 @@ ServiceListener::ServiceListener(std::string serviceName, SoftwareMap& softwareM
     : serviceName_(std::move(serviceName)), softwareMap_(softwareMap) {}
 
 ServiceListener::~ServiceListener() {
+  LedgerDistributedNotificationCenter::defaultCenter().setPoster(nullptr);
   if (storeRuntime_) storeRuntime_->withdraw();
   if (connection_) connection_->leaveEventLoop();
 }
@@ -96,7 +183,14 @@ void ServiceListener::resume() {
   }
   if (dialogAgents_) dialogAgents_->exportOn(*object_, *connection_);
   if (storeRuntime_) storeRuntime_->exportOn(*object_);
+  object_->registerSignal(std::string(DistributedNotificationProtocol::kInterfaceName),
+                          std::string(DistributedNotificationProtocol::kSignal),
+                          std::string(DistributedNotificationProtocol::kSignature));
   object_->finishRegistration();
+  LedgerDistributedNotificationCenter::defaultCenter().setPoster(
+      [this](const std::string& name, const std::string& object, const PlistDictionary& userInfo) {
+        emitDistributedNotification(name, object, userInfo);
+      });
   connection_->addMatch(
       "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop.DBus',"
       "member='NameOwnerChanged',path='/org/freedesktop/DBus'",
@@ -107,8 +201,24 @@ void ServiceListener::resume() {
   connection_->enterEventLoopAsync();
 }
 
+void ServiceListener::emitDistributedNotification(const std::string& name,
+                                                  const std::string& object,
+                                                  const PlistDictionary& userInfo) {
+  try {
+    sdbus::Signal signal =
+        object_->createSignal(std::string(DistributedNotificationProtocol::kInterfaceName),
+                              std::string(DistributedNotificationProtocol::kSignal));
+    DBusValueCodec::writeAll(signal, DistributedNotificationProtocol::kSignature,
+                             {name, object, userInfo});
+    object_->emitSignal(signal);
+  } catch (const sdbus::Error& error) {
+    TILL_LOG(2, "%@: notification %@ %@ not sent: %@", kSpeaker, name, object, error.what());
+  }
+}
+
 void ServiceListener::stopServing() {
   if (!connection_) return;
+  LedgerDistributedNotificationCenter::defaultCenter().setPoster(nullptr);
   if (storeRuntime_) storeRuntime_->withdraw();
   answerPendingCallsStopping();
   try {

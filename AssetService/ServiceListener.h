@@ -53,6 +53,10 @@ class ServiceListener {
   void dispatch(const RequestDescriptor& request, sdbus::MethodCall call);
   std::shared_ptr<AssetServiceInterface> interfaceForPeer(const std::string& peer);
   void peerDidChangeOwner(sdbus::Message& signal);
+  // The badge and other session-wide notifications, as a signal of the
+  // service object.
+  void emitDistributedNotification(const std::string& name, const std::string& object,
+                                   const PlistDictionary& userInfo);
   // Keeps a call that wants a reply until it is answered; false once the
   // service is stopping.
   bool track(const std::shared_ptr<PendingCall>& call) EXCLUDES(pendingMutex_);

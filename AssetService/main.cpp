@@ -22,7 +22,7 @@
 #include "platform/system/StopSignals.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/runtime/VendRuntime.h"
-#include "update-queue/UpdateQueue.h"
+#include "update-controller/UpdateController.h"
 
 namespace {
 
@@ -57,7 +57,7 @@ bool finishPendingWrites() {
   auto finished = std::make_shared<larder::DispatchSemaphore>();
   std::thread([finished] {
     larder::SoftwareMap::sharedInstance().finishPendingWrites();
-    larder::UpdateQueue::finishPendingWritesOfAllQueues();
+    larder::UpdateController::finishPendingWritesOfAllControllers();
     finished->signal();
   }).detach();
   return finished->waitFor(kStopWriteBound);

@@ -95,35 +95,55 @@ PlistArray ServiceClient::callMethod(std::string_view interfaceName, const BusMe
   }
 }
 
-void ServiceClient::exportSoftwareMapObserver(
-    const std::string& objectPath, std::function<void(const PlistValue&, std::int64_t)> onChange) {
-  observer_ = sdbus::createObject(*connection_, objectPath);
-  observer_->registerMethod(
-      std::string(ServiceRequests::kCallbackInterfacePrefix) + "VendSoftwareMapObserver",
-      "SoftwareProductUpdatedState", "a{sv}x", "",
-      [onChange = std::move(onChange)](sdbus::MethodCall call) {
-        PlistArray arguments = DBusValueCodec::readAll(call, "a{sv}x");
-        onChange(arguments.at(0), arguments.at(1).int64Value());
+void ServiceClient::exportCallbackObject(const std::string& objectPath, std::string_view protocol,
+                                         std::string_view member, std::string_view signature,
+                                         std::function<void(const PlistArray&)> onCall) {
+  auto object = sdbus::createObject(*connection_, objectPath);
+  object->registerMethod(
+      std::string(ServiceRequests::kCallbackInterfacePrefix) + std::string(protocol),
+      std::string(member), std::string(signature), "",
+      [signature = std::string(signature), onCall = std::move(onCall)](sdbus::MethodCall call) {
+        PlistArray arguments = DBusValueCodec::readAll(call, signature);
+        onCall(arguments);
         DBusValueCodec::reply(call, "", {});
       });
-  observer_->finishRegistration();
+  object->finishRegistration();
+  objects_.push_back(std::move(object));
+}
+
+void ServiceClient::exportSoftwareMapObserver(
+    const std::string& objectPath, std::function<void(const PlistValue&, std::int64_t)> onChange) {
+  exportCallbackObject(objectPath, "VendSoftwareMapObserver", "SoftwareProductUpdatedState",
+                       "a{sv}x", [onChange = std::move(onChange)](const PlistArray& arguments) {
+                         onChange(arguments.at(0), arguments.at(1).int64Value());
+                       });
+}
+
+void ServiceClient::watchSignal(std::string_view interfaceName, std::string_view member,
+                                std::string_view signature,
+                                std::function<void(const PlistArray&)> onSignal) {
+  const std::string rule = "type='signal',sender='" + serviceName_ + "',interface='" +
+                           std::string(interfaceName) + "',member='" + std::string(member) + "'";
+  matches_.push_back(connection_->addMatch(
+      rule, [signature = std::string(signature), onSignal = std::move(onSignal)](
+                sdbus::Message& signal) {
+        PlistArray values;
+        try {
+          values = DBusValueCodec::readAll(signal, signature);
+        } catch (const sdbus::Error&) {
+          return;  // not what the service sends: nothing to tell
+        }
+        onSignal(values);
+      }));
 }
 
 void ServiceClient::watchDownloadEndings(
     std::function<void(const PlistValue&, bool, const PlistValue&)> onEnded) {
-  const std::string rule = "type='signal',sender='" + serviceName_ + "',interface='" +
-                           std::string(StoreRuntimeProtocol::kInterfaceName) + "',member='" +
-                           std::string(StoreRuntimeProtocol::kDownloadEndedSignal) + "'";
-  matches_.push_back(
-      connection_->addMatch(rule, [onEnded = std::move(onEnded)](sdbus::Message& signal) {
-        PlistArray values;
-        try {
-          values = DBusValueCodec::readAll(signal, StoreRuntimeProtocol::kDownloadEndedSignature);
-        } catch (const sdbus::Error&) {
-          return;  // not what the service sends: nothing to tell
-        }
-        onEnded(values.at(0), values.at(1).boolValue(), values.at(2));
-      }));
+  watchSignal(StoreRuntimeProtocol::kInterfaceName, StoreRuntimeProtocol::kDownloadEndedSignal,
+              StoreRuntimeProtocol::kDownloadEndedSignature,
+              [onEnded = std::move(onEnded)](const PlistArray& values) {
+                onEnded(values.at(0), values.at(1).boolValue(), values.at(2));
+              });
 }
 
 void ServiceClient::watchServiceOwner(std::function<void(bool)> onChange) {

@@ -5,6 +5,7 @@
 
 #include <memory>
 #include <string>
+#include <string_view>
 #include <vector>
 #include "client/BusMethod.h"
 
@@ -44,6 +45,18 @@ class ServiceClient {
   PlistArray callStoreRuntime(const std::string& member, const PlistArray& arguments,
                               std::uint64_t timeoutMicroseconds = 0);
 
+  // Exports an object at `objectPath` that answers the one method `member`
+  // of a callback protocol (the interface kCallbackInterfacePrefix +
+  // `protocol`) and hands the arguments of every call to `onCall`, on the
+  // client's bus thread.
+  void exportCallbackObject(const std::string& objectPath, std::string_view protocol,
+                            std::string_view member, std::string_view signature,
+                            std::function<void(const PlistArray&)> onCall);
+  // Hands the values of every signal `member` of `interfaceName` that the
+  // service sends to `onSignal`, on the client's bus thread.
+  void watchSignal(std::string_view interfaceName, std::string_view member,
+                   std::string_view signature, std::function<void(const PlistArray&)> onSignal);
+
   // Exports a software map observer at `objectPath` that hands every
   // callback to `onChange`.
   void exportSoftwareMapObserver(const std::string& objectPath,
@@ -70,7 +83,7 @@ class ServiceClient {
   std::string serviceName_;
   std::string busName_ = "session";
   std::unique_ptr<sdbus::IProxy> proxy_;
-  std::unique_ptr<sdbus::IObject> observer_;
+  std::vector<std::unique_ptr<sdbus::IObject>> objects_;
   std::vector<sdbus::Slot> matches_;
   std::uint64_t timeout_;
 };

@@ -12,7 +12,6 @@
 #include "platform/system/FileIO.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/core/DaemonDefaults.h"
-#include "store-runtime/core/StoreClientRegistry.h"
 #include "store-runtime/download/VendFileManager.h"
 #include "store-runtime/services/VendOperationQueue.h"
 #include "update-queue/LoadUpdateQueueOperation.h"
@@ -71,14 +70,9 @@ PlistDate now() {
   return PlistDate{Seconds(std::chrono::system_clock::now().time_since_epoch()).count()};
 }
 
-StoreClientRegistry<UpdateQueue>& registry() {
-  static StoreClientRegistry<UpdateQueue> queues;
-  return queues;
-}
-
 }  // namespace
 
-UpdateQueue::UpdateQueue(VendStoreClient storeClient, std::shared_ptr<UpdateQueueDelegate> delegate,
+UpdateQueue::UpdateQueue(VendStoreClient storeClient, std::weak_ptr<UpdateQueueDelegate> delegate,
                          SoftwareMap& softwareMap)
     : delegate_(std::move(delegate)),
       storeClient_(std::move(storeClient)),
@@ -95,23 +89,9 @@ UpdateQueue::UpdateQueue(VendStoreClient storeClient, std::shared_ptr<UpdateQueu
   }
 }
 
-std::shared_ptr<UpdateQueue> UpdateQueue::updateQueueForStoreClient(
-    const VendStoreClient* storeClient) {
-  if (!storeClient || storeClient->identifier().empty()) {
-    TILL_LOG(1,
-             "%@: updateControllerForStoreClient: called with nil storeClient.identifier, no "
-             "UpdateController will be available for this client",
-             "UpdateController");
-    return nullptr;
-  }
-  return registry().objectForStoreClient(storeClient, [](const VendStoreClient& client) {
-    return std::make_shared<UpdateQueue>(client, nullptr, SoftwareMap::sharedInstance());
-  });
-}
-
-void UpdateQueue::finishPendingWritesOfAllQueues() {
+void UpdateQueue::finishPendingWrites() {
   // Every change, and the write that follows it, is a barrier.
-  registry().forEach([](UpdateQueue& queue) { queue.dispatchQueue_->barrierSync([] {}); });
+  dispatchQueue_->barrierSync([] {});
 }
 
 // --- Cache ---
@@ -237,9 +217,9 @@ bool UpdateQueue::hasStagedUpdates() {
 }
 
 void UpdateQueue::availableUpdatesDidChange() {
-  if (!delegate_) return;
-  DispatchQueue::globalQueue().async(
-      [delegate = delegate_] { delegate->availableUpdatesDidChange(); });
+  DispatchQueue::globalQueue().async([delegate = delegate_] {
+    if (auto alive = delegate.lock()) alive->availableUpdatesDidChange();
+  });
 }
 
 // --- Checks ---

@@ -39,19 +39,16 @@ class UpdateQueue : public std::enable_shared_from_this<UpdateQueue> {
   static constexpr std::string_view kCacheFileName = "updates.plist";
 
   // Reads the cache; the store is not asked. The software map gives the
-  // bodies of the checks and must outlive the queue.
-  UpdateQueue(VendStoreClient storeClient, std::shared_ptr<UpdateQueueDelegate> delegate,
+  // bodies of the checks and must outlive the queue. The delegate is not
+  // kept alive by the queue: it owns the queue.
+  UpdateQueue(VendStoreClient storeClient, std::weak_ptr<UpdateQueueDelegate> delegate,
               SoftwareMap& softwareMap);
   UpdateQueue(const UpdateQueue&) = delete;
   UpdateQueue& operator=(const UpdateQueue&) = delete;
 
-  // The queue of a store client, made on first use with the shared
-  // software map; nullptr for a client without identifier. Until the
-  // update controller owns the queues, this is their registry.
-  static std::shared_ptr<UpdateQueue> updateQueueForStoreClient(const VendStoreClient* storeClient);
-  // Waits until the change under way on every queue of the registry, and
-  // the cache write it makes, has ended.
-  static void finishPendingWritesOfAllQueues();
+  // Waits until the change under way, and the cache write it makes, has
+  // ended.
+  void finishPendingWrites();
 
   // Starts a check unless one is in flight; the handler, if any, gets the
   // result of the check in flight. Returns at once.
@@ -118,7 +115,7 @@ class UpdateQueue : public std::enable_shared_from_this<UpdateQueue> {
   void publishIncompatible(std::shared_ptr<const UpdateList> incompatible);
   void appendInstalledUpdateToJournal(const LedgerUpdateRef& update);
 
-  std::shared_ptr<UpdateQueueDelegate> delegate_;
+  std::weak_ptr<UpdateQueueDelegate> delegate_;
   VendStoreClient storeClient_;
   SoftwareMap& softwareMap_;
   std::atomic<bool> disableQueueChecks_{false};

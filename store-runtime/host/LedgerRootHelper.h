@@ -7,6 +7,7 @@
 
 #include "platform/value/PlistValue.h"
 #include "store-runtime/core/DaemonDefaults.h"
+#include "store-runtime/core/PreferenceKeys.h"
 
 namespace larder {
 
@@ -26,14 +27,15 @@ class LedgerRootHelper {
   static constexpr std::string_view kSystemPreferencesDomain = kDaemonDefaultsID;
 
   // Keys the helper writes in that domain.
-  static constexpr std::string_view kAutoUpdateEnabledKey = "AutoUpdate";
+  static constexpr std::string_view kAutoUpdateEnabledKey = kDefaultsAutoUpdateEnabledKey;
   static constexpr std::string_view kAutoUpdateEnabledMajorOSVersionKey =
-      "AutoUpdateMajorOSVersion";
+      kDefaultsAutoUpdateEnabledMajorOSVersionKey;
   static constexpr std::string_view kAutoUpdateRestartRequiredEnabledKey =
-      "AutoUpdateRestartRequired";
+      kDefaultsAutoUpdateRestartRequiredEnabledKey;
   static constexpr std::string_view kAutoUpdateRestartRequiredMajorOSVersionKey =
-      "AutoUpdateRestartRequiredMajorOSVersion";
-  static constexpr std::string_view kLastDoItLaterLogoutFailedKey = "LastDoItLaterLogoutFailed";
+      kDefaultsAutoUpdateRestartRequiredMajorOSVersionKey;
+  static constexpr std::string_view kLastDoItLaterLogoutFailedKey =
+      kDefaultsLastDoItLaterLogoutFailedKey;
   static constexpr std::string_view kOVPInviteURLKey = "OVPInviteURL";
   static constexpr std::string_view kOVPInviteOrgNameKey = "OVPInviteOrgName";
 

@@ -114,7 +114,8 @@ void CommandLine::addSoftwareMapCommands() {
       throw CLI::ValidationError("give --bundle-id or --item-id");
     }
   });
-  app_.add_subcommand("watch", "print software map changes until interrupted");
+  auto* watch = app_.add_subcommand("watch", "print software map changes until interrupted");
+  watch->add_flag("--badge", watchBadge, "print the store's badge count each time it is sent instead");
   auto* call = app_.add_subcommand("call", "call any request: call METHOD ARGS...");
   call->add_option("method", member, "D-Bus method name, e.g. ProductForBundleIdentifier")
       ->required();
@@ -176,6 +177,17 @@ void CommandLine::addStoreCommands() {
   auto* updates = app_.add_subcommand(
       "updates", "list the updates known for the installed software (exit status 3: none)");
   updates->add_flag("--check", checkFirst, "ask the store first");
+  addUpdateCommands();
+}
+
+void CommandLine::addUpdateCommands() {
+  auto* osUpdates = app_.add_subcommand(
+      "os-updates", "list the OS updates the system offers (exit status 3: none)");
+  osUpdates->add_flag("--scan", this->osUpdates.scan, "scan for OS updates first, showing progress");
+  osUpdates->add_option("--hide", this->osUpdates.hide, "hide the OS updates of these product keys")
+      ->expected(1, -1);
+  osUpdates->add_flag("--unhide-all", this->osUpdates.unhideAll, "show every hidden OS update again");
+  app_.add_subcommand("badge", "print the count the store application shows on its badge");
 }
 
 void CommandLine::addOtherCommands() {

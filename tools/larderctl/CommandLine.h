@@ -8,6 +8,7 @@
 
 #include "tools/larderctl/DialogAgentCommand.h"
 #include "tools/larderctl/DialogCommand.h"
+#include "tools/larderctl/OSUpdatesCommand.h"
 #include "tools/larderctl/PreferencesOptions.h"
 
 namespace larder {
@@ -57,6 +58,10 @@ class CommandLine {
   std::int64_t downloadMask = 3;
   // updates
   bool checkFirst = false;
+  // os-updates
+  OSUpdatesOptions osUpdates;
+  // watch
+  bool watchBadge = false;
   // dmap-dump
   std::string dmapFile;
   // prefs get|set|delete
@@ -71,6 +76,7 @@ class CommandLine {
   void addStoreCommands();
   void addOtherCommands();
   void addPreferenceCommands();
+  void addUpdateCommands();
 
   CLI::App app_;
 };

@@ -23,6 +23,9 @@ class WatchCommand {
   // Until SIGINT or SIGTERM, which the caller blocked before the bus
   // connection started its thread.
   int run();
+  // The same for the badge: each badge message the service sends, as its
+  // count (JSON: {"badgeCount": N}).
+  int runBadge();
 
  private:
   // Written on the bus thread, read on the command's.
@@ -32,6 +35,10 @@ class WatchCommand {
   };
 
   std::string registerObserver();
+  // Waits for a stop signal, calling `onRestart` each time the service has
+  // started again and saying on standard error when it stopped; false when
+  // `onRestart` failed.
+  bool waitForStop(const std::function<bool()>& onRestart);
 
   ServiceClient& client_;
   bool json_;

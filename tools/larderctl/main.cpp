@@ -12,6 +12,7 @@
 #include "tools/larderctl/DialogAgentCommand.h"
 #include "tools/larderctl/DialogCommand.h"
 #include "tools/larderctl/DmapDumpCommand.h"
+#include "tools/larderctl/OSUpdatesCommand.h"
 #include "tools/larderctl/ExitStatus.h"
 #include "tools/larderctl/PreferencesCommand.h"
 #include "tools/larderctl/ProductPrinter.h"
@@ -66,9 +67,20 @@ int runWatch(const CommandLine& line) {
   StopSignals::block();
   ServiceClient client = connect(line.global);
   const CommandLine::Global& options = line.global;
-  return WatchCommand(client, options.json,
-                      [&client, &options] { client.presentStoreClient(options.clientType); })
-      .run();
+  WatchCommand watch(client, options.json,
+                     [&client, &options] { client.presentStoreClient(options.clientType); });
+  return line.watchBadge ? watch.runBadge() : watch.run();
+}
+
+int runBadge(const CommandLine& line) {
+  ServiceClient client = connect(line.global);
+  const std::uint64_t count = client.call("AvailableUpdatesBadgeCount", {}).at(0).uint64Value();
+  if (line.global.json) {
+    std::cout << "{\"badgeCount\":" << count << "}" << std::endl;
+  } else {
+    std::cout << count << std::endl;
+  }
+  return kExitSuccess;
 }
 
 int runCall(const CommandLine& line) {
@@ -118,6 +130,11 @@ int runChosen(const CommandLine& line) {
   if (line.chose("call")) return runCall(line);
   if (line.chose("agent")) return runAgent(line);
   if (line.chose("dialog")) return runDialog(line);
+  if (line.chose("os-updates")) {
+    ServiceClient client = connect(line.global);
+    return OSUpdatesCommand(client, line.global.json).run(line.osUpdates);
+  }
+  if (line.chose("badge")) return runBadge(line);
   if (line.chose("updates")) {
     ServiceClient client = connect(line.global);
     return UpdatesCommand(client, line.global.json).run(line.checkFirst);

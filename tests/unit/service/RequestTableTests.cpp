@@ -69,36 +69,36 @@ constexpr std::string_view kHandledRequests =
     "IncompatibleUpdates CheckForUpdatesWithUserHasSeenUpdates "
     "WillStartDownloadForUpdateWithIdentifier "
     "DidFinishDownloadForUpdateWithItemIdentifierDidInstall "
-    "ShowInviteOrganizationNameStoreClientType";
+    "ShowInviteOrganizationNameStoreClientType AvailableUpdatesBadgeCount "
+    "OsUpdateScanInProgress ShouldOfferDoItLaterForAvailableUpdates IsAutoUpdateEnabled "
+    "ShouldPromptForAutoUpdateOptIn UpdatesForTags HideOSUpdatesWithProductKeys "
+    "UnhideAllOSUpdates AddAvailableUpdatesObserver RemoveAvailableUpdatesObserver "
+    "AddOSUpdateProgressObserver RemoveOSUpdateProgressObserver "
+    "StartOSUpdateScanWithForceFullScanReportProgressImmediatelyLaunchedFromNotificationU"
+    "serHasSeenAllUpdatesCheckForOtherUpdates "
+    "AddOSUpdateScanObserver RemoveOSUpdateScanObserver "
+    "SoftwareUpdateDidFinishBackgroundScanWithInfo "
+    "PromptUserToOptInForAutoUpdateWithShowNotification";
 constexpr std::string_view kEmptyReplyRequests =
-    "AvailableUpdatesBadgeCount WillInteractivelyPurchaseItemIdentifier OsUpdateScanInProgress "
-    "ShouldOfferDoItLaterForAvailableUpdates AppUpdatesToInstallLater InstalledUpdatesJournal "
-    "IsAutoUpdateEnabled ShouldPromptForAutoUpdateOptIn UpdateAutoInfoWithToken "
-    "MajorOSUpdateHasDownloadedToPath CheckSHDownloadStatus CountOfBooksWithInfo "
-    "SortedBooksWithInfo BookAtIndexWithInfo BookWithInfo HasSampleWithItemIdentifier "
-    "PurchasedItems";
+    "WillInteractivelyPurchaseItemIdentifier AppUpdatesToInstallLater "
+    "InstalledUpdatesJournal UpdateAutoInfoWithToken MajorOSUpdateHasDownloadedToPath "
+    "CheckSHDownloadStatus CountOfBooksWithInfo SortedBooksWithInfo BookAtIndexWithInfo "
+    "BookWithInfo HasSampleWithItemIdentifier PurchasedItems";
 // Some of these have a handler for the part this build has (the client type).
 constexpr std::string_view kRefusedRequests =
     "StartAppUpdatesAndOSUpdatesWithDelegate StartAppInstallWithTagsFallbackPurchase "
-    "UpdatesForTags HideOSUpdatesWithProductKeys UnhideAllOSUpdates "
     "RedownloadWithItemIdentifierBundleIdentifierStoreClientType "
     "ProcessMDMManifestURLOptionsStoreClientType "
     "AccountLessDownloadWithItemIdentifierBundleIdentifierExternalVersionIdentifierOptions "
     "PollForPurchasedBooks";
 constexpr std::string_view kSilentRequests =
-    "AddAvailableUpdatesObserver RemoveAvailableUpdatesObserver "
-    "DidInteractivelyPurchaseItemIdentifierSuccess AddOSUpdateProgressObserver "
-    "RemoveOSUpdateProgressObserver CancelOSUpdates CancelOSUpdatesWithProductKeys "
-    "StartOSUpdateScanWithForceFullScanReportProgressImmediatelyLaunchedFromNotification"
-    "UserHasSeenAllUpdatesCheckForOtherUpdates "
-    "AddOSUpdateScanObserver RemoveOSUpdateScanObserver "
-    "SoftwareUpdateDidFinishBackgroundScanWithInfo RemoveUpdateFromInstallLaterWithBundleID "
+    "DidInteractivelyPurchaseItemIdentifierSuccess CancelOSUpdates "
+    "CancelOSUpdatesWithProductKeys RemoveUpdateFromInstallLaterWithBundleID "
     "InstallAvailableUpdatesLaterWithMode CancelUpdatesToBeInstalledLater "
     "NowIsLaterWithModeCountdownDeferred LaterDidNotOccurWithDueToACPower "
-    "PromptUserToOptInForAutoUpdateWithShowNotification ManagedOSInstallWakeUpReceived "
-    "DownloadSetupHeraldForTagsBundleIdentifier AccountLessDownloadHeartbeat "
-    "AddLibraryObserver RemoveLibraryObserver RedownloadBooksWithItemIdentifiersAccountID "
-    "PollForPurchasedItems";
+    "ManagedOSInstallWakeUpReceived DownloadSetupHeraldForTagsBundleIdentifier "
+    "AccountLessDownloadHeartbeat AddLibraryObserver RemoveLibraryObserver "
+    "RedownloadBooksWithItemIdentifiersAccountID PollForPurchasedItems";
 
 std::set<std::string_view> allRequestNames() {
   std::set<std::string_view> names;
@@ -198,6 +198,18 @@ class NoRemoteObjects final : public RemoteObjectFactory {
  public:
   std::shared_ptr<VendSoftwareMapObserver> softwareMapObserver(const std::string&,
                                                                const std::string&) override {
+    return nullptr;
+  }
+  std::shared_ptr<VendAvailableUpdatesObserver> availableUpdatesObserver(
+      const std::string&, const std::string&) override {
+    return nullptr;
+  }
+  std::shared_ptr<VendOSUpdateScanObserver> osUpdateScanObserver(const std::string&,
+                                                                 const std::string&) override {
+    return nullptr;
+  }
+  std::shared_ptr<VendOSUpdateProgressObserver> osUpdateProgressObserver(
+      const std::string&, const std::string&) override {
     return nullptr;
   }
 };

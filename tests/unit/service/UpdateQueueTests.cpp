@@ -175,8 +175,8 @@ class UpdateQueueTest : public ServiceTest {
 
   // Every change queued so far has been made and every delegate call it
   // queued has been delivered: a count of calls taken after this is final.
-  static void settle() {
-    UpdateQueue::finishPendingWritesOfAllQueues();
+  static void settle(UpdateQueue& queue) {
+    queue.finishPendingWrites();
     DispatchQueue::globalQueue().barrierSync([] {});
   }
 
@@ -292,7 +292,7 @@ TEST_F(UpdateQueueTest, AFailedCheckLeavesListsFileAndDelegateAlone) {
   ASSERT_EQ(::stat(cacheFile().c_str(), &after), 0);
   EXPECT_EQ(after.st_mtim.tv_nsec, was.st_mtim.tv_nsec);
   EXPECT_EQ(cacheContents(), cached);
-  settle();
+  settle(*queue);
   EXPECT_EQ(delegate->calls(), 1U);
 }
 
@@ -330,7 +330,7 @@ TEST_F(UpdateQueueTest, AReturningUpdateKeepsItsPlaceAndMarksWhileTheStoreValues
   auto restarted = makeQueue();
   EXPECT_TRUE(restarted->availableUpdateWithItemIdentifier(102)->isStaged());
   EXPECT_TRUE(restarted->availableUpdateWithItemIdentifier(101)->hasBeenSeenByUser());
-  settle();
+  settle(*queue);
   EXPECT_EQ(delegate->calls(), 3U) << "two checks and the abort code";
 }
 
@@ -348,7 +348,7 @@ TEST_F(UpdateQueueTest, AnAnswerWithoutUpdatesEmptiesTheQueue) {
     EXPECT_TRUE(result.available.empty());
     EXPECT_EQ(cacheContents()["updates"], PlistValue(PlistArray{}));
   }
-  settle();
+  settle(*queue);
   EXPECT_EQ(delegate->calls(), 6U) << "every successful check tells the delegate";
 }
 
@@ -423,7 +423,7 @@ TEST_F(UpdateQueueTest, LookupsAndMarksFollowTheListOrder) {
   EXPECT_EQ(identifiersOf(*queue->availableUpdates()), (std::vector<std::uint64_t>{102, 103}));
   EXPECT_EQ(identifiersOf(*makeQueue()->availableUpdates()), (std::vector<std::uint64_t>{102, 103}))
       << "the removal is saved";
-  settle();
+  settle(*queue);
   EXPECT_EQ(delegate->calls(), 3U) << "staging tells nobody; two abort codes and the removal do";
   EXPECT_EQ(list->size(), 4U) << "a snapshot taken before stays as it was";
 }
@@ -458,7 +458,7 @@ TEST_F(UpdateQueueTest, AnUpdateBeingDownloadedReachesTheJournalAfterACheckDropp
             1U)
       << log.dump();
   EXPECT_EQ(cacheContents()["updates"], PlistValue(PlistArray{}));
-  settle();
+  settle(*queue);
   EXPECT_EQ(delegate->calls(), 3U);
 }
 

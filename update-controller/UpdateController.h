@@ -1,0 +1,252 @@
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/dispatch/DispatchQueue.h"
+#include "platform/error/VendError.h"
+#include "platform/system/Mutex.h"
+#include "platform/value/PlistValue.h"
+#include "store-runtime/core/VendStoreClient.h"
+#include "store-runtime/host/LedgerPowerSource.h"
+#include "store-runtime/records/LedgerSoftwareUpdateStatus.h"
+#include "store-runtime/records/SysupQuaymartUpdate.h"
+#include "store-runtime/services/VendServiceProxy.h"
+#include "store-runtime/sysup/SysupQuaymartUpdateController.h"
+#include "update-controller/ObserverArray.h"
+#include "update-controller/VendAvailableUpdatesObserver.h"
+#include "update-controller/VendOSUpdateProgressObserver.h"
+#include "update-controller/VendOSUpdateScanObserver.h"
+#include "update-queue/UpdateQueue.h"
+#include "update-queue/UpdateQueueDelegate.h"
+
+namespace larder {
+
+class SoftwareMap;
+class UpdateOperation;
+
+// The policy centre for the updates of one store client: when the update
+// machinery runs and with which tasks, what the badge counts, who hears of
+// changes, OS update scans and hiding, and the time tests and switches of
+// automatic updates. One per store client identifier, made on first use and
+// kept until the process ends.
+//
+// The time tests and switches keep nothing in memory: each answer is read
+// from the preferences at the moment of the question.
+class UpdateController final : public UpdateQueueDelegate,
+                               public std::enable_shared_from_this<UpdateController> {
+ public:
+  using OSUpdateList = std::vector<SysupQuaymartUpdate>;
+  using OSUpdatePredicate = SysupQuaymartUpdateController::Predicate;
+  using ScanCompletionHandler = std::function<void(const OptionalError& error)>;
+  using SuccessHandler = std::function<void(bool success)>;
+  using Clock = std::chrono::system_clock;
+
+  // Every interval test allows this much slack.
+  static constexpr double kTimestampSlackSeconds = 300;
+  // A scan shows up as in progress after this long even when it was started
+  // quietly.
+  static constexpr double kQuietScanSeconds = 2.5;
+
+  // --- The registry ---
+
+  // The controller of the client, made on first use; nothing for a client
+  // without identifier.
+  static std::shared_ptr<UpdateController> updateControllerForStoreClient(
+      const VendStoreClient* storeClient);
+  static std::shared_ptr<UpdateQueue> updateQueueForStoreClient(const VendStoreClient* storeClient);
+  // Waits until the changes under way on the update queues of every
+  // controller, and the writes they make, have ended.
+  static void finishPendingWritesOfAllControllers();
+
+  // --- Questions about the machine ---
+
+  static bool runningOnACPower();
+  // More than one session whose login has finished.
+  static bool otherUsersAreLoggedIn();
+  static bool diskSealKeyIsDestroyedOnStandby();
+
+  // A controller outside the registry, over `softwareMap`, which must
+  // outlive it: the registry makes its own with the shared map; tests make
+  // theirs with a map of their own.
+  static std::shared_ptr<UpdateController> make(VendStoreClient storeClient,
+                                                SoftwareMap& softwareMap);
+  // Use make; public for make_shared only.
+  explicit UpdateController(VendStoreClient storeClient);
+  ~UpdateController() override;
+  UpdateController(const UpdateController&) = delete;
+  UpdateController& operator=(const UpdateController&) = delete;
+
+  [[nodiscard]] const VendStoreClient& storeClient() const { return storeClient_; }
+  [[nodiscard]] const std::shared_ptr<UpdateQueue>& updateQueue() const { return updateQueue_; }
+  [[nodiscard]] const std::shared_ptr<VendServiceProxy>& serviceProxy() const {
+    return serviceProxy_;
+  }
+
+  // --- Badge and observers ---
+
+  void addAvailableUpdatesObserver(std::shared_ptr<VendAvailableUpdatesObserver> observer);
+  void removeAvailableUpdatesObserver(const std::shared_ptr<VendAvailableUpdatesObserver>& observer);
+  // App updates the user is to hear of, plus one for all OS updates together.
+  [[nodiscard]] std::uint64_t availableUpdatesBadgeCount() const;
+  void availableUpdatesDidChange() override;
+  void disableDockBadgeUpdates();
+  void enableDockBadgeUpdates();
+  void clearAvailableUpdatesBadgeCount();
+  // The badge count last sent, if any.
+  [[nodiscard]] std::optional<std::uint64_t> lastDockBadgeCount() const;
+
+  // --- The periodic entry ---
+
+  // The software update agent's report of a background scan: makes and
+  // enqueues the run that the time tests call for. Returns the operation
+  // enqueued, if any, for the caller's log and for tests.
+  std::shared_ptr<UpdateOperation> softwareUpdateDidFinishBackgroundScanWithInfo(
+      const PlistDictionary& info);
+
+  void updatesForTags(const std::vector<std::string>& tags,
+                      std::function<void(const OSUpdateList&)> handler) const;
+  // An update matches when it carries every tag.
+  static OSUpdatePredicate predicateWithTags(std::vector<std::string> tags);
+
+  // Calls `callback` on the main run loop when the machine moves between
+  // mains and limited power, until stopped. Nothing when already observing.
+  void startObservingPowerSourceWithCallback(std::function<void()> callback);
+  void stopObservingPowerSource();
+  [[nodiscard]] bool isObservingPowerSource() const;
+
+  // --- OS update scans and hiding ---
+
+  void startOSUpdateScanWithForceFullScan(bool forceFullScan, bool reportProgressImmediately,
+                                          bool launchedFromNotification,
+                                          bool userHasSeenAllUpdates, bool checkForOtherUpdates);
+  // One scan at a time: a caller that meets a running scan starts nothing,
+  // and its handler is called when that scan finishes, with its error.
+  void startOSUpdateScanForTags(std::optional<std::vector<std::string>> tags, bool forceFullScan,
+                                bool reportProgressImmediately, bool launchedFromNotification,
+                                bool userHasSeenAllUpdates, ScanCompletionHandler completion);
+  [[nodiscard]] bool osUpdateScanShouldReportProgress() const;
+  [[nodiscard]] bool osUpdateScanInProgress() const;
+  void addOSUpdateScanObserver(std::shared_ptr<VendOSUpdateScanObserver> observer);
+  void removeOSUpdateScanObserver(const std::shared_ptr<VendOSUpdateScanObserver>& observer);
+  void addOSUpdateProgressObserver(std::shared_ptr<VendOSUpdateProgressObserver> observer);
+  void removeOSUpdateProgressObserver(
+      const std::shared_ptr<VendOSUpdateProgressObserver>& observer);
+  void enumerateOSUpdateProgressObserversWithBlock(
+      const std::function<void(VendOSUpdateProgressObserver&)>& block) const;
+  void osUpdatesChangedProgress(const OSUpdateList& osUpdates,
+                                const LedgerSoftwareUpdateStatus& progress) const;
+  void didStartOSUpdates(const OSUpdateList& osUpdates);
+  void didFinishOSUpdates(const OSUpdateList& osUpdates);
+  [[nodiscard]] OSUpdateList osUpdatesInProgress() const;
+  void hideOSUpdatesWithProductKeys(const std::vector<std::string>& productKeys,
+                                    SuccessHandler completion);
+  void unhideAllOSUpdates(SuccessHandler completion);
+  void setUserHasSeenAllAvailableOSUpdates();
+  [[nodiscard]] std::vector<std::string> osUpdateProductKeysSeenByUser() const;
+
+  // --- Timing policy ---
+
+  [[nodiscard]] std::optional<Clock::time_point> dateForTimestampKey(std::string_view key) const;
+  static Clock::time_point dateWhenDateExceedsInterval(Clock::time_point date, double seconds);
+  [[nodiscard]] bool timestampWithKeyHasExceededCheckInterval(std::string_view key,
+                                                              double seconds) const;
+  [[nodiscard]] static double timeIntervalWithPreferenceKey(std::string_view key,
+                                                            double defaultValue);
+  [[nodiscard]] static double criticalUpdateNotificationMinimumInterval();
+  [[nodiscard]] static double availableUpdatesNotificationMinimumInterval();
+  [[nodiscard]] static double checkForAndStageAppUpdatesMinimumInterval();
+  [[nodiscard]] static double autoInstallUpdatesMinimumInterval();
+  [[nodiscard]] static double autoInstallUpdateMinimumReleaseTimeInterval();
+  [[nodiscard]] bool isTimeToPostCriticalUpdateNotification() const;
+  [[nodiscard]] bool isTimeToPostUpdatesAvailableNotification() const;
+  [[nodiscard]] bool isTimeToStageAppUpdates() const;
+  [[nodiscard]] bool isTimeToAutoUpdate() const;
+  void resetUpdatesAvailableNotificationTimestamp();
+  [[nodiscard]] static bool shouldNotifyForNewUpdatesOnly();
+
+  [[nodiscard]] static bool isUpdateStagingEnabled();
+  [[nodiscard]] static bool isAutoUpdatedEnabled();
+  [[nodiscard]] static bool isAutoUpdatedOfRestartRequiredUpdatesEnabled();
+  [[nodiscard]] static bool isSysupScanAutomaticCheckEnabled();
+  static void setAutoUpdateEnabled(bool enabled);
+  static void setAutoUpdateOfRestartRequiredUpdatesEnabled(bool enabled);
+  [[nodiscard]] static bool shouldPromptForAutoUpdateOptIn();
+  [[nodiscard]] static bool shouldPromptForAutoUpdateOfRestartRequiredUpdatesOptIn();
+  void promptUserToOptInForAutoUpdateWithShowNotification(bool showNotification);
+  void promptUserToOptInForAutoUpdateOfRestartRequiredUpdatesWithShowNotification(
+      bool showNotification);
+  [[nodiscard]] OSUpdateList availableOSUpdatesEligibleForAutoInstallOfRestartRequiredUpdates()
+      const;
+  [[nodiscard]] static bool lastDoItLaterLogoutFailed();
+  static void setLastDoItLaterLogoutFailed(bool failed);
+
+  // Whether the user may be offered to install these later: never on a
+  // machine that destroys its disk seal key on standby; always for app
+  // updates; for OS updates when one is recommended and needs no restart, or
+  // allows it.
+  [[nodiscard]] static bool shouldOfferDoItLaterForAppUpdates(
+      const std::vector<LedgerUpdateRef>& apps, const OSUpdateList& osUpdates);
+
+ private:
+  void initWithStoreClient(SoftwareMap& softwareMap);
+  void availableUpdatesDidChangeInternal();
+  void sendBadgeMessage(std::uint64_t count) const;
+  void enqueue(const std::shared_ptr<UpdateOperation>& operation) const;
+  [[nodiscard]] std::vector<LedgerUpdateRef> availableAppUpdates() const;
+  void sendOSUpdateScanForTags(const std::vector<std::string>& tags, bool finished,
+                               float percentComplete, const OptionalError& error) const;
+  void osUpdateScanDidFinish(const OptionalError& error, bool userHasSeenAllUpdates);
+
+  // Steps of the background scan report.
+  void recordSilentInstalls(const PlistDictionary& info);
+  void applyPostLogoutResults(const PlistDictionary& info, UpdateOperation& operation) const;
+  void configureTimedTasks(const PlistDictionary& info, UpdateOperation& operation) const;
+
+  // The notifications and the journal are not part of this build: what
+  // they would be given is logged, so that the decision can be seen.
+  void postSilentInstallNotification(std::int64_t count, const PlistDictionary& info) const;
+  void postAdminInstallNotification(std::int64_t count, bool restartRequired) const;
+  void removeUpdatesAvailableNotifications() const;
+  void postNotificationForAutoUpdateOptIn() const;
+  void postNotificationForAutoUpdateOfRestartRequiredUpdatesOptIn() const;
+  void appendCriticalUpdatesToJournal(const std::vector<PlistDictionary>& entries) const;
+  void confirmPendingUpdatesInJournal(const std::vector<std::string>& productKeys) const;
+
+  VendStoreClient storeClient_;
+  std::shared_ptr<UpdateQueue> updateQueue_;
+
+  mutable Mutex osUpdateScanLock_;
+  std::atomic<bool> osUpdateScanInProgress_{false};
+  std::atomic<bool> osUpdateReportProgressImmediately_{false};
+  // Seconds since the epoch of the running scan's start; 0 when idle.
+  std::atomic<double> osUpdateScanStartDate_{0};
+  std::optional<std::vector<std::string>> osUpdateScanTags_ GUARDED_BY(osUpdateScanLock_);
+  std::vector<ScanCompletionHandler> osUpdateScanWaiters_ GUARDED_BY(osUpdateScanLock_);
+  ObserverArray<VendOSUpdateScanObserver> osUpdateScanObservers_;
+
+  mutable Mutex osUpdatesInProgressLock_;
+  OSUpdateList osUpdatesInProgress_ GUARDED_BY(osUpdatesInProgressLock_);
+  ObserverArray<VendOSUpdateProgressObserver> osUpdateProgressObservers_;
+
+  ObserverArray<VendAvailableUpdatesObserver> availableUpdateObservers_;
+  std::atomic<bool> disableDockBadgeUpdates_{false};
+  mutable Mutex badgeLock_;
+  std::optional<std::uint64_t> lastDockBadgeCount_ GUARDED_BY(badgeLock_);
+
+  mutable Mutex powerLock_;
+  std::unique_ptr<LedgerPowerSource::Observation> powerRunLoopSource_ GUARDED_BY(powerLock_);
+
+  std::shared_ptr<VendServiceProxy> serviceProxy_;
+  std::shared_ptr<DispatchQueue> majorOSInstallQueue_;
+  SysupQuaymartUpdateController::ObserverToken availableOSUpdatesObservation_ = 0;
+};
+
+}  // namespace larder
