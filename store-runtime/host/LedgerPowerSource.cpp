@@ -49,6 +49,13 @@ std::optional<double> magnitudeOfAttribute(const std::string& path) {
   return std::fabs(value);
 }
 
+// Wireless mice and keyboards show their batteries here too, with the scope "Device"; the
+// machine's own batteries have the scope "System" or none at all.
+bool isSystemBattery(const std::string& supply) {
+  return firstWordOfAttribute(supply + "/type") == "Battery" &&
+         firstWordOfAttribute(supply + "/scope") != "Device";
+}
+
 // Seconds left in one battery: what it holds over what it draws, in energy (µWh / µW) when the
 // driver gives both, else in charge (µAh / µA).
 std::optional<double> secondsLeftInBattery(const std::string& supply) {
@@ -149,7 +156,7 @@ double LedgerPowerSource::remainingTimeEstimateInSupplyFolder(const std::string&
   for (std::filesystem::directory_iterator end; !code && iterator != end;
        iterator.increment(code)) {
     const std::string supply = iterator->path().string();
-    if (firstWordOfAttribute(supply + "/type") != "Battery") continue;
+    if (!isSystemBattery(supply)) continue;
     if (std::optional<double> seconds = secondsLeftInBattery(supply)) {
       total += *seconds;
       anyEstimate = true;

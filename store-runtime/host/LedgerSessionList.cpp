@@ -5,6 +5,7 @@
 
 #include <cstdlib>
 #include <optional>
+#include <string>
 #include <string_view>
 
 #include "platform/log/TillLogManager.h"
@@ -27,6 +28,26 @@ bool logindIsRunning() {
   return ::access("/run/systemd/seats/", F_OK) == 0;
 }
 
+// sd-login hands out text it allocated with malloc.
+std::string takeText(char* text) {
+  std::string taken = text ? std::string(text) : std::string();
+  std::free(text);  // NOLINT(cppcoreguidelines-no-malloc)
+  return taken;
+}
+
+// logind also keeps sessions that are nobody's login: the login screen ("greeter"), the lock
+// screen, cron jobs ("background") and, in newer versions, each user's service manager
+// ("manager"), which would count every user twice. Only the "user" classes are logins; a
+// session whose class cannot be read is taken as one.
+bool isLoggedInLogindSession(const char* session) {
+  char* state = nullptr;
+  if (sd_session_get_state(session, &state) < 0) return false;
+  if (!isLoggedInState(takeText(state))) return false;
+  char* sessionClass = nullptr;
+  if (sd_session_get_class(session, &sessionClass) < 0) return true;
+  return std::string_view(takeText(sessionClass)).starts_with("user");
+}
+
 std::optional<std::size_t> logindSessionCount() {
   if (!logindIsRunning()) return std::nullopt;
   char** sessions = nullptr;
@@ -37,14 +58,10 @@ std::optional<std::size_t> logindSessionCount() {
   }
   std::size_t loggedIn = 0;
   for (int index = 0; index < count; ++index) {
-    char* state = nullptr;
-    if (sd_session_get_state(sessions[index], &state) >= 0 && state && isLoggedInState(state)) {
-      ++loggedIn;
-    }
-    std::free(state);  // NOLINT(cppcoreguidelines-no-malloc): sd-login hands out malloc'd text
-    std::free(sessions[index]);
+    if (isLoggedInLogindSession(sessions[index])) ++loggedIn;
+    std::free(sessions[index]);  // NOLINT(cppcoreguidelines-no-malloc): sd-login's allocation
   }
-  std::free(sessions);
+  std::free(sessions);  // NOLINT(cppcoreguidelines-no-malloc)
   return loggedIn;
 }
 
