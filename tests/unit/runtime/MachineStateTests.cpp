@@ -184,35 +184,37 @@ TEST_F(MachineStateTest, ObservationHearsEachFlipOnItsLoop) {
   EXPECT_EQ(log.calls, 2);
 }
 
-// The first observation ends inside its own callback. A second one, made after it with the same
-// interval, polls after it in every round: once the second has heard two more flips, a live
-// first would have heard at least one of them.
-TEST_F(MachineStateTest, ObservationEndedInItsCallbackHearsNoMore) {
-  installSupplies({{"AC", {{"type", "Mains"}, {"online", "1"}}}});
-  RunLoopThread loopThread;
-  std::atomic<int> firstCalls{0};
-  DispatchSemaphore firstEnded;
-  std::unique_ptr<LedgerPowerSource::Observation> first;
-  first = LedgerPowerSource::observeLimitedPowerChanges(
-      [&] {
-        ++firstCalls;
-        first.reset();
-        firstEnded.signal();
-      },
-      loopThread.loop(), kQuickPoll);
-  ASSERT_NE(first, nullptr);
+// An observation ended inside its callback or from another thread hears no further flip. A
+// live poll would be due within one interval of the flip, and the loop fires due timers in the
+// order of their due times, so once a marker due two intervals after the flip has fired, a
+// live poll would have heard it.
+TEST_F(MachineStateTest, EndedObservationHearsNoMore) {
+  for (const bool endInsideCallback : {true, false}) {
+    SCOPED_TRACE(endInsideCallback ? "ended inside its callback" : "ended by the test's thread");
+    installSupplies({{"AC", {{"type", "Mains"}, {"online", "1"}}}});
+    RunLoopThread loopThread;
+    std::atomic<int> calls{0};
+    DispatchSemaphore called;
+    std::unique_ptr<LedgerPowerSource::Observation> observation;
+    observation = LedgerPowerSource::observeLimitedPowerChanges(
+        [&] {
+          ++calls;
+          if (endInsideCallback) observation.reset();
+          called.signal();
+        },
+        loopThread.loop(), kQuickPoll);
+    ASSERT_NE(observation, nullptr);
 
-  writeText("sys/class/power_supply/AC/online", "0\n");
-  ASSERT_TRUE(firstEnded.waitFor(kGenerous));
+    writeText("sys/class/power_supply/AC/online", "0\n");
+    ASSERT_TRUE(called.waitFor(kGenerous));
+    if (!endInsideCallback) observation.reset();
 
-  CallbackLog second;
-  auto observation = LedgerPowerSource::observeLimitedPowerChanges(second.callback(),
-                                                                   loopThread.loop(), kQuickPoll);
-  writeText("sys/class/power_supply/AC/online", "1\n");
-  ASSERT_TRUE(second.called.waitFor(kGenerous));
-  writeText("sys/class/power_supply/AC/online", "0\n");
-  ASSERT_TRUE(second.called.waitFor(kGenerous));
-  EXPECT_EQ(firstCalls, 1);
+    writeText("sys/class/power_supply/AC/online", "1\n");
+    DispatchSemaphore markerFired;
+    loopThread.loop().addTimer(2 * kQuickPoll, false, [&] { markerFired.signal(); });
+    ASSERT_TRUE(markerFired.waitFor(kGenerous));
+    EXPECT_EQ(calls, 1);
+  }
 }
 
 TEST_F(MachineStateTest, SessionFileCountsFinishedLogins) {
