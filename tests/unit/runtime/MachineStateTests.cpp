@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <filesystem>
 #include <map>
 #include <string>
 #include <thread>
@@ -121,15 +122,8 @@ TEST_F(MachineStateTest, RemainingTimeFollowsTheSuppliesRule) {
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
-    TemporaryFolder root;
-    ScopedEnvironment environment;
-    environment.set("LARDER_ROOT", root.path());
-    for (const auto& [name, attributes] : c.supplies) {
-      for (const auto& [attribute, text] : attributes) {
-        ASSERT_TRUE(FileIO::writeAtomically(
-            root / ("sys/class/power_supply/" + name + "/" + attribute), text + "\n"));
-      }
-    }
+    std::filesystem::remove_all(rooted("sys"));
+    installSupplies(c.supplies);
     EXPECT_DOUBLE_EQ(LedgerPowerSource::remainingTimeEstimate(), c.expected);
   }
 }
