@@ -1,7 +1,11 @@
 #pragma once
 
+#include <chrono>
 #include <functional>
 #include <memory>
+#include <string>
+
+#include "platform/dispatch/RunLoop.h"
 
 namespace larder {
 
@@ -17,9 +21,15 @@ class LedgerPowerSource {
   // Nothing could be estimated (a battery that gives no rate).
   static constexpr double kUnknownRemainingTime = -1.0;
 
+  // The kernel offers no change notification for these files, so a change
+  // is seen by asking again this often.
+  static constexpr std::chrono::seconds kPollInterval{5};
+
   // kUnlimitedRemainingTime on mains power; otherwise the batteries' energy
   // (or charge) over their draw, in seconds, or kUnknownRemainingTime.
   static double remainingTimeEstimate();
+  // The same rule applied to one folder of supplies.
+  static double remainingTimeEstimateInSupplyFolder(const std::string& folder);
 
   // Calls `callback` on the main run loop each time the machine moves
   // between mains and limited power, until the returned source is released.
@@ -29,6 +39,12 @@ class LedgerPowerSource {
     virtual ~Observation() = default;
   };
   static std::unique_ptr<Observation> observeLimitedPowerChanges(std::function<void()> callback);
+  // The same on `loop`, asking every `interval`. Once the returned source is
+  // gone the callback does not start again, and a callback running on
+  // another thread has finished.
+  static std::unique_ptr<Observation> observeLimitedPowerChanges(std::function<void()> callback,
+                                                                 RunLoop& loop,
+                                                                 RunLoop::Clock::duration interval);
 };
 
 }  // namespace larder

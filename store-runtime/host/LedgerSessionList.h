@@ -11,7 +11,9 @@ namespace larder {
 // "online", "active" or "closing") }.
 class LedgerSessionList {
  public:
-  // Sessions whose login has finished: state online or active.
+  // Sessions whose login has finished: state online or active (of logind's,
+  // only those of a user class: no login screen, lock screen, background
+  // job or service manager).
   static std::size_t loggedInSessionCount();
 };
 
