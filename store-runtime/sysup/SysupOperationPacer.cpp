@@ -16,8 +16,8 @@ bool SysupOperationPacer::run(double seconds, const std::function<void(double pe
   const auto start = std::chrono::steady_clock::now();
   const std::chrono::duration<double> length(std::clamp(seconds, 0.0, kLongestRunSeconds));
   for (int step = 0; step <= kSteps; ++step) {
-    const auto deadline =
-        start + std::chrono::duration_cast<std::chrono::steady_clock::duration>(length * step / kSteps);
+    const auto deadline = start + std::chrono::duration_cast<std::chrono::steady_clock::duration>(
+                                      length * step / kSteps);
     {
       MutexLock lock(mutex_);
       condition_.wait_until(lock, deadline, [this]() REQUIRES(mutex_) { return cancelled_; });

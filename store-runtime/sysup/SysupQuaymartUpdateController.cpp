@@ -31,7 +31,8 @@ SysupUpdateState readState(const PlatformStateFile& file) {
 }
 
 // A locked read-modify-write of the state through its typed view.
-bool changeState(const PlatformStateFile& file, const std::function<void(SysupUpdateState&)>& change) {
+bool changeState(const PlatformStateFile& file,
+                 const std::function<void(SysupUpdateState&)>& change) {
   return file.updateDictionary([&change](PlistDictionary& stored) {
     SysupUpdateState state(std::move(stored));
     change(state);
@@ -98,8 +99,9 @@ class SysupQuaymartUpdateController::Implementation {
 
   void scan(bool includingPrerelease, std::shared_ptr<DispatchQueue> notifyOn,
             ScanProgressHandler progress, FinishHandler finish) {
-    workQueue_->async([this, file = stateFile(), includingPrerelease, notifyOn = std::move(notifyOn),
-                       progress = std::move(progress), finish = std::move(finish)] {
+    workQueue_->async([this, file = stateFile(), includingPrerelease,
+                       notifyOn = std::move(notifyOn), progress = std::move(progress),
+                       finish = std::move(finish)] {
       DispatchQueue& target = handlerQueue(notifyOn);
       SysupOperationPacer pacer;
       pacer.run(readState(file).scanSeconds(), [&](double percent) {
@@ -161,8 +163,8 @@ class SysupQuaymartUpdateController::Implementation {
     observers_.emplace(token, std::make_shared<AvailableUpdatesObserver>(std::move(observer)));
     if (!watcher_ || watcher_->filePath() != file.path()) {
       retired = std::move(watcher_);
-      watcher_ = std::make_unique<SysupStateFileWatcher>(file.path(),
-                                                         [this] { stateMayHaveChanged(); });
+      watcher_ =
+          std::make_unique<SysupStateFileWatcher>(file.path(), [this] { stateMayHaveChanged(); });
     }
     return token;
   }
@@ -191,7 +193,8 @@ class SysupQuaymartUpdateController::Implementation {
   }
 
  private:
-  using ObserverList = std::vector<std::pair<ObserverToken, std::shared_ptr<AvailableUpdatesObserver>>>;
+  using ObserverList =
+      std::vector<std::pair<ObserverToken, std::shared_ptr<AvailableUpdatesObserver>>>;
 
   static bool storeScanResult(const PlatformStateFile& file, bool includingPrerelease) {
     std::size_t found = 0;
@@ -329,7 +332,8 @@ void SysupQuaymartUpdateController::removeAvailableUpdatesObserver(ObserverToken
 void SysupQuaymartUpdateController::availableUpdatesMatchingPredicate(
     Predicate predicate, std::function<void(const UpdateList&)> handler) const {
   UpdateList updates = availableUpdates();
-  if (predicate) std::erase_if(updates, [&predicate](const auto& update) { return !predicate(update); });
+  if (predicate)
+    std::erase_if(updates, [&predicate](const auto& update) { return !predicate(update); });
   DispatchQueue::globalQueue().async(
       [updates = std::move(updates), handler = std::move(handler)] { handler(updates); });
 }
@@ -373,7 +377,8 @@ void SysupQuaymartUpdateController::cancelOperation(const CancelToken& token) {
 
 std::int64_t SysupQuaymartUpdateController::actionRequiredForUpdates(
     const UpdateList& updates) const {
-  for (const SysupCatalogEntry& entry : readState(stateFile()).catalogEntries(productKeys(updates))) {
+  for (const SysupCatalogEntry& entry :
+       readState(stateFile()).catalogEntries(productKeys(updates))) {
     if (entry.restartRequired) return 1;
   }
   return 0;
@@ -382,7 +387,8 @@ std::int64_t SysupQuaymartUpdateController::actionRequiredForUpdates(
 std::uint64_t SysupQuaymartUpdateController::diskSpaceRequiredForUpdates(
     const UpdateList& updates) const {
   std::uint64_t total = 0;
-  for (const SysupCatalogEntry& entry : readState(stateFile()).catalogEntries(productKeys(updates))) {
+  for (const SysupCatalogEntry& entry :
+       readState(stateFile()).catalogEntries(productKeys(updates))) {
     total += entry.downloadSize;
   }
   return total;
@@ -400,9 +406,8 @@ void SysupQuaymartUpdateController::ignoreUpdate(const SysupQuaymartUpdate& upda
 
 void SysupQuaymartUpdateController::resetIgnoredUpdates() {
   TILL_LOG(2, "%@: Unhiding every update", kSpeaker);
-  changeState(stateFile(), [](SysupUpdateState& state) {
-    state.setKeyList(SysupUpdateState::kHiddenKey, {});
-  });
+  changeState(stateFile(),
+              [](SysupUpdateState& state) { state.setKeyList(SysupUpdateState::kHiddenKey, {}); });
   implementation_->stateMayHaveChanged();
 }
 

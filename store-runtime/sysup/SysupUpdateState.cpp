@@ -18,12 +18,11 @@ bool hasType(const PlistValue& value, bool (PlistValue::*check)() const) {
 std::optional<SysupCatalogEntry> readEntry(const PlistValue& value) {
   const PlistDictionary* dictionary = value.dictionary();
   if (!dictionary) return std::nullopt;
-  const bool simulationFieldsFit =
-      hasType(value["restartRequired"], &PlistValue::isBoolean) &&
-      hasType(value["downloadSize"], &PlistValue::isInteger) &&
-      hasType(value["installSeconds"], &PlistValue::isNumber) &&
-      hasType(value["installFails"], &PlistValue::isBoolean) &&
-      hasType(value["isPrerelease"], &PlistValue::isBoolean);
+  const bool simulationFieldsFit = hasType(value["restartRequired"], &PlistValue::isBoolean) &&
+                                   hasType(value["downloadSize"], &PlistValue::isInteger) &&
+                                   hasType(value["installSeconds"], &PlistValue::isNumber) &&
+                                   hasType(value["installFails"], &PlistValue::isBoolean) &&
+                                   hasType(value["isPrerelease"], &PlistValue::isBoolean);
   if (!simulationFieldsFit) return std::nullopt;
   std::optional<SysupQuaymartUpdate> update = SysupQuaymartUpdate::fromDictionary(*dictionary);
   if (!update || update->productKey().empty()) return std::nullopt;
@@ -40,9 +39,14 @@ std::optional<SysupCatalogEntry> readEntry(const PlistValue& value) {
 SysupUpdateState::SysupUpdateState(PlistDictionary dictionary)
     : dictionary_(std::move(dictionary)) {}
 
+const PlistValue& SysupUpdateState::member(std::string_view name) const {
+  auto found = dictionary_.find(name);
+  return found == dictionary_.end() ? PlistValue::null() : found->second;
+}
+
 std::vector<SysupCatalogEntry> SysupUpdateState::catalog() const {
   std::vector<SysupCatalogEntry> entries;
-  const PlistArray* stored = PlistValue(dictionary_)[kCatalogKey].array();
+  const PlistArray* stored = member(kCatalogKey).array();
   if (!stored) return entries;
   std::set<std::string> seen;
   for (std::size_t index = 0; index < stored->size(); ++index) {
@@ -74,12 +78,12 @@ std::vector<SysupCatalogEntry> SysupUpdateState::catalogEntries(
 }
 
 double SysupUpdateState::scanSeconds() const {
-  return std::max(0.0, PlistValue(dictionary_)[kScanSecondsKey].doubleValue());
+  return std::max(0.0, member(kScanSecondsKey).doubleValue());
 }
 
 std::vector<std::string> SysupUpdateState::keyList(std::string_view name) const {
   std::vector<std::string> keys;
-  const PlistArray* stored = PlistValue(dictionary_)[name].array();
+  const PlistArray* stored = member(name).array();
   if (!stored) return keys;
   for (const PlistValue& value : *stored) {
     if (const std::string* key = value.string()) keys.push_back(*key);
@@ -104,7 +108,7 @@ void SysupUpdateState::setKeyList(std::string_view name, const std::vector<std::
 
 std::set<std::string> SysupUpdateState::dictionaryKeys(std::string_view name) const {
   std::set<std::string> keys;
-  const PlistDictionary* stored = PlistValue(dictionary_)[name].dictionary();
+  const PlistDictionary* stored = member(name).dictionary();
   if (!stored) return keys;
   for (const auto& [key, value] : *stored) keys.insert(key);
   return keys;

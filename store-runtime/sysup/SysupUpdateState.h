@@ -69,6 +69,9 @@ class SysupUpdateState {
   [[nodiscard]] std::vector<SysupQuaymartUpdate> availableUpdates() const;
 
  private:
+  // The stored value itself, not a copy: callers keep pointers into it.
+  [[nodiscard]] const PlistValue& member(std::string_view name) const;
+
   PlistDictionary dictionary_;
 };
 
