@@ -59,6 +59,8 @@ class CommandLine {
   bool checkFirst = false;
   // dmap-dump
   std::string dmapFile;
+  // background-scan
+  std::optional<std::string> backgroundScanInfo;
   // prefs get|set|delete
   PreferencesOptions preferences;
   // The subcommand of a command that has them ("get" of "prefs get").
