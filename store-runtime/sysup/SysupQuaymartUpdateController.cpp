@@ -157,15 +157,21 @@ class SysupQuaymartUpdateController::Implementation {
     const PlatformStateFile file = stateFile();
     UpdateList current = readState(file).availableUpdates();
     std::unique_ptr<SysupStateFileWatcher> retired;
-    MutexLock lock(mutex_);
-    const ObserverToken token = nextObserverToken_++;
-    if (observers_.empty()) lastTold_ = std::move(current);
-    observers_.emplace(token, std::make_shared<AvailableUpdatesObserver>(std::move(observer)));
-    if (!watcher_ || watcher_->filePath() != file.path()) {
-      retired = std::move(watcher_);
-      watcher_ =
-          std::make_unique<SysupStateFileWatcher>(file.path(), [this] { stateMayHaveChanged(); });
+    ObserverToken token = 0;
+    {
+      MutexLock lock(mutex_);
+      token = nextObserverToken_++;
+      if (observers_.empty()) lastTold_ = std::move(current);
+      observers_.emplace(token, std::make_shared<AvailableUpdatesObserver>(std::move(observer)));
+      if (!watcher_ || watcher_->filePath() != file.path()) {
+        retired = std::move(watcher_);
+        watcher_ =
+            std::make_unique<SysupStateFileWatcher>(file.path(), [this] { stateMayHaveChanged(); });
+      }
     }
+    // A change between the read above and the watch would go unheard
+    // otherwise; an unchanged list is not told.
+    stateMayHaveChanged();
     return token;
   }
 
@@ -334,8 +340,9 @@ void SysupQuaymartUpdateController::availableUpdatesMatchingPredicate(
   UpdateList updates = availableUpdates();
   if (predicate)
     std::erase_if(updates, [&predicate](const auto& update) { return !predicate(update); });
-  DispatchQueue::globalQueue().async(
-      [updates = std::move(updates), handler = std::move(handler)] { handler(updates); });
+  DispatchQueue::globalQueue().async([updates = std::move(updates), handler = std::move(handler)] {
+    if (handler) handler(updates);
+  });
 }
 
 void SysupQuaymartUpdateController::startScanningForUpdatesIncludingPrerelease(

@@ -84,6 +84,11 @@ TEST_P(SysupScanTest, FindsTheCatalogueLessHiddenInstalledAndDamagedEntries) {
   PlistArray stored;
   for (const std::string& key : GetParam().expected) stored.emplace_back(key);
   EXPECT_EQ(SysupTest::stored("available"), PlistValue(stored));
+  Collector<Strings> critical;
+  controller().availableUpdatesMatchingPredicate(
+      [](const SysupQuaymartUpdate& update) { return update.isCritical(); },
+      [&critical](const UpdateList& updates) { critical.add(productKeysOf(updates)); });
+  EXPECT_EQ(critical.waitFor(1).front(), Strings{"A"});
 }
 
 INSTANTIATE_TEST_SUITE_P(Prerelease, SysupScanTest,
