@@ -10,7 +10,7 @@
 #include "platform/system/Uuid.h"
 #include "store-runtime/host/PlatformStateFile.h"
 #include "store-runtime/sysup/SysupOperationPacer.h"
-#include "store-runtime/sysup/SysupStateFileWatcher.h"
+#include "store-runtime/sysup/SysupUpdateObservers.h"
 #include "store-runtime/sysup/SysupUpdateState.h"
 
 namespace larder {
@@ -91,12 +91,6 @@ class SysupQuaymartUpdateController::Implementation {
       : workQueue_(DispatchQueue::create("com.orvane.larder.sysup", DispatchQueue::Kind::Concurrent,
                                          DispatchQueue::Limits{.concurrentWorkers = 8})) {}
 
-  ~Implementation() {
-    std::unique_ptr<SysupStateFileWatcher> retired;
-    MutexLock lock(mutex_);
-    retired = std::move(watcher_);
-  }
-
   void scan(bool includingPrerelease, std::shared_ptr<DispatchQueue> notifyOn,
             ScanProgressHandler progress, FinishHandler finish) {
     workQueue_->async([this, file = stateFile(), includingPrerelease,
@@ -154,54 +148,12 @@ class SysupQuaymartUpdateController::Implementation {
   }
 
   ObserverToken addObserver(AvailableUpdatesObserver observer) {
-    const PlatformStateFile file = stateFile();
-    UpdateList current = readState(file).availableUpdates();
-    std::unique_ptr<SysupStateFileWatcher> retired;
-    ObserverToken token = 0;
-    {
-      MutexLock lock(mutex_);
-      token = nextObserverToken_++;
-      if (observers_.empty()) lastTold_ = std::move(current);
-      observers_.emplace(token, std::make_shared<AvailableUpdatesObserver>(std::move(observer)));
-      if (!watcher_ || watcher_->filePath() != file.path()) {
-        retired = std::move(watcher_);
-        watcher_ =
-            std::make_unique<SysupStateFileWatcher>(file.path(), [this] { stateMayHaveChanged(); });
-      }
-    }
-    // A change between the read above and the watch would go unheard
-    // otherwise; an unchanged list is not told.
-    stateMayHaveChanged();
-    return token;
+    return observers_.add(std::move(observer), stateFile().path());
   }
-
-  void removeObserver(ObserverToken token) {
-    // Destroyed after the lock is let go: its thread may be waiting for it.
-    std::unique_ptr<SysupStateFileWatcher> retired;
-    MutexLock lock(mutex_);
-    observers_.erase(token);
-    if (observers_.empty()) {
-      retired = std::move(watcher_);
-      lastTold_.reset();
-    }
-  }
-
-  // Something may have changed the available list; observers hear about it
-  // from one delivery loop at a time, so that they hear lists in order.
-  void stateMayHaveChanged() {
-    {
-      MutexLock lock(mutex_);
-      changePending_ = true;
-      if (delivering_ || observers_.empty()) return;
-      delivering_ = true;
-    }
-    DispatchQueue::globalQueue().async([this] { deliverChanges(); });
-  }
+  void removeObserver(ObserverToken token) { observers_.remove(token); }
+  void stateMayHaveChanged() { observers_.stateMayHaveChanged(); }
 
  private:
-  using ObserverList =
-      std::vector<std::pair<ObserverToken, std::shared_ptr<AvailableUpdatesObserver>>>;
-
   static bool storeScanResult(const PlatformStateFile& file, bool includingPrerelease) {
     std::size_t found = 0;
     const bool stored = changeState(file, [&](SysupUpdateState& state) {
@@ -266,46 +218,10 @@ class SysupQuaymartUpdateController::Implementation {
     });
   }
 
-  void deliverChanges() {
-    while (true) {
-      {
-        MutexLock lock(mutex_);
-        if (!changePending_ || observers_.empty()) {
-          delivering_ = false;
-          return;
-        }
-        changePending_ = false;
-      }
-      UpdateList current = readState(stateFile()).availableUpdates();
-      ObserverList targets;
-      {
-        MutexLock lock(mutex_);
-        if (lastTold_ == current) continue;
-        lastTold_ = current;
-        targets.assign(observers_.begin(), observers_.end());
-      }
-      for (const auto& [token, observer] : targets) {
-        // An earlier observer of this round may have removed this one.
-        if (isObserving(token)) (*observer)(current);
-      }
-    }
-  }
-
-  bool isObserving(ObserverToken token) {
-    MutexLock lock(mutex_);
-    return observers_.contains(token);
-  }
-
   std::shared_ptr<DispatchQueue> workQueue_;
   Mutex mutex_;
   std::map<CancelToken, std::shared_ptr<SysupOperationPacer>> operations_ GUARDED_BY(mutex_);
-  std::map<ObserverToken, std::shared_ptr<AvailableUpdatesObserver>> observers_ GUARDED_BY(mutex_);
-  ObserverToken nextObserverToken_ GUARDED_BY(mutex_) = 1;
-  // The list observers heard last; they hear a list only when it differs.
-  std::optional<UpdateList> lastTold_ GUARDED_BY(mutex_);
-  bool changePending_ GUARDED_BY(mutex_) = false;
-  bool delivering_ GUARDED_BY(mutex_) = false;
-  std::unique_ptr<SysupStateFileWatcher> watcher_ GUARDED_BY(mutex_);
+  SysupUpdateObservers observers_{[] { return readState(stateFile()).availableUpdates(); }};
 };
 
 SysupQuaymartUpdateController::SysupQuaymartUpdateController()
