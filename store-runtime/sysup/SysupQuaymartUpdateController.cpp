@@ -87,8 +87,11 @@ class SysupQuaymartUpdateController::Implementation {
  public:
   enum class Transfer { Install, PostLogoutDownload };
 
+  // Each simulated run holds a worker while it waits out its seconds, so a
+  // few may run side by side without one waiting behind another.
   Implementation()
-      : workQueue_(DispatchQueue::create("com.orvane.larder.sysup", DispatchQueue::Kind::Concurrent,
+      : workQueue_(DispatchQueue::create("SysupQuaymartUpdateController operations",
+                                         DispatchQueue::Kind::Concurrent,
                                          DispatchQueue::Limits{.concurrentWorkers = 8})) {}
 
   void scan(bool includingPrerelease, std::shared_ptr<DispatchQueue> notifyOn,
