@@ -15,7 +15,7 @@ class SysupOperationPacer {
   // Reports handed out per run, 0 and 100 included.
   static constexpr int kSteps = 4;
 
-  // Calls `report` with 0, then with a larger percent after each part of
+  // Calls `report` with 0, then with a larger percent after each equal share of
   // `seconds` (all at once when 0), up to 100. False when cancelled first.
   bool run(double seconds, const std::function<void(double percent)>& report);
   void cancel();
