@@ -72,7 +72,7 @@ void BM_ReconcileAnswerWithCache(benchmark::State& state) {
     state.PauseTiming();
     larder::bench::writeFixture(path, s.cache);
     auto queue = std::make_shared<UpdateQueue>(larder::VendStoreClient::initWithStoreClientType(0),
-                                               nullptr, *s.map);
+                                               std::weak_ptr<larder::UpdateQueueDelegate>(), *s.map);
     larder::LoadUpdateQueueOperation operation(larder::VendStoreClient::initWithStoreClientType(0),
                                                *s.map);
     operation.setAvailableUpdates(s.answer);

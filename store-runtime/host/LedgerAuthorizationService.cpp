@@ -10,10 +10,8 @@ namespace {
 
 constexpr std::string_view kFileName = "authorization.plist";
 
-bool isDefaultGrant(const std::string& right) {
-  return right.starts_with("system.install.quaymart-software") ||
-         right.starts_with("system.install.orvane-software");
-}
+// Everything but the right that needs a person to agree.
+bool isDefaultGrant(const std::string& right) { return right != "system.install.software"; }
 
 bool isGranted(const PlistDictionary& state, const std::string& right) {
   auto found = state.find("grantedRights");

@@ -12,9 +12,9 @@ namespace larder {
 // are kept in "<root>/var/lib/larder-platform/authorization.plist":
 //
 //   grantedRights     array of right names granted without asking; when the
-//                     file or the key is missing, the rights of store
-//                     software and of the vendor's software are granted, as
-//                     on a machine whose user administers it
+//                     file or the key is missing, every right but the
+//                     interactive "system.install.software", as on a machine
+//                     whose user administers it
 //   interactiveGrant  boolean: what the user answers when asked (default
 //                     false: nobody is there to answer)
 //   requests          appended by each request: { rights, interactive }, so

@@ -58,6 +58,11 @@ class SysupQuaymartUpdateController {
   using CancelToken = std::string;
 
   static constexpr std::string_view kStateFileName = "system-updates.plist";
+  // Codes of VendErrorDomain for what only the simulation can fail at: an
+  // entry marked installFails or an update not in the catalogue, and a state
+  // file that could not be written.
+  static constexpr std::int64_t kInstallFailedErrorCode = 100;
+  static constexpr std::int64_t kStateFileErrorCode = 101;
 
   // The one instance of the process.
   static SysupQuaymartUpdateController& sharedUpdateController();

@@ -141,7 +141,7 @@ TEST_F(UpdateControllerServiceTest, ObserversHearChecksAndHidesAndOneThatHasGone
 
   const auto started = std::chrono::steady_clock::now();
   LarderctlRun hide = run({"--json", "os-updates", "--hide", "SEC-1", "APP-2", "KERNEL-3"});
-  ASSERT_EQ(hide.status, 3) << hide.errors << "\n" << hide.output;
+  ASSERT_EQ(hide.status, 3) << hide.errors << "\n" << hide.output << service_->log();
   EXPECT_LT(std::chrono::steady_clock::now() - started, 10s);
   EXPECT_EQ(JsonConversion::fromJson(nlohmann::json::parse(hide.output)), PlistValue(PlistArray{}));
   for (const auto& observer : calls) {

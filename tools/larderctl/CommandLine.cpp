@@ -193,6 +193,12 @@ void CommandLine::addUpdateCommands() {
 void CommandLine::addOtherCommands() {
   auto* dmapDump = app_.add_subcommand("dmap-dump", "decode a DMAP document and print it as JSON");
   dmapDump->add_option("file", dmapFile, "the document; - for standard input")->required();
+  auto* backgroundScan =
+      app_.add_subcommand("background-scan",
+                          "scan for OS updates and tell the service what was found, as the "
+                          "software update agent does");
+  backgroundScan->add_option("--info", backgroundScanInfo,
+                             "send this JSON object instead of scanning");
 }
 
 void CommandLine::addPreferenceCommands() {

@@ -64,6 +64,8 @@ class CommandLine {
   bool watchBadge = false;
   // dmap-dump
   std::string dmapFile;
+  // background-scan
+  std::optional<std::string> backgroundScanInfo;
   // prefs get|set|delete
   PreferencesOptions preferences;
   // The subcommand of a command that has them ("get" of "prefs get").

@@ -36,16 +36,19 @@ int OSUpdatesCommand::run(const OSUpdatesOptions& options) {
       return kExitFailure;
     }
   }
+  // One argument that is a list: a braced list holding one PlistArray would
+  // copy it instead.
   if (!options.hide.empty() &&
       !changeHidden("HideOSUpdatesWithProductKeys",
-                    {PlistArray(options.hide.begin(), options.hide.end())}, "hide the OS updates")) {
+                    PlistArray{PlistValue(PlistArray(options.hide.begin(), options.hide.end()))},
+                    "hide the OS updates")) {
     return kExitFailure;
   }
   if (options.unhideAll && !changeHidden("UnhideAllOSUpdates", {}, "unhide the OS updates")) {
     return kExitFailure;
   }
   // No tags: every available update carries all of none.
-  PlistValue updates = client_.call("UpdatesForTags", {PlistArray{}}).at(0);
+  PlistValue updates = client_.call("UpdatesForTags", PlistArray{PlistValue(PlistArray{})}).at(0);
   const PlistArray& list = updates.array() ? *updates.array() : PlistArray{};
   print(list);
   return list.empty() ? kExitNothingToDo : kExitSuccess;

@@ -7,6 +7,7 @@
 #include "client/ServiceClient.h"
 #include "client/ServiceRequests.h"
 #include "platform/system/StopSignals.h"
+#include "tools/larderctl/BackgroundScanCommand.h"
 #include "tools/larderctl/CallArguments.h"
 #include "tools/larderctl/CommandLine.h"
 #include "tools/larderctl/DialogAgentCommand.h"
@@ -119,6 +120,16 @@ int runStore(const CommandLine& line) {
   return store.downloads(line.downloadMask);
 }
 
+int runBackgroundScan(const CommandLine& line) {
+  // A wrong --info is a usage error, found before anything is tried.
+  std::optional<PlistDictionary> given;
+  if (line.backgroundScanInfo) {
+    given = BackgroundScanCommand::reportFromJson(*line.backgroundScanInfo);
+  }
+  ServiceClient client = connect(line.global);
+  return BackgroundScanCommand(line.global.json).run(client, given);
+}
+
 int runChosen(const CommandLine& line) {
   if (line.chose("dmap-dump")) return DmapDumpCommand(line.global.json).run(line.dmapFile);
   if (line.chose("prefs")) {
@@ -135,6 +146,7 @@ int runChosen(const CommandLine& line) {
     return OSUpdatesCommand(client, line.global.json).run(line.osUpdates);
   }
   if (line.chose("badge")) return runBadge(line);
+  if (line.chose("background-scan")) return runBackgroundScan(line);
   if (line.chose("updates")) {
     ServiceClient client = connect(line.global);
     return UpdatesCommand(client, line.global.json).run(line.checkFirst);

@@ -129,7 +129,7 @@ class UpdateControllerTest : public ServiceTest {
   static void setPreference(std::string_view key, PlistValue value,
                             std::string_view domain = kDaemonDefaultsID,
                             PreferenceScope scope = PreferenceScope::App) {
-    ASSERT_TRUE(PreferenceStore::setValue(key, std::move(value), domain, scope).ok());
+    ASSERT_TRUE(PreferenceStore::setValue(key, std::move(value), domain, scope).has_value());
   }
 
   std::optional<SoftwareMap> map_;
