@@ -3,6 +3,7 @@
 #include <sdbus-c++/Error.h>
 #include <sdbus-c++/IProxy.h>
 
+#include "AssetService/DBusRemoteObjectFactory.h"
 #include "AssetService/DialogAgentRegistry.h"
 #include "AssetService/StoreRuntimeInterface.h"
 #include "client/DBusValueCodec.h"
@@ -24,130 +25,7 @@ std::unique_ptr<sdbus::IConnection> connectToBus() {
   return sdbus::createSessionBusConnection();
 }
 
-// An object that lives in a client: each call is sent without waiting for
-// an answer, so that a slow or vanished client holds up nobody, and a client
-// that has gone simply never receives it.
-class DBusCallbackObject {
- public:
-  DBusCallbackObject(sdbus::IConnection& connection, std::string peer, std::string objectPath,
-                     std::string_view protocol)
-      : peer_(std::move(peer)),
-        objectPath_(std::move(objectPath)),
-        interfaceName_(std::string(ServiceRequests::kCallbackInterfacePrefix) +
-                       std::string(protocol)),
-        proxy_(sdbus::createProxy(connection, peer_, objectPath_)) {}
-
-  void send(std::string_view member, std::string_view signature, const PlistArray& values) const {
-    try {
-      sdbus::MethodCall call = proxy_->createMethodCall(interfaceName_, std::string(member));
-      DBusValueCodec::writeAll(call, signature, values);
-      call.dontExpectReply();
-      proxy_->callMethod(call);
-    } catch (const sdbus::Error& error) {
-      TILL_LOG(3, "%@: call to %@ %@ dropped: %@", kSpeaker, peer_, objectPath_, error.what());
-    }
-  }
-
-  [[nodiscard]] bool isSameObjectAs(const DBusCallbackObject* other) const {
-    return other && other->peer_ == peer_ && other->objectPath_ == objectPath_;
-  }
-
- private:
-  std::string peer_;
-  std::string objectPath_;
-  std::string interfaceName_;
-  std::unique_ptr<sdbus::IProxy> proxy_;
-};
-
-PlistArray wireForms(const std::vector<SysupQuaymartUpdate>& updates) {
-  PlistArray wire;
-  for (const SysupQuaymartUpdate& update : updates) wire.emplace_back(update.toDictionary());
-  return wire;
-}
-
-class DBusSoftwareMapObserver final : public VendSoftwareMapObserver, DBusCallbackObject {
- public:
-  using DBusCallbackObject::DBusCallbackObject;
-  void softwareProductUpdatedState(const LedgerSoftwareProductRef& product,
-                                   std::int64_t state) override {
-    send("SoftwareProductUpdatedState", "a{sv}x", {product->toDictionary(), state});
-  }
-};
-
-class DBusAvailableUpdatesObserver final : public VendAvailableUpdatesObserver,
-                                           DBusCallbackObject {
- public:
-  using DBusCallbackObject::DBusCallbackObject;
-  void availableUpdatesDidChangedWithUpdates(const std::vector<LedgerUpdateRef>& updates,
-                                             const std::vector<SysupQuaymartUpdate>& osUpdates,
-                                             std::uint64_t badgeCount) override {
-    PlistArray appUpdates;
-    for (const LedgerUpdateRef& update : updates) appUpdates.emplace_back(update->toDictionary());
-    send("AvailableUpdatesDidChangedWithUpdatesOsUpdatesBadgeCount", "aa{sv}aa{sv}t",
-         {std::move(appUpdates), wireForms(osUpdates), badgeCount});
-  }
-  [[nodiscard]] bool isSameObserverAs(const VendAvailableUpdatesObserver& other) const override {
-    return isSameObjectAs(dynamic_cast<const DBusAvailableUpdatesObserver*>(&other));
-  }
-};
-
-class DBusOSUpdateScanObserver final : public VendOSUpdateScanObserver, DBusCallbackObject {
- public:
-  using DBusCallbackObject::DBusCallbackObject;
-  void osUpdateScanForTags(const std::vector<std::string>& tags, float percentComplete,
-                           bool isFinished, const OptionalError& error) override {
-    send("OsUpdateScanForTagsDidProgressWithPercentCompleteIsFinishedError", "asdba{sv}",
-         {PlistArray(tags.begin(), tags.end()), static_cast<double>(percentComplete), isFinished,
-          error ? error->toDictionary() : PlistDictionary{}});
-  }
-  [[nodiscard]] bool isSameObserverAs(const VendOSUpdateScanObserver& other) const override {
-    return isSameObjectAs(dynamic_cast<const DBusOSUpdateScanObserver*>(&other));
-  }
-};
-
-class DBusOSUpdateProgressObserver final : public VendOSUpdateProgressObserver,
-                                           DBusCallbackObject {
- public:
-  using DBusCallbackObject::DBusCallbackObject;
-  void osUpdatesChangedProgress(const std::vector<SysupQuaymartUpdate>& osUpdates,
-                                const LedgerSoftwareUpdateStatus& progress) override {
-    send("OsUpdatesChangedProgress", "aa{sv}a{sv}", {wireForms(osUpdates), progress.toDictionary()});
-  }
-  [[nodiscard]] bool isSameObserverAs(const VendOSUpdateProgressObserver& other) const override {
-    return isSameObjectAs(dynamic_cast<const DBusOSUpdateProgressObserver*>(&other));
-  }
-};
-
 }  // namespace
-
-class ServiceListener::RemoteObjects final : public RemoteObjectFactory {
- public:
-  explicit RemoteObjects(sdbus::IConnection& connection) : connection_(connection) {}
-
-  std::shared_ptr<VendSoftwareMapObserver> softwareMapObserver(
-      const std::string& peer, const std::string& objectPath) override {
-    return std::make_shared<DBusSoftwareMapObserver>(connection_, peer, objectPath,
-                                                     "VendSoftwareMapObserver");
-  }
-  std::shared_ptr<VendAvailableUpdatesObserver> availableUpdatesObserver(
-      const std::string& peer, const std::string& objectPath) override {
-    return std::make_shared<DBusAvailableUpdatesObserver>(connection_, peer, objectPath,
-                                                          "VendAvailableUpdatesObserver");
-  }
-  std::shared_ptr<VendOSUpdateScanObserver> osUpdateScanObserver(
-      const std::string& peer, const std::string& objectPath) override {
-    return std::make_shared<DBusOSUpdateScanObserver>(connection_, peer, objectPath,
-                                                      "VendOSUpdateScanObserver");
-  }
-  std::shared_ptr<VendOSUpdateProgressObserver> osUpdateProgressObserver(
-      const std::string& peer, const std::string& objectPath) override {
-    return std::make_shared<DBusOSUpdateProgressObserver>(connection_, peer, objectPath,
-                                                          "VendOSUpdateProgressObserver");
-  }
-
- private:
-  sdbus::IConnection& connection_;
-};
 
 ServiceListener::ServiceListener(std::string serviceName, SoftwareMap& softwareMap)
     : serviceName_(std::move(serviceName)), softwareMap_(softwareMap) {}
@@ -173,7 +51,7 @@ void ServiceListener::setStoreRuntimeInterface(
 
 void ServiceListener::resume() {
   connection_ = connectToBus();
-  remoteObjects_ = std::make_shared<RemoteObjects>(*connection_);
+  remoteObjects_ = std::make_shared<DBusRemoteObjectFactory>(*connection_);
   object_ = sdbus::createObject(*connection_, std::string(ServiceRequests::kObjectPath));
   for (const RequestDescriptor& request : RequestTable::requests()) {
     object_->registerMethod(

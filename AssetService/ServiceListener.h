@@ -48,8 +48,6 @@ class ServiceListener {
   [[nodiscard]] std::size_t connectionCount() const;
 
  private:
-  class RemoteObjects;
-
   void dispatch(const RequestDescriptor& request, sdbus::MethodCall call);
   std::shared_ptr<AssetServiceInterface> interfaceForPeer(const std::string& peer);
   void peerDidChangeOwner(sdbus::Message& signal);
@@ -69,7 +67,7 @@ class ServiceListener {
   std::shared_ptr<StoreRuntimeInterface> storeRuntime_;
   std::unique_ptr<sdbus::IConnection> connection_;
   std::unique_ptr<sdbus::IObject> object_;
-  std::shared_ptr<RemoteObjects> remoteObjects_;
+  std::shared_ptr<RemoteObjectFactory> remoteObjects_;
 
   mutable Mutex peersMutex_;
   std::map<std::string, std::shared_ptr<AssetServiceInterface>, std::less<>> peers_

@@ -15,6 +15,7 @@
 #include <random>
 #include <thread>
 
+#include "BenchProcesses.h"
 #include "ProductStoreFixture.h"
 #include "client/DBusValueCodec.h"
 #include "client/ServiceClient.h"
@@ -26,29 +27,9 @@ namespace {
 using larder::PlistArray;
 using larder::ServiceClient;
 using larder::bench::ProductStoreFixture;
+using larder::bench::spawn;
 
 constexpr std::size_t kProducts = 10'000;
-
-pid_t spawn(std::vector<std::string> argv, const std::vector<std::string>& extraEnvironment,
-            int outputFd) {
-  std::vector<std::string> environment;
-  for (char** entry = environ; *entry; ++entry) environment.emplace_back(*entry);
-  environment.insert(environment.end(), extraEnvironment.begin(), extraEnvironment.end());
-  std::vector<char*> args;
-  for (auto& a : argv) args.push_back(a.data());
-  args.push_back(nullptr);
-  std::vector<char*> env;
-  for (auto& e : environment) env.push_back(e.data());
-  env.push_back(nullptr);
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  if (outputFd >= 0) posix_spawn_file_actions_adddup2(&actions, outputFd, 1);
-  posix_spawn_file_actions_addopen(&actions, 2, "/dev/null", O_WRONLY, 0);
-  pid_t pid = -1;
-  posix_spawn(&pid, args[0], &actions, nullptr, args.data(), env.data());
-  posix_spawn_file_actions_destroy(&actions);
-  return pid;
-}
 
 // A bare sd-bus server: one method, same argument, same reply record.
 class BareServer {
@@ -102,15 +83,7 @@ class BareServer {
 
 struct Environment {
   Environment() : fixture(kProducts) {
-    int pipeEnds[2];
-    pipe(pipeEnds);
-    busPid =
-        spawn({"/usr/bin/dbus-daemon", "--session", "--nofork", "--nopidfile", "--print-address=1"},
-              {}, pipeEnds[1]);
-    close(pipeEnds[1]);
-    char c = 0;
-    while (read(pipeEnds[0], &c, 1) == 1 && c != '\n') address += c;
-    close(pipeEnds[0]);
+    const std::string& address = bus.address();
     servicePid =
         spawn({LARDERD_PATH},
               {"DBUS_SESSION_BUS_ADDRESS=" + address, "HOME=" + fixture.directory() + "/home",
@@ -138,13 +111,10 @@ struct Environment {
     bare.reset();
     kill(servicePid, SIGKILL);
     waitpid(servicePid, nullptr, 0);
-    kill(busPid, SIGTERM);
-    waitpid(busPid, nullptr, 0);
   }
 
   ProductStoreFixture fixture;
-  std::string address;
-  pid_t busPid = -1;
+  larder::bench::PrivateSessionBus bus;
   pid_t servicePid = -1;
   std::unique_ptr<BareServer> bare;
   std::unique_ptr<ServiceClient> service;

@@ -18,6 +18,7 @@ larder_store="$PWD/$build/larder-store"
 demo=$(mktemp -d /tmp/larder-demo-XXXXXX)
 export LARDER_ROOT="$demo/root" HOME="$demo/home"
 export XDG_CACHE_HOME="$HOME/.cache" XDG_STATE_HOME="$HOME/.local/state"
+export XDG_CONFIG_HOME="$HOME/.config"
 mkdir -p "$LARDER_ROOT/Applications" "$HOME/Applications"
 
 plist_header='<?xml version="1.0" encoding="UTF-8"?>
@@ -173,3 +174,37 @@ echo; echo "== larderctl updates --check  (Ledgerly 2.5 installed, 2.6 in the st
 "$larderctl" updates --check
 echo; echo "== larderctl updates  (the same list, from the service's cache; no store request)"
 "$larderctl" updates
+
+# The OS updates the system offers this machine, in the simulated system
+# update framework.
+mkdir -p "$LARDER_ROOT/var/lib/larder-platform"
+cat >"$LARDER_ROOT/var/lib/larder-platform/system-updates.plist" <<PLIST
+$plist_header
+<dict><key>catalog</key><array>
+  <dict><key>productKey</key><string>SEC-2026-11</string><key>title</key><string>Security Update</string>
+    <key>versionString</key><string>2026-11</string><key>isCritical</key><true/>
+    <key>isRecommended</key><true/><key>downloadSize</key><integer>52428800</integer></dict>
+  <dict><key>productKey</key><string>KERNEL-6.12</string><key>title</key><string>Kernel</string>
+    <key>versionString</key><string>6.12.4</string><key>isRecommended</key><true/>
+    <key>restartRequired</key><true/><key>allowedToUseInstallLater</key><true/></dict>
+</array><key>scanSeconds</key><real>1.5</real></dict>
+</plist>
+PLIST
+
+echo; echo "== larderctl watch --badge, while larderctl os-updates --scan scans for OS updates (progress on a terminal)"
+"$larderctl" watch --badge &
+badge_watcher=$!
+sleep 0.3
+"$larderctl" os-updates --scan
+echo; echo "== larderctl badge  (one app update, plus one for all OS updates together)"
+"$larderctl" badge
+echo; echo "== larderctl os-updates --hide KERNEL-6.12"
+"$larderctl" os-updates --hide KERNEL-6.12
+echo; echo "== larderctl background-scan  (the daily agent's report: the service enqueues one run, see its log)"
+"$larderctl" background-scan
+sleep 0.3
+grep -o 'Enqueuing UpdateOperation.*' "$XDG_STATE_HOME/larderd.log" | tail -1
+"$larderctl" os-updates --unhide-all >/dev/null
+sleep 0.3
+kill -INT $badge_watcher
+wait $badge_watcher || true

@@ -175,7 +175,8 @@ std::uint64_t UpdateController::availableUpdatesBadgeCount() const {
   }
   if (storeClient_.clientType() != 0) return count;
 
-  OSUpdateList osUpdates = SysupQuaymartUpdateController::sharedUpdateController().availableUpdates();
+  OSUpdateList osUpdates =
+      SysupQuaymartUpdateController::sharedUpdateController().availableUpdates();
   if (isAutoUpdatedOfRestartRequiredUpdatesEnabled() && !lastDoItLaterLogoutFailed()) {
     std::vector<std::string> seen = osUpdateProductKeysSeenByUser();
     OSUpdateList quiet = availableOSUpdatesEligibleForAutoInstallOfRestartRequiredUpdates();
@@ -192,12 +193,14 @@ std::uint64_t UpdateController::availableUpdatesBadgeCount() const {
   return count + (osUpdates.empty() ? 0 : 1);
 }
 
-void UpdateController::availableUpdatesDidChange() { availableUpdatesDidChangeInternal(); }
+void UpdateController::availableUpdatesDidChange() {
+  availableUpdatesDidChangeInternal();
+}
 
 void UpdateController::availableUpdatesDidChangeInternal() {
-  bool badgeDisabled = PreferenceStore::booleanForKey(kDefaultsDisableQuaymartBadgeKey,
-                                                      kQuaymartDefaultsID)
-                           .value_or(false);
+  bool badgeDisabled =
+      PreferenceStore::booleanForKey(kDefaultsDisableQuaymartBadgeKey, kQuaymartDefaultsID)
+          .value_or(false);
   std::uint64_t count = badgeDisabled ? 0 : availableUpdatesBadgeCount();
   (void)PreferenceStore::setValue(kDefaultsQuaymartBadgeCountKey, count, kQuaymartDefaultsID);
   if (!disableDockBadgeUpdates_.load()) {
@@ -218,10 +221,11 @@ void UpdateController::availableUpdatesDidChangeInternal() {
              kSpeaker);
     removeUpdatesAvailableNotifications();
   }
-  std::vector<LedgerUpdateRef> appUpdates = availableAppUpdates();
-  OSUpdateList osUpdates = SysupQuaymartUpdateController::sharedUpdateController().availableUpdates();
+  auto change = std::make_shared<const AvailableUpdatesChange>(
+      availableAppUpdates(),
+      SysupQuaymartUpdateController::sharedUpdateController().availableUpdates(), count);
   availableUpdateObservers_.forEach([&](VendAvailableUpdatesObserver& observer) {
-    observer.availableUpdatesDidChangedWithUpdates(appUpdates, osUpdates, count);
+    observer.availableUpdatesDidChangedWithUpdates(change);
   });
 }
 
@@ -230,7 +234,9 @@ void UpdateController::sendBadgeMessage(std::uint64_t count) const {
       kBadgeNotificationName, kBadgeNotificationObject, {{"badgeCount", count}});
 }
 
-void UpdateController::disableDockBadgeUpdates() { disableDockBadgeUpdates_.store(true); }
+void UpdateController::disableDockBadgeUpdates() {
+  disableDockBadgeUpdates_.store(true);
+}
 
 void UpdateController::enableDockBadgeUpdates() {
   disableDockBadgeUpdates_.store(false);
@@ -253,9 +259,8 @@ std::optional<std::uint64_t> UpdateController::lastDockBadgeCount() const {
 UpdateController::OSUpdatePredicate UpdateController::predicateWithTags(
     std::vector<std::string> tags) {
   return [tags = std::move(tags)](const SysupQuaymartUpdate& update) {
-    return std::ranges::all_of(tags, [&](const std::string& tag) {
-      return contains(update.tags(), tag);
-    });
+    return std::ranges::all_of(
+        tags, [&](const std::string& tag) { return contains(update.tags(), tag); });
   };
 }
 
@@ -283,8 +288,8 @@ std::shared_ptr<UpdateOperation> UpdateController::softwareUpdateDidFinishBackgr
     // The major OS update is evaluated on the install queue by a later
     // part of the service; the notice is only acknowledged here.
     majorOSInstallQueue_->async([path = stringOf(info, "majorOSUpdateAvailableAtPath")] {
-      TILL_LOG(2, "%@: Major OS update notice at %@ left for the major OS update support",
-               kSpeaker, path.value_or(""));
+      TILL_LOG(2, "%@: Major OS update notice at %@ left for the major OS update support", kSpeaker,
+               path.value_or(""));
     });
     return nullptr;
   }
@@ -297,9 +302,8 @@ std::shared_ptr<UpdateOperation> UpdateController::softwareUpdateDidFinishBackgr
   if (valueOf(info, "updateNotificationsOnly").boolValue()) {
     TILL_LOG(2, "%@: updateNotificationsOnly=true, setting updateNotificationsOnly=YES on %@",
              kSpeaker, operation->description());
-    operation->changeSettings([](UpdateOperationSettings& s) {
-      s.shouldUpdateNotificationsOnly = true;
-    });
+    operation->changeSettings(
+        [](UpdateOperationSettings& s) { s.shouldUpdateNotificationsOnly = true; });
   } else {
     majorOSInstallQueue_->async([] {
       TILL_LOG(3, "%@: Major OS update status left for the major OS update support", kSpeaker);
@@ -382,9 +386,9 @@ void UpdateController::applyPostLogoutResults(const PlistDictionary& info,
                                               UpdateOperation& operation) const {
   std::vector<std::string> confirmedKeys;
   if (const PlistDictionary* results = valueOf(info, "postLogoutUpdatesInstalled").dictionary()) {
-    bool fakeFailure = PreferenceStore::booleanForKey(kDefaultsFakePostLogoutUpdateFailureKey,
-                                                      kDaemonDefaultsID)
-                           .value_or(false);
+    bool fakeFailure =
+        PreferenceStore::booleanForKey(kDefaultsFakePostLogoutUpdateFailureKey, kDaemonDefaultsID)
+            .value_or(false);
     std::vector<PlistDictionary> installed;
     std::vector<PlistDictionary> installedLater;
     std::vector<PlistDictionary> failed;
@@ -439,7 +443,9 @@ void UpdateController::enqueue(const std::shared_ptr<UpdateOperation>& operation
 
 void UpdateController::postSilentInstallNotification(std::int64_t count,
                                                      const PlistDictionary& info) const {
-  TILL_LOG(2, "%@: Silent install notification for %@ updates (title %@, text %@, url %@) not posted: no notifications in this build",
+  TILL_LOG(2,
+           "%@: Silent install notification for %@ updates (title %@, text %@, url %@) not posted: "
+           "no notifications in this build",
            kSpeaker, count, stringOf(info, "autoInstalledUpdatesTitle").value_or(""),
            stringOf(info, "autoInstalledUpdatesText").value_or(""),
            stringOf(info, "autoInstalledUpdatesURLString").value_or(""));
@@ -447,7 +453,9 @@ void UpdateController::postSilentInstallNotification(std::int64_t count,
 
 void UpdateController::postAdminInstallNotification(std::int64_t count,
                                                     bool restartRequired) const {
-  TILL_LOG(2, "%@: Admin install notification for %@ updates (restart required %d) not posted: no notifications in this build",
+  TILL_LOG(2,
+           "%@: Admin install notification for %@ updates (restart required %d) not posted: no "
+           "notifications in this build",
            kSpeaker, count, restartRequired);
 }
 
@@ -456,20 +464,22 @@ void UpdateController::removeUpdatesAvailableNotifications() const {
 }
 
 void UpdateController::postNotificationForAutoUpdateOptIn() const {
-  TILL_LOG(2, "%@: Automatic updates opt-in notification not posted: no notifications in this build",
+  TILL_LOG(2,
+           "%@: Automatic updates opt-in notification not posted: no notifications in this build",
            kSpeaker);
 }
 
 void UpdateController::postNotificationForAutoUpdateOfRestartRequiredUpdatesOptIn() const {
   TILL_LOG(2,
-           "%@: Restart-required automatic updates opt-in notification not posted: no notifications in this build",
+           "%@: Restart-required automatic updates opt-in notification not posted: no "
+           "notifications in this build",
            kSpeaker);
 }
 
 void UpdateController::appendCriticalUpdatesToJournal(
     const std::vector<PlistDictionary>& entries) const {
-  TILL_LOG(2, "%@: %@ silently installed updates not journaled: no journal in this build",
-           kSpeaker, entries.size());
+  TILL_LOG(2, "%@: %@ silently installed updates not journaled: no journal in this build", kSpeaker,
+           entries.size());
 }
 
 void UpdateController::confirmPendingUpdatesInJournal(

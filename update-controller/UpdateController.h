@@ -93,7 +93,8 @@ class UpdateController final : public UpdateQueueDelegate,
   // --- Badge and observers ---
 
   void addAvailableUpdatesObserver(std::shared_ptr<VendAvailableUpdatesObserver> observer);
-  void removeAvailableUpdatesObserver(const std::shared_ptr<VendAvailableUpdatesObserver>& observer);
+  void removeAvailableUpdatesObserver(
+      const std::shared_ptr<VendAvailableUpdatesObserver>& observer);
   // App updates the user is to hear of, plus one for all OS updates together.
   [[nodiscard]] std::uint64_t availableUpdatesBadgeCount() const;
   void availableUpdatesDidChange() override;
@@ -125,8 +126,8 @@ class UpdateController final : public UpdateQueueDelegate,
   // --- OS update scans and hiding ---
 
   void startOSUpdateScanWithForceFullScan(bool forceFullScan, bool reportProgressImmediately,
-                                          bool launchedFromNotification,
-                                          bool userHasSeenAllUpdates, bool checkForOtherUpdates);
+                                          bool launchedFromNotification, bool userHasSeenAllUpdates,
+                                          bool checkForOtherUpdates);
   // One scan at a time: a caller that meets a running scan starts nothing,
   // and its handler is called when that scan finishes, with its error.
   void startOSUpdateScanForTags(std::optional<std::vector<std::string>> tags, bool forceFullScan,

@@ -27,10 +27,10 @@ SysupQuaymartUpdateController& framework() {
 }  // namespace
 
 void UpdateController::startOSUpdateScanWithForceFullScan(bool forceFullScan,
-                                                           bool reportProgressImmediately,
-                                                           bool launchedFromNotification,
-                                                           bool userHasSeenAllUpdates,
-                                                           bool checkForOtherUpdates) {
+                                                          bool reportProgressImmediately,
+                                                          bool launchedFromNotification,
+                                                          bool userHasSeenAllUpdates,
+                                                          bool checkForOtherUpdates) {
   startOSUpdateScanForTags(std::nullopt, forceFullScan, reportProgressImmediately,
                            launchedFromNotification, userHasSeenAllUpdates, nullptr);
   if (!checkForOtherUpdates) return;
@@ -41,14 +41,14 @@ void UpdateController::startOSUpdateScanWithForceFullScan(bool forceFullScan,
           bool, const UpdateQueue::UpdateList& available,
           const std::optional<UpdateQueue::UpdateList>& incompatible, const OptionalError&) {
         if (userHasSeenAllUpdates) {
-          queue->setUserHasSeenAllUpdates(available, incompatible.value_or(UpdateQueue::UpdateList{}));
+          queue->setUserHasSeenAllUpdates(available,
+                                          incompatible.value_or(UpdateQueue::UpdateList{}));
         }
       });
 }
 
 void UpdateController::startOSUpdateScanForTags(std::optional<std::vector<std::string>> tags,
-                                                bool forceFullScan,
-                                                bool reportProgressImmediately,
+                                                bool forceFullScan, bool reportProgressImmediately,
                                                 bool launchedFromNotification,
                                                 bool userHasSeenAllUpdates,
                                                 ScanCompletionHandler completion) {
@@ -60,7 +60,8 @@ void UpdateController::startOSUpdateScanForTags(std::optional<std::vector<std::s
       if (completion) osUpdateScanWaiters_.push_back(std::move(completion));
       return;
     }
-    TILL_LOG(2, "%@: Starting SoftwareUpdate scan with forceFullScan=%i launchedFromNotification=%i",
+    TILL_LOG(2,
+             "%@: Starting SoftwareUpdate scan with forceFullScan=%i launchedFromNotification=%i",
              kSpeaker, forceFullScan, launchedFromNotification);
     osUpdateScanInProgress_.store(true);
     osUpdateScanStartDate_.store(secondsSinceEpoch());
@@ -117,8 +118,8 @@ bool UpdateController::osUpdateScanInProgress() const {
   return osUpdateScanShouldReportProgress() && osUpdateScanInProgress_.load();
 }
 
-void UpdateController::sendOSUpdateScanForTags(const std::vector<std::string>& tags,
-                                               bool finished, float percentComplete,
+void UpdateController::sendOSUpdateScanForTags(const std::vector<std::string>& tags, bool finished,
+                                               float percentComplete,
                                                const OptionalError& error) const {
   osUpdateScanObservers_.forEach([&](VendOSUpdateScanObserver& observer) {
     observer.osUpdateScanForTags(tags, percentComplete, finished, error);

@@ -61,7 +61,9 @@ bool shouldAskForSwitch(std::string_view key, std::string_view versionKey) {
   return refusalIsFromAnotherOSVersion(versionKey);
 }
 
-bool isAbsentOrEmpty(const std::optional<std::string>& text) { return !text || text->empty(); }
+bool isAbsentOrEmpty(const std::optional<std::string>& text) {
+  return !text || text->empty();
+}
 
 Mutex& autoUpdatePromptLock() {
   static Mutex lock;
@@ -88,7 +90,7 @@ Clock::time_point UpdateController::dateWhenDateExceedsInterval(Clock::time_poin
 }
 
 bool UpdateController::timestampWithKeyHasExceededCheckInterval(std::string_view key,
-                                                                 double seconds) const {
+                                                                double seconds) const {
   std::optional<Clock::time_point> stored = dateForTimestampKey(key);
   if (!stored) return true;
   Clock::time_point due = dateWhenDateExceedsInterval(*stored, seconds - kTimestampSlackSeconds);
@@ -129,13 +131,15 @@ double UpdateController::autoInstallUpdateMinimumReleaseTimeInterval() {
 }
 
 bool UpdateController::isTimeToPostCriticalUpdateNotification() const {
-  return timestampWithKeyHasExceededCheckInterval(kDefaultsDidPostUpdatesAvailableNotificationDateKey,
-                                                  criticalUpdateNotificationMinimumInterval());
+  return timestampWithKeyHasExceededCheckInterval(
+      kDefaultsDidPostUpdatesAvailableNotificationDateKey,
+      criticalUpdateNotificationMinimumInterval());
 }
 
 bool UpdateController::isTimeToPostUpdatesAvailableNotification() const {
-  return timestampWithKeyHasExceededCheckInterval(kDefaultsDidPostUpdatesAvailableNotificationDateKey,
-                                                  availableUpdatesNotificationMinimumInterval());
+  return timestampWithKeyHasExceededCheckInterval(
+      kDefaultsDidPostUpdatesAvailableNotificationDateKey,
+      availableUpdatesNotificationMinimumInterval());
 }
 
 bool UpdateController::isTimeToStageAppUpdates() const {
@@ -161,7 +165,9 @@ bool UpdateController::shouldNotifyForNewUpdatesOnly() {
 
 // --- Switches ---
 
-bool UpdateController::isUpdateStagingEnabled() { return switchIsOn(kDefaultsAutomaticDownloadKey); }
+bool UpdateController::isUpdateStagingEnabled() {
+  return switchIsOn(kDefaultsAutomaticDownloadKey);
+}
 
 bool UpdateController::isAutoUpdatedEnabled() {
   return booleanIsTrue(kDefaultsAutoUpdateEnabledKey) && isUpdateStagingEnabled();
@@ -187,7 +193,8 @@ void UpdateController::setAutoUpdateOfRestartRequiredUpdatesEnabled(bool enabled
 
 bool UpdateController::shouldPromptForAutoUpdateOptIn() {
   if (!isSysupScanAutomaticCheckEnabled()) return false;
-  return shouldAskForSwitch(kDefaultsAutoUpdateEnabledKey, kDefaultsAutoUpdateEnabledMajorOSVersionKey);
+  return shouldAskForSwitch(kDefaultsAutoUpdateEnabledKey,
+                            kDefaultsAutoUpdateEnabledMajorOSVersionKey);
 }
 
 bool UpdateController::shouldPromptForAutoUpdateOfRestartRequiredUpdatesOptIn() {
@@ -206,11 +213,11 @@ void UpdateController::promptUserToOptInForAutoUpdateWithShowNotification(bool s
     return;
   }
   auto text = [this](std::string_view key) { return LedgerLocalizedString(key, &storeClient_); };
-  VendDialog dialog = VendDialog::dialogWithDictionary(
-      {{"message", text("AUTOUPDATE_OPTIN_TITLE")},
-       {"explanation", text("AUTOUPDATE_OPTIN_BODY")},
-       {"okButtonString", text("AUTOUPDATE_OPTIN_OK")},
-       {"cancelButtonString", text("AUTOUPDATE_OPTIN_CANCEL")}});
+  VendDialog dialog =
+      VendDialog::dialogWithDictionary({{"message", text("AUTOUPDATE_OPTIN_TITLE")},
+                                        {"explanation", text("AUTOUPDATE_OPTIN_BODY")},
+                                        {"okButtonString", text("AUTOUPDATE_OPTIN_OK")},
+                                        {"cancelButtonString", text("AUTOUPDATE_OPTIN_CANCEL")}});
   // The answer comes later, without the lock.
   serviceProxy_->uiService()->displayDialog(dialog, nullptr, [](std::int64_t exitCode) {
     bool agreed = exitCode == 1;
@@ -234,8 +241,8 @@ UpdateController::availableOSUpdatesEligibleForAutoInstallOfRestartRequiredUpdat
   for (const SysupQuaymartUpdate& update : sysup.availableUpdates()) {
     OSUpdateList single{update};
     if (sysup.actionRequiredForUpdates(single) != 0 &&
-        shouldOfferDoItLaterForAppUpdates({}, single) && isAbsentOrEmpty(update.firmwareWarning()) &&
-        isAbsentOrEmpty(update.licenseAgreement())) {
+        shouldOfferDoItLaterForAppUpdates({}, single) &&
+        isAbsentOrEmpty(update.firmwareWarning()) && isAbsentOrEmpty(update.licenseAgreement())) {
       eligible.push_back(update);
     }
   }

@@ -1,10 +1,8 @@
 #pragma once
 
-#include <cstdint>
-#include <vector>
+#include <memory>
 
-#include "store-runtime/records/LedgerUpdate.h"
-#include "store-runtime/records/SysupQuaymartUpdate.h"
+#include "update-controller/AvailableUpdatesChange.h"
 
 namespace larder {
 
@@ -14,9 +12,10 @@ namespace larder {
 class VendAvailableUpdatesObserver {
  public:
   virtual ~VendAvailableUpdatesObserver() = default;
+  // The updates, the OS updates and the badge count of one change; shared,
+  // so that an observer may keep it until it has passed it on.
   virtual void availableUpdatesDidChangedWithUpdates(
-      const std::vector<LedgerUpdateRef>& updates,
-      const std::vector<SysupQuaymartUpdate>& osUpdates, std::uint64_t badgeCount) = 0;
+      const std::shared_ptr<const AvailableUpdatesChange>& change) = 0;
   [[nodiscard]] virtual bool isSameObserverAs(const VendAvailableUpdatesObserver& other) const {
     return this == &other;
   }

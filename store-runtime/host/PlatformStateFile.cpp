@@ -91,6 +91,9 @@ Result<void> PlatformStateFile::update(const std::function<void(PlistValue&)>& c
   }
   PlistValue value = read();
   change(value);
+  if (format_ == Format::Binary) {
+    return FileIO::writeAtomically(path_, PropertyListSerialization::writeBinary(value));
+  }
   return FileIO::writeAtomically(path_, PropertyListSerialization::writeXml(value));
 }
 

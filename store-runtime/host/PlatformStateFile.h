@@ -17,7 +17,13 @@ namespace larder {
 // sees the old or the new state, never a torn one.
 class PlatformStateFile {
  public:
-  explicit PlatformStateFile(std::string path) : path_(std::move(path)) {}
+  // How the file is written; reads take either. XML is for files people
+  // read and write by hand; binary for files read often, whose parse must
+  // be cheap.
+  enum class Format { Xml, Binary };
+
+  explicit PlatformStateFile(std::string path, Format format = Format::Xml)
+      : path_(std::move(path)), format_(format) {}
 
   // "<root>/var/lib/larder-platform/<name>".
   static std::string pathForName(std::string_view name);
@@ -44,6 +50,7 @@ class PlatformStateFile {
 
  private:
   std::string path_;
+  Format format_;
 };
 
 }  // namespace larder

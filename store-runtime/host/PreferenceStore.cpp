@@ -14,6 +14,20 @@ PlistDictionary storedValues(std::string_view domain, PreferenceScope scope) {
   return PlatformStateFile(PreferenceStore::pathFor(domain, scope)).readDictionary();
 }
 
+// A value that the scope's own file already holds as it is needs no write,
+// and no wait for the disk: some values (the badge count) are stored at
+// every change whether they changed or not. Only the file written counts,
+// not the machine's fallback, so that a user's value outlives a later change
+// of the machine's. A writer racing with this read is as if it had written
+// just after the write that was left out.
+bool isStoredAsItIs(std::string_view key, const PlistValue& value, std::string_view domain,
+                    PreferenceScope scope) {
+  PlistDictionary stored = storedValues(domain, scope);
+  auto found = stored.find(key);
+  if (value.isNull()) return found == stored.end();
+  return found != stored.end() && found->second == value;
+}
+
 }  // namespace
 
 bool PreferenceStore::isValidDomain(std::string_view domain) {
@@ -76,16 +90,18 @@ Result<void> PreferenceStore::setValue(std::string_view key, PlistValue value,
     return VendError::withDomain(std::string(kErrorDomain), kInvalidDomainCode,
                                  "\"" + std::string(domain) + "\" is not a preference domain");
   }
-  return PlatformStateFile(pathFor(domain, scope)).update([&](PlistValue& stored) {
-    PlistDictionary values;
-    if (PlistDictionary* existing = stored.dictionary()) values = std::move(*existing);
-    if (value.isNull()) {
-      values.erase(std::string(key));
-    } else {
-      values.insert_or_assign(std::string(key), std::move(value));
-    }
-    stored = PlistValue(std::move(values));
-  });
+  if (isStoredAsItIs(key, value, domain, scope)) return {};
+  return PlatformStateFile(pathFor(domain, scope), PlatformStateFile::Format::Binary)
+      .update([&](PlistValue& stored) {
+        PlistDictionary values;
+        if (PlistDictionary* existing = stored.dictionary()) values = std::move(*existing);
+        if (value.isNull()) {
+          values.erase(std::string(key));
+        } else {
+          values.insert_or_assign(std::string(key), std::move(value));
+        }
+        stored = PlistValue(std::move(values));
+      });
 }
 
 Result<void> PreferenceStore::removeValue(std::string_view key, std::string_view domain,

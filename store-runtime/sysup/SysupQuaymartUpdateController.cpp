@@ -10,6 +10,7 @@
 #include "platform/system/Uuid.h"
 #include "store-runtime/host/PlatformStateFile.h"
 #include "store-runtime/sysup/SysupOperationPacer.h"
+#include "store-runtime/sysup/SysupStateReader.h"
 #include "store-runtime/sysup/SysupUpdateObservers.h"
 #include "store-runtime/sysup/SysupUpdateState.h"
 
@@ -155,6 +156,8 @@ class SysupQuaymartUpdateController::Implementation {
   }
   void removeObserver(ObserverToken token) { observers_.remove(token); }
   void stateMayHaveChanged() { observers_.stateMayHaveChanged(); }
+  // The state of the current file, parsed once per version of it.
+  std::shared_ptr<const SysupUpdateState> currentState() { return reader_.read(stateFile()); }
 
  private:
   static bool storeScanResult(const PlatformStateFile& file, bool includingPrerelease) {
@@ -224,7 +227,8 @@ class SysupQuaymartUpdateController::Implementation {
   std::shared_ptr<DispatchQueue> workQueue_;
   Mutex mutex_;
   std::map<CancelToken, std::shared_ptr<SysupOperationPacer>> operations_ GUARDED_BY(mutex_);
-  SysupUpdateObservers observers_{[] { return readState(stateFile()).availableUpdates(); }};
+  SysupStateReader reader_;
+  SysupUpdateObservers observers_{[this] { return reader_.read(stateFile())->availableUpdates(); }};
 };
 
 SysupQuaymartUpdateController::SysupQuaymartUpdateController()
@@ -242,7 +246,7 @@ std::string SysupQuaymartUpdateController::stateFilePath() const {
 }
 
 UpdateList SysupQuaymartUpdateController::availableUpdates() const {
-  return readState(stateFile()).availableUpdates();
+  return implementation_->currentState()->availableUpdates();
 }
 
 SysupQuaymartUpdateController::ObserverToken
@@ -304,7 +308,7 @@ void SysupQuaymartUpdateController::cancelOperation(const CancelToken& token) {
 std::int64_t SysupQuaymartUpdateController::actionRequiredForUpdates(
     const UpdateList& updates) const {
   for (const SysupCatalogEntry& entry :
-       readState(stateFile()).catalogEntries(productKeys(updates))) {
+       implementation_->currentState()->catalogEntries(productKeys(updates))) {
     if (entry.restartRequired) return 1;
   }
   return 0;
@@ -314,7 +318,7 @@ std::uint64_t SysupQuaymartUpdateController::diskSpaceRequiredForUpdates(
     const UpdateList& updates) const {
   std::uint64_t total = 0;
   for (const SysupCatalogEntry& entry :
-       readState(stateFile()).catalogEntries(productKeys(updates))) {
+       implementation_->currentState()->catalogEntries(productKeys(updates))) {
     total += entry.downloadSize;
   }
   return total;
@@ -346,7 +350,8 @@ void SysupQuaymartUpdateController::installUpdatesLater(const UpdateList& update
 }
 
 UpdateList SysupQuaymartUpdateController::updatesToBeInstalledLater() const {
-  const SysupUpdateState state = readState(stateFile());
+  const std::shared_ptr<const SysupUpdateState> current = implementation_->currentState();
+  const SysupUpdateState& state = *current;
   UpdateList updates;
   for (SysupCatalogEntry& entry : state.catalogEntries(state.keySet(SysupUpdateState::kLaterKey))) {
     updates.push_back(std::move(entry.update));
@@ -362,7 +367,7 @@ void SysupQuaymartUpdateController::removeAllUpdatesFromInstallLater() {
 bool SysupQuaymartUpdateController::isDownloadRequiredForPostLogoutUpdates(
     const UpdateList& updates) const {
   const std::set<std::string> downloaded =
-      readState(stateFile()).keySet(SysupUpdateState::kDownloadedKey);
+      implementation_->currentState()->keySet(SysupUpdateState::kDownloadedKey);
   return std::any_of(updates.begin(), updates.end(), [&downloaded](const auto& update) {
     return !downloaded.contains(update.productKey());
   });
@@ -402,7 +407,7 @@ PlistDictionary SysupQuaymartUpdateController::takePostLogoutResults() {
 
 bool SysupQuaymartUpdateController::restartRequiredForProductKey(
     std::string_view productKey) const {
-  std::optional<SysupCatalogEntry> entry = readState(stateFile()).catalogEntry(productKey);
+  std::optional<SysupCatalogEntry> entry = implementation_->currentState()->catalogEntry(productKey);
   return entry && entry->restartRequired;
 }
 

@@ -45,12 +45,37 @@ const PlistValue& SysupUpdateState::member(std::string_view name) const {
 }
 
 std::vector<SysupCatalogEntry> SysupUpdateState::catalog() const {
+  return entriesWhere([](const std::string&) { return true; });
+}
+
+std::optional<SysupCatalogEntry> SysupUpdateState::catalogEntry(std::string_view productKey) const {
+  std::vector<SysupCatalogEntry> found =
+      entriesWhere([productKey](const std::string& key) { return key == productKey; });
+  if (found.empty()) return std::nullopt;
+  return std::move(found.front());
+}
+
+std::vector<SysupCatalogEntry> SysupUpdateState::catalogEntries(
+    const std::set<std::string>& keys) const {
+  return entriesWhere([&keys](const std::string& key) { return keys.contains(key); });
+}
+
+// Only the entries asked for are read whole: a question about one update
+// costs a look at each product key, not a parse of the catalogue.
+std::vector<SysupCatalogEntry> SysupUpdateState::entriesWhere(
+    const std::function<bool(const std::string&)>& wanted) const {
   std::vector<SysupCatalogEntry> entries;
   const PlistArray* stored = member(kCatalogKey).array();
   if (!stored) return entries;
   std::set<std::string> seen;
   for (std::size_t index = 0; index < stored->size(); ++index) {
-    std::optional<SysupCatalogEntry> entry = readEntry((*stored)[index]);
+    const PlistValue& value = (*stored)[index];
+    const std::string* key = value["productKey"].string();
+    if (key && !wanted(*key)) {
+      seen.insert(*key);
+      continue;
+    }
+    std::optional<SysupCatalogEntry> entry = readEntry(value);
     if (!entry || !seen.insert(entry->update.productKey()).second) {
       // A hand-edited file must not take the service down with it.
       TILL_LOG(1, "%@: Skipping damaged or repeated catalogue entry %zu", kSpeaker, index);
@@ -58,22 +83,6 @@ std::vector<SysupCatalogEntry> SysupUpdateState::catalog() const {
     }
     entries.push_back(std::move(*entry));
   }
-  return entries;
-}
-
-std::optional<SysupCatalogEntry> SysupUpdateState::catalogEntry(std::string_view productKey) const {
-  for (SysupCatalogEntry& entry : catalog()) {
-    if (entry.update.productKey() == productKey) return std::move(entry);
-  }
-  return std::nullopt;
-}
-
-std::vector<SysupCatalogEntry> SysupUpdateState::catalogEntries(
-    const std::set<std::string>& keys) const {
-  std::vector<SysupCatalogEntry> entries = catalog();
-  std::erase_if(entries, [&keys](const SysupCatalogEntry& entry) {
-    return !keys.contains(entry.update.productKey());
-  });
   return entries;
 }
 

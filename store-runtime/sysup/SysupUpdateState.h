@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <optional>
 #include <set>
 #include <string>
@@ -69,6 +70,8 @@ class SysupUpdateState {
   [[nodiscard]] std::vector<SysupQuaymartUpdate> availableUpdates() const;
 
  private:
+  [[nodiscard]] std::vector<SysupCatalogEntry> entriesWhere(
+      const std::function<bool(const std::string&)>& wanted) const;
   // The stored value itself, not a copy: callers keep pointers into it.
   [[nodiscard]] const PlistValue& member(std::string_view name) const;
 

@@ -242,9 +242,12 @@ TEST_F(ServiceTest, BadRequestsGetAnEmptyAnswerOrANamedErrorAndTheServiceGoesOn)
     }
     return std::string("(answered)");
   };
-  EXPECT_EQ(errorOf([&] { quick->call("UnhideAllOSUpdates", {}); }),
+  EXPECT_EQ(errorOf([&] { quick->call("PollForPurchasedBooks", {}); }),
             "com.orvane.larderd.Error.NotAvailable")
-      << "its reply belongs to a controller";
+      << "its reply belongs to the book library";
+  EXPECT_EQ(errorOf([&] { quick->call("UnhideAllOSUpdates", {}); }),
+            "com.orvane.larderd.Error.NoStoreClient")
+      << "no store client, so no update controller";
   EXPECT_EQ(errorOf([&] { quick->call("CheckForUpdatesWithUserHasSeenUpdates", {false}); }),
             "com.orvane.larderd.Error.NoStoreClient")
       << "no store client, so no update queue";

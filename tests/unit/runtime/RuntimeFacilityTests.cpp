@@ -624,10 +624,10 @@ TEST_F(RuntimeFacilityTest, RootHelperWritesSystemPreferencesWithTheOSVersion) {
   proxy.setAutoUpdateRestartRequiredEnabledPreference(true);
   proxy.setLastDoItLaterLogoutFailed(true);
   PlistValue stored = readPlist(path);
-  ASSERT_TRUE(stored["AutoUpdate"].isBoolean());
-  EXPECT_FALSE(stored["AutoUpdate"].boolValue());
-  EXPECT_EQ(stored["AutoUpdateMajorOSVersion"], PlistValue("13"));
-  EXPECT_TRUE(stored["AutoUpdateRestartRequired"].boolValue());
+  ASSERT_TRUE(stored["AutoUpdateEnabled"].isBoolean());
+  EXPECT_FALSE(stored["AutoUpdateEnabled"].boolValue());
+  EXPECT_EQ(stored["AutoUpdateEnabledMajorOSVersion"], PlistValue("13"));
+  EXPECT_TRUE(stored["AutoUpdateRestartRequiredEnabled"].boolValue());
   EXPECT_EQ(stored["AutoUpdateRestartRequiredMajorOSVersion"], PlistValue("13"));
   EXPECT_TRUE(stored["LastDoItLaterLogoutFailed"].boolValue());
 
@@ -636,7 +636,7 @@ TEST_F(RuntimeFacilityTest, RootHelperWritesSystemPreferencesWithTheOSVersion) {
   EXPECT_TRUE(stored["OVPInviteURL"].isNull());
   EXPECT_TRUE(stored["OVPInviteOrgName"].isNull());
   EXPECT_EQ(stored["Unrelated"], PlistValue("kept"));
-  EXPECT_FALSE(stored["AutoUpdate"].boolValue());
+  EXPECT_FALSE(stored["AutoUpdateEnabled"].boolValue());
 }
 
 TEST_F(RuntimeFacilityTest, RootHelperKeepsTheLockedPathsAsASet) {

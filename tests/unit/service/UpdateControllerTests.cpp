@@ -70,11 +70,10 @@ class RecordingUpdatesObserver final : public VendAvailableUpdatesObserver {
     std::size_t os;
     std::uint64_t badge;
   };
-  void availableUpdatesDidChangedWithUpdates(const std::vector<LedgerUpdateRef>& updates,
-                                             const std::vector<SysupQuaymartUpdate>& osUpdates,
-                                             std::uint64_t badgeCount) override {
+  void availableUpdatesDidChangedWithUpdates(
+      const std::shared_ptr<const AvailableUpdatesChange>& change) override {
     std::lock_guard lock(mutex_);
-    calls_.push_back({updates.size(), osUpdates.size(), badgeCount});
+    calls_.push_back({change->updates().size(), change->osUpdates().size(), change->badgeCount()});
   }
   std::vector<Call> calls() const {
     std::lock_guard lock(mutex_);
