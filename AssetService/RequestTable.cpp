@@ -62,16 +62,16 @@ void withController(AssetServiceInterface& interface, std::string_view member,
 }
 
 // A request answered by the controller with one value.
-#define CONTROLLER_REPLY(member, expression)                                  \
-  [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {   \
-    (void)a;                                                                  \
+#define CONTROLLER_REPLY(member, expression)                                             \
+  [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {              \
+    (void)a;                                                                             \
     withController(i, member, r, [&](UpdateController& c) { answer(r, {expression}); }); \
   }
 // A request the controller carries out without a reply.
-#define CONTROLLER_CALL(member, statement)                                   \
-  [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {  \
-    (void)a;                                                                 \
-    withController(i, member, r, [&](UpdateController& c) { statement; });   \
+#define CONTROLLER_CALL(member, statement)                                  \
+  [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) { \
+    (void)a;                                                                \
+    withController(i, member, r, [&](UpdateController& c) { statement; });  \
   }
 
 // Requests that carry a client type of their own set up the connection's

@@ -15,8 +15,9 @@ extern char** environ;
 
 namespace larder::bench {
 
-// Starts `argv` with this process's environment plus `extraEnvironment`;
-// standard output goes to `outputFd` when it is one, standard error nowhere.
+// Starts `argv` (the program found on the PATH) with this process's
+// environment plus `extraEnvironment`; standard output goes to `outputFd`
+// when it is one, standard error nowhere. -1 when it cannot be started.
 inline pid_t spawn(std::vector<std::string> argv, const std::vector<std::string>& extraEnvironment,
                    int outputFd) {
   std::vector<std::string> environment;
@@ -33,9 +34,9 @@ inline pid_t spawn(std::vector<std::string> argv, const std::vector<std::string>
   if (outputFd >= 0) posix_spawn_file_actions_adddup2(&actions, outputFd, 1);
   posix_spawn_file_actions_addopen(&actions, 2, "/dev/null", O_WRONLY, 0);
   pid_t pid = -1;
-  posix_spawn(&pid, args[0], &actions, nullptr, args.data(), env.data());
+  const int status = posix_spawnp(&pid, args[0], &actions, nullptr, args.data(), env.data());
   posix_spawn_file_actions_destroy(&actions);
-  return pid;
+  return status == 0 ? pid : -1;
 }
 
 // A session bus of the benchmark's own, stopped when it goes.
@@ -44,9 +45,9 @@ class PrivateSessionBus {
   PrivateSessionBus() {
     int pipeEnds[2];
     if (pipe(pipeEnds) != 0) return;
-    pid_ = spawn({"/usr/bin/dbus-daemon", "--session", "--nofork", "--nopidfile",
-                  "--print-address=1"},
-                 {}, pipeEnds[1]);
+    pid_ =
+        spawn({"/usr/bin/dbus-daemon", "--session", "--nofork", "--nopidfile", "--print-address=1"},
+              {}, pipeEnds[1]);
     close(pipeEnds[1]);
     char c = 0;
     while (read(pipeEnds[0], &c, 1) == 1 && c != '\n') address_ += c;

@@ -23,6 +23,7 @@
 #include <string>
 #include <vector>
 
+#include "BenchProcesses.h"
 #include "bench/BenchFiles.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
@@ -88,17 +89,7 @@ void writeCatalogue(const fs::path& catalogue) {
 }
 
 pid_t spawn(const std::vector<std::string>& argv, int stdoutFd) {
-  std::vector<char*> args;
-  for (const std::string& argument : argv) args.push_back(const_cast<char*>(argument.c_str()));
-  args.push_back(nullptr);
-  posix_spawn_file_actions_t actions;
-  posix_spawn_file_actions_init(&actions);
-  if (stdoutFd >= 0) posix_spawn_file_actions_adddup2(&actions, stdoutFd, 1);
-  posix_spawn_file_actions_addopen(&actions, 2, "/dev/null", O_WRONLY, 0);
-  pid_t pid = -1;
-  const int status = posix_spawnp(&pid, args[0], &actions, nullptr, args.data(), environ);
-  posix_spawn_file_actions_destroy(&actions);
-  return status == 0 ? pid : -1;
+  return larder::bench::spawn(argv, {}, stdoutFd);
 }
 
 // The reference store on a free port, serving a catalogue of one item.

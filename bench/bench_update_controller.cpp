@@ -109,9 +109,10 @@ class UpdateFixture {
     for (int index = 0; index < appUpdates; ++index) updates.emplace_back(appUpdate(index));
     std::string folder = VendFileManager::cacheDirectoryPathWithName(kDaemonDefaultsID);
     fs::create_directories(folder);
-    if (!FileIO::writeAtomically(folder + "/updates.plist",
-                                 PropertyListSerialization::writeBinary(PlistDictionary{
-                                     {"updates", updates}, {"incompatibleUpdates", PlistArray{}}}))) {
+    if (!FileIO::writeAtomically(
+            folder + "/updates.plist",
+            PropertyListSerialization::writeBinary(
+                PlistDictionary{{"updates", updates}, {"incompatibleUpdates", PlistArray{}}}))) {
       std::abort();
     }
     return UpdateController::make(
@@ -123,8 +124,9 @@ class UpdateFixture {
  private:
   static void scan() {
     std::atomic<bool> done{false};
-    SysupQuaymartUpdateController::sharedUpdateController().startScanningForUpdatesIncludingPrerelease(
-        true, true, true, nullptr, [](double) {}, [&](const OptionalError&) { done = true; });
+    SysupQuaymartUpdateController::sharedUpdateController()
+        .startScanningForUpdatesIncludingPrerelease(
+            true, true, true, nullptr, [](double) {}, [&](const OptionalError&) { done = true; });
     while (!done) std::this_thread::sleep_for(std::chrono::milliseconds(1));
   }
 
@@ -214,7 +216,8 @@ void BM_AvailableUpdatesDidChangeToBusObservers(benchmark::State& state) {
     controller.availableUpdatesDidChange();
     ++changes;
   }
-  for (const auto& observer : clients.observers()) controller.removeAvailableUpdatesObserver(observer);
+  for (const auto& observer : clients.observers())
+    controller.removeAvailableUpdatesObserver(observer);
   // Every live observer hears every change, after the timing.
   const std::int64_t expected = changes * (kObservers - kGoneObservers);
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::minutes(5);

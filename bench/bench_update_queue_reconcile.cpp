@@ -71,8 +71,9 @@ void BM_ReconcileAnswerWithCache(benchmark::State& state) {
   for (auto _ : state) {
     state.PauseTiming();
     larder::bench::writeFixture(path, s.cache);
-    auto queue = std::make_shared<UpdateQueue>(larder::VendStoreClient::initWithStoreClientType(0),
-                                               std::weak_ptr<larder::UpdateQueueDelegate>(), *s.map);
+    auto queue =
+        std::make_shared<UpdateQueue>(larder::VendStoreClient::initWithStoreClientType(0),
+                                      std::weak_ptr<larder::UpdateQueueDelegate>(), *s.map);
     larder::LoadUpdateQueueOperation operation(larder::VendStoreClient::initWithStoreClientType(0),
                                                *s.map);
     operation.setAvailableUpdates(s.answer);

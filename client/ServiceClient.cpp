@@ -125,8 +125,8 @@ void ServiceClient::watchSignal(std::string_view interfaceName, std::string_view
   const std::string rule = "type='signal',sender='" + serviceName_ + "',interface='" +
                            std::string(interfaceName) + "',member='" + std::string(member) + "'";
   matches_.push_back(connection_->addMatch(
-      rule, [signature = std::string(signature), onSignal = std::move(onSignal)](
-                sdbus::Message& signal) {
+      rule,
+      [signature = std::string(signature), onSignal = std::move(onSignal)](sdbus::Message& signal) {
         PlistArray values;
         try {
           values = DBusValueCodec::readAll(signal, signature);

@@ -22,7 +22,9 @@ const std::vector<std::string> kStandardUserRights = {
     "system.install.orvane-software.standard-user"};
 const std::vector<std::string> kInteractiveRights = {"system.install.software"};
 
-bool isGuestUser() { return ::getuid() == kGuestUserID || LedgerCurrentUserIsGuestUser(); }
+bool isGuestUser() {
+  return ::getuid() == kGuestUserID || LedgerCurrentUserIsGuestUser();
+}
 
 }  // namespace
 
@@ -54,11 +56,11 @@ bool AuthorizationController::interactiveAuthRequiredForSoftwareInstall() {
 
 bool AuthorizationController::allowSoftwareInstallForNonAdminUser() {
   if (isGuestUser()) {
-    TILL_LOG(1, "%@: Requiring admin authorization for software install from guest user",
-             kSpeaker);
+    TILL_LOG(1, "%@: Requiring admin authorization for software install from guest user", kSpeaker);
     return false;
   }
-  if (VendManagedRestrictions::isRestrictedTo(LedgerRestrictStoreToRequireAdminForSoftwareInstall)) {
+  if (VendManagedRestrictions::isRestrictedTo(
+          LedgerRestrictStoreToRequireAdminForSoftwareInstall)) {
     TILL_LOG(1, "%@: Requiring admin authorization for software install by managed preference",
              kSpeaker);
     return false;

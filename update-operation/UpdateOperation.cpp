@@ -47,8 +47,7 @@ void UpdateOperation::setSettings(UpdateOperationSettings settings) {
 
 std::string UpdateOperation::description() const {
   UpdateOperationSettings s = settings();
-  std::string text = "<UpdateOperation: client=" + storeClient().identifier() +
-                     " flags=[";
+  std::string text = "<UpdateOperation: client=" + storeClient().identifier() + " flags=[";
   appendFlag(text, s.userInitiated, "userInitiated");
   appendFlag(text, s.nowIsLater, "nowIsLater");
   appendFlag(text, s.restartCountdownWasDeferred, "restartCountdownWasDeferred");

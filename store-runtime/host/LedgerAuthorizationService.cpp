@@ -11,15 +11,16 @@ namespace {
 constexpr std::string_view kFileName = "authorization.plist";
 
 // Everything but the right that needs a person to agree.
-bool isDefaultGrant(const std::string& right) { return right != "system.install.software"; }
+bool isDefaultGrant(const std::string& right) {
+  return right != "system.install.software";
+}
 
 bool isGranted(const PlistDictionary& state, const std::string& right) {
   auto found = state.find("grantedRights");
   if (found == state.end() || !found->second.array()) return isDefaultGrant(right);
   const PlistArray& granted = *found->second.array();
-  return std::ranges::any_of(granted, [&](const PlistValue& entry) {
-    return entry.string() && *entry.string() == right;
-  });
+  return std::ranges::any_of(
+      granted, [&](const PlistValue& entry) { return entry.string() && *entry.string() == right; });
 }
 
 }  // namespace
@@ -37,14 +38,14 @@ std::int32_t LedgerAuthorizationService::copyRights(const std::vector<std::strin
     if (!requests.array()) requests = PlistArray{};
     requests.array()->push_back(
         PlistDictionary{{"rights", names}, {"interactive", interactionAllowed}});
-    bool quiet = std::ranges::all_of(rights, [&](const std::string& right) {
-      return isGranted(state, right);
-    });
+    bool quiet = std::ranges::all_of(
+        rights, [&](const std::string& right) { return isGranted(state, right); });
     if (quiet) {
       status = kGranted;
     } else if (interactionAllowed) {
       auto answer = state.find("interactiveGrant");
-      bool granted = answer != state.end() && answer->second.isBoolean() && answer->second.boolValue();
+      bool granted =
+          answer != state.end() && answer->second.isBoolean() && answer->second.boolValue();
       status = granted ? kGranted : kCanceled;
     }
   });

@@ -99,7 +99,8 @@ Result<void> PlatformStateFile::update(const std::function<void(PlistValue&)>& c
 
 bool PlatformStateFile::updateValue(const std::function<void(PlistValue&)>& change) const {
   Result<void> updated = update(change);
-  if (!updated) TILL_LOG(1, "%@: Cannot change state file %@: %@", kSpeaker, path_, updated.errorDescription());
+  if (!updated)
+    TILL_LOG(1, "%@: Cannot change state file %@: %@", kSpeaker, path_, updated.errorDescription());
   return updated.has_value();
 }
 

@@ -407,7 +407,8 @@ PlistDictionary SysupQuaymartUpdateController::takePostLogoutResults() {
 
 bool SysupQuaymartUpdateController::restartRequiredForProductKey(
     std::string_view productKey) const {
-  std::optional<SysupCatalogEntry> entry = implementation_->currentState()->catalogEntry(productKey);
+  std::optional<SysupCatalogEntry> entry =
+      implementation_->currentState()->catalogEntry(productKey);
   return entry && entry->restartRequired;
 }
 

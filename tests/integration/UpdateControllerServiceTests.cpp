@@ -70,11 +70,10 @@ class UpdateControllerServiceTest : public StoreAndServiceTest {
   // Exports an available-updates observer at `path` of `client` and registers it.
   static void observe(ServiceClient& client, const std::string& path,
                       const std::shared_ptr<ObserverCalls>& calls) {
-    client.exportCallbackObject(path, "VendAvailableUpdatesObserver",
-                                "AvailableUpdatesDidChangedWithUpdatesOsUpdatesBadgeCount",
-                                "aa{sv}aa{sv}t", [calls](const PlistArray& arguments) {
-                                  calls->add(arguments.at(2).uint64Value());
-                                });
+    client.exportCallbackObject(
+        path, "VendAvailableUpdatesObserver",
+        "AvailableUpdatesDidChangedWithUpdatesOsUpdatesBadgeCount", "aa{sv}aa{sv}t",
+        [calls](const PlistArray& arguments) { calls->add(arguments.at(2).uint64Value()); });
     client.call("AddAvailableUpdatesObserver", {path});
   }
 };
@@ -83,18 +82,17 @@ TEST_F(UpdateControllerServiceTest, TheAgentsReportEnqueuesOneRunAndTheBadgeAgre
   start();
   auto watcher = client();
   std::atomic<std::uint64_t> signalled{~0ULL};
-  watcher->watchSignal(DistributedNotificationProtocol::kInterfaceName,
-                       DistributedNotificationProtocol::kSignal,
-                       DistributedNotificationProtocol::kSignature,
-                       [&](const PlistArray& values) {
-                         signalled = values.at(2)["badgeCount"].uint64Value();
-                       });
+  watcher->watchSignal(
+      DistributedNotificationProtocol::kInterfaceName, DistributedNotificationProtocol::kSignal,
+      DistributedNotificationProtocol::kSignature,
+      [&](const PlistArray& values) { signalled = values.at(2)["badgeCount"].uint64Value(); });
   ASSERT_EQ(client()->call("CheckForUpdatesWithUserHasSeenUpdates", {false}, kCheckTimeout).at(0),
             PlistValue(true));
 
   LarderctlRun scan = run({"os-updates", "--scan"});
   ASSERT_EQ(scan.status, 0) << scan.errors << service_->log();
-  for (const char* key : {"SEC-1", "APP-2", "KERNEL-3"}) EXPECT_NE(scan.output.find(key), std::string::npos);
+  for (const char* key : {"SEC-1", "APP-2", "KERNEL-3"})
+    EXPECT_NE(scan.output.find(key), std::string::npos);
 
   LarderctlRun report = run({"background-scan"});
   ASSERT_EQ(report.status, 0) << report.errors << service_->log();
@@ -112,8 +110,9 @@ TEST_F(UpdateControllerServiceTest, TheAgentsReportEnqueuesOneRunAndTheBadgeAgre
   // Two app updates and the OS updates, which count as one.
   LarderctlRun badge = run({"--json", "badge"});
   ASSERT_EQ(badge.status, 0) << badge.errors;
-  EXPECT_EQ(JsonConversion::fromJson(nlohmann::json::parse(badge.output))["badgeCount"].uint64Value(),
-            3U);
+  EXPECT_EQ(
+      JsonConversion::fromJson(nlohmann::json::parse(badge.output))["badgeCount"].uint64Value(),
+      3U);
   EXPECT_TRUE(eventually([&] { return signalled.load() == 3; }, 10s)) << signalled.load();
 }
 

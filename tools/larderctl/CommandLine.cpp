@@ -115,7 +115,8 @@ void CommandLine::addSoftwareMapCommands() {
     }
   });
   auto* watch = app_.add_subcommand("watch", "print software map changes until interrupted");
-  watch->add_flag("--badge", watchBadge, "print the store's badge count each time it is sent instead");
+  watch->add_flag("--badge", watchBadge,
+                  "print the store's badge count each time it is sent instead");
   auto* call = app_.add_subcommand("call", "call any request: call METHOD ARGS...");
   call->add_option("method", member, "D-Bus method name, e.g. ProductForBundleIdentifier")
       ->required();
@@ -183,10 +184,12 @@ void CommandLine::addStoreCommands() {
 void CommandLine::addUpdateCommands() {
   auto* osUpdates = app_.add_subcommand(
       "os-updates", "list the OS updates the system offers (exit status 3: none)");
-  osUpdates->add_flag("--scan", this->osUpdates.scan, "scan for OS updates first, showing progress");
+  osUpdates->add_flag("--scan", this->osUpdates.scan,
+                      "scan for OS updates first, showing progress");
   osUpdates->add_option("--hide", this->osUpdates.hide, "hide the OS updates of these product keys")
       ->expected(1, -1);
-  osUpdates->add_flag("--unhide-all", this->osUpdates.unhideAll, "show every hidden OS update again");
+  osUpdates->add_flag("--unhide-all", this->osUpdates.unhideAll,
+                      "show every hidden OS update again");
   app_.add_subcommand("badge", "print the count the store application shows on its badge");
 }
 
@@ -211,8 +214,8 @@ void CommandLine::addPreferenceCommands() {
       "machine's, and writes the user's.");
   auto* get = prefs->add_subcommand("get", "print a preference, or a whole domain without KEY");
   auto* set = prefs->add_subcommand("set", "store a preference");
-  auto* remove = prefs->add_subcommand(
-      "delete", "remove a preference (exit status 3: there was none)");
+  auto* remove =
+      prefs->add_subcommand("delete", "remove a preference (exit status 3: there was none)");
   for (CLI::App* action : {get, set, remove}) {
     action->add_option("domain", preferences.domain, "preference domain")->required();
     auto* key = action->add_option("key", preferences.key, "preference key");
@@ -224,8 +227,9 @@ void CommandLine::addPreferenceCommands() {
                   "the value: true/false, a number, an ISO 8601 date, JSON for containers, "
                   "else text")
       ->required();
-  set->add_option("--type", preferences.type, "read VALUE as bool, integer, real, string, date "
-                                              "or json")
+  set->add_option("--type", preferences.type,
+                  "read VALUE as bool, integer, real, string, date "
+                  "or json")
       ->check(CLI::IsMember({"bool", "integer", "real", "string", "date", "json"}));
 }
 

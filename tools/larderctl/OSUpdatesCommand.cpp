@@ -7,14 +7,10 @@
 #include "platform/plist/JsonConversion.h"
 #include "tools/larderctl/ExitStatus.h"
 #include "tools/larderctl/ProgressBar.h"
+#include "tools/larderctl/ValueText.h"
 
 namespace larder {
 namespace {
-
-std::string textOr(const PlistValue& value, const char* fallback = "-") {
-  const std::string* text = value.string();
-  return text && !text->empty() ? *text : fallback;
-}
 
 std::string marksOf(const PlistValue& update) {
   std::string marks;
@@ -31,8 +27,9 @@ int OSUpdatesCommand::run(const OSUpdatesOptions& options) {
   if (options.scan) {
     PlistValue error = scan();
     if (const PlistDictionary* failure = error.dictionary(); failure && !failure->empty()) {
-      std::cerr << "larderctl: the OS update scan failed: " << textOr(error["description"], "unknown")
-                << " (code " << error["code"].int64Value() << ")" << std::endl;
+      std::cerr << "larderctl: the OS update scan failed: "
+                << ValueText::textOr(error["description"], "unknown") << " (code "
+                << error["code"].int64Value() << ")" << std::endl;
       return kExitFailure;
     }
   }
@@ -58,24 +55,25 @@ PlistValue OSUpdatesCommand::scan() {
   auto finished = std::make_shared<std::promise<PlistValue>>();
   std::future<PlistValue> outcome = finished->get_future();
   auto progress = std::make_shared<ProgressBar>(stderr);
-  client_.exportCallbackObject(
-      kScanObserverPath, "VendOSUpdateScanObserver",
-      "OsUpdateScanForTagsDidProgressWithPercentCompleteIsFinishedError", "asdba{sv}",
-      [finished, progress](const PlistArray& arguments) {
-        if (!arguments.at(2).boolValue()) {
-          progress->show(arguments.at(1).doubleValue() / 100.0, "scanning for OS updates");
-          return;
-        }
-        progress->clear();
-        try {
-          finished->set_value(arguments.at(3));
-        } catch (const std::future_error&) {
-          // A second end (a scan that another client started ends too).
-        }
-      });
+  client_.exportCallbackObject(kScanObserverPath, "VendOSUpdateScanObserver",
+                               "OsUpdateScanForTagsDidProgressWithPercentCompleteIsFinishedError",
+                               "asdba{sv}", [finished, progress](const PlistArray& arguments) {
+                                 if (!arguments.at(2).boolValue()) {
+                                   progress->show(arguments.at(1).doubleValue() / 100.0,
+                                                  "scanning for OS updates");
+                                   return;
+                                 }
+                                 progress->clear();
+                                 try {
+                                   finished->set_value(arguments.at(3));
+                                 } catch (const std::future_error&) {
+                                   // A second end (a scan that another client started ends too).
+                                 }
+                               });
   client_.call("AddOSUpdateScanObserver", {std::string(kScanObserverPath)});
   client_.call(
-      "StartOSUpdateScanWithForceFullScanReportProgressImmediatelyLaunchedFromNotificationUserHasSeen"
+      "StartOSUpdateScanWithForceFullScanReportProgressImmediatelyLaunchedFromNotificationUserHasSe"
+      "en"
       "AllUpdatesCheckForOtherUpdates",
       {true, true, false, false, false});
   std::future_status status = outcome.wait_for(std::chrono::microseconds(kScanTimeoutMicroseconds));
@@ -105,11 +103,12 @@ void OSUpdatesCommand::print(const PlistArray& updates) const {
     return;
   }
   std::cout << std::left << std::setw(28) << "PRODUCT KEY" << std::setw(14) << "VERSION"
-            << std::setw(34) << "TITLE" << "MARKS" << '\n';
+            << std::setw(34) << "TITLE"
+            << "MARKS" << '\n';
   for (const PlistValue& update : updates) {
-    std::cout << std::left << std::setw(28) << textOr(update["productKey"]) << std::setw(14)
-              << textOr(update["versionString"]) << std::setw(34) << textOr(update["title"])
-              << marksOf(update) << '\n';
+    std::cout << std::left << std::setw(28) << ValueText::textOr(update["productKey"])
+              << std::setw(14) << ValueText::textOr(update["versionString"]) << std::setw(34)
+              << ValueText::textOr(update["title"]) << marksOf(update) << '\n';
   }
   std::cout << std::flush;
 }

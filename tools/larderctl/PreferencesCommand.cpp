@@ -130,19 +130,18 @@ int PreferencesCommand::set(const PreferencesOptions& options) const {
 
 int PreferencesCommand::remove(const PreferencesOptions& options) const {
   const PreferenceScope scope = scopeOf(options);
-  const bool present = !PreferenceStore::valueForKey(options.key, options.domain,
-                                                     scope == PreferenceScope::App
-                                                         ? PreferenceScope::User
-                                                         : scope)
-                            .isNull();
+  const bool present =
+      !PreferenceStore::valueForKey(options.key, options.domain,
+                                    scope == PreferenceScope::App ? PreferenceScope::User : scope)
+           .isNull();
   if (!present) {
     std::cerr << "larderctl: no preference " << place(options) << std::endl;
     return kExitNothingToDo;
   }
   const Result<void> removed = PreferenceStore::removeValue(options.key, options.domain, scope);
   if (!removed) {
-    std::cerr << "larderctl: cannot delete " << place(options) << ": "
-              << removed.errorDescription() << std::endl;
+    std::cerr << "larderctl: cannot delete " << place(options) << ": " << removed.errorDescription()
+              << std::endl;
     return kExitFailure;
   }
   return kExitSuccess;

@@ -7,14 +7,10 @@
 #include "platform/plist/JsonConversion.h"
 #include "tools/larderctl/ExitStatus.h"
 #include "tools/larderctl/Spinner.h"
+#include "tools/larderctl/ValueText.h"
 
 namespace larder {
 namespace {
-
-std::string textOr(const PlistValue& value, const char* fallback = "-") {
-  const std::string* text = value.string();
-  return text && !text->empty() ? *text : fallback;
-}
 
 std::string marksOf(const PlistValue& update) {
   std::string marks;
@@ -49,9 +45,9 @@ int UpdatesCommand::run(bool check) {
     printJson(success, available, incompatible, error);
   } else {
     if (!success.boolValue()) {
-      std::cerr << "larderctl: the update check failed: " << textOr(error["description"], "unknown")
-                << " (code " << error["code"].int64Value() << "); showing what the service knew"
-                << std::endl;
+      std::cerr << "larderctl: the update check failed: "
+                << ValueText::textOr(error["description"], "unknown") << " (code "
+                << error["code"].int64Value() << "); showing what the service knew" << std::endl;
     }
     // After a failed check an empty list says nothing about the store.
     if (!updates.empty() || success.boolValue()) printTable(updates, false);
@@ -74,9 +70,9 @@ void UpdatesCommand::printTable(const PlistArray& updates, bool incompatible) co
             << "MARKS" << '\n';
   for (const PlistValue& update : updates) {
     std::cout << std::left << std::setw(12) << update["itemIdentifier"].uint64Value()
-              << std::setw(34) << textOr(update["bundleID"]) << std::setw(12)
-              << textOr(update["version"]) << std::setw(28) << textOr(update["title"])
-              << marksOf(update) << '\n';
+              << std::setw(34) << ValueText::textOr(update["bundleID"]) << std::setw(12)
+              << ValueText::textOr(update["version"]) << std::setw(28)
+              << ValueText::textOr(update["title"]) << marksOf(update) << '\n';
   }
   std::cout << std::flush;
 }

@@ -64,4 +64,9 @@ std::string ValueText::of(std::string_view key, const PlistValue& value) {
   return JsonConversion::toJson(value).dump();
 }
 
+std::string ValueText::textOr(const PlistValue& value, const char* fallback) {
+  const std::string* text = value.string();
+  return text && !text->empty() ? *text : fallback;
+}
+
 }  // namespace larder

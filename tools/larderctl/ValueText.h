@@ -16,6 +16,8 @@ class ValueText {
   static std::string of(std::string_view key, const PlistValue& value);
   // "2026-01-15 11:00:00 CET"
   static std::string localTime(double secondsSince1970);
+  // The text of a field for a table cell; `fallback` when it is no text or empty.
+  static std::string textOr(const PlistValue& value, const char* fallback = "-");
 };
 
 }  // namespace larder

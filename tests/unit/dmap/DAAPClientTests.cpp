@@ -34,7 +34,9 @@
 #include "store-runtime/http/VendRequestSigner.h"
 #include "store-runtime/http/VendURLBag.h"
 #include "store-runtime/runtime/VendRuntime.h"
+#include "tests/unit/RunLoopThread.h"
 #include "tests/unit/ScopedEnvironment.h"
+#include "tests/unit/TemporaryFolder.h"
 
 // Scaffolding: a cloud library service whose every answer a test can
 // script, a delegate that records what it is told, a run loop on a thread of
@@ -45,40 +47,9 @@ namespace fs = std::filesystem;
 
 using ScopedEnvironment = larder::testing::ScopedEnvironment;
 
-class TemporaryFolder {
- public:
-  TemporaryFolder() {
-    std::string pattern = (fs::temp_directory_path() / "larder-daap-XXXXXX").string();
-    path_ = ::mkdtemp(pattern.data());
-  }
-  ~TemporaryFolder() {
-    std::error_code ignored;
-    fs::remove_all(path_, ignored);
-  }
-  TemporaryFolder(const TemporaryFolder&) = delete;
-  TemporaryFolder& operator=(const TemporaryFolder&) = delete;
-  [[nodiscard]] const std::string& path() const { return path_; }
+using RunLoopThread = larder::testing::RunLoopThread;
 
- private:
-  std::string path_;
-};
-
-// A run loop served by a thread of its own, standing in for the main one.
-class RunLoopThread {
- public:
-  RunLoopThread() : thread_([this] { loop_.run(); }) {}
-  ~RunLoopThread() {
-    loop_.stop();
-    thread_.join();
-  }
-  RunLoopThread(const RunLoopThread&) = delete;
-  RunLoopThread& operator=(const RunLoopThread&) = delete;
-  RunLoop& loop() { return loop_; }
-
- private:
-  RunLoop loop_;
-  std::thread thread_;
-};
+using TemporaryFolder = larder::testing::TemporaryFolder;
 
 inline bool waitUntil(const std::function<bool()>& condition,
                       std::chrono::milliseconds limit = std::chrono::seconds(10)) {

@@ -19,6 +19,7 @@
 #include "store-runtime/host/LedgerSessionList.h"
 #include "store-runtime/host/LedgerSystemSettings.h"
 #include "store-runtime/host/PlatformStateFile.h"
+#include "tests/unit/RunLoopThread.h"
 #include "tests/unit/ScopedEnvironment.h"
 #include "tests/unit/TemporaryFolder.h"
 
@@ -26,6 +27,7 @@ namespace larder {
 namespace {
 
 using namespace std::chrono_literals;
+using testing::RunLoopThread;
 using testing::ScopedEnvironment;
 using testing::TemporaryFolder;
 
@@ -141,23 +143,6 @@ struct CallbackLog {
       called.signal();
     };
   }
-};
-
-class RunLoopThread {
- public:
-  RunLoopThread() : thread_([this] { loop_.run(); }) {}
-  ~RunLoopThread() {
-    loop_.stop();
-    thread_.join();
-  }
-  RunLoopThread(const RunLoopThread&) = delete;
-  RunLoopThread& operator=(const RunLoopThread&) = delete;
-  RunLoop& loop() { return loop_; }
-  [[nodiscard]] std::thread::id id() const { return thread_.get_id(); }
-
- private:
-  RunLoop loop_;
-  std::thread thread_;
 };
 
 TEST_F(MachineStateTest, ObservationHearsEachFlipOnItsLoop) {

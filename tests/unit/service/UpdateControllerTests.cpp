@@ -119,9 +119,10 @@ class UpdateControllerTest : public ServiceTest {
     ASSERT_TRUE(PlatformStateFile::named(SysupQuaymartUpdateController::kStateFileName)
                     .updateDictionary([&](PlistDictionary& state) { state["catalog"] = catalog; }));
     std::promise<OptionalError> finished;
-    SysupQuaymartUpdateController::sharedUpdateController().startScanningForUpdatesIncludingPrerelease(
-        true, true, true, nullptr, [](double) {},
-        [&](const OptionalError& error) { finished.set_value(error); });
+    SysupQuaymartUpdateController::sharedUpdateController()
+        .startScanningForUpdatesIncludingPrerelease(
+            true, true, true, nullptr, [](double) {},
+            [&](const OptionalError& error) { finished.set_value(error); });
     ASSERT_FALSE(finished.get_future().get());
   }
 
@@ -149,18 +150,49 @@ TEST_F(UpdateControllerTest, TheBadgeCountsWhatTheUserIsToHearOf) {
   };
   const PlistDictionary restart{{"restartRequired", true}, {"allowedToUseInstallLater", true}};
   const Case cases[] = {
-      {"three OS updates count as one", {appUpdate(1), appUpdate(2)},
-       {osUpdate("A"), osUpdate("B"), osUpdate("C")}, false, false, 0, {}, 3},
-      {"with auto update an unseen app update waits", {appUpdate(1), appUpdate(2, true), appUpdate(3, false, true)},
-       {}, true, false, 0, {}, 2},
-      {"a book client never counts OS updates", {appUpdate(1)}, {osUpdate("A")}, false, false, 1, {}, 1},
-      {"restart-required updates that will install by themselves wait", {},
-       {osUpdate("R", restart)}, false, true, 0, {}, 0},
+      {"three OS updates count as one",
+       {appUpdate(1), appUpdate(2)},
+       {osUpdate("A"), osUpdate("B"), osUpdate("C")},
+       false,
+       false,
+       0,
+       {},
+       3},
+      {"with auto update an unseen app update waits",
+       {appUpdate(1), appUpdate(2, true), appUpdate(3, false, true)},
+       {},
+       true,
+       false,
+       0,
+       {},
+       2},
+      {"a book client never counts OS updates",
+       {appUpdate(1)},
+       {osUpdate("A")},
+       false,
+       false,
+       1,
+       {},
+       1},
+      {"restart-required updates that will install by themselves wait",
+       {},
+       {osUpdate("R", restart)},
+       false,
+       true,
+       0,
+       {},
+       0},
       {"until the user has seen them", {}, {osUpdate("R", restart)}, false, true, 0, {"R"}, 1},
-      {"one with a licence is not installed by itself", {},
-       {osUpdate("L", {{"restartRequired", true}, {"allowedToUseInstallLater", true},
+      {"one with a licence is not installed by itself",
+       {},
+       {osUpdate("L", {{"restartRequired", true},
+                       {"allowedToUseInstallLater", true},
                        {"licenseAgreement", "terms"}})},
-       false, true, 0, {}, 1},
+       false,
+       true,
+       0,
+       {},
+       1},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
@@ -229,7 +261,9 @@ TEST_F(UpdateControllerTest, ABackgroundScanReportConfiguresOneRunByTheTimeTests
       {"plain", {}, false, {}},
       {"critical updates follow the daily test", {{"criticalUpdatesCount", 2}}, true, {}},
       {"unknown keys to install later vanish",
-       {{"osUpdatesToPerformLater", PlistArray{"B", "gone", "A"}}}, false, {"B", "A"}},
+       {{"osUpdatesToPerformLater", PlistArray{"B", "gone", "A"}}},
+       false,
+       {"B", "A"}},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
@@ -243,8 +277,8 @@ TEST_F(UpdateControllerTest, ABackgroundScanReportConfiguresOneRunByTheTimeTests
     for (const auto& update : s.osUpdatesToInstallLater.value_or(UpdateController::OSUpdateList{}))
       later.push_back(update.productKey());
     EXPECT_EQ(later, c.later);
-    EXPECT_TRUE(PreferenceStore::dateForKey(kDefaultsLastAutoUpdateInvocationKey,
-                                            kDaemonDefaultsID, PreferenceScope::User));
+    EXPECT_TRUE(PreferenceStore::dateForKey(kDefaultsLastAutoUpdateInvocationKey, kDaemonDefaultsID,
+                                            PreferenceScope::User));
   }
 
   // Post-logout results: installed ones are confirmed unless failure is
@@ -253,11 +287,11 @@ TEST_F(UpdateControllerTest, ABackgroundScanReportConfiguresOneRunByTheTimeTests
       {"A", PlistDictionary{{"State", "Installed"}, {"InstalledLater", true}}},
       {"B", PlistDictionary{{"State", "Error"}}},
       {"C", PlistDictionary{{"State", "Pending"}}}};
-  UpdateOperationSettings s = controller()
-                                  .softwareUpdateDidFinishBackgroundScanWithInfo(
-                                      {{"postLogoutUpdatesInstalled", results},
-                                       {"updateNotificationsOnly", true}})
-                                  ->settings();
+  UpdateOperationSettings s =
+      controller()
+          .softwareUpdateDidFinishBackgroundScanWithInfo(
+              {{"postLogoutUpdatesInstalled", results}, {"updateNotificationsOnly", true}})
+          ->settings();
   EXPECT_TRUE(s.shouldUpdateNotificationsOnly);
   EXPECT_EQ(s.postLogoutInstalledUpdates.size(), 1U);
   EXPECT_EQ(s.postLogoutInstalledLaterUpdates.size(), 1U);
@@ -275,8 +309,8 @@ TEST_F(UpdateControllerTest, AMajorOSUpdateNoticeIsAboutNothingElse) {
   auto operation = controller().softwareUpdateDidFinishBackgroundScanWithInfo(
       {{"majorOSUpdateAvailableAtPath", "/tmp/major"}, {"criticalUpdatesCount", 1}});
   EXPECT_FALSE(operation);
-  EXPECT_FALSE(PreferenceStore::dateForKey(kDefaultsLastAutoUpdateInvocationKey,
-                                           kDaemonDefaultsID, PreferenceScope::User));
+  EXPECT_FALSE(PreferenceStore::dateForKey(kDefaultsLastAutoUpdateInvocationKey, kDaemonDefaultsID,
+                                           PreferenceScope::User));
   EXPECT_EQ(log.countContaining("Enqueuing UpdateOperation"), 0U);
   EXPECT_EQ(log.countContaining("Received notice of new major OS update availability"), 1U);
 }
@@ -295,7 +329,7 @@ TEST_F(UpdateControllerTest, TimestampsAllowFiveMinutesOfSlackAndIntervalsComeFr
   struct Case {
     PlistValue stored;
     double expected;
-  } const intervals[] = {{PlistValue(), 604800}, {"3600", 3600}, {std::int64_t{0}, 0},
+  } const intervals[] = {{PlistValue(), 604800}, {"3600", 3600},   {std::int64_t{0}, 0},
                          {PlistDate{5}, 604800}, {"soon", 604800}, {2.5, 2.5}};
   for (const auto& [stored, expected] : intervals) {
     setPreference(kDefaultsAvailableUpdatesNotificationIntervalKey, stored, kDaemonDefaultsID,
@@ -363,8 +397,8 @@ class RecordingScanObserver final : public VendOSUpdateScanObserver {
 TEST_F(UpdateControllerTest, OneScanRunsAtATimeAndTheUserHasSeenWhatItFound) {
   ASSERT_TRUE(PlatformStateFile::named(SysupQuaymartUpdateController::kStateFileName)
                   .updateDictionary([](PlistDictionary& state) {
-                    state["catalog"] = PlistArray{osUpdate("A", {{"tags", PlistArray{"t"}}}),
-                                                  osUpdate("B")};
+                    state["catalog"] =
+                        PlistArray{osUpdate("A", {{"tags", PlistArray{"t"}}}), osUpdate("B")};
                     state["scanSeconds"] = 0.5;
                   }));
   UpdateController& updates = controller();
