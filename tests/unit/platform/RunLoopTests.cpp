@@ -253,9 +253,10 @@ TEST(RunLoop, ToleranceLetsATimerFireLaterTogetherWithAnother) {
     loop.stop();
   });
   ASSERT_TRUE(runStoppedByTheTest(loop));
-  EXPECT_GE(relaxedAt - added, 10ms);
+  // Deferred to the other timer's wake-up rather than woken for alone: not
+  // before that timer was due, whatever the load on the machine.
+  EXPECT_GE(relaxedAt - added, 25ms) << "the two timers did not share a wake-up";
   EXPECT_LE(relaxedAt, strictAt);
-  EXPECT_LT(strictAt - relaxedAt, 5ms) << "the two timers did not share a wake-up";
 }
 
 TEST(RunLoop, WorkThatThrowsIsReportedAndTheLoopGoesOn) {

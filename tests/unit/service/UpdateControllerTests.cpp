@@ -5,6 +5,7 @@
 #include <future>
 
 #include "ServiceTestSupport.h"
+#include "platform/dispatch/DispatchQueue.h"
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/PreferenceKeys.h"
 #include "store-runtime/download/VendFileManager.h"
@@ -94,6 +95,9 @@ class UpdateControllerTest : public ServiceTest {
   }
   void TearDown() override {
     controller_.reset();
+    // The framework tells its observers on the global queue: the telling
+    // that a test's last change started ends before the test does.
+    DispatchQueue::globalQueue().barrierSync([] {});
     map_.reset();
     ServiceTest::TearDown();
   }
