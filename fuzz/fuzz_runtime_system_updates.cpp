@@ -22,10 +22,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   }
   (void)state.catalogEntries(keys);
   (void)state.scanSeconds();
-  for (std::string_view list : {larder::SysupUpdateState::kAvailableKey,
-                                larder::SysupUpdateState::kHiddenKey,
-                                larder::SysupUpdateState::kLaterKey,
-                                larder::SysupUpdateState::kDownloadedKey}) {
+  for (std::string_view list :
+       {larder::SysupUpdateState::kAvailableKey, larder::SysupUpdateState::kHiddenKey,
+        larder::SysupUpdateState::kLaterKey, larder::SysupUpdateState::kDownloadedKey}) {
     for (const std::string& key : state.keyList(list)) (void)state.catalogEntry(key);
   }
   (void)state.dictionaryKeys(larder::SysupUpdateState::kInstalledKey);

@@ -214,7 +214,10 @@ void UpdateController::availableUpdatesDidChangeInternal() {
     }
     if (changed) sendBadgeMessage(count);
   }
-  if (availableUpdatesBadgeCount() == 0) {
+  // The real count, whatever the switch says: only a switched-off badge
+  // needs it counted a second time.
+  const std::uint64_t realCount = badgeDisabled ? availableUpdatesBadgeCount() : count;
+  if (realCount == 0) {
     TILL_LOG(2,
              "%@: _availableUpdatesDidChange removing all updates available notifications "
              "because the badge count is 0",

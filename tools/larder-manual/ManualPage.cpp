@@ -68,7 +68,8 @@ namespace {
 // A command, then its own commands under their full names ("prefs get").
 void writeCommand(std::ostream& out, const CLI::App& command, const std::string& parents) {
   const std::string name = parents + command.get_name();
-  out << ".SS " << ManualPage::escape(name) << "\n" << ManualPage::escape(command.get_description()) << "\n";
+  out << ".SS " << ManualPage::escape(name) << "\n"
+      << ManualPage::escape(command.get_description()) << "\n";
   writeOptions(out, command);
   for (const CLI::App* action : command.get_subcommands({})) {
     writeCommand(out, *action, name + " ");

@@ -50,9 +50,9 @@ TEST_F(PreferenceStoreTest, ScopesReadTheirFilesAndAppFallsBackToTheMachine) {
     Scope scope;
     PlistValue expected;
   } const cases[] = {
-      {"Both", Scope::App, "user"},          {"Both", Scope::User, "user"},
-      {"Both", Scope::System, "system"},     {"SystemOnly", Scope::App, true},
-      {"SystemOnly", Scope::User, {}},       {"UserOnly", Scope::System, {}},
+      {"Both", Scope::App, "user"},      {"Both", Scope::User, "user"},
+      {"Both", Scope::System, "system"}, {"SystemOnly", Scope::App, true},
+      {"SystemOnly", Scope::User, {}},   {"UserOnly", Scope::System, {}},
       {"Missing", Scope::App, {}},
   };
   for (const Case& c : cases) {

@@ -33,8 +33,12 @@ TEST(PreferenceValueWords, AreTypedByTheirLookOrByTheGivenType) {
     SCOPED_TRACE(std::string(c.word) + " as '" + c.type + "'");
     EXPECT_EQ(PreferencesCommand::valueOf(c.word, c.type), c.expected);
   }
-  for (auto [word, type] : {std::pair{"maybe", "bool"}, {"1.5", "integer"}, {"inf", "real"},
-                            {"tomorrow", "date"}, {"\"text\"", "json"}, {"{", "json"}}) {
+  for (auto [word, type] : {std::pair{"maybe", "bool"},
+                            {"1.5", "integer"},
+                            {"inf", "real"},
+                            {"tomorrow", "date"},
+                            {"\"text\"", "json"},
+                            {"{", "json"}}) {
     SCOPED_TRACE(std::string(word) + " as " + type);
     EXPECT_ANY_THROW((void)PreferencesCommand::valueOf(word, type));
   }

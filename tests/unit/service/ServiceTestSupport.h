@@ -171,8 +171,8 @@ inline void writePlist(const std::string& path, const PlistValue& value) {
 // temporary folder. The variables are put back as they were afterwards.
 class ServiceTest : public ::testing::Test {
  protected:
-  static constexpr const char* kVariables[] = {"LARDER_ROOT",    "HOME",
-                                               "XDG_CACHE_HOME", "XDG_STATE_HOME",
+  static constexpr const char* kVariables[] = {"LARDER_ROOT",     "HOME",
+                                               "XDG_CACHE_HOME",  "XDG_STATE_HOME",
                                                "XDG_CONFIG_HOME", "__OSINSTALL_ENVIRONMENT"};
 
   void SetUp() override {
