@@ -1,0 +1,95 @@
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/system/Mutex.h"
+#include "platform/value/PlistValue.h"
+#include "running-apps/RunningApplication.h"
+#include "store-runtime/core/VendStoreClient.h"
+#include "store-runtime/records/SysupQuaymartUpdate.h"
+
+namespace larder {
+
+class DispatchSemaphore;
+class PlugInHold;
+
+// The display name of each application that uses a busy plug-in, to what
+// the plug-in host knows of that plug-in (its containing bundle's path among
+// it).
+using PlugInHostApps = std::map<std::string, PlistDictionary>;
+
+// What a take-down shows the user before it quits applications. The quit
+// dialog itself is not part of this layer; a helper without one treats a
+// prompted take-down as cancelled.
+class AppHelperQuitPrompt {
+ public:
+  enum class Answer { kNone, kQuit, kSkip, kCancel };
+  virtual ~AppHelperQuitPrompt() = default;
+  // Blocks until the user answers or `forceFinish` is called (then kNone
+  // with `didForceFinish` true).
+  virtual Answer run(const std::vector<std::shared_ptr<RunningApplication>>& appsToQuit,
+                     bool allowUserToSkip, const std::vector<SysupQuaymartUpdate>& osUpdates,
+                     bool* didForceFinish) = 0;
+  // Takes the dialog down without an answer: an application quit by itself.
+  virtual void forceFinish() = 0;
+};
+
+// Stands between the update machinery and the applications the user has
+// open. The class operations answer questions about one bundle identifier;
+// an instance takes a set of applications out of the way (asking the user
+// first when told to), keeps them from coming back through their plug-ins,
+// and starts them again afterwards.
+class AppHelper : public std::enable_shared_from_this<AppHelper> {
+ public:
+  // --- Questions about one bundle identifier; any thread ---
+  static bool isAppRunningWithBundleID(std::string_view bundleIdentifier,
+                                       std::optional<std::string>* appName,
+                                       std::optional<PlugInHostApps>* plugInHostApps);
+  static std::optional<PlugInHostApps> getPluginHostAppInfo(const PlistDictionary& holdErrorInfo,
+                                                            std::string_view containerBundleID);
+  static const std::vector<std::string>& immortalAppBundleIDWhiteList();
+  static bool isRunningAppImmortalWhiteListed(const RunningApplication& application);
+  static bool isAppImmortalWithBundleID(std::string_view bundleIdentifier,
+                                        std::optional<std::string>* reason,
+                                        std::optional<std::string>* appName);
+  static bool isAppForemostWithBundleID(std::string_view bundleIdentifier,
+                                        std::optional<std::string>* appName);
+  // Start the application without bringing it forward; nothing for nullopt.
+  static void relaunchAppWithBundleID(const std::optional<std::string>& bundleIdentifier);
+  static void relaunchAppWithBundleURL(const std::optional<std::string>& bundleURL);
+
+  // --- Making a take-down ---
+  static std::shared_ptr<AppHelper> initWithBundleIdentifier(std::string bundleIdentifier,
+                                                             VendStoreClient storeClient);
+  static std::shared_ptr<AppHelper> initWithBundleIdentifiers(
+      std::vector<std::string> bundleIdentifiers, VendStoreClient storeClient);
+  static std::shared_ptr<AppHelper> initWithRunningApplications(
+      std::vector<std::shared_ptr<RunningApplication>> applications, VendStoreClient storeClient);
+  static std::shared_ptr<AppHelper> initWithAllRunningApplicationsIgnoringWhitelistedApps(
+      bool ignoreWhitelisted, VendStoreClient storeClient);
+
+  // True when nothing is left to terminate. Blocks for the prompt and for
+  // each application's quit.
+  bool ensureAppsAreNotRunningWithPromptToConfirm(bool promptToConfirm);
+  void relaunchTerminatedApps();
+  [[nodiscard]] bool needsRelaunch() const;
+
+  void setQuitPrompt(std::shared_ptr<AppHelperQuitPrompt> prompt);
+  [[nodiscard]] bool allowUserToSkipApps() const;
+  void setAllowUserToSkipApps(bool allow);
+  [[nodiscard]] std::vector<SysupQuaymartUpdate> osUpdates() const;
+  void setOsUpdates(std::vector<SysupQuaymartUpdate> updates);
+  [[nodiscard]] std::vector<std::string> skippedAppBundleIdentifiers() const;
+  [[nodiscard]] std::vector<std::shared_ptr<RunningApplication>> immortalRunningApplications()
+      const;
+  [[nodiscard]] std::vector<std::string> terminatedAppBundleURLs() const;
+  [[nodiscard]] const VendStoreClient& storeClient() const { return storeClient_; }
+};
+
+}  // namespace larder
