@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <map>
 #include <memory>
@@ -90,6 +91,66 @@ class AppHelper : public std::enable_shared_from_this<AppHelper> {
       const;
   [[nodiscard]] std::vector<std::string> terminatedAppBundleURLs() const;
   [[nodiscard]] const VendStoreClient& storeClient() const { return storeClient_; }
+
+  // How long a take-down pauses and waits. Tests shorten them; the service
+  // keeps the defaults.
+  struct Timing {
+    // The pause before a take-down looks at what runs.
+    std::chrono::milliseconds settle{1000};
+    // The wait for one application to obey a quit request.
+    std::chrono::milliseconds quitTimeout{20000};
+    // The same while the machine is in a dim wake, when applications are
+    // slower to react.
+    std::chrono::milliseconds dimWakeQuitTimeout{60000};
+  };
+  void setTiming(Timing timing);
+  [[nodiscard]] Timing timing() const;
+  // The wait for one application's quit as the machine stands now.
+  [[nodiscard]] std::chrono::milliseconds terminationWaitTimeout() const;
+
+ private:
+  using Applications = std::vector<std::shared_ptr<RunningApplication>>;
+
+  AppHelper(std::vector<std::string> bundleIdentifiers, VendStoreClient storeClient);
+
+  bool terminateApplicationsWithPromptToConfirm(bool promptToConfirm);
+  enum class PromptOutcome { kTerminate, kStop, kSkipped };
+  PromptOutcome askToQuit(bool promptToConfirm);
+  void terminateEach(bool alwaysForceTerminate);
+  // False when the wait timed out and the pass must end.
+  bool quitAndWait(const std::shared_ptr<RunningApplication>& application,
+                   ApplicationSerialNumber serialNumber);
+  void holdPlugInsAfterTermination(const std::shared_ptr<RunningApplication>& application);
+  void handleHoldAfterTermination(const std::shared_ptr<RunningApplication>& application,
+                                  std::shared_ptr<PlugInHold> hold,
+                                  const std::optional<VendError>& error);
+  void applicationDidTerminate(const std::shared_ptr<RunningApplication>& application);
+  std::vector<std::uint64_t> observeTermination(const Applications& applications);
+  static void stopObservingTermination(const Applications& applications,
+                                       const std::vector<std::uint64_t>& tokens);
+  static void messageTraceTermination(const std::optional<std::string>& bundleIdentifier,
+                                      bool terminatedSuccessfully, bool didTimeout);
+
+  // Guards everything below that a termination notification, arriving on
+  // another thread, may touch while a pass runs.
+  mutable Mutex mutex_;
+  const std::vector<std::string> bundleIdentifiers_;
+  Applications terminatedApps_ GUARDED_BY(mutex_);
+  Applications appsToTerminate_ GUARDED_BY(mutex_);
+  std::shared_ptr<AppHelperQuitPrompt> quitPrompt_ GUARDED_BY(mutex_);
+  // The prompt is on screen and has not been answered.
+  bool quitPromptShowing_ GUARDED_BY(mutex_) = false;
+  const VendStoreClient storeClient_;
+  bool allowUserToSkipApps_ GUARDED_BY(mutex_) = false;
+  std::vector<std::string> skippedAppBundleIdentifiers_ GUARDED_BY(mutex_);
+  // Made on first use: nothing to open until something was quit.
+  std::optional<std::vector<std::string>> relaunchBundleURLs_ GUARDED_BY(mutex_);
+  std::shared_ptr<RunningApplication> terminationWaitApp_ GUARDED_BY(mutex_);
+  std::shared_ptr<DispatchSemaphore> terminationWaitSemaphore_ GUARDED_BY(mutex_);
+  Applications immortalRunningApplications_ GUARDED_BY(mutex_);
+  std::vector<std::shared_ptr<PlugInHold>> pluginHoldsToRelease_ GUARDED_BY(mutex_);
+  std::vector<SysupQuaymartUpdate> osUpdates_ GUARDED_BY(mutex_);
+  Timing timing_ GUARDED_BY(mutex_);
 };
 
 }  // namespace larder

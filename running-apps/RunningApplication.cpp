@@ -1,0 +1,587 @@
+#include "running-apps/RunningApplication.h"
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <charconv>
+#include <chrono>
+#include <cstring>
+#include <string_view>
+#include <unordered_map>
+
+#include "platform/log/TillLogManager.h"
+#include "platform/system/Bundle.h"
+#include "platform/system/FileIO.h"
+#include "store-runtime/host/PlatformStateFile.h"
+
+extern char** environ;
+
+namespace larder {
+
+namespace {
+
+constexpr std::string_view kSpeaker = "RunningApplication";
+constexpr std::string_view kBundleSuffix = ".app";
+constexpr auto kWatchInterval = std::chrono::milliseconds(50);
+
+int openPidFd(pid_t pid) {
+#ifdef SYS_pidfd_open
+  return static_cast<int>(::syscall(SYS_pidfd_open, pid, 0));
+#else
+  (void)pid;
+  errno = ENOSYS;
+  return -1;
+#endif
+}
+
+bool pidFdSendSignal(int pidFd, int signal) {
+#ifdef SYS_pidfd_send_signal
+  return ::syscall(SYS_pidfd_send_signal, pidFd, signal, nullptr, 0) == 0;
+#else
+  (void)pidFd;
+  (void)signal;
+  return false;
+#endif
+}
+
+std::string procPath(pid_t pid, std::string_view entry) {
+  std::string path = "/proc/" + std::to_string(pid);
+  if (!entry.empty()) path.append("/").append(entry);
+  return path;
+}
+
+// Reads a small /proc file with one read; /proc files are not seekable
+// streams worth buffering.
+std::optional<std::string> readSmallFile(const std::string& path) {
+  int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return std::nullopt;
+  std::array<char, 1024> buffer{};
+  ssize_t count = ::read(fd, buffer.data(), buffer.size());
+  ::close(fd);
+  if (count <= 0) return std::nullopt;
+  return std::string(buffer.data(), static_cast<std::size_t>(count));
+}
+
+struct ProcessStat {
+  char state = '?';
+  std::uint64_t startTicks = 0;
+};
+
+// The fields after the command name, which may itself hold spaces and
+// parentheses; the start time is field 22.
+std::optional<ProcessStat> readProcessStat(pid_t pid) {
+  std::optional<std::string> text = readSmallFile(procPath(pid, "stat"));
+  if (!text) return std::nullopt;
+  std::size_t close = text->rfind(')');
+  if (close == std::string::npos || close + 2 >= text->size()) return std::nullopt;
+  std::string_view rest = std::string_view(*text).substr(close + 2);
+  ProcessStat stat;
+  stat.state = rest.front();
+  constexpr int kStartTimeIndex = 19;  // field 22 counted from field 3
+  for (int index = 0; index < kStartTimeIndex; ++index) {
+    std::size_t space = rest.find(' ');
+    if (space == std::string_view::npos) return std::nullopt;
+    rest.remove_prefix(space + 1);
+  }
+  std::from_chars(rest.data(), rest.data() + rest.size(), stat.startTicks);
+  return stat;
+}
+
+// Seconds since 1970 at which the machine booted; it does not change while
+// the process runs.
+double bootTime() {
+  static const double seconds = [] {
+    std::optional<PlistData> bytes = FileIO::read("/proc/stat").optional();
+    if (!bytes) return 0.0;
+    std::string_view text(reinterpret_cast<const char*>(bytes->data()), bytes->size());
+    std::size_t at = text.find("\nbtime ");
+    if (at == std::string_view::npos) return 0.0;
+    text.remove_prefix(at + 7);
+    std::uint64_t value = 0;
+    std::from_chars(text.data(), text.data() + text.size(), value);
+    return static_cast<double>(value);
+  }();
+  return seconds;
+}
+
+std::optional<PlistDate> launchDateForTicks(std::uint64_t ticks) {
+  const long ticksPerSecond = ::sysconf(_SC_CLK_TCK);
+  if (ticksPerSecond <= 0 || bootTime() == 0.0) return std::nullopt;
+  return PlistDate{bootTime() + static_cast<double>(ticks) / static_cast<double>(ticksPerSecond)};
+}
+
+// The innermost folder of `executable` whose name ends in ".app".
+std::optional<std::string> bundlePathOfExecutable(std::string_view executable) {
+  std::size_t end = executable.rfind('/');
+  while (end != std::string_view::npos && end > 0) {
+    std::string_view folder = executable.substr(0, end);
+    std::size_t start = folder.rfind('/');
+    std::string_view name = folder.substr(start == std::string_view::npos ? 0 : start + 1);
+    if (name.size() > kBundleSuffix.size() && name.ends_with(kBundleSuffix)) {
+      return std::string(folder);
+    }
+    end = start;
+  }
+  return std::nullopt;
+}
+
+std::optional<std::string> executablePath(pid_t pid) {
+  std::array<char, 4096> buffer{};
+  ssize_t length = ::readlink(procPath(pid, "exe").c_str(), buffer.data(), buffer.size() - 1);
+  if (length <= 0) return std::nullopt;
+  return std::string(buffer.data(), static_cast<std::size_t>(length));
+}
+
+struct BundleFacts {
+  std::optional<std::string> identifier;
+  std::optional<std::string> name;
+};
+
+std::string displayName(const std::optional<Bundle>& bundle, const std::string& bundlePath) {
+  for (std::string_view key : {"HostBundleDisplayName", "HostBundleName"}) {
+    const std::string* name = bundle ? bundle->infoValue(key).string() : nullptr;
+    if (name && !name->empty()) return *name;
+  }
+  std::string folder = bundlePath.substr(bundlePath.rfind('/') + 1);
+  if (folder.ends_with(kBundleSuffix)) folder.resize(folder.size() - kBundleSuffix.size());
+  return folder;
+}
+
+BundleFacts readBundleFacts(const std::string& bundlePath) {
+  BundleFacts facts;
+  std::optional<Bundle> bundle = Bundle::open(bundlePath);
+  if (bundle) facts.identifier = bundle->identifier();
+  facts.name = displayName(bundle, bundlePath);
+  return facts;
+}
+
+// Bundles seen during one scan: many processes may run from the same one.
+using BundleCache = std::unordered_map<std::string, BundleFacts>;
+
+std::optional<RunningApplication::Description> describe(pid_t pid, uid_t user,
+                                                        BundleCache& bundles) {
+  struct stat status {};
+  if (::stat(procPath(pid, {}).c_str(), &status) != 0 || status.st_uid != user) {
+    return std::nullopt;
+  }
+  std::optional<std::string> executable = executablePath(pid);
+  if (!executable) return std::nullopt;
+  std::optional<std::string> bundlePath = bundlePathOfExecutable(*executable);
+  if (!bundlePath) return std::nullopt;
+  std::optional<ProcessStat> stat = readProcessStat(pid);
+  if (!stat || stat->state == 'Z' || stat->state == 'X') return std::nullopt;
+  auto cached = bundles.find(*bundlePath);
+  if (cached == bundles.end()) {
+    cached = bundles.emplace(*bundlePath, readBundleFacts(*bundlePath)).first;
+  }
+  RunningApplication::Description description;
+  description.pid = pid;
+  description.startTicks = stat->startTicks;
+  description.bundleIdentifier = cached->second.identifier;
+  description.bundleURL = *bundlePath;
+  description.launchDate = launchDateForTicks(stat->startTicks);
+  description.localizedName = cached->second.name;
+  return description;
+}
+
+// Every numeric entry of /proc, in pid order.
+std::vector<pid_t> allPids() {
+  std::vector<pid_t> pids;
+  DIR* proc = ::opendir("/proc");
+  if (!proc) return pids;
+  while (const dirent* entry = ::readdir(proc)) {
+    pid_t pid = 0;
+    const char* name = entry->d_name;
+    auto [end, error] = std::from_chars(name, name + std::strlen(name), pid);
+    if (error == std::errc() && *end == '\0' && pid > 0) pids.push_back(pid);
+  }
+  ::closedir(proc);
+  std::sort(pids.begin(), pids.end());
+  return pids;
+}
+
+std::vector<std::shared_ptr<RunningApplication>> scan(
+    const std::function<bool(const RunningApplication::Description&)>& wanted) {
+  std::vector<std::shared_ptr<RunningApplication>> applications;
+  BundleCache bundles;
+  const uid_t user = ::getuid();
+  for (pid_t pid : allPids()) {
+    std::optional<RunningApplication::Description> description = describe(pid, user, bundles);
+    if (description && wanted(*description)) {
+      applications.push_back(RunningApplication::make(std::move(*description)));
+    }
+  }
+  return applications;
+}
+
+PlistDictionary facts() {
+  return PlatformStateFile::named(RunningApplicationFacts::kFileName).readDictionary();
+}
+
+bool arrayHolds(const PlistValue& array, std::string_view text) {
+  const PlistArray* values = array.array();
+  if (!values) return false;
+  return std::any_of(values->begin(), values->end(), [&](const PlistValue& value) {
+    return value.string() && *value.string() == text;
+  });
+}
+
+bool setArrayMember(std::string_view key, std::string_view bundleIdentifier, bool member) {
+  return PlatformStateFile::named(RunningApplicationFacts::kFileName)
+      .updateDictionary([&](PlistDictionary& dictionary) {
+        PlistArray values;
+        if (const PlistArray* old = dictionary[std::string(key)].array()) values = *old;
+        std::erase_if(values, [&](const PlistValue& value) {
+          return value.string() && *value.string() == bundleIdentifier;
+        });
+        if (member) values.emplace_back(bundleIdentifier);
+        dictionary[std::string(key)] = std::move(values);
+      });
+}
+
+// The two ends of a pipe whose ends close at exec.
+struct Pipe {
+  std::array<int, 2> fds{-1, -1};
+  bool open() { return ::pipe2(fds.data(), O_CLOEXEC) == 0; }
+  void closeAll() {
+    for (int& fd : fds) {
+      if (fd >= 0) ::close(fd);
+      fd = -1;
+    }
+  }
+};
+
+// Reads a whole value, or nothing when the other end closed first.
+template <typename T>
+bool readValue(int fd, T& value) {
+  ssize_t count = 0;
+  do {
+    count = ::read(fd, &value, sizeof value);
+  } while (count < 0 && errno == EINTR);
+  return count == static_cast<ssize_t>(sizeof value);
+}
+
+}  // namespace
+
+std::shared_ptr<RunningApplication> RunningApplication::make(Description description) {
+  return std::shared_ptr<RunningApplication>(new RunningApplication(std::move(description)));
+}
+
+RunningApplication::RunningApplication(Description description)
+    : description_(std::move(description)) {
+  if (description_.pid <= 0) {
+    terminated_ = true;
+    return;
+  }
+  pidFd_ = openPidFd(description_.pid);
+  // The pidfd pins the process only from now on: make sure it is still the
+  // one that was described, not a later one with the same pid.
+  if (description_.startTicks != 0) {
+    std::optional<ProcessStat> stat = readProcessStat(description_.pid);
+    if (!stat || stat->startTicks != description_.startTicks) terminated_ = true;
+  }
+}
+
+RunningApplication::~RunningApplication() {
+  std::jthread watcher;
+  {
+    MutexLock lock(observersMutex_);
+    watcher = std::move(watcher_);
+  }
+  if (watcher.joinable()) {
+    // An observer may drop the last reference on the watcher thread itself.
+    if (watcher.get_id() == std::this_thread::get_id()) {
+      watcher.detach();
+    } else {
+      watcher.request_stop();
+      watcher.join();
+    }
+  }
+  if (pidFd_ >= 0) ::close(pidFd_);
+}
+
+std::shared_ptr<RunningApplication> RunningApplication::withPid(pid_t pid) {
+  BundleCache bundles;
+  std::optional<Description> description = describe(pid, ::getuid(), bundles);
+  return description ? make(std::move(*description)) : nullptr;
+}
+
+std::vector<std::shared_ptr<RunningApplication>>
+RunningApplication::runningApplicationsWithBundleIdentifier(std::string_view bundleIdentifier) {
+  return scan([&](const Description& description) {
+    return description.bundleIdentifier && *description.bundleIdentifier == bundleIdentifier;
+  });
+}
+
+std::vector<std::shared_ptr<RunningApplication>> RunningApplication::allRunningApplications() {
+  return scan([](const Description&) { return true; });
+}
+
+Result<pid_t> RunningApplication::launchBundle(const std::string& bundlePath) {
+  std::optional<Bundle> bundle = Bundle::open(bundlePath);
+  if (!bundle) return VendError::withDomain("RunningApplication", ENOENT, "No bundle at " + bundlePath);
+  const std::string* executableName = bundle->infoValue("HostBundleExecutable").string();
+  if (!executableName || executableName->empty() || executableName->find('/') != std::string::npos) {
+    return VendError::withDomain("RunningApplication", EINVAL,
+                                 "The bundle at " + bundlePath + " names no executable");
+  }
+  std::string executable = bundlePath + "/bin/" + *executableName;
+  if (::access(executable.c_str(), X_OK) != 0) {
+    return VendError::withDomain("RunningApplication", errno, executable + " is not executable");
+  }
+  // Everything the children need is made before fork: after it, only
+  // async-signal-safe calls are allowed.
+  std::array<char*, 2> argv{executable.data(), nullptr};
+  Pipe pidPipe;
+  Pipe execPipe;
+  if (!pidPipe.open() || !execPipe.open()) {
+    int error = errno;
+    pidPipe.closeAll();
+    execPipe.closeAll();
+    return VendError::withDomain("RunningApplication", error, "No pipe for the launch");
+  }
+  pid_t child = ::fork();
+  if (child < 0) {
+    int error = errno;
+    pidPipe.closeAll();
+    execPipe.closeAll();
+    return VendError::withDomain("RunningApplication", error, "fork failed");
+  }
+  if (child == 0) {
+    // Double fork: the program is nobody's child here and leaves no zombie.
+    ::setsid();
+    pid_t program = ::fork();
+    if (program == 0) {
+      ::execve(argv[0], argv.data(), environ);
+      int error = errno;
+      (void)::write(execPipe.fds[1], &error, sizeof error);
+      ::_exit(127);
+    }
+    (void)::write(pidPipe.fds[1], &program, sizeof program);
+    ::_exit(program > 0 ? 0 : 1);
+  }
+  ::close(pidPipe.fds[1]);
+  pidPipe.fds[1] = -1;
+  ::close(execPipe.fds[1]);
+  execPipe.fds[1] = -1;
+  pid_t program = -1;
+  bool gotPid = readValue(pidPipe.fds[0], program);
+  int execError = 0;
+  bool execFailed = readValue(execPipe.fds[0], execError);
+  pidPipe.closeAll();
+  execPipe.closeAll();
+  int status = 0;
+  while (::waitpid(child, &status, 0) < 0 && errno == EINTR) {
+  }
+  if (!gotPid || program <= 0) {
+    return VendError::withDomain("RunningApplication", EAGAIN, "Could not start " + executable);
+  }
+  if (execFailed) {
+    return VendError::withDomain("RunningApplication", execError,
+                                 "Could not run " + executable + ": " + std::strerror(execError));
+  }
+  TILL_LOG(3, "%@: Started %@ as %@", kSpeaker, executable, program);
+  return program;
+}
+
+std::string RunningApplication::description() const {
+  return description_.localizedName.value_or("(unnamed)") + " (" +
+         description_.bundleIdentifier.value_or("no identifier") + ", pid " +
+         std::to_string(description_.pid) + ")";
+}
+
+std::string RunningApplication::displayNameOfBundle(const std::string& bundlePath) {
+  return displayName(Bundle::open(bundlePath), bundlePath);
+}
+
+bool RunningApplication::isActive() const {
+  return description_.bundleIdentifier &&
+         RunningApplicationFacts::foremost() == description_.bundleIdentifier;
+}
+
+bool RunningApplication::quittingWillBeNoisyOrLoseData() const {
+  return reasonThatQuittingWillBeNoisyOrLoseData().has_value();
+}
+
+std::optional<std::string> RunningApplication::reasonThatQuittingWillBeNoisyOrLoseData() const {
+  if (!description_.bundleIdentifier) return std::nullopt;
+  return RunningApplicationFacts::quittingLosesData(*description_.bundleIdentifier);
+}
+
+bool RunningApplication::isStoppedInApplicationRegistry() const {
+  return description_.bundleIdentifier &&
+         RunningApplicationFacts::isStopped(*description_.bundleIdentifier);
+}
+
+bool RunningApplication::isProxied() const {
+  return description_.bundleIdentifier &&
+         RunningApplicationFacts::isProxied(*description_.bundleIdentifier);
+}
+
+bool RunningApplication::processHasGone() const {
+  std::optional<ProcessStat> stat = readProcessStat(description_.pid);
+  if (!stat) return true;
+  if (description_.startTicks != 0 && stat->startTicks != description_.startTicks) return true;
+  return stat->state == 'Z' || stat->state == 'X';
+}
+
+bool RunningApplication::isTerminated() const {
+  if (terminated_) return true;
+  if (pidFd_ >= 0) {
+    pollfd poller{pidFd_, POLLIN, 0};
+    return ::poll(&poller, 1, 0) > 0;
+  }
+  return processHasGone();
+}
+
+RunningApplication::ObserverToken RunningApplication::addTerminationObserver(
+    TerminationObserver observer) {
+  MutexLock lock(observersMutex_);
+  ObserverToken token = nextToken_++;
+  if (notified_) return token;
+  observers_.emplace(token, std::move(observer));
+  if (!watcher_.joinable()) {
+    watcher_ = std::jthread([this](const std::stop_token& stop) { watchTermination(stop); });
+  }
+  return token;
+}
+
+void RunningApplication::removeTerminationObserver(ObserverToken token) {
+  MutexLock lock(observersMutex_);
+  observers_.erase(token);
+}
+
+void RunningApplication::watchTermination(const std::stop_token& stop) {
+  while (!stop.stop_requested()) {
+    if (terminated_) break;
+    if (pidFd_ >= 0) {
+      pollfd poller{pidFd_, POLLIN, 0};
+      int ready = ::poll(&poller, 1, static_cast<int>(kWatchInterval.count()));
+      if (ready > 0) break;
+      if (ready < 0 && errno != EINTR) {
+        TILL_LOG(1, "%@: Cannot watch process %@: %@", kSpeaker, description_.pid,
+                 std::strerror(errno));
+        return;
+      }
+    } else {
+      if (processHasGone()) break;
+      std::this_thread::sleep_for(kWatchInterval);
+    }
+  }
+  if (stop.stop_requested()) return;
+  notifyTerminated();
+  // Nothing of this object may be touched from here: the last reference
+  // may have gone with the observers.
+}
+
+void RunningApplication::notifyTerminated() {
+  terminated_ = true;
+  std::shared_ptr<RunningApplication> self = weak_from_this().lock();
+  std::vector<TerminationObserver> observers;
+  {
+    MutexLock lock(observersMutex_);
+    if (notified_) return;
+    notified_ = true;
+    for (auto& [token, observer] : observers_) observers.push_back(observer);
+  }
+  if (!self) return;
+  TILL_LOG(3, "%@: Process %@ of %@ has terminated", kSpeaker, description_.pid,
+           description_.bundleIdentifier.value_or("(no identifier)"));
+  for (const TerminationObserver& observer : observers) observer(self);
+}
+
+bool RunningApplication::sendSignal(int signal) {
+  if (terminated_) return false;
+  if (pidFd_ >= 0) return pidFdSendSignal(pidFd_, signal);
+  if (processHasGone()) return false;
+  return ::kill(description_.pid, signal) == 0;
+}
+
+bool RunningApplication::forceTerminate() {
+  return sendSignal(SIGKILL);
+}
+
+bool RunningApplication::requestQuit() {
+  return sendSignal(SIGTERM);
+}
+
+void RunningApplication::activateWithOptions(unsigned /*options*/) {}
+
+Result<ApplicationSerialNumber> RunningApplication::applicationSerialNumber() const {
+  if (description_.pid <= 0 || isTerminated()) {
+    return VendError::withDomain("RunningApplication", ESRCH,
+                                 "Process " + std::to_string(description_.pid) + " has gone");
+  }
+  auto value = static_cast<std::uint64_t>(description_.pid);
+  return ApplicationSerialNumber{static_cast<std::uint32_t>(value >> 32U),
+                                 static_cast<std::uint32_t>(value & 0xffffffffU)};
+}
+
+std::optional<std::string> RunningApplicationFacts::foremost() {
+  const std::string* value = facts()["foremost"].string();
+  return value ? std::optional<std::string>(*value) : std::nullopt;
+}
+
+bool RunningApplicationFacts::setForemost(const std::optional<std::string>& bundleIdentifier) {
+  return PlatformStateFile::named(kFileName).updateDictionary([&](PlistDictionary& dictionary) {
+    if (bundleIdentifier) {
+      dictionary["foremost"] = *bundleIdentifier;
+    } else {
+      dictionary.erase("foremost");
+    }
+  });
+}
+
+std::optional<std::string> RunningApplicationFacts::quittingLosesData(
+    std::string_view bundleIdentifier) {
+  const PlistDictionary all = facts();
+  auto reasons = all.find("quittingLosesData");
+  if (reasons == all.end()) return std::nullopt;
+  const std::string* reason = reasons->second[bundleIdentifier].string();
+  return reason ? std::optional<std::string>(*reason) : std::nullopt;
+}
+
+bool RunningApplicationFacts::setQuittingLosesData(std::string_view bundleIdentifier,
+                                                   const std::optional<std::string>& reason) {
+  return PlatformStateFile::named(kFileName).updateDictionary([&](PlistDictionary& dictionary) {
+    PlistDictionary reasons;
+    if (const PlistDictionary* old = dictionary["quittingLosesData"].dictionary()) reasons = *old;
+    if (reason) {
+      reasons[std::string(bundleIdentifier)] = *reason;
+    } else {
+      reasons.erase(std::string(bundleIdentifier));
+    }
+    dictionary["quittingLosesData"] = std::move(reasons);
+  });
+}
+
+bool RunningApplicationFacts::isStopped(std::string_view bundleIdentifier) {
+  const PlistDictionary all = facts();
+  auto found = all.find("stopped");
+  return found != all.end() && arrayHolds(found->second, bundleIdentifier);
+}
+
+bool RunningApplicationFacts::setStopped(std::string_view bundleIdentifier, bool stopped) {
+  return setArrayMember("stopped", bundleIdentifier, stopped);
+}
+
+bool RunningApplicationFacts::isProxied(std::string_view bundleIdentifier) {
+  const PlistDictionary all = facts();
+  auto found = all.find("proxied");
+  return found != all.end() && arrayHolds(found->second, bundleIdentifier);
+}
+
+bool RunningApplicationFacts::setProxied(std::string_view bundleIdentifier, bool proxied) {
+  return setArrayMember("proxied", bundleIdentifier, proxied);
+}
+
+}  // namespace larder
