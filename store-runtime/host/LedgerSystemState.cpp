@@ -58,6 +58,10 @@ bool LedgerIsDimWake() {
   return systemState()["dimWake"].boolValue();
 }
 
+std::int64_t LedgerDimWakeThermalEmergencyCount() {
+  return systemState()["dimWakeThermalEmergencyCount"].int64Value();
+}
+
 bool LedgerOnRecoveryPartition() {
   return Environment::variableIfSet("__OSINSTALL_ENVIRONMENT").has_value();
 }

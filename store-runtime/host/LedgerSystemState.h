@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -16,6 +17,9 @@ namespace larder {
 // platform has no such state; it is "dimWake" (boolean) of
 // "<root>/var/lib/larder-platform/system-state.plist".
 bool LedgerIsDimWake();
+// How often the machine has woken only partly because it ran too hot:
+// "dimWakeThermalEmergencyCount" (integer) of the same file; 0 when absent.
+std::int64_t LedgerDimWakeThermalEmergencyCount();
 
 // The process runs from an OS install environment: the variable
 // __OSINSTALL_ENVIRONMENT is set, to any value, the empty one included.
