@@ -100,6 +100,7 @@ UpdateController::~UpdateController() {
 // reference to this controller. It must not ask the registry.
 void UpdateController::initWithStoreClient(SoftwareMap& softwareMap) {
   std::weak_ptr<UpdateController> weakSelf = weak_from_this();
+  softwareMap_ = &softwareMap;
   updateQueue_ = std::make_shared<UpdateQueue>(storeClient_, weakSelf, softwareMap);
   serviceProxy_ = std::make_shared<VendServiceProxy>(storeClient_);
   majorOSInstallQueue_ =
@@ -109,22 +110,6 @@ void UpdateController::initWithStoreClient(SoftwareMap& softwareMap) {
           [weakSelf](const OSUpdateList&) {
             if (auto self = weakSelf.lock()) self->availableUpdatesDidChangeInternal();
           });
-}
-
-// --- Questions about the machine ---
-
-bool UpdateController::runningOnACPower() {
-  return LedgerPowerSource::remainingTimeEstimate() == LedgerPowerSource::kUnlimitedRemainingTime;
-}
-
-bool UpdateController::otherUsersAreLoggedIn() {
-  return LedgerSessionList::loggedInSessionCount() > 1;
-}
-
-bool UpdateController::diskSealKeyIsDestroyedOnStandby() {
-  const PlistValue& value =
-      valueOf(LedgerSystemSettings::systemPowerSettings(), "DestroyDiskSealKeyOnStandby");
-  return value.isBoolean() && value.boolValue();
 }
 
 void UpdateController::startObservingPowerSourceWithCallback(std::function<void()> callback) {
@@ -300,7 +285,8 @@ std::shared_ptr<UpdateOperation> UpdateController::softwareUpdateDidFinishBackgr
                                   PreferenceScope::User);
   recordSilentInstalls(info);
 
-  auto operation = std::make_shared<UpdateOperation>(storeClient_);
+  auto operation = std::make_shared<UpdateOperation>(
+      storeClient_, std::weak_ptr<UpdateOperationController>(weak_from_this()));
   configureTimedTasks(info, *operation);
   if (valueOf(info, "updateNotificationsOnly").boolValue()) {
     TILL_LOG(2, "%@: updateNotificationsOnly=true, setting updateNotificationsOnly=YES on %@",

@@ -24,6 +24,7 @@
 #include "update-controller/VendAvailableUpdatesObserver.h"
 #include "update-controller/VendOSUpdateProgressObserver.h"
 #include "update-controller/VendOSUpdateScanObserver.h"
+#include "update-operation/UpdateOperationController.h"
 #include "update-queue/UpdateQueue.h"
 #include "update-queue/UpdateQueueDelegate.h"
 
@@ -41,16 +42,14 @@ class UpdateOperation;
 // The time tests and switches keep nothing in memory: each answer is read
 // from the preferences at the moment of the question.
 class UpdateController final : public UpdateQueueDelegate,
+                               public UpdateOperationController,
                                public std::enable_shared_from_this<UpdateController> {
  public:
   using OSUpdateList = std::vector<SysupQuaymartUpdate>;
   using OSUpdatePredicate = SysupQuaymartUpdateController::Predicate;
   using ScanCompletionHandler = std::function<void(const OptionalError& error)>;
   using SuccessHandler = std::function<void(bool success)>;
-  using Clock = std::chrono::system_clock;
 
-  // Every interval test allows this much slack.
-  static constexpr double kTimestampSlackSeconds = 300;
   // A scan shows up as in progress after this long even when it was started
   // quietly.
   static constexpr double kQuietScanSeconds = 2.5;
@@ -66,13 +65,6 @@ class UpdateController final : public UpdateQueueDelegate,
   // controller, and the writes they make, have ended.
   static void finishPendingWritesOfAllControllers();
 
-  // --- Questions about the machine ---
-
-  static bool runningOnACPower();
-  // More than one session whose login has finished.
-  static bool otherUsersAreLoggedIn();
-  static bool diskSealKeyIsDestroyedOnStandby();
-
   // A controller outside the registry, over `softwareMap`, which must
   // outlive it: the registry makes its own with the shared map; tests make
   // theirs with a map of their own.
@@ -85,7 +77,10 @@ class UpdateController final : public UpdateQueueDelegate,
   UpdateController& operator=(const UpdateController&) = delete;
 
   [[nodiscard]] const VendStoreClient& storeClient() const { return storeClient_; }
-  [[nodiscard]] const std::shared_ptr<UpdateQueue>& updateQueue() const { return updateQueue_; }
+  [[nodiscard]] const std::shared_ptr<UpdateQueue>& updateQueue() const override {
+    return updateQueue_;
+  }
+  [[nodiscard]] SoftwareMap& softwareMap() const override { return *softwareMap_; }
   [[nodiscard]] const std::shared_ptr<VendServiceProxy>& serviceProxy() const {
     return serviceProxy_;
   }
@@ -96,10 +91,10 @@ class UpdateController final : public UpdateQueueDelegate,
   void removeAvailableUpdatesObserver(
       const std::shared_ptr<VendAvailableUpdatesObserver>& observer);
   // App updates the user is to hear of, plus one for all OS updates together.
-  [[nodiscard]] std::uint64_t availableUpdatesBadgeCount() const;
+  [[nodiscard]] std::uint64_t availableUpdatesBadgeCount() const override;
   void availableUpdatesDidChange() override;
-  void disableDockBadgeUpdates();
-  void enableDockBadgeUpdates();
+  void disableDockBadgeUpdates() override;
+  void enableDockBadgeUpdates() override;
   void clearAvailableUpdatesBadgeCount();
   // The badge count last sent, if any.
   [[nodiscard]] std::optional<std::uint64_t> lastDockBadgeCount() const;
@@ -143,9 +138,9 @@ class UpdateController final : public UpdateQueueDelegate,
   void enumerateOSUpdateProgressObserversWithBlock(
       const std::function<void(VendOSUpdateProgressObserver&)>& block) const;
   void osUpdatesChangedProgress(const OSUpdateList& osUpdates,
-                                const LedgerSoftwareUpdateStatus& progress) const;
-  void didStartOSUpdates(const OSUpdateList& osUpdates);
-  void didFinishOSUpdates(const OSUpdateList& osUpdates);
+                                const LedgerSoftwareUpdateStatus& progress) const override;
+  void didStartOSUpdates(const OSUpdateList& osUpdates) override;
+  void didFinishOSUpdates(const OSUpdateList& osUpdates) override;
   [[nodiscard]] OSUpdateList osUpdatesInProgress() const;
   void hideOSUpdatesWithProductKeys(const std::vector<std::string>& productKeys,
                                     SuccessHandler completion);
@@ -156,38 +151,34 @@ class UpdateController final : public UpdateQueueDelegate,
   // --- Timing policy ---
 
   [[nodiscard]] std::optional<Clock::time_point> dateForTimestampKey(std::string_view key) const;
-  static Clock::time_point dateWhenDateExceedsInterval(Clock::time_point date, double seconds);
   [[nodiscard]] bool timestampWithKeyHasExceededCheckInterval(std::string_view key,
                                                               double seconds) const;
-  [[nodiscard]] static double timeIntervalWithPreferenceKey(std::string_view key,
-                                                            double defaultValue);
-  [[nodiscard]] static double criticalUpdateNotificationMinimumInterval();
-  [[nodiscard]] static double availableUpdatesNotificationMinimumInterval();
-  [[nodiscard]] static double checkForAndStageAppUpdatesMinimumInterval();
-  [[nodiscard]] static double autoInstallUpdatesMinimumInterval();
-  [[nodiscard]] static double autoInstallUpdateMinimumReleaseTimeInterval();
   [[nodiscard]] bool isTimeToPostCriticalUpdateNotification() const;
   [[nodiscard]] bool isTimeToPostUpdatesAvailableNotification() const;
   [[nodiscard]] bool isTimeToStageAppUpdates() const;
   [[nodiscard]] bool isTimeToAutoUpdate() const;
   void resetUpdatesAvailableNotificationTimestamp();
-  [[nodiscard]] static bool shouldNotifyForNewUpdatesOnly();
-
-  [[nodiscard]] static bool isUpdateStagingEnabled();
-  [[nodiscard]] static bool isAutoUpdatedEnabled();
-  [[nodiscard]] static bool isAutoUpdatedOfRestartRequiredUpdatesEnabled();
-  [[nodiscard]] static bool isSysupScanAutomaticCheckEnabled();
-  static void setAutoUpdateEnabled(bool enabled);
-  static void setAutoUpdateOfRestartRequiredUpdatesEnabled(bool enabled);
-  [[nodiscard]] static bool shouldPromptForAutoUpdateOptIn();
-  [[nodiscard]] static bool shouldPromptForAutoUpdateOfRestartRequiredUpdatesOptIn();
-  void promptUserToOptInForAutoUpdateWithShowNotification(bool showNotification);
+  void promptUserToOptInForAutoUpdateWithShowNotification(bool showNotification) override;
   void promptUserToOptInForAutoUpdateOfRestartRequiredUpdatesWithShowNotification(
-      bool showNotification);
+      bool showNotification) override;
   [[nodiscard]] OSUpdateList availableOSUpdatesEligibleForAutoInstallOfRestartRequiredUpdates()
-      const;
-  [[nodiscard]] static bool lastDoItLaterLogoutFailed();
-  static void setLastDoItLaterLogoutFailed(bool failed);
+      const override;
+
+  // --- What runs ask ---
+
+  [[nodiscard]] bool updatesAreInProgress() const override;
+  void didRequestPostLogoutInstallOfUpdates() override;
+  [[nodiscard]] bool hasRecentlyRequestedPostLogoutInstall() const;
+  [[nodiscard]] std::vector<std::string> appUpdatesToInstallLater() const override;
+  [[nodiscard]] bool appUpdatesToInstallLaterIncludesBundleID(
+      std::string_view bundleIdentifier) const override;
+  [[nodiscard]] bool updateFailureNotificationIsDisplayed() const override;
+  bool confirmRestartWithUpdatesWillDownload(bool willDownload) override;
+  void appendInstalledUpdatesToJournal(const std::vector<LedgerUpdateRef>& appUpdates,
+                                       const OSUpdateList& osUpdates) override;
+  [[nodiscard]] const std::shared_ptr<OSUpdateCancelTokens>& osUpdateCancelTokens() const override {
+    return osUpdateCancelTokens_;
+  }
 
   // Whether the user may be offered to install these later: never on a
   // machine that destroys its disk seal key on standby; always for app
@@ -222,7 +213,13 @@ class UpdateController final : public UpdateQueueDelegate,
   void confirmPendingUpdatesInJournal(const std::vector<std::string>& productKeys) const;
 
   VendStoreClient storeClient_;
+  SoftwareMap* softwareMap_ = nullptr;
   std::shared_ptr<UpdateQueue> updateQueue_;
+  // Seconds since the epoch of the last request to install after logout; 0
+  // when there was none.
+  std::atomic<double> lastLogoutRequestedDate_{0};
+  std::shared_ptr<OSUpdateCancelTokens> osUpdateCancelTokens_ =
+      std::make_shared<OSUpdateCancelTokens>();
 
   mutable Mutex osUpdateScanLock_;
   std::atomic<bool> osUpdateScanInProgress_{false};

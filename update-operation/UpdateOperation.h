@@ -1,17 +1,31 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
+#include <memory>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "platform/error/VendError.h"
 #include "platform/system/Mutex.h"
 #include "platform/value/PlistValue.h"
+#include "running-apps/AppHelper.h"
+#include "store-runtime/records/LedgerSoftwareUpdateStatus.h"
 #include "store-runtime/records/LedgerUpdate.h"
 #include "store-runtime/records/SysupQuaymartUpdate.h"
+#include "store-runtime/records/TillDownload.h"
+#include "store-runtime/records/TillPurchase.h"
 #include "store-runtime/services/VendOperation.h"
+#include "update-operation/UpdateOperationController.h"
+#include "update-operation/VendUpdateDelegate.h"
 
 namespace larder {
+
+class DispatchQueue;
+class UpdateQueue;
+class UpdateRunRecord;
+struct VendPurchaseRecord;
 
 // What one run of the update machinery is asked to do. Plain data, set by
 // the makers of runs before the run starts.
@@ -38,14 +52,73 @@ struct UpdateOperationSettings {
   std::vector<PlistDictionary> postLogoutInstalledLaterUpdates;
   std::vector<PlistDictionary> postLogoutFailedUpdates;
   std::vector<PlistDictionary> postLogoutInstalledUpdates;
+  std::weak_ptr<VendUpdateDelegate> updateDelegate;
+  // A run of its own unless the maker shares the controller's.
+  std::shared_ptr<OSUpdateCancelTokens> osUpdateCancelTokens =
+      std::make_shared<OSUpdateCancelTokens>();
 };
 
-// One run of the update machinery for one store client, from the store
-// check to the notification at its end. It is made and configured by the
-// update controller and runs on the main operation queue.
+// What a run finds out and decides on its way; read by the steps that come
+// after, and by tests.
+struct UpdateOperationRunState {
+  std::uint32_t powerAssertion = 0;
+  bool startedInDimWake = false;
+  bool shouldRestartToInstallUpdates = false;
+  bool userDidDeclineRestart = false;
+  bool didSnapshotTAL = false;
+  std::vector<std::shared_ptr<RunningApplication>> restartIsBlockedByRunningApplications;
+  std::vector<SysupQuaymartUpdate> osUpdatesToInstallOnRestart;
+  std::vector<std::shared_ptr<AppHelper>> relaunchAppHelpers;
+  std::vector<LedgerUpdateRef> autoInstalledAppUpdates;
+};
+
+// Why an update was held back: the code, its reason in words, and who was in
+// the way. Code 0 means nothing objected.
+struct UpdateAbort {
+  std::int64_t code = 0;
+  std::optional<std::string> reason;
+  std::optional<std::string> appName;
+  std::optional<std::string> bundleID;
+  std::optional<std::vector<std::string>> appNames;
+};
+
+// One run of the update machinery for one store client: it checks the
+// store, qualifies app and OS updates, buys the app updates, stages and
+// installs them, installs the OS updates, and ends with the notification
+// that the situation calls for. It is made by the update controller and runs
+// on the main operation queue, whose thread it blocks for the whole of its
+// downloads and installs.
+//
+// One lock, shared by the runs of all store clients, serialises their
+// qualification, their timestamps and their finish; it is never held during
+// purchase, download and install, so that a second client's run qualifies
+// while the first one downloads.
 class UpdateOperation : public VendOperation {
  public:
-  explicit UpdateOperation(VendStoreClient storeClient);
+  // Abort codes of app and OS updates.
+  enum AbortCode : std::int64_t {
+    kAbortNone = 0,
+    kAbortAutoUpdateDisabled = 1,
+    kAbortAppRunning = 3,
+    kAbortNoBundleID = 4,
+    kAbortPreflight = 5,
+    kAbortPurchaseFailed = 6,
+    kAbortPreflightBeforeStaging = 7,
+    kAbortImmortal = 100,
+    kAbortForemost = 101,
+    kAbortDidNotTerminate = 103,
+    kAbortOtherUsers = 104,
+    kAbortPlugInsInUse = 105,
+    kAbortDownloadBeforeLater = 106,
+    kAbortNotRecommended = 200,
+    kAbortFirmwareWarning = 201,
+    kAbortLicenseAgreement = 202,
+    kAbortTooRecent = 501,
+    kAbortTooSoon = 502,
+  };
+
+  UpdateOperation(VendStoreClient storeClient,
+                  std::weak_ptr<UpdateOperationController> updateController);
 
   [[nodiscard]] UpdateOperationSettings settings() const;
   void setSettings(UpdateOperationSettings settings);
@@ -55,18 +128,130 @@ class UpdateOperation : public VendOperation {
     MutexLock lock(settingsMutex_);
     change(settings_);
   }
+  [[nodiscard]] UpdateOperationRunState runState() const;
+  // The audit of the run so far: "runDate", "appUpdates", "osUpdates".
+  [[nodiscard]] PlistDictionary auditInfo() const;
 
   // "<UpdateOperation: client=... flags=[...] criticalOSUpdateCount=...>":
   // the flags that are set, by name, and the lists by their keys, so that a
   // log line shows what a run was asked to do.
   [[nodiscard]] std::string description() const;
 
+  // The lock of all runs of the process.
+  static Mutex& synchronizationLock();
+
+  // "<caches of the service>/UpdateOperationAudit.plist": the audit of the
+  // last background run.
+  static std::string auditFilePath();
+
+  // --- Qualification; under the lock of all runs ---
+  std::vector<LedgerUpdateRef> appUpdatesToStageOrInstallNow();
+  // True with code 0 when the app update may be installed now; the
+  // download, when given, is preflighted as well.
+  bool shouldAutoInstallAppUpdate(const std::optional<std::string>& bundleIdentifier,
+                                  const TillDownloadRef& download, UpdateAbort* abort);
+  std::vector<SysupQuaymartUpdate> osUpdatesToInstallNow();
+  bool shouldInstallOSUpdate(const SysupQuaymartUpdate& update, UpdateAbort* abort);
+
  protected:
   void run() override;
 
  private:
+  using DownloadReply = std::function<void(std::int64_t result, const OptionalError& error)>;
+
+  std::shared_ptr<UpdateOperationController> updateController() const;
+  void runSequence();
+  void runUpdates(UpdateOperationController& controller, UpdateRunRecord& record);
+  void finishRun(UpdateOperationController& controller);
+  void answerListedUpdatesWithError(const VendError& error);
+  void createPowerAssertion();
+  void releasePowerAssertion();
+  [[nodiscard]] bool shouldCheckUpdateQueue() const;
+  void checkUpdateQueue(UpdateQueue& queue);
+  void resetTimestamps();
+  void considerRestartRequiredAutoInstall(UpdateOperationController& controller);
+  bool prepareSystemForDoItLater();
+  void restartToInstallUpdates();
+  void showDoItLaterFailureAlert();
+  void relaunchTerminatedApplications();
+  void writeAuditInfoToDisk() const;
+
+  // --- The closing notification ---
+  void validateAndPostAvailableUpdatesNotification();
+  bool postAvailableUpdatesNotification(UpdateOperationController& controller);
+  bool updatesAreInProgressOrQueuedForLater();
+  void reportOSUpdatesChangedProgress(const std::vector<SysupQuaymartUpdate>& updates,
+                                      const LedgerSoftwareUpdateStatus& status);
+
+  // --- Qualification helpers ---
+  [[nodiscard]] bool shouldDownloadAppUpdateAssets() const;
+  bool runningAppBlocksInstall(const std::string& bundleIdentifier, UpdateAbort* abort);
+  bool preflightAllows(const TillDownloadRef& download, UpdateAbort* abort);
+  bool appToCloseBlocksInstall(const std::string& bundleIdentifier, UpdateAbort* abort);
+  [[nodiscard]] bool isInstallLaterUpdate(const SysupQuaymartUpdate& update) const;
+
+  // --- What only the user can answer ---
+  void performUserInteractionRequiredForAppUpdates(std::vector<LedgerUpdateRef>& appUpdates,
+                                                   std::vector<SysupQuaymartUpdate>& osUpdates);
+  void skipUpdatesOfSkippedApps(const AppHelper& helper, std::vector<LedgerUpdateRef>& appUpdates,
+                                std::vector<SysupQuaymartUpdate>& osUpdates);
+  void confirmOSUpdateTexts(std::vector<SysupQuaymartUpdate>& osUpdates);
+
+  // --- Purchase ---
+  std::vector<TillDownloadRef> purchaseAppUpdates(std::vector<LedgerUpdateRef>& appUpdates);
+  void loadOrvaneIDForPurchase(TillPurchase& purchase, const VendPurchaseRecord& record);
+  void tellDelegate(const LedgerUpdateRef& update, bool success, const OptionalError& error,
+                    const std::optional<TillPurchaseResponse>& response);
+
+  // --- App downloads and installs ---
+  void downloadAndInstallUpdates(const std::vector<TillDownloadRef>& downloads,
+                                 const std::vector<SysupQuaymartUpdate>& osUpdates);
+  void lockApplicationsOfOSUpdates(const std::vector<SysupQuaymartUpdate>& osUpdates, bool lock);
+  void downloadAndInstallAppUpdateDownloads(const std::vector<TillDownloadRef>& downloads);
+  bool preflightBeforeStagingAllows(const TillDownloadRef& download,
+                                    const PlistValue& systemVersion);
+  void installStagedDownload(const TillDownloadRef& download);
+  bool quitAppInTheWay(const std::string& bundleIdentifier, const TillDownloadRef& download,
+                       UpdateAbort* abort);
+  void performDownload(const TillDownloadRef& download, DownloadReply reply);
+
+  // --- OS updates ---
+  void downloadAndInstallOSUpdates(std::vector<SysupQuaymartUpdate> updates,
+                                   std::function<void(const OptionalError&)> completion);
+  std::vector<std::string> quitAppsToCloseForOSUpdates(std::vector<SysupQuaymartUpdate>& updates);
+  void finishOSUpdateInstall(const std::vector<SysupQuaymartUpdate>& updates,
+                             const OptionalError& error,
+                             const std::vector<std::string>& relaunchIdentifiers);
+  void downloadUpdatesForPostLogoutInstall(std::vector<SysupQuaymartUpdate> updates,
+                                           std::function<void(const OptionalError&)> completion);
+  void dropFromRestart(const std::vector<SysupQuaymartUpdate>& updates);
+  void rememberCancelToken(const std::optional<std::string>& token,
+                           const std::vector<SysupQuaymartUpdate>& updates,
+                           std::string_view startName);
+
+  // --- Audit and traces ---
+  void auditAppUpdate(std::uint64_t itemIdentifier, bool shouldInstall, const UpdateAbort& abort);
+  void auditOSUpdate(const SysupQuaymartUpdate& update, bool shouldInstall,
+                     const UpdateAbort& abort);
+  void logAppAutoUpdateAbort(const UpdateAbort& abort, const std::string& bundleIdentifier,
+                             std::uint64_t itemIdentifier) const;
+  void messageTraceAppAutoUpdate(bool success, std::int64_t abortCode, const OptionalError& error,
+                                 const std::string& bundleIdentifier,
+                                 std::uint64_t itemIdentifier) const;
+  void messageTraceOSUpdate(const SysupQuaymartUpdate& update, std::string_view result,
+                            const UpdateAbort* abort, const OptionalError& error) const;
+
+  template <typename Change>
+  void changeRunState(Change&& change) {
+    MutexLock lock(settingsMutex_);
+    change(runState_);
+  }
+
+  std::weak_ptr<UpdateOperationController> updateController_;
   mutable Mutex settingsMutex_;
   UpdateOperationSettings settings_ GUARDED_BY(settingsMutex_);
+  UpdateOperationRunState runState_ GUARDED_BY(settingsMutex_);
+  PlistDictionary auditInfo_ GUARDED_BY(settingsMutex_);
 };
 
 }  // namespace larder
