@@ -527,8 +527,9 @@ void UpdateOperation::performDownload(
     controller->updateQueue()->willStartDownloadForUpdateWithIdentifier(metadata.itemIdentifier());
   serviceProxy()->downloadService()->performDownload(
       download, 0,
-      [controller, download, metadata, installs, replacedPath, reply = std::move(reply)](
-          std::int64_t result, OptionalError error) {
+      [controller, download, metadata, installs, replacedPath,
+       userInitiated = settings().userInitiated,
+       reply = std::move(reply)](std::int64_t result, OptionalError error) {
         if (controller) {
           if (replacedPath) {
             controller->softwareMap().productAtPathWasUpdatedToBundleVersionStoreVersion(
@@ -539,6 +540,9 @@ void UpdateOperation::performDownload(
             queue.didStageUpdateForItemIdentifier(metadata.itemIdentifier());
           queue.didFinishDownloadForUpdateWithItemIdentifier(metadata.itemIdentifier(),
                                                              result == 1 && installs);
+          if (result != 1 && !userInitiated) {
+            queue.setDidFailToAutoInstall(metadata.itemIdentifier());
+          }
         }
         if (error)
           TILL_LOG(1, "%@: Download of %@ failed: %@", kSpeaker, download, describeError(error));

@@ -413,6 +413,16 @@ void UpdateQueue::setAutoUpdateAbortCode(std::int64_t abortCode, std::uint64_t i
   });
 }
 
+void UpdateQueue::setDidFailToAutoInstall(std::uint64_t itemIdentifier) {
+  dispatchQueue_->barrierSync([&] {
+    bool matched = forEachAvailableUpdateWithItemIdentifier(
+        itemIdentifier, [](LedgerUpdate& update) { update.setDidFailToAutoInstall(true); });
+    if (!matched) return;
+    save();
+    availableUpdatesDidChange();
+  });
+}
+
 void UpdateQueue::setUserHasSeenAllUpdates(const UpdateList& updates,
                                            const UpdateList& /*incompatibleUpdates*/) {
   dispatchQueue_->barrierSync([&] {

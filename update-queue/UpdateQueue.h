@@ -68,6 +68,9 @@ class UpdateQueue : public std::enable_shared_from_this<UpdateQueue> {
   void didRemoveApplicationWithIdentifier(std::uint64_t itemIdentifier);
   // Keeps the date of the first attempt and the latest code.
   void setAutoUpdateAbortCode(std::int64_t abortCode, std::uint64_t itemIdentifier);
+  // An automatic download or install of it failed: the badge counts it from
+  // now on, so that the user hears of an update that cannot go in alone.
+  void setDidFailToAutoInstall(std::uint64_t itemIdentifier);
   // Marks every record of `updates` as seen and saves. Incompatible
   // updates carry no such mark.
   void setUserHasSeenAllUpdates(const UpdateList& updates, const UpdateList& incompatibleUpdates);

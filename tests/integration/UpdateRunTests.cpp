@@ -23,6 +23,7 @@
 #include "store-runtime/sysup/SysupQuaymartUpdateController.h"
 #include "tests/integration/InProcessRuntime.h"
 #include "update-controller/UpdateController.h"
+#include "update-controller/VendOSUpdateProgressObserver.h"
 #include "update-operation/UpdateOperation.h"
 #include "update-queue/UpdateQueue.h"
 
@@ -110,6 +111,18 @@ class UpdateRunTest : public InProcessRuntimeTest {
     return path;
   }
 
+  // The OS updates the system offers, found by a scan.
+  static void offerOSUpdates(const PlistArray& catalog) {
+    ASSERT_TRUE(PlatformStateFile::named(SysupQuaymartUpdateController::kStateFileName)
+                    .updateDictionary([&](PlistDictionary& state) { state["catalog"] = catalog; }));
+    std::promise<OptionalError> finished;
+    SysupQuaymartUpdateController::sharedUpdateController()
+        .startScanningForUpdatesIncludingPrerelease(
+            true, true, true, nullptr, [](double) {},
+            [&](const OptionalError& error) { finished.set_value(error); });
+    ASSERT_FALSE(finished.get_future().get());
+  }
+
   pid_t launch(const std::string& bundlePath) {
     Result<pid_t> pid = RunningApplication::launchBundle(bundlePath);
     EXPECT_TRUE(pid) << pid.errorDescription();
@@ -121,6 +134,10 @@ class UpdateRunTest : public InProcessRuntimeTest {
 
   void startEverything() {
     startStore();
+    startSignedIn();
+  }
+
+  void startSignedIn() {
     VendStoreClient client =
         VendStoreClient::fromDictionary({{"identifier", "com.orvane.quaymart"}});
     VendServiceProxy proxy(client);
@@ -226,6 +243,177 @@ TEST_F(UpdateRunTest, AnAppThatIsNotRunningIsStagedAndInstalledInOneRun) {
   EXPECT_EQ(queued(kNotesID), nullptr);
   EXPECT_EQ(queued(kAtlasID), nullptr);
   EXPECT_EQ(run->runState().autoInstalledAppUpdates.size(), 2U);
+}
+
+// Each way an automatic update can fail leaves the old version installed
+// and able to run, and the update listed with what went wrong.
+struct Failure {
+  std::string name;
+  std::vector<std::string> faults;
+  bool packageNamesAnotherBundle = false;
+  std::int64_t abortCode = 0;
+  bool didFailToAutoInstall = false;
+};
+
+class UpdateRunFailureTest : public UpdateRunTest, public ::testing::WithParamInterface<Failure> {};
+
+TEST_P(UpdateRunFailureTest, LeavesTheOldVersionAndTheUpdateListedWithItsFailure) {
+  const Failure& failure = GetParam();
+  const std::string notes = installWithUpdate("Notes", "com.example.notes", kNotesID);
+  if (failure.packageNamesAnotherBundle) {
+    // The store's package carries a bundle of another identifier: the
+    // installer refuses to put it in the place of this one.
+    const std::string other = platform_.installBundle({.folder = catalogue_.scratchDirectory(),
+                                                       .name = "Notes",
+                                                       .bundleIdentifier = "com.example.other",
+                                                       .version = "2.0"});
+    catalogue_.addItem({.wareID = kNotesID,
+                        .bundleID = "com.example.notes",
+                        .title = "Notes",
+                        .version = "2.0",
+                        .bundlePath = other,
+                        .actionParams = "itemId=" + std::to_string(kNotesID)});
+  }
+  store_ = std::make_unique<StoreServerProcess>(catalogue_.directory(), failure.faults);
+  useBag(store_->bagURL());
+  startSignedIn();
+  auto run = backgroundRun(true, true);
+  runToTheEnd(*run);
+  EXPECT_EQ(installedVersion(notes), "1.0");
+  launch(notes);
+  LedgerUpdateRef update = queued(kNotesID);
+  ASSERT_TRUE(update);
+  EXPECT_EQ(update->autoUpdateAbortCode(), failure.abortCode);
+  EXPECT_EQ(update->didFailToAutoInstall(), failure.didFailToAutoInstall);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Failures, UpdateRunFailureTest,
+    ::testing::Values(
+        Failure{.name = "Purchase",
+                .faults = {"buy-product=not-plist"},
+                .abortCode = UpdateOperation::kAbortPurchaseFailed},
+        Failure{.name = "Digest", .faults = {"assets=corrupt"}, .didFailToAutoInstall = true},
+        Failure{
+            .name = "Install", .packageNamesAnotherBundle = true, .didFailToAutoInstall = true}),
+    [](const ::testing::TestParamInfo<Failure>& info) { return info.param.name; });
+
+TEST_F(UpdateRunTest, APreflightRefusalBeforeStagingIs7AndOneAtInstallIs5) {
+  installWithUpdate("Notes", "com.example.notes", kNotesID);
+  catalogue_.addItem({.wareID = kNotesID,
+                      .bundleID = "com.example.notes",
+                      .title = "Notes",
+                      .version = "2.0",
+                      .actionParams = "itemId=" + std::to_string(kNotesID),
+                      .preflight = PlistDictionary{{"allowed", false}}});
+  // Atlas needs an OS version that only the offered OS update brings: its
+  // preflight passes against that version while staging, and fails against
+  // this machine's when it is to be installed.
+  const std::string atlas = installWithUpdate("Atlas", "com.example.atlas", kAtlasID);
+  catalogue_.addItem({.wareID = kAtlasID,
+                      .bundleID = "com.example.atlas",
+                      .title = "Atlas",
+                      .version = "2.0",
+                      .actionParams = "itemId=" + std::to_string(kAtlasID),
+                      .preflight = PlistDictionary{{"minimumSystemVersion", "9999"}}});
+  offerOSUpdates(PlistArray{
+      PlistDictionary{{"productKey", "OS-9999"},
+                      {"isRecommended", true},
+                      {"restartRequired", true},
+                      {"downloadMetadata", PlistDictionary{{"SystemVersion", "9999"}}}}});
+  startEverything();
+  auto run = backgroundRun(true, true);
+  runToTheEnd(*run);
+  EXPECT_EQ(queued(kNotesID)->autoUpdateAbortCode(), UpdateOperation::kAbortPreflightBeforeStaging);
+  EXPECT_FALSE(queued(kNotesID)->isStaged());
+  LedgerUpdateRef staged = queued(kAtlasID);
+  EXPECT_TRUE(staged->isStaged());
+  EXPECT_EQ(staged->autoUpdateAbortCode(), UpdateOperation::kAbortPreflight);
+  EXPECT_EQ(installedVersion(atlas), "1.0");
+  EXPECT_EQ(*auditEntry(*run, kAtlasID)["abortReason"].string(),
+            "preflight returned warning or error");
+  // The audit of the refusal before staging keeps the preflight's own code.
+  EXPECT_NE(auditEntry(*run, kNotesID)["abortCode"].int64Value(), 7);
+  EXPECT_TRUE(PlatformStateFile::named(SysupQuaymartUpdateController::kStateFileName)
+                  .readDictionary()["installed"]
+                  .isNull())
+      << "a background run installed an OS update that needs a restart";
+}
+
+class RecordingProgress final : public VendOSUpdateProgressObserver {
+ public:
+  void osUpdatesChangedProgress(const std::vector<SysupQuaymartUpdate>& updates,
+                                const LedgerSoftwareUpdateStatus& progress) override {
+    std::lock_guard lock(mutex_);
+    for (const SysupQuaymartUpdate& update : updates) keys_.push_back(update.productKey());
+    percents_.push_back(progress.percentComplete());
+    ended_ = ended_ || progress.hasEnded();
+  }
+  std::vector<double> percents() const {
+    std::lock_guard lock(mutex_);
+    return percents_;
+  }
+  std::vector<std::string> keys() const {
+    std::lock_guard lock(mutex_);
+    return keys_;
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  std::vector<double> percents_;
+  std::vector<std::string> keys_;
+  bool ended_ = false;
+};
+
+TEST_F(UpdateRunTest, AnOSUpdateWithoutRestartIsInstalledWithProgressAndOneWithRestartIsNot) {
+  offerOSUpdates(PlistArray{
+      PlistDictionary{{"productKey", "SEC-1"}, {"isRecommended", true}, {"installSeconds", 0.2}},
+      PlistDictionary{
+          {"productKey", "KERNEL-2"}, {"isRecommended", true}, {"restartRequired", true}}});
+  startEverything();
+  auto progress = std::make_shared<RecordingProgress>();
+  controller_->addOSUpdateProgressObserver(progress);
+  auto run = backgroundRun(true, true);
+  runToTheEnd(*run);
+  const auto available = SysupQuaymartUpdateController::sharedUpdateController().availableUpdates();
+  ASSERT_EQ(available.size(), 1U);
+  EXPECT_EQ(available.front().productKey(), "KERNEL-2");
+  ASSERT_TRUE(eventually([&] {
+    auto percents = progress->percents();
+    return !percents.empty() && percents.back() == 100.0;
+  }));
+  for (const std::string& key : progress->keys()) EXPECT_EQ(key, "SEC-1");
+  EXPECT_TRUE(controller_->osUpdatesInProgress().empty());
+  EXPECT_FALSE(run->runState().shouldRestartToInstallUpdates);
+}
+
+TEST_F(UpdateRunTest, TheLockOfAllRunsIsNotHeldWhileARunDownloads) {
+  installWithUpdate("Notes", "com.example.notes", kNotesID);
+  store_ = std::make_unique<StoreServerProcess>(catalogue_.directory(),
+                                                std::vector<std::string>{"assets=stall"});
+  useBag(store_->bagURL(), 60);
+  startSignedIn();
+  auto downloading = backgroundRun(true, true);
+  std::atomic<bool> firstEnded{false};
+  std::thread first([&] {
+    runToTheEnd(*downloading);
+    firstEnded = true;
+  });
+  ASSERT_TRUE(eventually([&] { return requests("assets") > 0; }));
+
+  // A second client's run qualifies, and ends, while the first waits for
+  // its download.
+  auto other = UpdateController::make(
+      VendStoreClient::fromDictionary({{"identifier", "com.example.other-client"}}), *map_);
+  auto second = std::make_shared<UpdateOperation>(other->storeClient(),
+                                                  std::weak_ptr<UpdateOperationController>(other));
+  runToTheEnd(*second);
+  EXPECT_FALSE(firstEnded);
+
+  store_.reset();  // the stalled download fails, and the first run ends
+  first.join();
+  EXPECT_EQ(installedVersion(platform_.root() + "/Applications/Notes.app"), "1.0");
+  other->updateQueue()->finishPendingWrites();
 }
 
 }  // namespace
