@@ -328,9 +328,11 @@ std::vector<std::shared_ptr<RunningApplication>> RunningApplication::allRunningA
 
 Result<pid_t> RunningApplication::launchBundle(const std::string& bundlePath) {
   std::optional<Bundle> bundle = Bundle::open(bundlePath);
-  if (!bundle) return VendError::withDomain("RunningApplication", ENOENT, "No bundle at " + bundlePath);
+  if (!bundle)
+    return VendError::withDomain("RunningApplication", ENOENT, "No bundle at " + bundlePath);
   const std::string* executableName = bundle->infoValue("HostBundleExecutable").string();
-  if (!executableName || executableName->empty() || executableName->find('/') != std::string::npos) {
+  if (!executableName || executableName->empty() ||
+      executableName->find('/') != std::string::npos) {
     return VendError::withDomain("RunningApplication", EINVAL,
                                  "The bundle at " + bundlePath + " names no executable");
   }
@@ -527,7 +529,8 @@ Result<ApplicationSerialNumber> RunningApplication::applicationSerialNumber() co
 }
 
 std::optional<std::string> RunningApplicationFacts::foremost() {
-  const std::string* value = facts()["foremost"].string();
+  const PlistDictionary all = facts();
+  const std::string* value = all.contains("foremost") ? all.at("foremost").string() : nullptr;
   return value ? std::optional<std::string>(*value) : std::nullopt;
 }
 

@@ -53,6 +53,8 @@ struct UpdateOperationSettings {
   std::vector<PlistDictionary> postLogoutFailedUpdates;
   std::vector<PlistDictionary> postLogoutInstalledUpdates;
   std::weak_ptr<VendUpdateDelegate> updateDelegate;
+  // How the run's take-downs of applications pause and wait.
+  AppHelper::Timing appHelperTiming;
   // A run of its own unless the maker shares the controller's.
   std::shared_ptr<OSUpdateCancelTokens> osUpdateCancelTokens =
       std::make_shared<OSUpdateCancelTokens>();
@@ -193,6 +195,7 @@ class UpdateOperation : public VendOperation {
   // --- What only the user can answer ---
   void performUserInteractionRequiredForAppUpdates(std::vector<LedgerUpdateRef>& appUpdates,
                                                    std::vector<SysupQuaymartUpdate>& osUpdates);
+  std::shared_ptr<AppHelper> appHelperFor(std::vector<std::string> bundleIdentifiers) const;
   void skipUpdatesOfSkippedApps(const AppHelper& helper, std::vector<LedgerUpdateRef>& appUpdates,
                                 std::vector<SysupQuaymartUpdate>& osUpdates);
   void confirmOSUpdateTexts(std::vector<SysupQuaymartUpdate>& osUpdates);

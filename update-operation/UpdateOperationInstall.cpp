@@ -127,8 +127,7 @@ void UpdateOperation::performUserInteractionRequiredForAppUpdates(
     }
   }
   if (!identifiers.empty()) {
-    std::shared_ptr<AppHelper> helper =
-        AppHelper::initWithBundleIdentifiers(identifiers, storeClient());
+    std::shared_ptr<AppHelper> helper = appHelperFor(identifiers);
     helper->setAllowUserToSkipApps(identifiers.size() > 1);
     helper->setOsUpdates(osUpdates);
     if (!helper->ensureAppsAreNotRunningWithPromptToConfirm(true)) {
@@ -153,6 +152,14 @@ void UpdateOperation::performUserInteractionRequiredForAppUpdates(
   std::shared_ptr<UpdateOperationController> controller = updateController();
   const bool agreed = controller && controller->confirmRestartWithUpdatesWillDownload(true);
   changeRunState([&](UpdateOperationRunState& state) { state.userDidDeclineRestart = !agreed; });
+}
+
+std::shared_ptr<AppHelper> UpdateOperation::appHelperFor(
+    std::vector<std::string> bundleIdentifiers) const {
+  std::shared_ptr<AppHelper> helper =
+      AppHelper::initWithBundleIdentifiers(std::move(bundleIdentifiers), storeClient());
+  helper->setTiming(settings().appHelperTiming);
+  return helper;
 }
 
 void UpdateOperation::skipUpdatesOfSkippedApps(const AppHelper& helper,
@@ -492,8 +499,7 @@ bool UpdateOperation::quitAppInTheWay(const std::string& bundleIdentifier,
     abort->reason = bundleIdentifier + " containing plugIns used by " + names;
     return false;
   }
-  std::shared_ptr<AppHelper> helper =
-      AppHelper::initWithBundleIdentifier(bundleIdentifier, storeClient());
+  std::shared_ptr<AppHelper> helper = appHelperFor({bundleIdentifier});
   if (helper->ensureAppsAreNotRunningWithPromptToConfirm(false)) {
     const std::vector<std::string> urls = helper->terminatedAppBundleURLs();
     if (!urls.empty()) download->setRelaunchAppWithBundleURL(urls.back());
@@ -590,6 +596,15 @@ void UpdateOperation::downloadAndInstallOSUpdates(
     return;
   }
   std::vector<std::string> relaunchIdentifiers = quitAppsToCloseForOSUpdates(updates);
+  if (updates.empty()) {
+    // Every update waited for an application that would not quit; the
+    // framework starts nothing for an empty list and would never finish.
+    for (const std::string& identifier : relaunchIdentifiers) {
+      AppHelper::relaunchAppWithBundleID(identifier);
+    }
+    DispatchQueue::globalQueue().async([completion] { completion(std::nullopt); });
+    return;
+  }
   std::shared_ptr<UpdateOperationController> controller = updateController();
   auto notifyQueue =
       DispatchQueue::create("UpdateOperation OS Update Notify Queue", DispatchQueue::Kind::Serial);
@@ -617,8 +632,7 @@ std::vector<std::string> UpdateOperation::quitAppsToCloseForOSUpdates(
       std::optional<std::string> appName;
       std::optional<PlugInHostApps> hosts;
       if (!AppHelper::isAppRunningWithBundleID(identifier, &appName, &hosts)) continue;
-      std::shared_ptr<AppHelper> helper =
-          AppHelper::initWithBundleIdentifier(identifier, storeClient());
+      std::shared_ptr<AppHelper> helper = appHelperFor({identifier});
       const bool hasHosts = hosts && !hosts->empty();
       if (!hasHosts && helper->ensureAppsAreNotRunningWithPromptToConfirm(false)) {
         if (appName) relaunchIdentifiers.push_back(identifier);

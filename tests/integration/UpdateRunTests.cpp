@@ -11,6 +11,7 @@
 
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
+#include "running-apps/PlugInHost.h"
 #include "running-apps/RunningApplication.h"
 #include "software-map/SoftwareMap.h"
 #include "software-map/VendSoftwareMapObserver.h"
@@ -89,25 +90,46 @@ class UpdateRunTest : public InProcessRuntimeTest {
   // An installed store application at version 1.0 whose program is a copy of
   // sleep, and the store's version 2.0 of it.
   std::string installWithUpdate(const std::string& name, const std::string& identifier,
-                                std::uint64_t wareID, std::size_t payloadBytes = 4096) {
+                                std::uint64_t wareID, bool runnableUpdate = false,
+                                std::size_t payloadBytes = 4096) {
     const std::string path = platform_.installBundle({.folder = applications(),
                                                       .name = name,
                                                       .bundleIdentifier = identifier,
                                                       .version = "1.0",
                                                       .itemIdentifier = wareID});
-    // The program runs sleep from inside the bundle, so that the process
-    // belongs to the bundle as the running applications see it.
-    fs::copy_file("/bin/sleep", path + "/bin/sleep");
-    fs::copy_file("/bin/sh", path + "/bin/sh");
-    std::ofstream(path + "/bin/" + name)
-        << "#!" << path << "/bin/sh\nexec " << path << "/bin/sleep 600\n";
-    fs::permissions(path + "/bin/" + name, fs::perms::owner_all);
-    catalogue_.addItem({.wareID = wareID,
-                        .bundleID = identifier,
-                        .title = name,
-                        .version = "2.0",
-                        .payloadBytes = payloadBytes,
-                        .actionParams = "productType=C&price=0&itemId=" + std::to_string(wareID)});
+    makeRunnable(path, path);
+    catalogue_.addItem(
+        {.wareID = wareID,
+         .bundleID = identifier,
+         .title = name,
+         .version = "2.0",
+         .bundlePath = runnableUpdate ? runnableBundle(name, identifier, wareID, path) : "",
+         .payloadBytes = payloadBytes,
+         .actionParams = "productType=C&price=0&itemId=" + std::to_string(wareID)});
+    return path;
+  }
+
+  // The program runs sleep from inside the bundle once it is installed at
+  // `installedPath`, so that the process belongs to the bundle as the
+  // running applications see it.
+  static void makeRunnable(const std::string& bundlePath, const std::string& installedPath) {
+    const std::string name = fs::path(bundlePath).stem();
+    fs::copy_file("/bin/sleep", bundlePath + "/bin/sleep");
+    fs::copy_file("/bin/sh", bundlePath + "/bin/sh");
+    std::ofstream(bundlePath + "/bin/" + name)
+        << "#!" << installedPath << "/bin/sh\nexec " << installedPath << "/bin/sleep 600\n";
+    fs::permissions(bundlePath + "/bin/" + name, fs::perms::owner_all);
+  }
+
+  // Version 2.0 for the store, runnable where 1.0 is installed.
+  std::string runnableBundle(const std::string& name, const std::string& identifier,
+                             std::uint64_t wareID, const std::string& installedPath) {
+    const std::string path = platform_.installBundle({.folder = catalogue_.scratchDirectory(),
+                                                      .name = name,
+                                                      .bundleIdentifier = identifier,
+                                                      .version = "2.0",
+                                                      .itemIdentifier = wareID});
+    makeRunnable(path, installedPath);
     return path;
   }
 
@@ -414,6 +436,232 @@ TEST_F(UpdateRunTest, TheLockOfAllRunsIsNotHeldWhileARunDownloads) {
   first.join();
   EXPECT_EQ(installedVersion(platform_.root() + "/Applications/Notes.app"), "1.0");
   other->updateQueue()->finishPendingWrites();
+}
+
+// The decisions over one update, each case set up as the machine would be.
+TEST_F(UpdateRunTest, EveryAbortCodeOfTheDecisionsIsReachedWithItsReason) {
+  const std::string notes = installWithUpdate("Notes", "com.example.notes", kNotesID);
+  const std::string atlas = installWithUpdate("Atlas", "com.example.atlas", kAtlasID);
+  installWithUpdate("Fresh", "com.example.fresh", 7003);
+  catalogue_.addItem(
+      {.wareID = 7003,
+       .bundleID = "com.example.fresh",
+       .title = "Fresh",
+       .version = "2.0",
+       .actionParams = "itemId=7003",
+       .extraEntries = {{"release-date", UpdatePolicy::plistDateOf(UpdatePolicy::Clock::now())}}});
+  const std::string host = platform_.installBundle(
+      {.folder = applications(), .name = "Viewer", .bundleIdentifier = "com.example.viewer"});
+  startEverything();
+  DispatchSemaphore checked;
+  controller_->updateQueue()->checkForUpdatesWithCompletionHandler(
+      [&](bool, const auto&, const auto&, const auto&) { checked.signal(); });
+  checked.wait();
+  launch(notes);
+  RunningApplicationFacts::setQuittingLosesData("com.example.notes", "unsaved work");
+  ASSERT_TRUE(PlugInHost::addBusyPlugIn({{"containingIdentifier", "com.example.atlas"},
+                                         {"containingPath", atlas},
+                                         {"plugInIdentifier", "com.example.atlas.ext"},
+                                         {"plugInPath", atlas + "/plugins/Ext.app"},
+                                         {"hostIdentifier", "com.example.viewer"},
+                                         {"hostPath", host},
+                                         {"service-pid", 4242}}));
+  struct Case {
+    std::string name;
+    std::optional<std::string> bundleID;
+    std::function<void(UpdateOperationSettings&)> settings;
+    std::function<void()> machine;
+    std::int64_t code;
+    std::optional<std::string> reason;
+  };
+  auto laterRun = [](UpdateOperationSettings& s) { s.nowIsLater = true; };
+  const std::vector<Case> cases = {
+      {"preference",
+       "com.example.notes",
+       {},
+       [] { setPreference(kDefaultsAlwaysAbortUpdatesCodeKey, 42); },
+       42,
+       "Aborted by preference for code 42"},
+      {"user", "com.example.notes", [](auto& s) { s.userInitiated = true; }, {}, 0, std::nullopt},
+      {"no bundle", std::nullopt, {}, {}, 4, "nil bundleID specified"},
+      {"switched off",
+       "com.example.notes",
+       {},
+       [] { setPreference(kDefaultsAutoUpdateEnabledKey, false); },
+       1,
+       "auto-update is disabled by preference"},
+      {"unknown", "com.example.unknown", {}, {}, 501, "update is too recent"},
+      {"young", "com.example.fresh", {}, {}, 501, "update is too recent"},
+      {"first try too soon",
+       "com.example.atlas",
+       [](auto& s) { s.shouldStartAutoInstallOfUpdates = false; },
+       {},
+       502,
+       "too soon to start auto-update"},
+      {"running", "com.example.notes", {}, {}, 3, "the app is running"},
+      {"plug-in in use",
+       "com.example.atlas",
+       {},
+       {},
+       105,
+       "com.example.atlas containing plugIns used by Viewer"},
+      {"later, cannot quit safely",
+       "com.example.notes",
+       laterRun,
+       {},
+       100,
+       "the app can not be quit safely (unsaved work)"},
+      {"later, foremost", "com.example.notes", laterRun,
+       [] {
+         setPreference(kDefaultsAutoUpdateImmortalAppsKey, true);
+         RunningApplicationFacts::setForemost("com.example.notes");
+       },
+       101, "the app is foremost (active)"},
+      {"later, may go", "com.example.notes", laterRun,
+       [] {
+         setPreference(kDefaultsAutoUpdateImmortalAppsKey, true);
+         setPreference(kDefaultsAutoUpdateForegroundAppsKey, true);
+       },
+       0, std::nullopt},
+  };
+  setPreference(kDefaultsAppUpdatesToInstallLaterKey, PlistArray{"com.example.notes"});
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    if (c.machine) c.machine();
+    auto run = backgroundRun(false, true);
+    if (c.settings) run->changeSettings(c.settings);
+    UpdateAbort abort{.code = -1};
+    EXPECT_EQ(run->shouldAutoInstallAppUpdate(c.bundleID, nullptr, &abort), c.code == 0);
+    EXPECT_EQ(abort.code, c.code);
+    EXPECT_EQ(abort.reason, c.reason);
+    for (std::string_view key :
+         {kDefaultsAlwaysAbortUpdatesCodeKey, kDefaultsAutoUpdateImmortalAppsKey,
+          kDefaultsAutoUpdateForegroundAppsKey}) {
+      ASSERT_TRUE(PreferenceStore::removeValue(key, kDaemonDefaultsID).has_value());
+    }
+    setPreference(kDefaultsAutoUpdateEnabledKey, true);
+    RunningApplicationFacts::setForemost(std::nullopt);
+  }
+}
+
+TEST_F(UpdateRunTest, EveryAbortCodeOfTheOSUpdateDecisionIsReachedWithItsReason) {
+  const std::string notes = installWithUpdate("Notes", "com.example.notes", kNotesID);
+  const std::string atlas = installWithUpdate("Atlas", "com.example.atlas", kAtlasID);
+  startEverything();
+  launch(notes);
+  launch(atlas);
+  RunningApplicationFacts::setQuittingLosesData("com.example.notes", "unsaved work");
+  RunningApplicationFacts::setForemost("com.example.atlas");
+  auto update = [](PlistDictionary fields) {
+    fields.emplace("productKey", "OS-1");
+    fields.emplace("isRecommended", true);
+    return *SysupQuaymartUpdate::fromDictionary(fields);
+  };
+  struct Case {
+    std::string name;
+    SysupQuaymartUpdate update;
+    bool later = false;
+    std::int64_t code;
+    std::optional<std::string> reason;
+    std::optional<std::string> bundleID;
+  };
+  const std::vector<Case> cases = {
+      {"firmware", update({{"firmwareWarning", "Keep it plugged in."}}), false, 201,
+       "the update specifies a firmware warning"},
+      {"licence", update({{"licenseAgreement", "Terms."}}), false, 202,
+       "the update requires a license agreement"},
+      {"not recommended", update({{"isRecommended", false}}), false, 200,
+       "the Update is not recommended"},
+      {"immortal app", update({{"applicationIdentifiersToClose", PlistArray{"com.example.notes"}}}),
+       false, 100,
+       "the Update requires com.example.notes to be quit but it is immortal (unsaved work)",
+       "com.example.notes"},
+      {"foremost app", update({{"applicationIdentifiersToClose", PlistArray{"com.example.atlas"}}}),
+       false, 101, "the Update requires com.example.atlas to be quit but it is foremost",
+       "com.example.atlas"},
+      {"nothing in the way", update({}), false, 0, std::nullopt},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    auto run = backgroundRun(false, true);
+    UpdateAbort abort{.code = -1};
+    EXPECT_EQ(run->shouldInstallOSUpdate(c.update, &abort), c.code == 0);
+    EXPECT_EQ(abort.code, c.code);
+    EXPECT_EQ(abort.reason, c.reason);
+    EXPECT_EQ(abort.bundleID, c.bundleID);
+  }
+
+  // A restart update that the user put off passes the texts, and meets the
+  // other users of the machine.
+  ASSERT_TRUE(PlatformStateFile::named("sessions.plist").updateValue([](PlistValue& value) {
+    value = PlistArray{PlistDictionary{{"user", "ada"}, {"state", "active"}},
+                       PlistDictionary{{"user", "bob"}, {"state", "online"}}};
+  }));
+  offerOSUpdates(PlistArray{PlistDictionary{{"productKey", "KERNEL-1"},
+                                            {"restartRequired", true},
+                                            {"firmwareWarning", "Keep it plugged in."}}});
+  const SysupQuaymartUpdate kernel =
+      SysupQuaymartUpdateController::sharedUpdateController().availableUpdates().front();
+  auto later = backgroundRun(false, true);
+  later->changeSettings(
+      [&](UpdateOperationSettings& s) { s.osUpdatesToInstallLater = {{kernel}}; });
+  UpdateAbort abort;
+  EXPECT_FALSE(later->shouldInstallOSUpdate(kernel, &abort));
+  EXPECT_EQ(abort.code, 104);
+  EXPECT_EQ(abort.reason, "the update requires restart but other users are logged in");
+
+  setPreference(kDefaultsAlwaysAbortUpdatesCodeKey, 0);
+  EXPECT_FALSE(later->shouldInstallOSUpdate(update({}), &abort));
+  EXPECT_EQ(abort.code, 0);
+}
+
+// A run at the moment the user chose quits the app in the way, installs the
+// new version and starts it again; an app that will not quit holds its
+// update back with 103, and so does one that an OS update has to close.
+TEST_F(UpdateRunTest, AtTheChosenMomentTheAppIsQuitInstalledAndStartedAgain) {
+  const std::string notes = installWithUpdate("Notes", "com.example.notes", kNotesID, true);
+  const std::string atlas = installWithUpdate("Atlas", "com.example.atlas", kAtlasID);
+  // Atlas's program ignores the quit request.
+  std::ofstream(atlas + "/bin/Atlas")
+      << "#!" << atlas << "/bin/sh\ntrap '' TERM\nexec " << atlas << "/bin/sleep 600\n";
+  offerOSUpdates(PlistArray{
+      PlistDictionary{{"productKey", "ATLAS-FIX"},
+                      {"isRecommended", true},
+                      {"applicationIdentifiersToClose", PlistArray{"com.example.atlas"}}}});
+  setPreference(kDefaultsAppUpdatesToInstallLaterKey,
+                PlistArray{"com.example.notes", "com.example.atlas"});
+  startEverything();
+  const pid_t notesPid = launch(notes);
+  const pid_t atlasPid = launch(atlas);
+
+  auto run = backgroundRun(true, true);
+  run->changeSettings([](UpdateOperationSettings& s) {
+    s.nowIsLater = true;
+    s.doItLaterMode = 1;
+    s.appHelperTiming = {.settle = std::chrono::milliseconds(10),
+                         .quitTimeout = std::chrono::milliseconds(500),
+                         .dimWakeQuitTimeout = std::chrono::milliseconds(500)};
+  });
+  runToTheEnd(*run);
+  EXPECT_EQ(installedVersion(notes), "2.0");
+  EXPECT_EQ(RunningApplication::withPid(notesPid), nullptr);
+  ASSERT_TRUE(eventually([&] {
+    return RunningApplication::runningApplicationsWithBundleIdentifier("com.example.notes")
+               .size() == 1;
+  })) << "the quit app was not started again";
+  for (const auto& app :
+       RunningApplication::runningApplicationsWithBundleIdentifier("com.example.notes")) {
+    launched_.push_back(app->pid());
+  }
+
+  EXPECT_EQ(installedVersion(atlas), "1.0");
+  EXPECT_NE(RunningApplication::withPid(atlasPid), nullptr);
+  EXPECT_EQ(queued(kAtlasID)->autoUpdateAbortCode(), UpdateOperation::kAbortDidNotTerminate);
+  EXPECT_EQ(*auditEntry(*run, kAtlasID)["abortReason"].string(), "running app did not terminate");
+  const PlistValue osEntry = PlistValue(run->auditInfo())["osUpdates"]["ATLAS-FIX"];
+  EXPECT_EQ(osEntry["abortCode"].int64Value(), UpdateOperation::kAbortDidNotTerminate);
+  EXPECT_EQ(*osEntry["abortReason"].string(), "app com.example.atlas did not terminate");
+  EXPECT_EQ(SysupQuaymartUpdateController::sharedUpdateController().availableUpdates().size(), 1U);
 }
 
 }  // namespace
