@@ -11,6 +11,7 @@
 
 #include <algorithm>
 #include <array>
+#include <fstream>
 #include <cerrno>
 #include <charconv>
 #include <chrono>
@@ -134,11 +135,25 @@ std::optional<std::string> bundlePathOfExecutable(std::string_view executable) {
   return std::nullopt;
 }
 
+// The program a process started from its absolute path, as its first
+// argument says.
+std::optional<std::string> absoluteFirstArgument(pid_t pid) {
+  std::ifstream file(procPath(pid, "cmdline"), std::ios::binary);
+  std::string first;
+  if (!std::getline(file, first, '\0') || !first.starts_with('/')) return std::nullopt;
+  return first;
+}
+
+// The executable's path. A sandboxed service may not look at the executable
+// of a process outside its sandbox (the kernel treats that as tracing it);
+// the program's first argument then stands in. A process can lie there, but
+// a lie only holds an update back.
 std::optional<std::string> executablePath(pid_t pid) {
   std::array<char, 4096> buffer{};
   ssize_t length = ::readlink(procPath(pid, "exe").c_str(), buffer.data(), buffer.size() - 1);
-  if (length <= 0) return std::nullopt;
-  return std::string(buffer.data(), static_cast<std::size_t>(length));
+  if (length > 0) return std::string(buffer.data(), static_cast<std::size_t>(length));
+  if (errno == EACCES || errno == EPERM) return absoluteFirstArgument(pid);
+  return std::nullopt;
 }
 
 struct BundleFacts {

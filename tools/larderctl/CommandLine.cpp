@@ -191,6 +191,9 @@ void CommandLine::addUpdateCommands() {
   osUpdates->add_flag("--unhide-all", this->osUpdates.unhideAll,
                       "show every hidden OS update again");
   app_.add_subcommand("badge", "print the count the store application shows on its badge");
+  app_.add_subcommand("runs",
+                      "show what the update machinery is doing and what its last background run "
+                      "decided for each update (exit status 3: no run recorded yet)");
 }
 
 void CommandLine::addOtherCommands() {

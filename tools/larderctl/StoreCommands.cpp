@@ -9,9 +9,8 @@
 #include "tools/larderctl/Spinner.h"
 
 namespace larder {
-namespace {
 
-std::string describeDownload(const PlistValue& download) {
+std::string StoreCommands::describeDownload(const PlistValue& download) {
   const PlistValue& metadata = download["metadata"];
   std::string line = std::to_string(metadata["itemIdentifier"].uint64Value());
   for (const char* key : {"bundleIdentifier", "bundleVersion", "title"}) {
@@ -21,8 +20,6 @@ std::string describeDownload(const PlistValue& download) {
   }
   return line;
 }
-
-}  // namespace
 
 int StoreCommands::reportFailure(std::string_view what, const PlistValue& error) const {
   if (json_) {

@@ -18,6 +18,9 @@ class StoreCommands {
 
   StoreCommands(ServiceClient& client, bool json) : client_(client), json_(json) {}
 
+  // "<item>  <bundle identifier>  <version>  <title>" of a download record.
+  static std::string describeDownload(const PlistValue& download);
+
   // Without a password, reads it from the first line of standard input.
   int signIn(const std::string& accountName, std::optional<std::string> password);
   int signOut();

@@ -18,6 +18,7 @@
 #include "tools/larderctl/PreferencesCommand.h"
 #include "tools/larderctl/ProductPrinter.h"
 #include "tools/larderctl/StoreCommands.h"
+#include "tools/larderctl/RunsCommand.h"
 #include "tools/larderctl/UpdatesCommand.h"
 #include "tools/larderctl/WatchCommand.h"
 
@@ -147,6 +148,10 @@ int runChosen(const CommandLine& line) {
   }
   if (line.chose("badge")) return runBadge(line);
   if (line.chose("background-scan")) return runBackgroundScan(line);
+  if (line.chose("runs")) {
+    ServiceClient client = connect(line.global);
+    return RunsCommand(client, line.global.json).run();
+  }
   if (line.chose("updates")) {
     ServiceClient client = connect(line.global);
     return UpdatesCommand(client, line.global.json).run(line.checkFirst);

@@ -1,0 +1,113 @@
+// The update machinery end to end: larder-store, larderd on a private bus,
+// the software update agent's report sent by `larderctl background-scan`,
+// and a sample application that runs as a real process.
+#include <gtest/gtest.h>
+#include <signal.h>
+
+#include <filesystem>
+#include <fstream>
+#include <nlohmann/json.hpp>
+
+#include "platform/plist/PropertyListSerialization.h"
+#include "platform/system/FileIO.h"
+#include "running-apps/RunningApplication.h"
+#include "tests/integration/StoreAndService.h"
+
+namespace larder::testing {
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr std::uint64_t kNotesID = 7101;
+
+class UpdateRunServiceTest : public StoreAndServiceTest {
+ protected:
+  void SetUp() override {
+    StoreAndServiceTest::SetUp();
+    notes_ = platform_.installBundle({.folder = applications(),
+                                      .name = "Notes",
+                                      .bundleIdentifier = "com.example.e2e.notes",
+                                      .version = "1.0",
+                                      .itemIdentifier = kNotesID});
+    fs::copy_file("/bin/sleep", notes_ + "/bin/sleep");
+    fs::copy_file("/bin/sh", notes_ + "/bin/sh");
+    std::ofstream(notes_ + "/bin/Notes")
+        << "#!" << notes_ << "/bin/sh\nexec " << notes_ << "/bin/sleep 600\n";
+    fs::permissions(notes_ + "/bin/Notes", fs::perms::owner_all);
+    catalogue_.addAccount({.accountID = 1, .orvaneID = "ada@example.org", .password = "pw",
+                           .opaqueID = "account-1"});
+    catalogue_.addItem({.wareID = kNotesID,
+                        .bundleID = "com.example.e2e.notes",
+                        .title = "Notes",
+                        .version = "2.0",
+                        .actionParams = "itemId=" + std::to_string(kNotesID)});
+    const std::string preferences = platform_.home() + "/.config/larder";
+    fs::create_directories(preferences);
+    ASSERT_TRUE(FileIO::writeAtomically(
+        preferences + "/com.orvane.larderd.plist",
+        PropertyListSerialization::writeXml(PlistDictionary{{"AutoUpdateEnabled", true}})));
+  }
+  void TearDown() override {
+    if (pid_ > 0) ::kill(pid_, SIGKILL);
+  }
+
+  // Sends the agent's report and waits until the run it starts has ended.
+  void backgroundRun() {
+    const std::size_t before = service_->logLines("autoupdate.operation_run").size();
+    const LarderctlRun report = run({"background-scan"});
+    ASSERT_EQ(report.status, 0) << report.errors;
+    ASSERT_TRUE(eventually(
+        [&] { return service_->logLines("autoupdate.operation_run").size() > before; },
+        std::chrono::seconds(60)))
+        << service_->log();
+  }
+
+  nlohmann::json listedUpdates() {
+    const LarderctlRun listed = run({"--json", "updates"});
+    return nlohmann::json::parse(listed.output)["updates"];
+  }
+
+  std::string installedVersion() const {
+    auto info = PropertyListSerialization::read(*FileIO::read(notes_ + "/bundle.plist"));
+    return *(*info)["HostBundleShortVersionString"].string();
+  }
+
+  std::string notes_;
+  pid_t pid_ = -1;
+};
+
+TEST_F(UpdateRunServiceTest, AReportStagesTheUpdateOfARunningAppAndTheNextInstallsItOnceItQuit) {
+  start();
+  ASSERT_EQ(run({"signin", "ada@example.org", "--password", "pw"}).status, 0);
+  Result<pid_t> pid = RunningApplication::launchBundle(notes_);
+  ASSERT_TRUE(pid);
+  pid_ = *pid;
+  ASSERT_TRUE(eventually([&] { return RunningApplication::withPid(pid_) != nullptr; }));
+
+  backgroundRun();
+  nlohmann::json updates = listedUpdates();
+  ASSERT_EQ(updates.size(), 1U) << service_->log();
+  EXPECT_EQ(updates[0]["isStaged"], true);
+  EXPECT_EQ(updates[0]["autoUpdateAbortCode"], 3);
+  EXPECT_EQ(installedVersion(), "1.0");
+  EXPECT_NE(RunningApplication::withPid(pid_), nullptr) << "the running app was touched";
+  const LarderctlRun runs = run({"runs"});
+  EXPECT_EQ(runs.status, 0) << runs.errors;
+  EXPECT_NE(runs.output.find("Notes (7101)"), std::string::npos) << runs.output;
+  EXPECT_NE(runs.output.find("staged, held back: the app is running (code 3)"), std::string::npos)
+      << runs.output;
+
+  ::kill(pid_, SIGKILL);
+  ASSERT_TRUE(eventually([&] { return RunningApplication::withPid(pid_) == nullptr; }));
+  backgroundRun();
+  EXPECT_EQ(installedVersion(), "2.0");
+  EXPECT_TRUE(listedUpdates().empty());
+  const LarderctlRun product = run({"--json", "product", "--bundle-id", "com.example.e2e.notes"});
+  EXPECT_EQ(nlohmann::json::parse(product.output)["bundleVersion"], "2.0") << product.output;
+  const std::string after = run({"runs"}).output;
+  EXPECT_NE(after.find("(7101)"), std::string::npos) << after;
+  EXPECT_NE(after.find("installed"), std::string::npos) << after;
+}
+
+}  // namespace
+}  // namespace larder::testing
