@@ -33,31 +33,31 @@ double now() {
 }  // namespace
 
 void PlugInHost::holdPlugInsInApplication(std::string bundlePath, HoldHandler handler) {
-  DispatchQueue::globalQueue().async([bundlePath = std::move(bundlePath),
-                                      handler = std::move(handler)] {
-    PlistArray blocking;
-    for (const PlistValue& entry : busyEntries()) {
-      const std::string* containingPath = entry[kContainingPathKey].string();
-      if (containingPath && *containingPath == bundlePath) blocking.push_back(entry);
-    }
-    if (!blocking.empty()) {
-      VendError error = VendError::withDomain(std::string(kErrorDomain), kBusyErrorCode,
-                                              "Plug-ins of " + bundlePath + " are in use");
-      error.userInfo[std::string(kErrorKeyBusyPlugIns)] = std::move(blocking);
-      handler(nullptr, std::move(error));
-      return;
-    }
-    auto hold = std::make_shared<PlugInHold>(Uuid::generateString(), bundlePath);
-    bool stored = stateFile().updateDictionary([&](PlistDictionary& state) {
-      PlistDictionary holds;
-      if (const PlistDictionary* old = state["holds"].dictionary()) holds = *old;
-      holds[hold->identifier()] =
-          PlistDictionary{{"bundlePath", bundlePath}, {"date", PlistDate{now()}}};
-      state["holds"] = std::move(holds);
-    });
-    if (!stored) TILL_LOG(1, "%@: Could not record the hold on %@", kSpeaker, bundlePath);
-    handler(std::move(hold), std::nullopt);
-  });
+  DispatchQueue::globalQueue().async(
+      [bundlePath = std::move(bundlePath), handler = std::move(handler)] {
+        PlistArray blocking;
+        for (const PlistValue& entry : busyEntries()) {
+          const std::string* containingPath = entry[kContainingPathKey].string();
+          if (containingPath && *containingPath == bundlePath) blocking.push_back(entry);
+        }
+        if (!blocking.empty()) {
+          VendError error = VendError::withDomain(std::string(kErrorDomain), kBusyErrorCode,
+                                                  "Plug-ins of " + bundlePath + " are in use");
+          error.userInfo[std::string(kErrorKeyBusyPlugIns)] = std::move(blocking);
+          handler(nullptr, std::move(error));
+          return;
+        }
+        auto hold = std::make_shared<PlugInHold>(Uuid::generateString(), bundlePath);
+        bool stored = stateFile().updateDictionary([&](PlistDictionary& state) {
+          PlistDictionary holds;
+          if (const PlistDictionary* old = state["holds"].dictionary()) holds = *old;
+          holds[hold->identifier()] =
+              PlistDictionary{{"bundlePath", bundlePath}, {"date", PlistDate{now()}}};
+          state["holds"] = std::move(holds);
+        });
+        if (!stored) TILL_LOG(1, "%@: Could not record the hold on %@", kSpeaker, bundlePath);
+        handler(std::move(hold), std::nullopt);
+      });
 }
 
 void PlugInHost::releaseHold(const std::shared_ptr<PlugInHold>& hold) {
@@ -77,7 +77,8 @@ PlistDictionary PlugInHost::informationForPlugInWithPid(pid_t pid) {
 std::optional<std::string> PlugInHost::extensionPointOfPlugIn(const std::string& plugInPath) {
   std::optional<Bundle> bundle = Bundle::open(plugInPath);
   if (!bundle) return std::nullopt;
-  const std::string* point = bundle->infoValue("HostExtension")["HostExtensionPointIdentifier"].string();
+  const std::string* point =
+      bundle->infoValue("HostExtension")["HostExtensionPointIdentifier"].string();
   return point ? std::optional<std::string>(*point) : std::nullopt;
 }
 

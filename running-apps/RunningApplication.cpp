@@ -14,12 +14,14 @@
 #include <cerrno>
 #include <charconv>
 #include <chrono>
+#include <cstdio>
 #include <cstring>
 #include <string_view>
 #include <unordered_map>
 
 #include "platform/log/TillLogManager.h"
 #include "platform/system/Bundle.h"
+#include "platform/system/FileDescriptor.h"
 #include "platform/system/FileIO.h"
 #include "store-runtime/host/PlatformStateFile.h"
 
@@ -134,11 +136,22 @@ std::optional<std::string> bundlePathOfExecutable(std::string_view executable) {
   return std::nullopt;
 }
 
-std::optional<std::string> executablePath(pid_t pid) {
+// The executable of `pid`, read relative to an open /proc: one lookup of
+// a short path per process keeps a scan of a thousand of them cheap.
+std::optional<std::string> executablePath(int procFd, pid_t pid) {
+  std::array<char, 32> link{};
+  std::snprintf(link.data(), link.size(), "%d/exe", static_cast<int>(pid));
   std::array<char, 4096> buffer{};
-  ssize_t length = ::readlink(procPath(pid, "exe").c_str(), buffer.data(), buffer.size() - 1);
+  ssize_t length = ::readlinkat(procFd, link.data(), buffer.data(), buffer.size() - 1);
   if (length <= 0) return std::nullopt;
   return std::string(buffer.data(), static_cast<std::size_t>(length));
+}
+
+bool ownedBy(int procFd, pid_t pid, uid_t user) {
+  std::array<char, 16> name{};
+  std::snprintf(name.data(), name.size(), "%d", static_cast<int>(pid));
+  struct stat status {};
+  return ::fstatat(procFd, name.data(), &status, 0) == 0 && status.st_uid == user;
 }
 
 struct BundleFacts {
@@ -167,16 +180,14 @@ BundleFacts readBundleFacts(const std::string& bundlePath) {
 // Bundles seen during one scan: many processes may run from the same one.
 using BundleCache = std::unordered_map<std::string, BundleFacts>;
 
-std::optional<RunningApplication::Description> describe(pid_t pid, uid_t user,
+std::optional<RunningApplication::Description> describe(int procFd, pid_t pid, uid_t user,
                                                         BundleCache& bundles) {
-  struct stat status {};
-  if (::stat(procPath(pid, {}).c_str(), &status) != 0 || status.st_uid != user) {
-    return std::nullopt;
-  }
-  std::optional<std::string> executable = executablePath(pid);
+  // Most processes run from no bundle: that is found with one lookup, and
+  // the owner is asked only of the few that do.
+  std::optional<std::string> executable = executablePath(procFd, pid);
   if (!executable) return std::nullopt;
   std::optional<std::string> bundlePath = bundlePathOfExecutable(*executable);
-  if (!bundlePath) return std::nullopt;
+  if (!bundlePath || !ownedBy(procFd, pid, user)) return std::nullopt;
   std::optional<ProcessStat> stat = readProcessStat(pid);
   if (!stat || stat->state == 'Z' || stat->state == 'X') return std::nullopt;
   auto cached = bundles.find(*bundlePath);
@@ -194,17 +205,14 @@ std::optional<RunningApplication::Description> describe(pid_t pid, uid_t user,
 }
 
 // Every numeric entry of /proc, in pid order.
-std::vector<pid_t> allPids() {
+std::vector<pid_t> allPids(DIR* proc) {
   std::vector<pid_t> pids;
-  DIR* proc = ::opendir("/proc");
-  if (!proc) return pids;
   while (const dirent* entry = ::readdir(proc)) {
     pid_t pid = 0;
     const char* name = entry->d_name;
     auto [end, error] = std::from_chars(name, name + std::strlen(name), pid);
     if (error == std::errc() && *end == '\0' && pid > 0) pids.push_back(pid);
   }
-  ::closedir(proc);
   std::sort(pids.begin(), pids.end());
   return pids;
 }
@@ -212,14 +220,18 @@ std::vector<pid_t> allPids() {
 std::vector<std::shared_ptr<RunningApplication>> scan(
     const std::function<bool(const RunningApplication::Description&)>& wanted) {
   std::vector<std::shared_ptr<RunningApplication>> applications;
+  DIR* proc = ::opendir("/proc");
+  if (!proc) return applications;
   BundleCache bundles;
   const uid_t user = ::getuid();
-  for (pid_t pid : allPids()) {
-    std::optional<RunningApplication::Description> description = describe(pid, user, bundles);
+  for (pid_t pid : allPids(proc)) {
+    std::optional<RunningApplication::Description> description =
+        describe(::dirfd(proc), pid, user, bundles);
     if (description && wanted(*description)) {
       applications.push_back(RunningApplication::make(std::move(*description)));
     }
   }
+  ::closedir(proc);
   return applications;
 }
 
@@ -310,8 +322,10 @@ RunningApplication::~RunningApplication() {
 }
 
 std::shared_ptr<RunningApplication> RunningApplication::withPid(pid_t pid) {
+  FileDescriptor proc(::open("/proc", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!proc.valid()) return nullptr;
   BundleCache bundles;
-  std::optional<Description> description = describe(pid, ::getuid(), bundles);
+  std::optional<Description> description = describe(proc.get(), pid, ::getuid(), bundles);
   return description ? make(std::move(*description)) : nullptr;
 }
 
@@ -328,9 +342,11 @@ std::vector<std::shared_ptr<RunningApplication>> RunningApplication::allRunningA
 
 Result<pid_t> RunningApplication::launchBundle(const std::string& bundlePath) {
   std::optional<Bundle> bundle = Bundle::open(bundlePath);
-  if (!bundle) return VendError::withDomain("RunningApplication", ENOENT, "No bundle at " + bundlePath);
+  if (!bundle)
+    return VendError::withDomain("RunningApplication", ENOENT, "No bundle at " + bundlePath);
   const std::string* executableName = bundle->infoValue("HostBundleExecutable").string();
-  if (!executableName || executableName->empty() || executableName->find('/') != std::string::npos) {
+  if (!executableName || executableName->empty() ||
+      executableName->find('/') != std::string::npos) {
     return VendError::withDomain("RunningApplication", EINVAL,
                                  "The bundle at " + bundlePath + " names no executable");
   }

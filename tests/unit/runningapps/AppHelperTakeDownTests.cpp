@@ -34,8 +34,9 @@ class FakePrompt : public AppHelperQuitPrompt {
 
   void quitWhileShowing(pid_t pid) { quitWhileShowing_ = pid; }
 
-  Answer run(const std::vector<std::shared_ptr<RunningApplication>>& appsToQuit, bool allowUserToSkip,
-             const std::vector<SysupQuaymartUpdate>& /*osUpdates*/, bool* didForceFinish) override {
+  Answer run(const std::vector<std::shared_ptr<RunningApplication>>& appsToQuit,
+             bool allowUserToSkip, const std::vector<SysupQuaymartUpdate>& /*osUpdates*/,
+             bool* didForceFinish) override {
     MutexLock lock(mutex_);
     std::vector<pid_t> shown;
     for (const auto& application : appsToQuit) shown.push_back(application->pid());
@@ -166,11 +167,11 @@ class AppHelperForceTest : public AppHelperTakeDownTest,
 TEST_P(AppHelperForceTest, ForcedTerminationKillsWithoutQuitRequestAndDoesNotRelaunch) {
   const ForceCase& forced = GetParam();
   const std::string identifier = "test.apphelper.forced";
-  pid_t pid = apps_.launch(
-      apps_.makeBundle("Forced", identifier, AppTestRoot::Program::kIgnoresTerm));
+  pid_t pid =
+      apps_.launch(apps_.makeBundle("Forced", identifier, AppTestRoot::Program::kIgnoresTerm));
   if (forced.preference) {
-    ASSERT_TRUE(PreferenceStore::setValue(kDefaultsAlwaysForceTerminateAppsKey, true,
-                                          kDaemonDefaultsID));
+    ASSERT_TRUE(
+        PreferenceStore::setValue(kDefaultsAlwaysForceTerminateAppsKey, true, kDaemonDefaultsID));
   }
   ASSERT_TRUE(RunningApplicationFacts::setStopped(identifier, forced.stopped));
   ASSERT_TRUE(RunningApplicationFacts::setProxied(identifier, forced.proxied));
@@ -276,8 +277,8 @@ TEST_F(AppHelperTakeDownTest, TheCompanionsOfTheEditorGoWithIt) {
 
 TEST_F(AppHelperTakeDownTest, ABusyPlugInAfterTheQuitKeepsTheAppBlocked) {
   std::string bundle = apps_.makeBundle("Foo", "test.apphelper.foo");
-  std::string plugIn = apps_.makeBundle("Ext", "test.apphelper.foo.ext", AppTestRoot::Program::kSleeps,
-                                        {}, bundle);
+  std::string plugIn =
+      apps_.makeBundle("Ext", "test.apphelper.foo.ext", AppTestRoot::Program::kSleeps, {}, bundle);
   pid_t pid = apps_.launch(bundle);
   ASSERT_TRUE(PlugInHost::addBusyPlugIn({{"containingIdentifier", "test.apphelper.foo"},
                                          {"containingPath", bundle},
@@ -318,9 +319,10 @@ TEST_F(AppHelperTakeDownTest, ABusyFileBrowserExtensionDoesNotBlock) {
 TEST_F(AppHelperTakeDownTest, TheQuitWaitIsLongerInADimWake) {
   auto helper = AppHelper::initWithBundleIdentifier("test.apphelper.foo", VendStoreClient());
   EXPECT_EQ(helper->terminationWaitTimeout(), 20s);
-  ASSERT_TRUE(PlatformStateFile::named("system-state.plist").updateDictionary([](PlistDictionary& state) {
-    state["dimWake"] = true;
-  }));
+  ASSERT_TRUE(
+      PlatformStateFile::named("system-state.plist").updateDictionary([](PlistDictionary& state) {
+        state["dimWake"] = true;
+      }));
   EXPECT_EQ(helper->terminationWaitTimeout(), 60s);
 }
 

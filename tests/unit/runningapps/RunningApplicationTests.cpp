@@ -41,8 +41,10 @@ TEST_F(RunningApplicationTest, ABundleProgramIsFoundWithItsFacts) {
             static_cast<std::uint64_t>(pid));
 
   auto all = RunningApplication::allRunningApplications();
-  EXPECT_TRUE(std::any_of(all.begin(), all.end(), [&](const auto& app) { return app->pid() == pid; }));
-  EXPECT_TRUE(RunningApplication::runningApplicationsWithBundleIdentifier("com.example.other").empty());
+  EXPECT_TRUE(
+      std::any_of(all.begin(), all.end(), [&](const auto& app) { return app->pid() == pid; }));
+  EXPECT_TRUE(
+      RunningApplication::runningApplicationsWithBundleIdentifier("com.example.other").empty());
 }
 
 TEST_F(RunningApplicationTest, NameFallsBackToTheFolderName) {
@@ -70,7 +72,8 @@ TEST_F(RunningApplicationTest, TerminationIsObservedAndTheAppIsNoLongerFound) {
   EXPECT_TRUE(application->isTerminated());
   EXPECT_FALSE(application->applicationSerialNumber());
   EXPECT_FALSE(application->forceTerminate());
-  EXPECT_TRUE(RunningApplication::runningApplicationsWithBundleIdentifier("com.example.foo").empty());
+  EXPECT_TRUE(
+      RunningApplication::runningApplicationsWithBundleIdentifier("com.example.foo").empty());
 }
 
 TEST_F(RunningApplicationTest, ForceTerminateKillsAProgramThatIgnoresQuit) {
