@@ -25,6 +25,14 @@ PlistArray busyEntries() {
   return *busy->second.array();
 }
 
+// The answers come on threads of their own: callers wait for them in line,
+// and may themselves run on the global queue.
+DispatchQueue& answerQueue() {
+  static const std::shared_ptr<DispatchQueue> queue =
+      DispatchQueue::create("PlugInHost Answers", DispatchQueue::Kind::Concurrent);
+  return *queue;
+}
+
 double now() {
   using namespace std::chrono;
   return duration<double>(system_clock::now().time_since_epoch()).count();
@@ -33,31 +41,30 @@ double now() {
 }  // namespace
 
 void PlugInHost::holdPlugInsInApplication(std::string bundlePath, HoldHandler handler) {
-  DispatchQueue::globalQueue().async(
-      [bundlePath = std::move(bundlePath), handler = std::move(handler)] {
-        PlistArray blocking;
-        for (const PlistValue& entry : busyEntries()) {
-          const std::string* containingPath = entry[kContainingPathKey].string();
-          if (containingPath && *containingPath == bundlePath) blocking.push_back(entry);
-        }
-        if (!blocking.empty()) {
-          VendError error = VendError::withDomain(std::string(kErrorDomain), kBusyErrorCode,
-                                                  "Plug-ins of " + bundlePath + " are in use");
-          error.userInfo[std::string(kErrorKeyBusyPlugIns)] = std::move(blocking);
-          handler(nullptr, std::move(error));
-          return;
-        }
-        auto hold = std::make_shared<PlugInHold>(Uuid::generateString(), bundlePath);
-        bool stored = stateFile().updateDictionary([&](PlistDictionary& state) {
-          PlistDictionary holds;
-          if (const PlistDictionary* old = state["holds"].dictionary()) holds = *old;
-          holds[hold->identifier()] =
-              PlistDictionary{{"bundlePath", bundlePath}, {"date", PlistDate{now()}}};
-          state["holds"] = std::move(holds);
-        });
-        if (!stored) TILL_LOG(1, "%@: Could not record the hold on %@", kSpeaker, bundlePath);
-        handler(std::move(hold), std::nullopt);
-      });
+  answerQueue().async([bundlePath = std::move(bundlePath), handler = std::move(handler)] {
+    PlistArray blocking;
+    for (const PlistValue& entry : busyEntries()) {
+      const std::string* containingPath = entry[kContainingPathKey].string();
+      if (containingPath && *containingPath == bundlePath) blocking.push_back(entry);
+    }
+    if (!blocking.empty()) {
+      VendError error = VendError::withDomain(std::string(kErrorDomain), kBusyErrorCode,
+                                              "Plug-ins of " + bundlePath + " are in use");
+      error.userInfo[std::string(kErrorKeyBusyPlugIns)] = std::move(blocking);
+      handler(nullptr, std::move(error));
+      return;
+    }
+    auto hold = std::make_shared<PlugInHold>(Uuid::generateString(), bundlePath);
+    bool stored = stateFile().updateDictionary([&](PlistDictionary& state) {
+      PlistDictionary holds;
+      if (const PlistDictionary* old = state["holds"].dictionary()) holds = *old;
+      holds[hold->identifier()] =
+          PlistDictionary{{"bundlePath", bundlePath}, {"date", PlistDate{now()}}};
+      state["holds"] = std::move(holds);
+    });
+    if (!stored) TILL_LOG(1, "%@: Could not record the hold on %@", kSpeaker, bundlePath);
+    handler(std::move(hold), std::nullopt);
+  });
 }
 
 void PlugInHost::releaseHold(const std::shared_ptr<PlugInHold>& hold) {

@@ -2,6 +2,7 @@
 
 #include <dirent.h>
 #include <fcntl.h>
+#include <linux/close_range.h>
 #include <poll.h>
 #include <signal.h>
 #include <sys/stat.h>
@@ -282,6 +283,23 @@ bool readValue(int fd, T& value) {
   return count == static_cast<ssize_t>(sizeof value);
 }
 
+// What a program started by the service must not inherit from it: signals
+// it blocks or ignores (a program that cannot see SIGTERM could never be
+// asked to quit) and its descriptors (a lock file held open by an
+// application would stall the service). Only async-signal-safe calls: this
+// runs between fork and exec.
+void resetInheritedState() {
+  sigset_t none;
+  ::sigemptyset(&none);
+  ::sigprocmask(SIG_SETMASK, &none, nullptr);
+  struct sigaction standard {};
+  standard.sa_handler = SIG_DFL;
+  for (int signal = 1; signal < NSIG; ++signal) ::sigaction(signal, &standard, nullptr);
+#if defined(SYS_close_range) && defined(CLOSE_RANGE_CLOEXEC)
+  ::syscall(SYS_close_range, 3U, ~0U, CLOSE_RANGE_CLOEXEC);
+#endif
+}
+
 }  // namespace
 
 std::shared_ptr<RunningApplication> RunningApplication::make(Description description) {
@@ -377,6 +395,7 @@ Result<pid_t> RunningApplication::launchBundle(const std::string& bundlePath) {
     ::setsid();
     pid_t program = ::fork();
     if (program == 0) {
+      resetInheritedState();
       ::execve(argv[0], argv.data(), environ);
       int error = errno;
       (void)::write(execPipe.fds[1], &error, sizeof error);

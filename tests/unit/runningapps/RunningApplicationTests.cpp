@@ -110,6 +110,23 @@ TEST_F(RunningApplicationTest, DesktopFactsComeFromThePlatformState) {
   EXPECT_TRUE(application->isProxied());
 }
 
+// The service blocks SIGTERM in its threads to wait for it; what it starts
+// must still obey it.
+TEST_F(RunningApplicationTest, ALaunchedProgramDoesNotInheritBlockedSignals) {
+  std::string bundle = apps_.makeBundle("Foo", "com.example.foo");
+  sigset_t term;
+  sigset_t old;
+  ::sigemptyset(&term);
+  ::sigaddset(&term, SIGTERM);
+  ASSERT_EQ(::pthread_sigmask(SIG_BLOCK, &term, &old), 0);
+  pid_t pid = apps_.launch(bundle);
+  ::pthread_sigmask(SIG_SETMASK, &old, nullptr);
+  auto application = RunningApplication::withPid(pid);
+  ASSERT_TRUE(application);
+  ASSERT_TRUE(application->requestQuit());
+  EXPECT_TRUE(eventually([&] { return application->isTerminated(); }));
+}
+
 TEST_F(RunningApplicationTest, LaunchOfABundleWithoutProgramFails) {
   std::string bundle = apps_.applications() + "/Empty.app";
   std::filesystem::create_directories(bundle);
