@@ -295,6 +295,13 @@ void resetInheritedState() {
   struct sigaction standard {};
   standard.sa_handler = SIG_DFL;
   for (int signal = 1; signal < NSIG; ++signal) ::sigaction(signal, &standard, nullptr);
+  // Nor its standard streams: an application's output is not the service's
+  // log, and a pipe the service was started with must not stay open.
+  int nothing = ::open("/dev/null", O_RDWR);
+  if (nothing >= 0) {
+    for (int stream = 0; stream <= 2; ++stream) ::dup2(nothing, stream);
+    if (nothing > 2) ::close(nothing);
+  }
 #if defined(SYS_close_range) && defined(CLOSE_RANGE_CLOEXEC)
   ::syscall(SYS_close_range, 3U, ~0U, CLOSE_RANGE_CLOEXEC);
 #endif

@@ -45,7 +45,7 @@ class FakePrompt : public AppHelperQuitPrompt {
     if (quitWhileShowing_ > 0) {
       ::kill(quitWhileShowing_, SIGTERM);
       quitWhileShowing_ = 0;
-      forced_.wait_for(lock, 10s, [&] { return forceFinishCalls_ > 0; });
+      forced_.wait_for(lock, 10s, [this]() REQUIRES(mutex_) { return forceFinishCalls_ > 0; });
       *didForceFinish = forceFinishCalls_ > 0;
       return Answer::kNone;
     }
@@ -205,6 +205,39 @@ TEST_F(AppHelperTakeDownTest, CancelLeavesTheAppsRunning) {
   EXPECT_FALSE(helper->needsRelaunch());
 }
 
+TEST_F(AppHelperTakeDownTest, AppsThatWouldLoseDataAreAskedAboutFirst) {
+  pid_t calm = apps_.launch(apps_.makeBundle("Calm", "test.apphelper.calm"));
+  pid_t noisy = apps_.launch(apps_.makeBundle("Noisy", "test.apphelper.noisy"));
+  ASSERT_TRUE(RunningApplicationFacts::setQuittingLosesData("test.apphelper.noisy", "Recording"));
+  auto prompt = std::make_shared<FakePrompt>(std::vector<Answer>{Answer::kCancel});
+  auto helper = helperFor({"test.apphelper.calm", "test.apphelper.noisy"});
+  helper->setQuitPrompt(prompt);
+
+  EXPECT_FALSE(helper->ensureAppsAreNotRunningWithPromptToConfirm(true));
+  EXPECT_EQ(prompt->shownPids(), (std::vector<std::vector<pid_t>>{{noisy, calm}}));
+}
+
+// All of this user's applications are asked about and the answer is
+// cancel: other applications of the machine's user are never touched.
+TEST_F(AppHelperTakeDownTest, AllRunningAppsLeaveOutTheWhiteListWhenTold) {
+  pid_t ordinary = apps_.launch(apps_.makeBundle("Ordinary", "test.apphelper.ordinary"));
+  pid_t store = apps_.launch(apps_.makeBundle("Store", "com.orvane.quaymart"));
+  for (bool ignoreWhitelisted : {true, false}) {
+    auto prompt = std::make_shared<FakePrompt>(std::vector<Answer>{Answer::kCancel});
+    auto helper =
+        AppHelper::initWithAllRunningApplicationsIgnoringWhitelistedApps(ignoreWhitelisted, {});
+    helper->setTiming({10ms, 1s, 1s});
+    helper->setQuitPrompt(prompt);
+    EXPECT_FALSE(helper->ensureAppsAreNotRunningWithPromptToConfirm(true));
+    ASSERT_EQ(prompt->shownPids().size(), 1u);
+    const std::vector<pid_t> shown = prompt->shownPids().front();
+    EXPECT_NE(std::find(shown.begin(), shown.end(), ordinary), shown.end());
+    EXPECT_EQ(std::find(shown.begin(), shown.end(), store) != shown.end(), !ignoreWhitelisted);
+  }
+  EXPECT_FALSE(processIsGone(ordinary));
+  EXPECT_FALSE(processIsGone(store));
+}
+
 TEST_F(AppHelperTakeDownTest, APromptThatCannotBeShownCountsAsCancel) {
   pid_t pid = apps_.launch(apps_.makeBundle("Foo", "test.apphelper.foo"));
   auto helper = helperFor({"test.apphelper.foo"});
@@ -256,12 +289,14 @@ TEST_F(AppHelperTakeDownTest, WithPromptAnAppThatTimedOutIsOfferedAgain) {
   EXPECT_EQ(prompt->shownPids(), (std::vector<std::vector<pid_t>>{{pid}, {pid}}));
 }
 
-TEST_F(AppHelperTakeDownTest, NothingToTerminateSucceedsWithoutAsking) {
+TEST_F(AppHelperTakeDownTest, NothingToTerminateSucceedsWithoutAskingAfterThePause) {
   auto prompt = std::make_shared<FakePrompt>(std::vector<Answer>{Answer::kCancel});
   auto helper = AppHelper::initWithRunningApplications({}, VendStoreClient());
-  helper->setTiming({10ms, 1s, 1s});
+  helper->setTiming({200ms, 1s, 1s});
   helper->setQuitPrompt(prompt);
+  const auto start = std::chrono::steady_clock::now();
   EXPECT_TRUE(helper->ensureAppsAreNotRunningWithPromptToConfirm(true));
+  EXPECT_GE(std::chrono::steady_clock::now() - start, 200ms);
   EXPECT_TRUE(prompt->shownPids().empty());
   EXPECT_FALSE(helper->needsRelaunch());
 }
