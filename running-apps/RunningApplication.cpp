@@ -569,7 +569,8 @@ Result<ApplicationSerialNumber> RunningApplication::applicationSerialNumber() co
 }
 
 std::optional<std::string> RunningApplicationFacts::foremost() {
-  const std::string* value = facts()["foremost"].string();
+  const PlistValue all(facts());
+  const std::string* value = all["foremost"].string();
   return value ? std::optional<std::string>(*value) : std::nullopt;
 }
 
