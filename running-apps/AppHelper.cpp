@@ -263,7 +263,7 @@ void AppHelper::relaunchAppWithBundleURL(const std::optional<std::string>& bundl
   // Started in the background: nothing here brings an application forward.
   Result<pid_t> launched = RunningApplication::launchBundle(*bundleURL);
   if (!launched) {
-    TILL_LOG(1, "%@: relaunchAppWithBundleURL:%@ failed with error %@", kSpeaker, *bundleURL,
+    TILL_LOG(2, "%@: relaunchAppWithBundleURL:%@ failed with error %@", kSpeaker, *bundleURL,
              launched.error().descriptionText());
   }
 }
