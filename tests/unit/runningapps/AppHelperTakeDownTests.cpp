@@ -193,16 +193,20 @@ INSTANTIATE_TEST_SUITE_P(States, AppHelperForceTest,
                                            ForceCase{"Proxied", false, false, true}),
                          [](const auto& info) { return std::string(info.param.name); });
 
+// Cancel, and a prompt that went away without an answer and without an
+// application quitting, leave everything as it was.
 TEST_F(AppHelperTakeDownTest, CancelLeavesTheAppsRunning) {
   pid_t pid = apps_.launch(apps_.makeBundle("Foo", "test.apphelper.foo"));
-  auto prompt = std::make_shared<FakePrompt>(std::vector<Answer>{Answer::kCancel});
-  auto helper = helperFor({"test.apphelper.foo"});
-  helper->setQuitPrompt(prompt);
+  for (Answer answer : {Answer::kCancel, Answer::kNone}) {
+    auto prompt = std::make_shared<FakePrompt>(std::vector<Answer>{answer});
+    auto helper = helperFor({"test.apphelper.foo"});
+    helper->setQuitPrompt(prompt);
 
-  EXPECT_FALSE(helper->ensureAppsAreNotRunningWithPromptToConfirm(true));
-  EXPECT_EQ(prompt->shownPids(), (std::vector<std::vector<pid_t>>{{pid}}));
-  EXPECT_FALSE(processIsGone(pid));
-  EXPECT_FALSE(helper->needsRelaunch());
+    EXPECT_FALSE(helper->ensureAppsAreNotRunningWithPromptToConfirm(true));
+    EXPECT_EQ(prompt->shownPids(), (std::vector<std::vector<pid_t>>{{pid}}));
+    EXPECT_FALSE(processIsGone(pid));
+    EXPECT_FALSE(helper->needsRelaunch());
+  }
 }
 
 TEST_F(AppHelperTakeDownTest, AppsThatWouldLoseDataAreAskedAboutFirst) {
