@@ -123,7 +123,8 @@ bool AppHelper::isAppRunningWithBundleID(std::string_view bundleIdentifier,
                                          std::optional<std::string>* appName,
                                          std::optional<PlugInHostApps>* plugInHostApps) {
   if (bundleIdentifier.empty()) return false;
-  Applications running = RunningApplication::runningApplicationsWithBundleIdentifier(bundleIdentifier);
+  Applications running =
+      RunningApplication::runningApplicationsWithBundleIdentifier(bundleIdentifier);
   const bool isRunning = !running.empty();
   if (isRunning && appName) *appName = running.front()->localizedName();
   for (const std::string& bundlePath : bundlePathsForIdentifier(bundleIdentifier)) {
@@ -134,8 +135,9 @@ bool AppHelper::isAppRunningWithBundleID(std::string_view bundleIdentifier,
     TILL_LOG(3, "%@:holdPlugInsInApplication returned error %@", kSpeaker,
              answer.error->descriptionText());
     if (!isRunning) {
-      TILL_LOG(2, "%@: Application with bundleID %@ is not running, but has an active plugin "
-                  "running in the bundle at %@",
+      TILL_LOG(2,
+               "%@: Application with bundleID %@ is not running, but has an active plugin "
+               "running in the bundle at %@",
                kSpeaker, bundleIdentifier, bundlePath);
     }
     if (plugInHostApps) {
@@ -154,7 +156,8 @@ std::optional<PlugInHostApps> AppHelper::getPluginHostAppInfo(const PlistDiction
   for (const PlistValue& element : *busy->second.array()) {
     auto pid = static_cast<pid_t>(element[PlugInHost::kServicePidKey].int64Value());
     if (pid == 0) {
-      const std::string* plugInIdentifier = element[PlugInHost::kPlugInBundleIdentifierKey].string();
+      const std::string* plugInIdentifier =
+          element[PlugInHost::kPlugInBundleIdentifierKey].string();
       const std::string* plugInPath = element[PlugInHost::kPlugInPathKey].string();
       if (plugInIdentifier && plugInPath) {
         for (const auto& application :
@@ -201,7 +204,7 @@ std::optional<PlugInHostApps> AppHelper::getPluginHostAppInfo(const PlistDiction
 
 const std::vector<std::string>& AppHelper::immortalAppBundleIDWhiteList() {
   static const std::vector<std::string> whiteList = {
-      "com.orvane.quaymart",      "com.orvane.signinscreen", "com.orvane.statusbarserver",
+      "com.orvane.quaymart",      "com.orvane.signinscreen",  "com.orvane.statusbarserver",
       "com.orvane.twilightagent", "com.orvane.SonorelHelper", "com.orvane.OrvaneSpell",
   };
   return whiteList;
@@ -260,7 +263,7 @@ void AppHelper::relaunchAppWithBundleURL(const std::optional<std::string>& bundl
   // Started in the background: nothing here brings an application forward.
   Result<pid_t> launched = RunningApplication::launchBundle(*bundleURL);
   if (!launched) {
-    TILL_LOG(1, "%@: relaunchAppWithBundleURL:%@ failed with error %@", kSpeaker, *bundleURL,
+    TILL_LOG(2, "%@: relaunchAppWithBundleURL:%@ failed with error %@", kSpeaker, *bundleURL,
              launched.error().descriptionText());
   }
 }
@@ -297,8 +300,9 @@ std::shared_ptr<AppHelper> AppHelper::initWithAllRunningApplicationsIgnoringWhit
       return isRunningAppImmortalWhiteListed(*application);
     });
   }
-  TILL_LOG(2, "%@: initWithAllRunningApplicationsIgnoringWhitelistedApps:%i has the following "
-              "apps to terminate: %@",
+  TILL_LOG(2,
+           "%@: initWithAllRunningApplicationsIgnoringWhitelistedApps:%i has the following "
+           "apps to terminate: %@",
            kSpeaker, ignoreWhitelisted, describeApplications(applications));
   return initWithRunningApplications(std::move(applications), std::move(storeClient));
 }
@@ -569,7 +573,8 @@ void AppHelper::messageTraceTermination(const std::optional<std::string>& bundle
   PlistDictionary message{{"terminated_successfully", terminatedSuccessfully}};
   if (bundleIdentifier) {
     // Names of other developers' applications stay on the machine.
-    const bool named = bundleIdentifier->starts_with(kOwnIdentifierPrefix) && !terminatedSuccessfully;
+    const bool named =
+        bundleIdentifier->starts_with(kOwnIdentifierPrefix) && !terminatedSuccessfully;
     message["bundle_id"] = named ? *bundleIdentifier : std::string(kThirdPartyApp);
   }
   LedgerTraceMessage(kTerminationTraceDomain, message);
@@ -587,8 +592,9 @@ void AppHelper::relaunchTerminatedApps() {
     holds = pluginHoldsToRelease_;
   }
   if (bundleURLs.empty() && holds.empty()) return;
-  TILL_LOG(2, "%@: Re-launching previously terminated applications %@ and releasing plugin kit "
-              "holds %@",
+  TILL_LOG(2,
+           "%@: Re-launching previously terminated applications %@ and releasing plugin kit "
+           "holds %@",
            kSpeaker, describeStrings(bundleURLs), describeHolds(holds));
   for (const std::string& bundleURL : bundleURLs) {
     Result<pid_t> launched = RunningApplication::launchBundle(bundleURL);

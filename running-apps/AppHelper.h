@@ -38,6 +38,8 @@ class AppHelperQuitPrompt {
                      bool allowUserToSkip, const std::vector<SysupQuaymartUpdate>& osUpdates,
                      bool* didForceFinish) = 0;
   // Takes the dialog down without an answer: an application quit by itself.
+  // Called on the thread that saw the application go; it may arrive just
+  // after `run` returned with an answer, and is then to be ignored.
   virtual void forceFinish() = 0;
 };
 

@@ -25,6 +25,14 @@ PlistArray busyEntries() {
   return *busy->second.array();
 }
 
+// The answers come on threads of their own: callers wait for them in line,
+// and may themselves run on the global queue.
+DispatchQueue& answerQueue() {
+  static const std::shared_ptr<DispatchQueue> queue =
+      DispatchQueue::create("PlugInHost Answers", DispatchQueue::Kind::Concurrent);
+  return *queue;
+}
+
 double now() {
   using namespace std::chrono;
   return duration<double>(system_clock::now().time_since_epoch()).count();
@@ -33,8 +41,7 @@ double now() {
 }  // namespace
 
 void PlugInHost::holdPlugInsInApplication(std::string bundlePath, HoldHandler handler) {
-  DispatchQueue::globalQueue().async([bundlePath = std::move(bundlePath),
-                                      handler = std::move(handler)] {
+  answerQueue().async([bundlePath = std::move(bundlePath), handler = std::move(handler)] {
     PlistArray blocking;
     for (const PlistValue& entry : busyEntries()) {
       const std::string* containingPath = entry[kContainingPathKey].string();
@@ -77,7 +84,8 @@ PlistDictionary PlugInHost::informationForPlugInWithPid(pid_t pid) {
 std::optional<std::string> PlugInHost::extensionPointOfPlugIn(const std::string& plugInPath) {
   std::optional<Bundle> bundle = Bundle::open(plugInPath);
   if (!bundle) return std::nullopt;
-  const std::string* point = bundle->infoValue("HostExtension")["HostExtensionPointIdentifier"].string();
+  const std::string* point =
+      bundle->infoValue("HostExtension")["HostExtensionPointIdentifier"].string();
   return point ? std::optional<std::string>(*point) : std::nullopt;
 }
 

@@ -2,6 +2,7 @@
 
 #include <dirent.h>
 #include <fcntl.h>
+#include <linux/close_range.h>
 #include <poll.h>
 #include <signal.h>
 #include <sys/stat.h>
@@ -11,16 +12,17 @@
 
 #include <algorithm>
 #include <array>
-#include <fstream>
 #include <cerrno>
 #include <charconv>
 #include <chrono>
+#include <cstdio>
 #include <cstring>
 #include <string_view>
 #include <unordered_map>
 
 #include "platform/log/TillLogManager.h"
 #include "platform/system/Bundle.h"
+#include "platform/system/FileDescriptor.h"
 #include "platform/system/FileIO.h"
 #include "store-runtime/host/PlatformStateFile.h"
 
@@ -137,23 +139,38 @@ std::optional<std::string> bundlePathOfExecutable(std::string_view executable) {
 
 // The program a process started from its absolute path, as its first
 // argument says.
-std::optional<std::string> absoluteFirstArgument(pid_t pid) {
-  std::ifstream file(procPath(pid, "cmdline"), std::ios::binary);
-  std::string first;
-  if (!std::getline(file, first, '\0') || !first.starts_with('/')) return std::nullopt;
-  return first;
+std::optional<std::string> absoluteFirstArgument(int procFd, pid_t pid) {
+  std::array<char, 32> name{};
+  std::snprintf(name.data(), name.size(), "%d/cmdline", static_cast<int>(pid));
+  FileDescriptor file(::openat(procFd, name.data(), O_RDONLY | O_CLOEXEC));
+  if (!file.valid()) return std::nullopt;
+  std::array<char, 4096> buffer{};
+  const ssize_t length = ::read(file.get(), buffer.data(), buffer.size() - 1);
+  if (length <= 0 || buffer[0] != '/') return std::nullopt;
+  return std::string(buffer.data());
 }
 
-// The executable's path. A sandboxed service may not look at the executable
-// of a process outside its sandbox (the kernel treats that as tracing it);
-// the program's first argument then stands in. A process can lie there, but
-// a lie only holds an update back.
-std::optional<std::string> executablePath(pid_t pid) {
+// The executable of `pid`, read relative to an open /proc: one lookup of
+// a short path per process keeps a scan of a thousand of them cheap. A
+// sandboxed service may not look at the executable of a process outside
+// its sandbox (the kernel treats that as tracing it); the program's first
+// argument then stands in. A process can lie there, but a lie only holds
+// an update back.
+std::optional<std::string> executablePath(int procFd, pid_t pid) {
+  std::array<char, 32> link{};
+  std::snprintf(link.data(), link.size(), "%d/exe", static_cast<int>(pid));
   std::array<char, 4096> buffer{};
-  ssize_t length = ::readlink(procPath(pid, "exe").c_str(), buffer.data(), buffer.size() - 1);
+  ssize_t length = ::readlinkat(procFd, link.data(), buffer.data(), buffer.size() - 1);
   if (length > 0) return std::string(buffer.data(), static_cast<std::size_t>(length));
-  if (errno == EACCES || errno == EPERM) return absoluteFirstArgument(pid);
+  if (errno == EACCES || errno == EPERM) return absoluteFirstArgument(procFd, pid);
   return std::nullopt;
+}
+
+bool ownedBy(int procFd, pid_t pid, uid_t user) {
+  std::array<char, 16> name{};
+  std::snprintf(name.data(), name.size(), "%d", static_cast<int>(pid));
+  struct stat status {};
+  return ::fstatat(procFd, name.data(), &status, 0) == 0 && status.st_uid == user;
 }
 
 struct BundleFacts {
@@ -182,16 +199,14 @@ BundleFacts readBundleFacts(const std::string& bundlePath) {
 // Bundles seen during one scan: many processes may run from the same one.
 using BundleCache = std::unordered_map<std::string, BundleFacts>;
 
-std::optional<RunningApplication::Description> describe(pid_t pid, uid_t user,
+std::optional<RunningApplication::Description> describe(int procFd, pid_t pid, uid_t user,
                                                         BundleCache& bundles) {
-  struct stat status {};
-  if (::stat(procPath(pid, {}).c_str(), &status) != 0 || status.st_uid != user) {
-    return std::nullopt;
-  }
-  std::optional<std::string> executable = executablePath(pid);
+  // Most processes run from no bundle: that is found with one lookup, and
+  // the owner is asked only of the few that do.
+  std::optional<std::string> executable = executablePath(procFd, pid);
   if (!executable) return std::nullopt;
   std::optional<std::string> bundlePath = bundlePathOfExecutable(*executable);
-  if (!bundlePath) return std::nullopt;
+  if (!bundlePath || !ownedBy(procFd, pid, user)) return std::nullopt;
   std::optional<ProcessStat> stat = readProcessStat(pid);
   if (!stat || stat->state == 'Z' || stat->state == 'X') return std::nullopt;
   auto cached = bundles.find(*bundlePath);
@@ -209,17 +224,14 @@ std::optional<RunningApplication::Description> describe(pid_t pid, uid_t user,
 }
 
 // Every numeric entry of /proc, in pid order.
-std::vector<pid_t> allPids() {
+std::vector<pid_t> allPids(DIR* proc) {
   std::vector<pid_t> pids;
-  DIR* proc = ::opendir("/proc");
-  if (!proc) return pids;
   while (const dirent* entry = ::readdir(proc)) {
     pid_t pid = 0;
     const char* name = entry->d_name;
     auto [end, error] = std::from_chars(name, name + std::strlen(name), pid);
     if (error == std::errc() && *end == '\0' && pid > 0) pids.push_back(pid);
   }
-  ::closedir(proc);
   std::sort(pids.begin(), pids.end());
   return pids;
 }
@@ -227,14 +239,18 @@ std::vector<pid_t> allPids() {
 std::vector<std::shared_ptr<RunningApplication>> scan(
     const std::function<bool(const RunningApplication::Description&)>& wanted) {
   std::vector<std::shared_ptr<RunningApplication>> applications;
+  DIR* proc = ::opendir("/proc");
+  if (!proc) return applications;
   BundleCache bundles;
   const uid_t user = ::getuid();
-  for (pid_t pid : allPids()) {
-    std::optional<RunningApplication::Description> description = describe(pid, user, bundles);
+  for (pid_t pid : allPids(proc)) {
+    std::optional<RunningApplication::Description> description =
+        describe(::dirfd(proc), pid, user, bundles);
     if (description && wanted(*description)) {
       applications.push_back(RunningApplication::make(std::move(*description)));
     }
   }
+  ::closedir(proc);
   return applications;
 }
 
@@ -285,6 +301,30 @@ bool readValue(int fd, T& value) {
   return count == static_cast<ssize_t>(sizeof value);
 }
 
+// What a program started by the service must not inherit from it: signals
+// it blocks or ignores (a program that cannot see SIGTERM could never be
+// asked to quit) and its descriptors (a lock file held open by an
+// application would stall the service). Only async-signal-safe calls: this
+// runs between fork and exec.
+void resetInheritedState() {
+  sigset_t none;
+  ::sigemptyset(&none);
+  ::sigprocmask(SIG_SETMASK, &none, nullptr);
+  struct sigaction standard {};
+  standard.sa_handler = SIG_DFL;
+  for (int signal = 1; signal < NSIG; ++signal) ::sigaction(signal, &standard, nullptr);
+  // Nor its standard streams: an application's output is not the service's
+  // log, and a pipe the service was started with must not stay open.
+  int nothing = ::open("/dev/null", O_RDWR);
+  if (nothing >= 0) {
+    for (int stream = 0; stream <= 2; ++stream) ::dup2(nothing, stream);
+    if (nothing > 2) ::close(nothing);
+  }
+#if defined(SYS_close_range) && defined(CLOSE_RANGE_CLOEXEC)
+  ::syscall(SYS_close_range, 3U, ~0U, CLOSE_RANGE_CLOEXEC);
+#endif
+}
+
 }  // namespace
 
 std::shared_ptr<RunningApplication> RunningApplication::make(Description description) {
@@ -325,8 +365,10 @@ RunningApplication::~RunningApplication() {
 }
 
 std::shared_ptr<RunningApplication> RunningApplication::withPid(pid_t pid) {
+  FileDescriptor proc(::open("/proc", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!proc.valid()) return nullptr;
   BundleCache bundles;
-  std::optional<Description> description = describe(pid, ::getuid(), bundles);
+  std::optional<Description> description = describe(proc.get(), pid, ::getuid(), bundles);
   return description ? make(std::move(*description)) : nullptr;
 }
 
@@ -378,6 +420,7 @@ Result<pid_t> RunningApplication::launchBundle(const std::string& bundlePath) {
     ::setsid();
     pid_t program = ::fork();
     if (program == 0) {
+      resetInheritedState();
       ::execve(argv[0], argv.data(), environ);
       int error = errno;
       (void)::write(execPipe.fds[1], &error, sizeof error);
@@ -544,8 +587,8 @@ Result<ApplicationSerialNumber> RunningApplication::applicationSerialNumber() co
 }
 
 std::optional<std::string> RunningApplicationFacts::foremost() {
-  const PlistDictionary all = facts();
-  const std::string* value = all.contains("foremost") ? all.at("foremost").string() : nullptr;
+  const PlistValue all(facts());
+  const std::string* value = all["foremost"].string();
   return value ? std::optional<std::string>(*value) : std::nullopt;
 }
 

@@ -2,9 +2,9 @@
 
 #include <unistd.h>
 
+#include <sdbus-c++/sdbus-c++.h>
 #include <chrono>
 #include <optional>
-#include <sdbus-c++/sdbus-c++.h>
 #include <string>
 
 #include "platform/log/TillLogManager.h"
@@ -27,7 +27,8 @@ bool logindIsRunning() {
 std::optional<int> takeInhibitorLock(std::string_view name) {
   try {
     auto connection = sdbus::createSystemBusConnection();
-    auto proxy = sdbus::createProxy(*connection, "org.freedesktop.login1", "/org/freedesktop/login1");
+    auto proxy =
+        sdbus::createProxy(*connection, "org.freedesktop.login1", "/org/freedesktop/login1");
     sdbus::UnixFd lock;
     proxy->callMethod("Inhibit")
         .onInterface("org.freedesktop.login1.Manager")

@@ -34,8 +34,8 @@ class UpdateRunServiceTest : public StoreAndServiceTest {
     std::ofstream(notes_ + "/bin/Notes")
         << "#!" << notes_ << "/bin/sh\nexec " << notes_ << "/bin/sleep 600\n";
     fs::permissions(notes_ + "/bin/Notes", fs::perms::owner_all);
-    catalogue_.addAccount({.accountID = 1, .orvaneID = "ada@example.org", .password = "pw",
-                           .opaqueID = "account-1"});
+    catalogue_.addAccount(
+        {.accountID = 1, .orvaneID = "ada@example.org", .password = "pw", .opaqueID = "account-1"});
     catalogue_.addItem({.wareID = kNotesID,
                         .bundleID = "com.example.e2e.notes",
                         .title = "Notes",
@@ -56,9 +56,9 @@ class UpdateRunServiceTest : public StoreAndServiceTest {
     const std::size_t before = service_->logLines("autoupdate.operation_run").size();
     const LarderctlRun report = run({"background-scan"});
     ASSERT_EQ(report.status, 0) << report.errors;
-    ASSERT_TRUE(eventually(
-        [&] { return service_->logLines("autoupdate.operation_run").size() > before; },
-        std::chrono::seconds(60)))
+    ASSERT_TRUE(
+        eventually([&] { return service_->logLines("autoupdate.operation_run").size() > before; },
+                   std::chrono::seconds(60)))
         << service_->log();
   }
 

@@ -2,8 +2,8 @@
 
 #include <ctime>
 #include <iomanip>
-#include <sstream>
 #include <iostream>
+#include <sstream>
 
 #include "platform/plist/JsonConversion.h"
 #include "platform/plist/PropertyListSerialization.h"

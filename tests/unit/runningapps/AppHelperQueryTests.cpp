@@ -56,14 +56,14 @@ TEST_P(AppHelperPlugInTest, ABusyPlugInCountsAsRunning) {
                                         AppTestRoot::Program::kSleeps, plugInInfo, container);
   std::string host = apps_.makeBundle("Host", "test.query.host", AppTestRoot::Program::kSleeps,
                                       {{"HostBundleName", "Host Viewer"}});
-  PlistDictionary busy{{"containingIdentifier", "test.query.container"},
-                       {"containingPath", container},
-                       {"plugInIdentifier", "test.query.container.ext"},
-                       {"plugInPath", plugIn},
-                       {"hostIdentifier",
-                        plugInCase.hostIsContainer ? "test.query.container" : "test.query.host"},
-                       {"hostPath", plugInCase.hostIsContainer ? container : host},
-                       {"service-pid", 4242}};
+  PlistDictionary busy{
+      {"containingIdentifier", "test.query.container"},
+      {"containingPath", container},
+      {"plugInIdentifier", "test.query.container.ext"},
+      {"plugInPath", plugIn},
+      {"hostIdentifier", plugInCase.hostIsContainer ? "test.query.container" : "test.query.host"},
+      {"hostPath", plugInCase.hostIsContainer ? container : host},
+      {"service-pid", 4242}};
   ASSERT_TRUE(PlugInHost::addBusyPlugIn(busy));
   // A busy plug-in of another application does not count.
   ASSERT_TRUE(PlugInHost::addBusyPlugIn({{"containingIdentifier", "test.query.other"},
@@ -90,12 +90,11 @@ TEST_P(AppHelperPlugInTest, ABusyPlugInCountsAsRunning) {
   EXPECT_EQ(hosts.has_value(), plugInCase.expectHosts);
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Hosts, AppHelperPlugInTest,
-    ::testing::Values(PlugInCase{"InAnotherApp", false, false, true},
-                      PlugInCase{"ContainerIsHost", true, false, false},
-                      PlugInCase{"FileBrowserExtension", false, true, false}),
-    [](const auto& info) { return std::string(info.param.name); });
+INSTANTIATE_TEST_SUITE_P(Hosts, AppHelperPlugInTest,
+                         ::testing::Values(PlugInCase{"InAnotherApp", false, false, true},
+                                           PlugInCase{"ContainerIsHost", true, false, false},
+                                           PlugInCase{"FileBrowserExtension", false, true, false}),
+                         [](const auto& info) { return std::string(info.param.name); });
 
 struct WhiteListCase {
   const char* name;

@@ -34,8 +34,9 @@ class FakePrompt : public AppHelperQuitPrompt {
 
   void quitWhileShowing(pid_t pid) { quitWhileShowing_ = pid; }
 
-  Answer run(const std::vector<std::shared_ptr<RunningApplication>>& appsToQuit, bool allowUserToSkip,
-             const std::vector<SysupQuaymartUpdate>& /*osUpdates*/, bool* didForceFinish) override {
+  Answer run(const std::vector<std::shared_ptr<RunningApplication>>& appsToQuit,
+             bool allowUserToSkip, const std::vector<SysupQuaymartUpdate>& /*osUpdates*/,
+             bool* didForceFinish) override {
     MutexLock lock(mutex_);
     std::vector<pid_t> shown;
     for (const auto& application : appsToQuit) shown.push_back(application->pid());
@@ -44,7 +45,7 @@ class FakePrompt : public AppHelperQuitPrompt {
     if (quitWhileShowing_ > 0) {
       ::kill(quitWhileShowing_, SIGTERM);
       quitWhileShowing_ = 0;
-      forced_.wait_for(lock, 10s, [&] { return forceFinishCalls_ > 0; });
+      forced_.wait_for(lock, 10s, [this]() REQUIRES(mutex_) { return forceFinishCalls_ > 0; });
       *didForceFinish = forceFinishCalls_ > 0;
       return Answer::kNone;
     }
@@ -166,11 +167,11 @@ class AppHelperForceTest : public AppHelperTakeDownTest,
 TEST_P(AppHelperForceTest, ForcedTerminationKillsWithoutQuitRequestAndDoesNotRelaunch) {
   const ForceCase& forced = GetParam();
   const std::string identifier = "test.apphelper.forced";
-  pid_t pid = apps_.launch(
-      apps_.makeBundle("Forced", identifier, AppTestRoot::Program::kIgnoresTerm));
+  pid_t pid =
+      apps_.launch(apps_.makeBundle("Forced", identifier, AppTestRoot::Program::kIgnoresTerm));
   if (forced.preference) {
-    ASSERT_TRUE(PreferenceStore::setValue(kDefaultsAlwaysForceTerminateAppsKey, true,
-                                          kDaemonDefaultsID));
+    ASSERT_TRUE(
+        PreferenceStore::setValue(kDefaultsAlwaysForceTerminateAppsKey, true, kDaemonDefaultsID));
   }
   ASSERT_TRUE(RunningApplicationFacts::setStopped(identifier, forced.stopped));
   ASSERT_TRUE(RunningApplicationFacts::setProxied(identifier, forced.proxied));
@@ -192,16 +193,53 @@ INSTANTIATE_TEST_SUITE_P(States, AppHelperForceTest,
                                            ForceCase{"Proxied", false, false, true}),
                          [](const auto& info) { return std::string(info.param.name); });
 
+// Cancel, and a prompt that went away without an answer and without an
+// application quitting, leave everything as it was.
 TEST_F(AppHelperTakeDownTest, CancelLeavesTheAppsRunning) {
   pid_t pid = apps_.launch(apps_.makeBundle("Foo", "test.apphelper.foo"));
+  for (Answer answer : {Answer::kCancel, Answer::kNone}) {
+    auto prompt = std::make_shared<FakePrompt>(std::vector<Answer>{answer});
+    auto helper = helperFor({"test.apphelper.foo"});
+    helper->setQuitPrompt(prompt);
+
+    EXPECT_FALSE(helper->ensureAppsAreNotRunningWithPromptToConfirm(true));
+    EXPECT_EQ(prompt->shownPids(), (std::vector<std::vector<pid_t>>{{pid}}));
+    EXPECT_FALSE(processIsGone(pid));
+    EXPECT_FALSE(helper->needsRelaunch());
+  }
+}
+
+TEST_F(AppHelperTakeDownTest, AppsThatWouldLoseDataAreAskedAboutFirst) {
+  pid_t calm = apps_.launch(apps_.makeBundle("Calm", "test.apphelper.calm"));
+  pid_t noisy = apps_.launch(apps_.makeBundle("Noisy", "test.apphelper.noisy"));
+  ASSERT_TRUE(RunningApplicationFacts::setQuittingLosesData("test.apphelper.noisy", "Recording"));
   auto prompt = std::make_shared<FakePrompt>(std::vector<Answer>{Answer::kCancel});
-  auto helper = helperFor({"test.apphelper.foo"});
+  auto helper = helperFor({"test.apphelper.calm", "test.apphelper.noisy"});
   helper->setQuitPrompt(prompt);
 
   EXPECT_FALSE(helper->ensureAppsAreNotRunningWithPromptToConfirm(true));
-  EXPECT_EQ(prompt->shownPids(), (std::vector<std::vector<pid_t>>{{pid}}));
-  EXPECT_FALSE(processIsGone(pid));
-  EXPECT_FALSE(helper->needsRelaunch());
+  EXPECT_EQ(prompt->shownPids(), (std::vector<std::vector<pid_t>>{{noisy, calm}}));
+}
+
+// All of this user's applications are asked about and the answer is
+// cancel: other applications of the machine's user are never touched.
+TEST_F(AppHelperTakeDownTest, AllRunningAppsLeaveOutTheWhiteListWhenTold) {
+  pid_t ordinary = apps_.launch(apps_.makeBundle("Ordinary", "test.apphelper.ordinary"));
+  pid_t store = apps_.launch(apps_.makeBundle("Store", "com.orvane.quaymart"));
+  for (bool ignoreWhitelisted : {true, false}) {
+    auto prompt = std::make_shared<FakePrompt>(std::vector<Answer>{Answer::kCancel});
+    auto helper =
+        AppHelper::initWithAllRunningApplicationsIgnoringWhitelistedApps(ignoreWhitelisted, {});
+    helper->setTiming({10ms, 1s, 1s});
+    helper->setQuitPrompt(prompt);
+    EXPECT_FALSE(helper->ensureAppsAreNotRunningWithPromptToConfirm(true));
+    ASSERT_EQ(prompt->shownPids().size(), 1u);
+    const std::vector<pid_t> shown = prompt->shownPids().front();
+    EXPECT_NE(std::find(shown.begin(), shown.end(), ordinary), shown.end());
+    EXPECT_EQ(std::find(shown.begin(), shown.end(), store) != shown.end(), !ignoreWhitelisted);
+  }
+  EXPECT_FALSE(processIsGone(ordinary));
+  EXPECT_FALSE(processIsGone(store));
 }
 
 TEST_F(AppHelperTakeDownTest, APromptThatCannotBeShownCountsAsCancel) {
@@ -255,12 +293,14 @@ TEST_F(AppHelperTakeDownTest, WithPromptAnAppThatTimedOutIsOfferedAgain) {
   EXPECT_EQ(prompt->shownPids(), (std::vector<std::vector<pid_t>>{{pid}, {pid}}));
 }
 
-TEST_F(AppHelperTakeDownTest, NothingToTerminateSucceedsWithoutAsking) {
+TEST_F(AppHelperTakeDownTest, NothingToTerminateSucceedsWithoutAskingAfterThePause) {
   auto prompt = std::make_shared<FakePrompt>(std::vector<Answer>{Answer::kCancel});
   auto helper = AppHelper::initWithRunningApplications({}, VendStoreClient());
-  helper->setTiming({10ms, 1s, 1s});
+  helper->setTiming({200ms, 1s, 1s});
   helper->setQuitPrompt(prompt);
+  const auto start = std::chrono::steady_clock::now();
   EXPECT_TRUE(helper->ensureAppsAreNotRunningWithPromptToConfirm(true));
+  EXPECT_GE(std::chrono::steady_clock::now() - start, 200ms);
   EXPECT_TRUE(prompt->shownPids().empty());
   EXPECT_FALSE(helper->needsRelaunch());
 }
@@ -276,8 +316,8 @@ TEST_F(AppHelperTakeDownTest, TheCompanionsOfTheEditorGoWithIt) {
 
 TEST_F(AppHelperTakeDownTest, ABusyPlugInAfterTheQuitKeepsTheAppBlocked) {
   std::string bundle = apps_.makeBundle("Foo", "test.apphelper.foo");
-  std::string plugIn = apps_.makeBundle("Ext", "test.apphelper.foo.ext", AppTestRoot::Program::kSleeps,
-                                        {}, bundle);
+  std::string plugIn =
+      apps_.makeBundle("Ext", "test.apphelper.foo.ext", AppTestRoot::Program::kSleeps, {}, bundle);
   pid_t pid = apps_.launch(bundle);
   ASSERT_TRUE(PlugInHost::addBusyPlugIn({{"containingIdentifier", "test.apphelper.foo"},
                                          {"containingPath", bundle},
@@ -318,9 +358,10 @@ TEST_F(AppHelperTakeDownTest, ABusyFileBrowserExtensionDoesNotBlock) {
 TEST_F(AppHelperTakeDownTest, TheQuitWaitIsLongerInADimWake) {
   auto helper = AppHelper::initWithBundleIdentifier("test.apphelper.foo", VendStoreClient());
   EXPECT_EQ(helper->terminationWaitTimeout(), 20s);
-  ASSERT_TRUE(PlatformStateFile::named("system-state.plist").updateDictionary([](PlistDictionary& state) {
-    state["dimWake"] = true;
-  }));
+  ASSERT_TRUE(
+      PlatformStateFile::named("system-state.plist").updateDictionary([](PlistDictionary& state) {
+        state["dimWake"] = true;
+      }));
   EXPECT_EQ(helper->terminationWaitTimeout(), 60s);
 }
 

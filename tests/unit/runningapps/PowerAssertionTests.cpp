@@ -21,8 +21,10 @@ class PowerAssertionTest : public ::testing::Test {
 };
 
 TEST_F(PowerAssertionTest, TheRecordAppearsAndGoesOnRelease) {
-  Result<std::uint32_t> first = LedgerPowerAssertion::create("PreventUserIdleSystemSleep", "Installing");
-  Result<std::uint32_t> second = LedgerPowerAssertion::create("PreventSystemSleep", "Quitting apps");
+  Result<std::uint32_t> first =
+      LedgerPowerAssertion::create("PreventUserIdleSystemSleep", "Installing");
+  Result<std::uint32_t> second =
+      LedgerPowerAssertion::create("PreventSystemSleep", "Quitting apps");
   ASSERT_TRUE(first) << first.errorDescription();
   ASSERT_TRUE(second) << second.errorDescription();
   EXPECT_NE(*first, 0u);
@@ -46,9 +48,10 @@ TEST_F(PowerAssertionTest, TheRecordAppearsAndGoesOnRelease) {
 
 TEST_F(PowerAssertionTest, ThermalEmergencyCountIsReadFromTheSystemState) {
   EXPECT_EQ(LedgerDimWakeThermalEmergencyCount(), 0);
-  ASSERT_TRUE(PlatformStateFile::named("system-state.plist").updateDictionary([](PlistDictionary& state) {
-    state["dimWakeThermalEmergencyCount"] = 3;
-  }));
+  ASSERT_TRUE(
+      PlatformStateFile::named("system-state.plist").updateDictionary([](PlistDictionary& state) {
+        state["dimWakeThermalEmergencyCount"] = 3;
+      }));
   EXPECT_EQ(LedgerDimWakeThermalEmergencyCount(), 3);
 }
 

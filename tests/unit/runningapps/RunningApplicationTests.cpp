@@ -41,8 +41,10 @@ TEST_F(RunningApplicationTest, ABundleProgramIsFoundWithItsFacts) {
             static_cast<std::uint64_t>(pid));
 
   auto all = RunningApplication::allRunningApplications();
-  EXPECT_TRUE(std::any_of(all.begin(), all.end(), [&](const auto& app) { return app->pid() == pid; }));
-  EXPECT_TRUE(RunningApplication::runningApplicationsWithBundleIdentifier("com.example.other").empty());
+  EXPECT_TRUE(
+      std::any_of(all.begin(), all.end(), [&](const auto& app) { return app->pid() == pid; }));
+  EXPECT_TRUE(
+      RunningApplication::runningApplicationsWithBundleIdentifier("com.example.other").empty());
 }
 
 TEST_F(RunningApplicationTest, NameFallsBackToTheFolderName) {
@@ -70,7 +72,8 @@ TEST_F(RunningApplicationTest, TerminationIsObservedAndTheAppIsNoLongerFound) {
   EXPECT_TRUE(application->isTerminated());
   EXPECT_FALSE(application->applicationSerialNumber());
   EXPECT_FALSE(application->forceTerminate());
-  EXPECT_TRUE(RunningApplication::runningApplicationsWithBundleIdentifier("com.example.foo").empty());
+  EXPECT_TRUE(
+      RunningApplication::runningApplicationsWithBundleIdentifier("com.example.foo").empty());
 }
 
 TEST_F(RunningApplicationTest, ForceTerminateKillsAProgramThatIgnoresQuit) {
@@ -105,6 +108,23 @@ TEST_F(RunningApplicationTest, DesktopFactsComeFromThePlatformState) {
   EXPECT_FALSE(application->quittingWillBeNoisyOrLoseData());
   EXPECT_FALSE(application->isStoppedInApplicationRegistry());
   EXPECT_TRUE(application->isProxied());
+}
+
+// The service blocks SIGTERM in its threads to wait for it; what it starts
+// must still obey it.
+TEST_F(RunningApplicationTest, ALaunchedProgramDoesNotInheritBlockedSignals) {
+  std::string bundle = apps_.makeBundle("Foo", "com.example.foo");
+  sigset_t term;
+  sigset_t old;
+  ::sigemptyset(&term);
+  ::sigaddset(&term, SIGTERM);
+  ASSERT_EQ(::pthread_sigmask(SIG_BLOCK, &term, &old), 0);
+  pid_t pid = apps_.launch(bundle);
+  ::pthread_sigmask(SIG_SETMASK, &old, nullptr);
+  auto application = RunningApplication::withPid(pid);
+  ASSERT_TRUE(application);
+  ASSERT_TRUE(application->requestQuit());
+  EXPECT_TRUE(eventually([&] { return application->isTerminated(); }));
 }
 
 TEST_F(RunningApplicationTest, LaunchOfABundleWithoutProgramFails) {
