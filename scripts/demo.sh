@@ -74,6 +74,7 @@ $plist_header
   <key>accountID</key><integer>5150</integer>
   <key>orvaneID</key><string>demo@example.org</string>
   <key>password</key><string>demo</string>
+  <key>opaqueID</key><string>demo-account</string>
 </dict></array>
 </plist>
 PLIST
@@ -208,3 +209,37 @@ grep -o 'Enqueuing UpdateOperation.*' "$XDG_STATE_HOME/larderd.log" | tail -1
 sleep 0.3
 kill -INT $badge_watcher
 wait $badge_watcher || true
+
+# background_run: the agent's report, as if the intervals had passed since
+# the last run, and the wait for the end of the run it starts.
+background_run() {
+  local before
+  before=$(grep -c 'autoupdate.operation_run' "$XDG_STATE_HOME/larderd.log" || true)
+  "$larderctl" prefs delete com.orvane.larderd DidStageAppUpdatesDate >/dev/null || true
+  "$larderctl" prefs delete com.orvane.larderd DidStartAutoUpdateDate >/dev/null || true
+  "$larderctl" background-scan >/dev/null
+  for _ in $(seq 300); do
+    [ "$(grep -c 'autoupdate.operation_run' "$XDG_STATE_HOME/larderd.log")" -gt "$before" ] && break
+    sleep 0.1
+  done
+}
+
+# Ledgerly becomes a program that runs from inside its bundle.
+cp /bin/sh /bin/sleep "$ledgerly/bin/"
+printf '#!%s/bin/sh\nexec %s/bin/sleep 600\n' "$ledgerly" "$ledgerly" >"$ledgerly/bin/Ledgerly"
+chmod +x "$ledgerly/bin/Ledgerly"
+"$larderctl" prefs set com.orvane.larderd AutoUpdateEnabled true --type bool
+"$ledgerly/bin/Ledgerly" &
+ledgerly_app=$!
+trap 'kill $service $store $ledgerly_app 2>/dev/null; rm -rf "$demo"' EXIT
+sleep 0.3
+echo; echo "== automatic updates on, Ledgerly running: a background run stages its update and holds it back"
+background_run
+"$larderctl" runs
+echo; echo "== larderctl updates  (staged; abort code 3: the app is running)"
+"$larderctl" --json updates | grep -o '"autoUpdateAbortCode":[0-9]*\|"isStaged":[a-z]*' | paste -sd' '
+kill $ledgerly_app; wait $ledgerly_app 2>/dev/null || true
+echo; echo "== Ledgerly has quit: the next background run installs the staged update"
+background_run
+"$larderctl" runs || true
+"$larderctl" product --bundle-id com.example.ledgerly | grep -i version
