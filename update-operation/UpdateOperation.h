@@ -189,6 +189,10 @@ class UpdateOperation : public VendOperation {
   [[nodiscard]] bool shouldDownloadAppUpdateAssets() const;
   bool runningAppBlocksInstall(const std::string& bundleIdentifier, UpdateAbort* abort);
   bool preflightAllows(const TillDownloadRef& download, UpdateAbort* abort);
+  // The download layer's answer on the download's preflight package: whether
+  // the item may be installed, and what objected.
+  std::pair<bool, PlistValue> checkPreflight(const TillDownloadMetadata& metadata,
+                                             const PlistValue& systemVersion);
   bool appToCloseBlocksInstall(const std::string& bundleIdentifier, UpdateAbort* abort);
   [[nodiscard]] bool isInstallLaterUpdate(const SysupQuaymartUpdate& update) const;
 

@@ -415,18 +415,7 @@ bool UpdateOperation::preflightBeforeStagingAllows(const TillDownloadRef& downlo
              kSpeaker, metadata.itemIdentifier(), metadata.bundleIdentifier());
     return true;
   }
-  bool allowed = true;
-  PlistValue object;
-  serviceProxy()->downloadServiceSynchronousBlock(
-      [&](VendDownloadService& service, DispatchSemaphore& semaphore) {
-        service.checkPreflightWithItemIdentifier(metadata.itemIdentifier(),
-                                                 *metadata.preflightPackageURL(), systemVersion,
-                                                 [&](bool replyAllowed, PlistValue replyObject) {
-                                                   allowed = replyAllowed;
-                                                   object = std::move(replyObject);
-                                                   semaphore.signal();
-                                                 });
-      });
+  const auto [allowed, object] = checkPreflight(metadata, systemVersion);
   if (allowed) return true;
   const UpdateAbort abort{kAbortPreflightBeforeStaging, "not downloaded due to preflight failed"};
   logAppAutoUpdateAbort(abort, metadata.bundleIdentifier(), metadata.itemIdentifier());

@@ -229,18 +229,7 @@ bool UpdateOperation::preflightAllows(const TillDownloadRef& download, UpdateAbo
   // A download without a preflight package has nothing to be checked
   // against; the download layer would refuse the empty URL as a failure.
   if (!metadata.preflightPackageURL()) return true;
-  bool allowed = true;
-  PlistValue objection;
-  serviceProxy()->downloadServiceSynchronousBlock(
-      [&](VendDownloadService& service, DispatchSemaphore& semaphore) {
-        service.checkPreflightWithItemIdentifier(metadata.itemIdentifier(),
-                                                 *metadata.preflightPackageURL(), PlistValue(),
-                                                 [&](bool replyAllowed, PlistValue replyObject) {
-                                                   allowed = replyAllowed;
-                                                   objection = std::move(replyObject);
-                                                   semaphore.signal();
-                                                 });
-      });
+  const auto [allowed, objection] = checkPreflight(metadata, PlistValue());
   if (!allowed) {
     TILL_LOG(1, "%@: Preflight returned ERROR during auto-update preflight check", kSpeaker);
     return abortWith(abort, kAbortPreflight, "preflight returned warning or error");
@@ -250,6 +239,21 @@ bool UpdateOperation::preflightAllows(const TillDownloadRef& download, UpdateAbo
     return abortWith(abort, kAbortPreflight, "preflight returned warning or error");
   }
   return true;
+}
+
+std::pair<bool, PlistValue> UpdateOperation::checkPreflight(const TillDownloadMetadata& metadata,
+                                                            const PlistValue& systemVersion) {
+  std::pair<bool, PlistValue> answer{true, PlistValue()};
+  serviceProxy()->downloadServiceSynchronousBlock([&](VendDownloadService& service,
+                                                      DispatchSemaphore& semaphore) {
+    service.checkPreflightWithItemIdentifier(metadata.itemIdentifier(),
+                                             metadata.preflightPackageURL().value_or(""),
+                                             systemVersion, [&](bool allowed, PlistValue object) {
+                                               answer = {allowed, std::move(object)};
+                                               semaphore.signal();
+                                             });
+  });
+  return answer;
 }
 
 // --- OS updates ---

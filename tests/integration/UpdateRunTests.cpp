@@ -23,6 +23,7 @@
 #include "store-runtime/services/VendOperationQueue.h"
 #include "store-runtime/sysup/SysupQuaymartUpdateController.h"
 #include "tests/integration/InProcessRuntime.h"
+#include "tests/unit/OSUpdateOffers.h"
 #include "update-controller/UpdateController.h"
 #include "update-controller/VendOSUpdateProgressObserver.h"
 #include "update-operation/UpdateOperation.h"
@@ -35,16 +36,6 @@ namespace fs = std::filesystem;
 
 constexpr std::uint64_t kNotesID = 7001;
 constexpr std::uint64_t kAtlasID = 7002;
-
-bool eventually(const std::function<bool()>& condition,
-                std::chrono::milliseconds limit = std::chrono::seconds(15)) {
-  const auto deadline = std::chrono::steady_clock::now() + limit;
-  while (std::chrono::steady_clock::now() < deadline) {
-    if (condition()) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(20));
-  }
-  return condition();
-}
 
 // Counts what the map tells its observers, so that a replacement can be
 // told from a removal and an addition.
@@ -131,18 +122,6 @@ class UpdateRunTest : public InProcessRuntimeTest {
                                                       .itemIdentifier = wareID});
     makeRunnable(path, installedPath);
     return path;
-  }
-
-  // The OS updates the system offers, found by a scan.
-  static void offerOSUpdates(const PlistArray& catalog) {
-    ASSERT_TRUE(PlatformStateFile::named(SysupQuaymartUpdateController::kStateFileName)
-                    .updateDictionary([&](PlistDictionary& state) { state["catalog"] = catalog; }));
-    std::promise<OptionalError> finished;
-    SysupQuaymartUpdateController::sharedUpdateController()
-        .startScanningForUpdatesIncludingPrerelease(
-            true, true, true, nullptr, [](double) {},
-            [&](const OptionalError& error) { finished.set_value(error); });
-    ASSERT_FALSE(finished.get_future().get());
   }
 
   pid_t launch(const std::string& bundlePath) {

@@ -12,6 +12,7 @@
 #include "store-runtime/host/LedgerDistributedNotificationCenter.h"
 #include "store-runtime/host/PlatformStateFile.h"
 #include "store-runtime/host/PreferenceStore.h"
+#include "tests/unit/OSUpdateOffers.h"
 #include "update-controller/UpdateController.h"
 #include "update-operation/UpdateOperation.h"
 
@@ -116,18 +117,6 @@ class UpdateControllerTest : public ServiceTest {
     writeBytes(folder + "/updates.plist",
                PropertyListSerialization::writeBinary(
                    PlistDictionary{{"updates", updates}, {"incompatibleUpdates", PlistArray{}}}));
-  }
-
-  // The OS updates the system offers, found by a scan.
-  static void offerOSUpdates(const PlistArray& catalog) {
-    ASSERT_TRUE(PlatformStateFile::named(SysupQuaymartUpdateController::kStateFileName)
-                    .updateDictionary([&](PlistDictionary& state) { state["catalog"] = catalog; }));
-    std::promise<OptionalError> finished;
-    SysupQuaymartUpdateController::sharedUpdateController()
-        .startScanningForUpdatesIncludingPrerelease(
-            true, true, true, nullptr, [](double) {},
-            [&](const OptionalError& error) { finished.set_value(error); });
-    ASSERT_FALSE(finished.get_future().get());
   }
 
   static void setPreference(std::string_view key, PlistValue value,
