@@ -22,6 +22,7 @@
 
 #include "platform/log/TillLogManager.h"
 #include "platform/system/Bundle.h"
+#include "platform/system/Environment.h"
 #include "platform/system/FileDescriptor.h"
 #include "platform/system/FileIO.h"
 #include "store-runtime/host/PlatformStateFile.h"
@@ -199,6 +200,19 @@ BundleFacts readBundleFacts(const std::string& bundlePath) {
 // Bundles seen during one scan: many processes may run from the same one.
 using BundleCache = std::unordered_map<std::string, BundleFacts>;
 
+bool isBelow(const std::string& path, const std::string& folder) {
+  return path.size() > folder.size() && path.starts_with(folder) && path[folder.size()] == '/';
+}
+
+// Under a private platform root the machine is that tree and the user's home:
+// a bundle elsewhere belongs to another machine's tests or demo, and its
+// processes are none of this one's applications.
+bool belongsToThisMachine(const std::string& bundlePath) {
+  const std::string root = Environment::platformRoot();
+  return root == "/" || isBelow(bundlePath, root) ||
+         isBelow(bundlePath, Environment::homeDirectory());
+}
+
 std::optional<RunningApplication::Description> describe(int procFd, pid_t pid, uid_t user,
                                                         BundleCache& bundles) {
   // Most processes run from no bundle: that is found with one lookup, and
@@ -206,7 +220,9 @@ std::optional<RunningApplication::Description> describe(int procFd, pid_t pid, u
   std::optional<std::string> executable = executablePath(procFd, pid);
   if (!executable) return std::nullopt;
   std::optional<std::string> bundlePath = bundlePathOfExecutable(*executable);
-  if (!bundlePath || !ownedBy(procFd, pid, user)) return std::nullopt;
+  if (!bundlePath || !belongsToThisMachine(*bundlePath) || !ownedBy(procFd, pid, user)) {
+    return std::nullopt;
+  }
   std::optional<ProcessStat> stat = readProcessStat(pid);
   if (!stat || stat->state == 'Z' || stat->state == 'X') return std::nullopt;
   auto cached = bundles.find(*bundlePath);

@@ -6,6 +6,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <mutex>
 #include <nlohmann/json.hpp>
 
 #include "platform/plist/PropertyListSerialization.h"
@@ -41,6 +42,15 @@ class UpdateRunServiceTest : public StoreAndServiceTest {
                         .title = "Notes",
                         .version = "2.0",
                         .actionParams = "itemId=" + std::to_string(kNotesID)});
+    // An OS update that needs no restart, which the run installs too.
+    const std::string framework = platform_.root() + "/var/lib/larder-platform";
+    fs::create_directories(framework);
+    ASSERT_TRUE(FileIO::writeAtomically(
+        framework + "/system-updates.plist",
+        PropertyListSerialization::writeXml(PlistDictionary{
+            {"catalog",
+             PlistArray{PlistDictionary{
+                 {"productKey", "SEC-1"}, {"isRecommended", true}, {"installSeconds", 0.3}}}}})));
     const std::string preferences = platform_.home() + "/.config/larder";
     fs::create_directories(preferences);
     ASSERT_TRUE(FileIO::writeAtomically(
@@ -83,8 +93,26 @@ TEST_F(UpdateRunServiceTest, AReportStagesTheUpdateOfARunningAppAndTheNextInstal
   ASSERT_TRUE(pid);
   pid_ = *pid;
   ASSERT_TRUE(eventually([&] { return RunningApplication::withPid(pid_) != nullptr; }));
+  auto observer = client();
+  std::mutex mutex;
+  std::vector<double> percents;
+  observer->exportCallbackObject(
+      "/test/progress", "VendOSUpdateProgressObserver", "OsUpdatesChangedProgress", "aa{sv}a{sv}",
+      [&](const PlistArray& arguments) {
+        std::lock_guard lock(mutex);
+        const PlistArray* updates = arguments.at(0).array();
+        if (updates && !updates->empty() && updates->front()["productKey"] == PlistValue("SEC-1")) {
+          percents.push_back(arguments.at(1)["percentComplete"].doubleValue());
+        }
+      });
+  observer->call("AddOSUpdateProgressObserver", {"/test/progress"});
 
   backgroundRun();
+  // The OS update went in through the framework, its progress told on the bus.
+  EXPECT_TRUE(eventually([&] {
+    std::lock_guard lock(mutex);
+    return !percents.empty() && percents.back() == 100.0;
+  })) << service_->log();
   nlohmann::json updates = listedUpdates();
   ASSERT_EQ(updates.size(), 1U) << service_->log();
   EXPECT_EQ(updates[0]["isStaged"], true);
@@ -100,7 +128,7 @@ TEST_F(UpdateRunServiceTest, AReportStagesTheUpdateOfARunningAppAndTheNextInstal
   ::kill(pid_, SIGKILL);
   ASSERT_TRUE(eventually([&] { return RunningApplication::withPid(pid_) == nullptr; }));
   backgroundRun();
-  EXPECT_EQ(installedVersion(), "2.0");
+  EXPECT_EQ(installedVersion(), "2.0") << service_->log();
   EXPECT_TRUE(listedUpdates().empty());
   const LarderctlRun product = run({"--json", "product", "--bundle-id", "com.example.e2e.notes"});
   EXPECT_EQ(nlohmann::json::parse(product.output)["bundleVersion"], "2.0") << product.output;
