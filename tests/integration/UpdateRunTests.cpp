@@ -13,6 +13,7 @@
 #include "platform/system/FileIO.h"
 #include "running-apps/PlugInHost.h"
 #include "running-apps/RunningApplication.h"
+#include "running-apps/RunningApplicationFacts.h"
 #include "software-map/SoftwareMap.h"
 #include "software-map/VendSoftwareMapObserver.h"
 #include "store-runtime/core/DaemonDefaults.h"

@@ -19,6 +19,7 @@
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/value/PlistValue.h"
 #include "running-apps/RunningApplication.h"
+#include "running-apps/RunningApplicationFacts.h"
 #include "tests/unit/ScopedEnvironment.h"
 #include "tests/unit/TemporaryFolder.h"
 

@@ -5,6 +5,7 @@
 
 #include "platform/dispatch/DispatchSemaphore.h"
 #include "running-apps/RunningApplication.h"
+#include "running-apps/RunningApplicationFacts.h"
 #include "tests/unit/runningapps/AppTestSupport.h"
 
 namespace larder {
