@@ -1,0 +1,38 @@
+#!/bin/sh
+# The public tools' side of the update run's timing: the same work around
+# the update as `larder-update-run-timing --run DIR` (a fresh copy of the
+# installed 1.0 bundles, larder-store started on loopback), then each of the
+# 100 packages fetched with curl, one after another, and unpacked with tar
+# into a scratch folder.
+#
+#   curl-and-tar.sh DIR     (DIR made by larder-update-run-timing --prepare)
+#
+# The store program is $LARDER_STORE, or larder-store on the PATH.
+set -eu
+dir=$(cd "$1" && pwd)
+store=${LARDER_STORE:-larder-store}
+work=$dir/curl-work
+
+rm -rf "$work"
+mkdir -p "$work/packages" "$work/unpacked"
+cp -R "$dir/pristine" "$work/root"
+
+"$store" --catalogue "$dir/catalogue" --port 0 >"$work/store.out" 2>/dev/null &
+store_pid=$!
+trap 'kill "$store_pid" 2>/dev/null; wait "$store_pid" 2>/dev/null || true' EXIT
+until grep -q '^larder-store listening on ' "$work/store.out"; do
+  kill -0 "$store_pid" || exit 1
+  sleep 0.01
+done
+base=$(sed -n 's/^larder-store listening on //p' "$work/store.out")
+
+count=0
+for package in "$dir"/catalogue/items/*/*.tar; do
+  ware=$(basename "$(dirname "$package")")
+  name=$(basename "$package")
+  curl -sSf -o "$work/packages/$name" "$base/assets/$ware/$name"
+  mkdir "$work/unpacked/$ware"
+  tar -xf "$work/packages/$name" -C "$work/unpacked/$ware"
+  count=$((count + 1))
+done
+[ "$count" -eq 100 ]
