@@ -1,15 +1,20 @@
 #!/bin/sh
 # The public tools' side of the update run's timing: the same work around
 # the update as `larder-update-run-timing --run DIR` (a fresh copy of the
-# installed 1.0 bundles, larder-store started on loopback), then each of the
-# 100 packages fetched with curl, one after another, and unpacked with tar
+# installed 1.0 bundles, larder-store started on loopback), then the 100
+# packages fetched with curl one after another and each unpacked with tar
 # into a scratch folder.
 #
-#   curl-and-tar.sh DIR     (DIR made by larder-update-run-timing --prepare)
+#   curl-and-tar.sh DIR [--one-curl]
 #
-# The store program is $LARDER_STORE, or larder-store on the PATH.
+# DIR is made by `larder-update-run-timing --prepare DIR`. By default each
+# package is fetched by a curl process of its own; with --one-curl a single
+# curl fetches them all in turn over one connection, which leaves out the
+# 100 process starts (the stricter reference). The store program is
+# $LARDER_STORE, or larder-store on the PATH.
 set -eu
 dir=$(cd "$1" && pwd)
+mode=${2:-}
 store=${LARDER_STORE:-larder-store}
 work=$dir/curl-work
 
@@ -26,13 +31,23 @@ until grep -q '^larder-store listening on ' "$work/store.out"; do
 done
 base=$(sed -n 's/^larder-store listening on //p' "$work/store.out")
 
-count=0
+set --
 for package in "$dir"/catalogue/items/*/*.tar; do
   ware=$(basename "$(dirname "$package")")
   name=$(basename "$package")
-  curl -sSf -o "$work/packages/$name" "$base/assets/$ware/$name"
+  if [ "$mode" = --one-curl ]; then
+    set -- "$@" -o "$work/packages/$ware.tar" "$base/assets/$ware/$name"
+  else
+    curl -sSf -o "$work/packages/$ware.tar" "$base/assets/$ware/$name"
+  fi
+done
+[ "$#" -eq 0 ] || curl -sSf "$@"
+
+count=0
+for package in "$work"/packages/*.tar; do
+  ware=$(basename "$package" .tar)
   mkdir "$work/unpacked/$ware"
-  tar -xf "$work/packages/$name" -C "$work/unpacked/$ware"
+  tar -xf "$package" -C "$work/unpacked/$ware"
   count=$((count + 1))
 done
 [ "$count" -eq 100 ]
