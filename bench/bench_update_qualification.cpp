@@ -35,7 +35,9 @@ using namespace larder;
 
 constexpr int kAppUpdates = 2'000;
 
-std::string bundleIdentifier(int index) { return "com.example.app" + std::to_string(index); }
+std::string bundleIdentifier(int index) {
+  return "com.example.app" + std::to_string(index);
+}
 
 // The cache record of one update; staged ones carry the abort code of the
 // run that held them back.

@@ -54,8 +54,12 @@ constexpr char kAccountName[] = "bench@example.com";
 constexpr char kPassword[] = "pw";
 constexpr char kOpaqueAccountID[] = "account-1";
 
-std::string appName(int index) { return "App" + std::to_string(index); }
-std::uint64_t wareID(int index) { return kFirstWareID + static_cast<std::uint64_t>(index); }
+std::string appName(int index) {
+  return "App" + std::to_string(index);
+}
+std::uint64_t wareID(int index) {
+  return kFirstWareID + static_cast<std::uint64_t>(index);
+}
 
 void writePlist(const fs::path& path, const PlistDictionary& contents) {
   bench::writeFixture(path.string(), PropertyListSerialization::writeXml(contents));
@@ -114,18 +118,19 @@ void prepare(const fs::path& dir) {
     const fs::path item = catalogue / "items" / std::to_string(wareID(index));
     fs::create_directories(item);
     const std::string package = appName(index) + ".tar";
-    if (waitFor(bench::spawn({LARDER_STORE_PATH, "pack", bundle.string(), (item / package).string()},
-                             {}, -1)) != 0) {
+    if (waitFor(bench::spawn(
+            {LARDER_STORE_PATH, "pack", bundle.string(), (item / package).string()}, {}, -1)) !=
+        0) {
       throw std::runtime_error("larder-store pack " + bundle.string() + " failed");
     }
-    writePlist(item / "item.plist",
-               {{"ware-id", wareID(index)},
-                {"bundle-id", "com.example.bench" + std::to_string(index)},
-                {"title", appName(index)},
-                {"version", "2.0"},
-                {"release-date", PlistDate{1700000000}},
-                {"package", package},
-                {"action-params", "productType=C&price=0&itemId=" + std::to_string(wareID(index))}});
+    writePlist(item / "item.plist", {{"ware-id", wareID(index)},
+                                     {"bundle-id", "com.example.bench" + std::to_string(index)},
+                                     {"title", appName(index)},
+                                     {"version", "2.0"},
+                                     {"release-date", PlistDate{1700000000}},
+                                     {"package", package},
+                                     {"action-params", "productType=C&price=0&itemId=" +
+                                                           std::to_string(wareID(index))}});
     writeBundle(dir / "pristine" / "Applications", index, "1.0", kInstalledPayloadBytes);
   }
   fs::remove_all(dir / "bundles");
@@ -137,9 +142,9 @@ class Store {
   explicit Store(const fs::path& catalogue) {
     int ends[2];
     if (::pipe(ends) != 0) throw std::runtime_error("pipe");
-    pid_ = bench::spawn({LARDER_STORE_PATH, "--catalogue", catalogue.string(), "--port", "0",
-                         "--exit-with-parent"},
-                        {}, ends[1]);
+    pid_ = bench::spawn(
+        {LARDER_STORE_PATH, "--catalogue", catalogue.string(), "--port", "0", "--exit-with-parent"},
+        {}, ends[1]);
     ::close(ends[1]);
     FILE* output = ::fdopen(ends[0], "r");
     char line[512] = {};
