@@ -31,10 +31,13 @@ until grep -q '^larder-store listening on ' "$work/store.out"; do
 done
 base=$(sed -n 's/^larder-store listening on //p' "$work/store.out")
 
+# Names are cut with the shell's own expansions: a basename process per
+# package would be timed as part of the reference.
 set --
 for package in "$dir"/catalogue/items/*/*.tar; do
-  ware=$(basename "$(dirname "$package")")
-  name=$(basename "$package")
+  folder=${package%/*}
+  ware=${folder##*/}
+  name=${package##*/}
   if [ "$mode" = --one-curl ]; then
     set -- "$@" -o "$work/packages/$ware.tar" "$base/assets/$ware/$name"
   else
@@ -45,7 +48,8 @@ done
 
 count=0
 for package in "$work"/packages/*.tar; do
-  ware=$(basename "$package" .tar)
+  ware=${package##*/}
+  ware=${ware%.tar}
   mkdir "$work/unpacked/$ware"
   tar -xf "$package" -C "$work/unpacked/$ware"
   count=$((count + 1))
