@@ -32,7 +32,7 @@ done
 base=$(sed -n 's/^larder-store listening on //p' "$work/store.out")
 
 # Names are cut with the shell's own expansions: a basename process per
-# package would be timed as part of the reference.
+# package would be timed with the reference.
 set --
 for package in "$dir"/catalogue/items/*/*.tar; do
   folder=${package%/*}

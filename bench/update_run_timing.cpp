@@ -12,7 +12,7 @@
 //     stages and installs every update, and exits 0 only when all 100
 //     bundles are at 2.0.
 //
-// The copy of the 1.0 bundles is part of every run on both sides, so the two
+// The copy of the 1.0 bundles is in every run on both sides, so the two
 // commands do the same work around the update itself.
 
 #include <signal.h>
