@@ -58,9 +58,24 @@ std::string describeHolds(const std::vector<std::shared_ptr<PlugInHold>>& holds)
 
 // Every bundle in the application folders with that identifier, in the
 // registry's order.
+bool isInApplicationFolder(const std::string& path) {
+  for (const std::string& folder : ApplicationRegistry::applicationFolders()) {
+    if (path.size() > folder.size() && path.starts_with(folder) && path[folder.size()] == '/') {
+      return true;
+    }
+  }
+  return false;
+}
+
+// The installed bundles of the identifier whose plug-ins could refuse a
+// hold. A hold on a bundle without a busy plug-in is granted and gives the
+// question nothing, so only the bundles that hold a busy plug-in are looked
+// at: one read of the plug-in host's state instead of opening every bundle
+// of the application folders, and no hold written for the others.
 std::vector<std::string> bundlePathsForIdentifier(std::string_view bundleIdentifier) {
   std::vector<std::string> paths;
-  for (const std::string& path : ApplicationRegistry::allApplicationPaths()) {
+  for (const std::string& path : PlugInHost::containingPathsOfBusyPlugIns()) {
+    if (!isInApplicationFolder(path)) continue;
     std::optional<Bundle> bundle = Bundle::open(path);
     if (bundle && bundle->identifier() == bundleIdentifier) paths.push_back(path);
   }

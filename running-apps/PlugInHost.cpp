@@ -89,6 +89,15 @@ std::optional<std::string> PlugInHost::extensionPointOfPlugIn(const std::string&
   return point ? std::optional<std::string>(*point) : std::nullopt;
 }
 
+std::vector<std::string> PlugInHost::containingPathsOfBusyPlugIns() {
+  std::vector<std::string> paths;
+  for (const PlistValue& entry : busyEntries()) {
+    const std::string* path = entry[kContainingPathKey].string();
+    if (path && std::find(paths.begin(), paths.end(), *path) == paths.end()) paths.push_back(*path);
+  }
+  return paths;
+}
+
 bool PlugInHost::addBusyPlugIn(PlistDictionary entry) {
   return stateFile().updateDictionary([&](PlistDictionary& state) {
     PlistArray busy;

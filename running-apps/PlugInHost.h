@@ -7,6 +7,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/error/VendError.h"
 #include "platform/value/PlistValue.h"
@@ -63,6 +64,8 @@ class PlugInHost {
   static void releaseHold(const std::shared_ptr<PlugInHold>& hold);
   // The busy entry of that plug-in process; empty when there is none.
   static PlistDictionary informationForPlugInWithPid(pid_t pid);
+  // The bundles that hold a plug-in in use right now, each once.
+  static std::vector<std::string> containingPathsOfBusyPlugIns();
 
   // The extension point of the plug-in bundle at `plugInPath`, from
   // "HostExtension" -> "HostExtensionPointIdentifier" of its bundle.plist.

@@ -21,7 +21,6 @@ namespace larder {
 
 namespace {
 
-constexpr std::string_view kSpeaker = "UpdateController";
 constexpr std::string_view kOptInTraceName = "com.orvane.Quaymart.autoupdate.opt_in";
 
 using Clock = UpdateController::Clock;
