@@ -72,9 +72,10 @@ bool isInApplicationFolder(const std::string& path) {
 // question nothing, so only the bundles that hold a busy plug-in are looked
 // at: one read of the plug-in host's state instead of opening every bundle
 // of the application folders, and no hold written for the others.
-std::vector<std::string> bundlePathsForIdentifier(std::string_view bundleIdentifier) {
+std::vector<std::string> bundlePathsForIdentifier(std::string_view bundleIdentifier,
+                                                  const std::vector<std::string>& busyContainers) {
   std::vector<std::string> paths;
-  for (const std::string& path : PlugInHost::containingPathsOfBusyPlugIns()) {
+  for (const std::string& path : busyContainers) {
     if (!isInApplicationFolder(path)) continue;
     std::optional<Bundle> bundle = Bundle::open(path);
     if (bundle && bundle->identifier() == bundleIdentifier) paths.push_back(path);
@@ -134,15 +135,43 @@ void erase(std::vector<std::shared_ptr<RunningApplication>>& applications,
 
 // --- Questions about one bundle identifier ---
 
+AppHelper::Survey AppHelper::Survey::take() {
+  Survey survey;
+  for (std::shared_ptr<RunningApplication>& application :
+       RunningApplication::allRunningApplications()) {
+    if (application->bundleIdentifier()) {
+      survey.running_.emplace(*application->bundleIdentifier(), std::move(application));
+    }
+  }
+  survey.busyPlugInContainers_ = PlugInHost::containingPathsOfBusyPlugIns();
+  return survey;
+}
+
+std::vector<std::shared_ptr<RunningApplication>>
+AppHelper::Survey::applicationsWithBundleIdentifier(std::string_view bundleIdentifier) const {
+  std::vector<std::shared_ptr<RunningApplication>> applications;
+  auto [first, last] = running_.equal_range(bundleIdentifier);
+  for (auto it = first; it != last; ++it) applications.push_back(it->second);
+  return applications;
+}
+
 bool AppHelper::isAppRunningWithBundleID(std::string_view bundleIdentifier,
                                          std::optional<std::string>* appName,
                                          std::optional<PlugInHostApps>* plugInHostApps) {
   if (bundleIdentifier.empty()) return false;
-  Applications running =
-      RunningApplication::runningApplicationsWithBundleIdentifier(bundleIdentifier);
+  return isAppRunningWithBundleID(bundleIdentifier, appName, plugInHostApps, Survey::take());
+}
+
+bool AppHelper::isAppRunningWithBundleID(std::string_view bundleIdentifier,
+                                         std::optional<std::string>* appName,
+                                         std::optional<PlugInHostApps>* plugInHostApps,
+                                         const Survey& survey) {
+  if (bundleIdentifier.empty()) return false;
+  Applications running = survey.applicationsWithBundleIdentifier(bundleIdentifier);
   const bool isRunning = !running.empty();
   if (isRunning && appName) *appName = running.front()->localizedName();
-  for (const std::string& bundlePath : bundlePathsForIdentifier(bundleIdentifier)) {
+  for (const std::string& bundlePath :
+       bundlePathsForIdentifier(bundleIdentifier, survey.busyPlugInContainers())) {
     HoldAnswer answer = holdPlugInsAndWait(bundlePath);
     // Only a probe: a hold that was granted goes at once.
     if (answer.hold) PlugInHost::releaseHold(answer.hold);

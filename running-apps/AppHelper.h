@@ -50,10 +50,32 @@ class AppHelperQuitPrompt {
 // and starts them again afterwards.
 class AppHelper : public std::enable_shared_from_this<AppHelper> {
  public:
+  // What runs and which bundles hold busy plug-ins, looked at once: a pass
+  // that asks about many bundle identifiers in a moment asks it, instead of
+  // scanning the processes and reading the plug-in host for each.
+  class Survey {
+   public:
+    static Survey take();
+    [[nodiscard]] std::vector<std::shared_ptr<RunningApplication>> applicationsWithBundleIdentifier(
+        std::string_view bundleIdentifier) const;
+    [[nodiscard]] const std::vector<std::string>& busyPlugInContainers() const {
+      return busyPlugInContainers_;
+    }
+
+   private:
+    std::multimap<std::string, std::shared_ptr<RunningApplication>, std::less<>> running_;
+    std::vector<std::string> busyPlugInContainers_;
+  };
+
   // --- Questions about one bundle identifier; any thread ---
   static bool isAppRunningWithBundleID(std::string_view bundleIdentifier,
                                        std::optional<std::string>* appName,
                                        std::optional<PlugInHostApps>* plugInHostApps);
+  // The same question answered from a survey taken a moment ago.
+  static bool isAppRunningWithBundleID(std::string_view bundleIdentifier,
+                                       std::optional<std::string>* appName,
+                                       std::optional<PlugInHostApps>* plugInHostApps,
+                                       const Survey& survey);
   static std::optional<PlugInHostApps> getPluginHostAppInfo(const PlistDictionary& holdErrorInfo,
                                                             std::string_view containerBundleID);
   static const std::vector<std::string>& immortalAppBundleIDWhiteList();

@@ -146,14 +146,32 @@ class UpdateOperation : public VendOperation {
   // last background run.
   static std::string auditFilePath();
 
+  // What the decisions read from the preferences and the machine, taken
+  // once for a pass over many updates; within such a pass the answers
+  // could only change by a moment's difference.
+  struct DecisionInputs {
+    std::optional<std::int64_t> alwaysAbortCode;
+    bool autoUpdateEnabled = false;
+    double minimumReleaseInterval = 0;
+    bool updateImmortalApps = false;
+    bool updateForegroundApps = false;
+    AppHelper::Survey survey;
+    static DecisionInputs read();
+  };
+
   // --- Qualification; under the lock of all runs ---
   std::vector<LedgerUpdateRef> appUpdatesToStageOrInstallNow();
   // True with code 0 when the app update may be installed now; the
   // download, when given, is preflighted as well.
   bool shouldAutoInstallAppUpdate(const std::optional<std::string>& bundleIdentifier,
                                   const TillDownloadRef& download, UpdateAbort* abort);
+  bool shouldAutoInstallAppUpdate(const std::optional<std::string>& bundleIdentifier,
+                                  const TillDownloadRef& download, UpdateAbort* abort,
+                                  const DecisionInputs& inputs);
   std::vector<SysupQuaymartUpdate> osUpdatesToInstallNow();
   bool shouldInstallOSUpdate(const SysupQuaymartUpdate& update, UpdateAbort* abort);
+  bool shouldInstallOSUpdate(const SysupQuaymartUpdate& update, UpdateAbort* abort,
+                             const DecisionInputs& inputs);
 
  protected:
   void run() override;
@@ -187,13 +205,15 @@ class UpdateOperation : public VendOperation {
 
   // --- Qualification helpers ---
   [[nodiscard]] bool shouldDownloadAppUpdateAssets() const;
-  bool runningAppBlocksInstall(const std::string& bundleIdentifier, UpdateAbort* abort);
+  bool runningAppBlocksInstall(const std::string& bundleIdentifier, UpdateAbort* abort,
+                               const AppHelper::Survey& survey);
   bool preflightAllows(const TillDownloadRef& download, UpdateAbort* abort);
   // The download layer's answer on the download's preflight package: whether
   // the item may be installed, and what objected.
   std::pair<bool, PlistValue> checkPreflight(const TillDownloadMetadata& metadata,
                                              const PlistValue& systemVersion);
-  bool appToCloseBlocksInstall(const std::string& bundleIdentifier, UpdateAbort* abort);
+  bool appToCloseBlocksInstall(const std::string& bundleIdentifier, UpdateAbort* abort,
+                               const DecisionInputs& inputs);
   [[nodiscard]] bool isInstallLaterUpdate(const SysupQuaymartUpdate& update) const;
 
   // --- What only the user can answer ---

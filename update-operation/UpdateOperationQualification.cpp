@@ -21,7 +21,7 @@ namespace {
 constexpr std::string_view kSpeaker = "UpdateOperation";
 
 // The code every decision gives while the preference holds one.
-std::optional<std::int64_t> alwaysAbortCode() {
+std::optional<std::int64_t> alwaysAbortCodeByPreference() {
   PlistValue value =
       PreferenceStore::valueForKey(kDefaultsAlwaysAbortUpdatesCodeKey, kDaemonDefaultsID);
   if (value.isInteger() || value.isReal() || value.isBoolean()) return value.int64Value();
@@ -106,13 +106,15 @@ std::vector<LedgerUpdateRef> UpdateOperation::appUpdatesToStageOrInstallNow() {
   std::vector<LedgerUpdateRef> qualified;
   const bool downloadAssets = shouldDownloadAppUpdateAssets();
   const bool laterRun = s.nowIsLater && s.doItLaterMode != 0;
-  // The switch is read from its file at the first update that asks and
-  // then holds for the pass: a read per update cost 30 ms over 2,000.
-  std::optional<bool> autoUpdateEnabled;
-  const auto isAutoUpdatedEnabled = [&autoUpdateEnabled] {
-    if (!autoUpdateEnabled) autoUpdateEnabled = UpdatePolicy::isAutoUpdatedEnabled();
-    return *autoUpdateEnabled;
+  // The preferences and the machine are read at the first update that asks
+  // and then hold for the pass: a read per update cost over a second for
+  // 2,000.
+  std::optional<DecisionInputs> inputs;
+  const auto decisionInputs = [&inputs]() -> const DecisionInputs& {
+    if (!inputs) inputs = DecisionInputs::read();
+    return *inputs;
   };
+  const auto isAutoUpdatedEnabled = [&] { return decisionInputs().autoUpdateEnabled; };
   for (const LedgerUpdateRef& update : *controller->updateQueue()->availableUpdates()) {
     if (!downloadAssets && !update->isStaged()) {
       TILL_LOG(2,
@@ -133,7 +135,8 @@ std::vector<LedgerUpdateRef> UpdateOperation::appUpdatesToStageOrInstallNow() {
     }
     if (!downloadAssets && update->isStaged() && update->autoUpdateAbortCode() != 0) {
       UpdateAbort abort;
-      const bool shouldInstall = shouldAutoInstallAppUpdate(update->bundleID(), nullptr, &abort);
+      const bool shouldInstall =
+          shouldAutoInstallAppUpdate(update->bundleID(), nullptr, &abort, decisionInputs());
       auditAppUpdate(update->itemIdentifierValue(), shouldInstall, abort);
       if (abort.code == update->autoUpdateAbortCode()) {
         TILL_LOG(2,
@@ -156,10 +159,26 @@ std::vector<LedgerUpdateRef> UpdateOperation::appUpdatesToStageOrInstallNow() {
   return qualified;
 }
 
+UpdateOperation::DecisionInputs UpdateOperation::DecisionInputs::read() {
+  return DecisionInputs{
+      .alwaysAbortCode = alwaysAbortCodeByPreference(),
+      .autoUpdateEnabled = UpdatePolicy::isAutoUpdatedEnabled(),
+      .minimumReleaseInterval = UpdatePolicy::autoInstallUpdateMinimumReleaseTimeInterval(),
+      .updateImmortalApps = preferenceIsTrue(kDefaultsAutoUpdateImmortalAppsKey),
+      .updateForegroundApps = preferenceIsTrue(kDefaultsAutoUpdateForegroundAppsKey),
+      .survey = AppHelper::Survey::take()};
+}
+
 bool UpdateOperation::shouldAutoInstallAppUpdate(const std::optional<std::string>& bundleIdentifier,
                                                  const TillDownloadRef& download,
                                                  UpdateAbort* abort) {
-  if (std::optional<std::int64_t> code = alwaysAbortCode()) return abortByPreference(abort, *code);
+  return shouldAutoInstallAppUpdate(bundleIdentifier, download, abort, DecisionInputs::read());
+}
+
+bool UpdateOperation::shouldAutoInstallAppUpdate(const std::optional<std::string>& bundleIdentifier,
+                                                 const TillDownloadRef& download,
+                                                 UpdateAbort* abort, const DecisionInputs& inputs) {
+  if (inputs.alwaysAbortCode) return abortByPreference(abort, *inputs.alwaysAbortCode);
   const UpdateOperationSettings s = settings();
   if (s.userInitiated) return proceed(abort);
   if (!bundleIdentifier) return abortWith(abort, kAbortNoBundleID, "nil bundleID specified");
@@ -170,7 +189,7 @@ bool UpdateOperation::shouldAutoInstallAppUpdate(const std::optional<std::string
   if (putOffToNow) {
     std::optional<std::string> appName;
     std::optional<PlugInHostApps> hosts;
-    if (AppHelper::isAppRunningWithBundleID(*bundleIdentifier, &appName, &hosts)) {
+    if (AppHelper::isAppRunningWithBundleID(*bundleIdentifier, &appName, &hosts, inputs.survey)) {
       if (hosts && !hosts->empty()) {
         if (abort) abort->appName = appName;
         return abortWith(
@@ -180,28 +199,27 @@ bool UpdateOperation::shouldAutoInstallAppUpdate(const std::optional<std::string
       std::optional<std::string> reason;
       std::optional<std::string> name;
       if (AppHelper::isAppImmortalWithBundleID(*bundleIdentifier, &reason, &name) &&
-          !preferenceIsTrue(kDefaultsAutoUpdateImmortalAppsKey)) {
+          !inputs.updateImmortalApps) {
         if (abort) abort->appName = name;
         return abortWith(abort, kAbortImmortal,
                          "the app can not be quit safely (" + reason.value_or("(null)") + ")");
       }
       name.reset();
       if (AppHelper::isAppForemostWithBundleID(*bundleIdentifier, &name) &&
-          !preferenceIsTrue(kDefaultsAutoUpdateForegroundAppsKey)) {
+          !inputs.updateForegroundApps) {
         if (abort) abort->appName = name;
         return abortWith(abort, kAbortForemost, "the app is foremost (active)");
       }
     }
   } else {
-    if (!UpdatePolicy::isAutoUpdatedEnabled()) {
+    if (!inputs.autoUpdateEnabled) {
       return abortWith(abort, kAbortAutoUpdateDisabled, "auto-update is disabled by preference");
     }
     LedgerUpdateRef update =
         controller->updateQueue()->availableUpdateWithBundleIdentifier(*bundleIdentifier);
-    const auto oldEnough =
-        UpdatePolicy::Clock::now() -
-        std::chrono::duration_cast<UpdatePolicy::Clock::duration>(std::chrono::duration<double>(
-            UpdatePolicy::autoInstallUpdateMinimumReleaseTimeInterval()));
+    const auto oldEnough = UpdatePolicy::Clock::now() -
+                           std::chrono::duration_cast<UpdatePolicy::Clock::duration>(
+                               std::chrono::duration<double>(inputs.minimumReleaseInterval));
     const std::optional<PlistDate> releaseDate = update ? update->releaseDate() : std::nullopt;
     if (!releaseDate || UpdatePolicy::timePointOf(*releaseDate) >= oldEnough) {
       return abortWith(abort, kAbortTooRecent, "update is too recent");
@@ -210,17 +228,19 @@ bool UpdateOperation::shouldAutoInstallAppUpdate(const std::optional<std::string
         !controller->appUpdatesToInstallLaterIncludesBundleID(*bundleIdentifier)) {
       return abortWith(abort, kAbortTooSoon, "too soon to start auto-update");
     }
-    if (runningAppBlocksInstall(*bundleIdentifier, abort)) return false;
+    if (runningAppBlocksInstall(*bundleIdentifier, abort, inputs.survey)) return false;
   }
   if (download && !preflightAllows(download, abort)) return false;
   return proceed(abort);
 }
 
 bool UpdateOperation::runningAppBlocksInstall(const std::string& bundleIdentifier,
-                                              UpdateAbort* abort) {
+                                              UpdateAbort* abort, const AppHelper::Survey& survey) {
   std::optional<std::string> appName;
   std::optional<PlugInHostApps> hosts;
-  if (!AppHelper::isAppRunningWithBundleID(bundleIdentifier, &appName, &hosts)) return false;
+  if (!AppHelper::isAppRunningWithBundleID(bundleIdentifier, &appName, &hosts, survey)) {
+    return false;
+  }
   if (abort) abort->appName = appName;
   if (hosts && !hosts->empty()) {
     abortWith(abort, kAbortPlugInsInUse,
@@ -278,6 +298,7 @@ std::vector<SysupQuaymartUpdate> UpdateOperation::osUpdatesToInstallNow() {
     return *s.osUpdatesToInstall;
   }
   SysupQuaymartUpdateController& sysup = SysupQuaymartUpdateController::sharedUpdateController();
+  const DecisionInputs inputs = DecisionInputs::read();
   std::vector<SysupQuaymartUpdate> candidates;
   for (const SysupQuaymartUpdate& update : sysup.availableUpdates()) {
     const bool needsNoRestart = sysup.actionRequiredForUpdates({update}) == 0;
@@ -286,7 +307,7 @@ std::vector<SysupQuaymartUpdate> UpdateOperation::osUpdatesToInstallNow() {
       candidate = update.isCritical();
     } else {
       candidate =
-          (needsNoRestart && update.isRecommended() && UpdatePolicy::isAutoUpdatedEnabled()) ||
+          (needsNoRestart && update.isRecommended() && inputs.autoUpdateEnabled) ||
           (s.userInitiated && update.isRecommended() && !containsProductKey(candidates, update));
     }
     if (candidate) candidates.push_back(update);
@@ -299,7 +320,7 @@ std::vector<SysupQuaymartUpdate> UpdateOperation::osUpdatesToInstallNow() {
   std::vector<SysupQuaymartUpdate> qualified;
   for (const SysupQuaymartUpdate& update : candidates) {
     UpdateAbort abort;
-    const bool shouldInstall = shouldInstallOSUpdate(update, &abort);
+    const bool shouldInstall = shouldInstallOSUpdate(update, &abort, inputs);
     if (shouldInstall) {
       qualified.push_back(update);
     } else {
@@ -312,7 +333,12 @@ std::vector<SysupQuaymartUpdate> UpdateOperation::osUpdatesToInstallNow() {
 }
 
 bool UpdateOperation::shouldInstallOSUpdate(const SysupQuaymartUpdate& update, UpdateAbort* abort) {
-  if (std::optional<std::int64_t> code = alwaysAbortCode()) return abortByPreference(abort, *code);
+  return shouldInstallOSUpdate(update, abort, DecisionInputs::read());
+}
+
+bool UpdateOperation::shouldInstallOSUpdate(const SysupQuaymartUpdate& update, UpdateAbort* abort,
+                                            const DecisionInputs& inputs) {
+  if (inputs.alwaysAbortCode) return abortByPreference(abort, *inputs.alwaysAbortCode);
   const UpdateOperationSettings s = settings();
   if (s.userInitiated) return proceed(abort);
   const bool later = isInstallLaterUpdate(update);
@@ -350,15 +376,17 @@ bool UpdateOperation::shouldInstallOSUpdate(const SysupQuaymartUpdate& update, U
     return abortWith(abort, kAbortNotRecommended, "the Update is not recommended");
   }
   for (const std::string& identifier : update.applicationIdentifiersToClose()) {
-    if (appToCloseBlocksInstall(identifier, abort)) return false;
+    if (appToCloseBlocksInstall(identifier, abort, inputs)) return false;
   }
   return proceed(abort);
 }
 
 bool UpdateOperation::appToCloseBlocksInstall(const std::string& bundleIdentifier,
-                                              UpdateAbort* abort) {
+                                              UpdateAbort* abort, const DecisionInputs& inputs) {
   std::optional<PlugInHostApps> hosts;
-  if (!AppHelper::isAppRunningWithBundleID(bundleIdentifier, nullptr, &hosts)) return false;
+  if (!AppHelper::isAppRunningWithBundleID(bundleIdentifier, nullptr, &hosts, inputs.survey)) {
+    return false;
+  }
   auto blockedBy = [&](std::int64_t code, std::string reason,
                        std::optional<std::vector<std::string>> names) {
     if (abort) {
@@ -380,7 +408,7 @@ bool UpdateOperation::appToCloseBlocksInstall(const std::string& bundleIdentifie
   std::optional<std::string> reason;
   std::optional<std::string> name;
   if (AppHelper::isAppImmortalWithBundleID(bundleIdentifier, &reason, &name) &&
-      !preferenceIsTrue(kDefaultsAutoUpdateImmortalAppsKey)) {
+      !inputs.updateImmortalApps) {
     return blockedBy(kAbortImmortal,
                      "the Update requires " + bundleIdentifier +
                          " to be quit but it is immortal (" + reason.value_or("(null)") + ")",
@@ -388,7 +416,7 @@ bool UpdateOperation::appToCloseBlocksInstall(const std::string& bundleIdentifie
   }
   name.reset();
   if (AppHelper::isAppForemostWithBundleID(bundleIdentifier, &name) &&
-      !preferenceIsTrue(kDefaultsAutoUpdateForegroundAppsKey)) {
+      !inputs.updateForegroundApps) {
     return blockedBy(kAbortForemost,
                      "the Update requires " + bundleIdentifier + " to be quit but it is foremost",
                      oneName(name));
