@@ -4,10 +4,12 @@
 // inside an application bundle.
 
 #include <benchmark/benchmark.h>
+
 #include <signal.h>
 #include <spawn.h>
 #include <sys/wait.h>
 #include <unistd.h>
+#include <algorithm>
 
 #include <cstdlib>
 #include <filesystem>
@@ -73,39 +75,38 @@ class SleepingProcesses {
   std::vector<pid_t> pids_;
 };
 
-void BM_AllRunningApplications(benchmark::State& state) {
+// Times `scan` among the sleeping processes; it returns how many of the
+// bundle's processes it found, all of which must be.
+template <typename Scan>
+void timeScan(benchmark::State& state, Scan&& scan) {
   SleepingProcesses processes;
   if (processes.count() != kProcesses) {
     state.SkipWithError("could not start the processes");
     return;
   }
   std::size_t found = 0;
-  for (auto _ : state) {
-    auto applications = RunningApplication::allRunningApplications();
-    found = 0;
-    for (const auto& application : applications) {
-      if (application->bundleIdentifier() == kIdentifier) ++found;
-    }
-    benchmark::DoNotOptimize(applications);
-  }
+  for (auto _ : state) found = scan();
   if (found != kBundleProcesses) state.SkipWithError("the bundle processes were not all found");
   state.counters["processes"] = static_cast<double>(processes.count());
+}
+
+void BM_AllRunningApplications(benchmark::State& state) {
+  timeScan(state, [] {
+    auto applications = RunningApplication::allRunningApplications();
+    benchmark::DoNotOptimize(applications);
+    return static_cast<std::size_t>(std::count_if(
+        applications.begin(), applications.end(),
+        [](const auto& application) { return application->bundleIdentifier() == kIdentifier; }));
+  });
 }
 BENCHMARK(BM_AllRunningApplications)->Unit(benchmark::kMillisecond);
 
 void BM_RunningApplicationsWithBundleIdentifier(benchmark::State& state) {
-  SleepingProcesses processes;
-  if (processes.count() != kProcesses) {
-    state.SkipWithError("could not start the processes");
-    return;
-  }
-  std::size_t found = 0;
-  for (auto _ : state) {
+  timeScan(state, [] {
     auto applications = RunningApplication::runningApplicationsWithBundleIdentifier(kIdentifier);
-    found = applications.size();
     benchmark::DoNotOptimize(applications);
-  }
-  if (found != kBundleProcesses) state.SkipWithError("the bundle processes were not all found");
+    return applications.size();
+  });
 }
 BENCHMARK(BM_RunningApplicationsWithBundleIdentifier)->Unit(benchmark::kMillisecond);
 

@@ -24,6 +24,7 @@
 
 #include "AssetService/DBusRemoteObjectFactory.h"
 #include "BenchProcesses.h"
+#include "BenchUpdatePlatform.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
 #include "software-map/SoftwareMap.h"
@@ -68,17 +69,6 @@ PlistDictionary osUpdate(int index) {
 class UpdateFixture {
  public:
   UpdateFixture() {
-    std::string pattern = (fs::temp_directory_path() / "larder-bench-updates-XXXXXX").string();
-    if (::mkdtemp(pattern.data()) == nullptr) std::abort();
-    base_ = pattern;
-    ::setenv("LARDER_ROOT", (base_ + "/root").c_str(), 1);
-    ::setenv("HOME", (base_ + "/home").c_str(), 1);
-    ::setenv("XDG_CACHE_HOME", (base_ + "/cache").c_str(), 1);
-    ::setenv("XDG_STATE_HOME", (base_ + "/state").c_str(), 1);
-    ::setenv("XDG_CONFIG_HOME", (base_ + "/config").c_str(), 1);
-    ::setenv("LARDER_LOG_LEVEL", "0", 1);
-    fs::create_directories(base_ + "/root/Applications");
-
     PlistArray catalog;
     for (int index = 0; index < kOSUpdates; ++index) catalog.emplace_back(osUpdate(index));
     PlatformStateFile::named(SysupQuaymartUpdateController::kStateFileName)
@@ -87,38 +77,13 @@ class UpdateFixture {
     (void)PreferenceStore::setValue(kDefaultsAutoUpdateEnabledKey, true, kDaemonDefaultsID);
     (void)PreferenceStore::setValue(kDefaultsAutoUpdateRestartRequiredEnabledKey, true,
                                     kDaemonDefaultsID);
-
-    SoftwareMap::Options options;
-    options.persistedStorePath = base_ + "/SoftwareMap";
-    options.discoverApplications = false;
-    options.liveQueries = false;
-    options.periodicReload = false;
-    map_.emplace(std::move(options));
   }
-  ~UpdateFixture() {
-    map_.reset();
-    std::error_code ignored;
-    fs::remove_all(base_, ignored);
-  }
-  UpdateFixture(const UpdateFixture&) = delete;
-  UpdateFixture& operator=(const UpdateFixture&) = delete;
 
   // A controller whose update queue starts with `appUpdates` updates.
   std::shared_ptr<UpdateController> controllerWithAppUpdates(int appUpdates) {
     PlistArray updates;
     for (int index = 0; index < appUpdates; ++index) updates.emplace_back(appUpdate(index));
-    std::string folder = VendFileManager::cacheDirectoryPathWithName(kDaemonDefaultsID);
-    fs::create_directories(folder);
-    if (!FileIO::writeAtomically(
-            folder + "/updates.plist",
-            PropertyListSerialization::writeBinary(
-                PlistDictionary{{"updates", updates}, {"incompatibleUpdates", PlistArray{}}}))) {
-      std::abort();
-    }
-    return UpdateController::make(
-        VendStoreClient::fromDictionary(
-            {{"identifier", "bench-" + std::to_string(appUpdates)}, {"clientType", 0}}),
-        *map_);
+    return platform_.controllerWithUpdates("bench-" + std::to_string(appUpdates), updates);
   }
 
  private:
@@ -130,8 +95,7 @@ class UpdateFixture {
     while (!done) std::this_thread::sleep_for(std::chrono::milliseconds(1));
   }
 
-  std::string base_;
-  std::optional<SoftwareMap> map_;
+  bench::BenchUpdatePlatform platform_{"larder-bench-updates"};
 };
 
 UpdateFixture& fixture() {

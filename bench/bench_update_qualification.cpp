@@ -18,7 +18,9 @@
 
 #include <filesystem>
 
-#include "bench/BenchFiles.h"
+#include "BenchFiles.h"
+#include "BenchUpdatePlatform.h"
+#include "bench/BenchUpdatePlatform.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/core/DaemonDefaults.h"
@@ -59,32 +61,9 @@ PlistDictionary queuedUpdate(int index, bool staged) {
 class QualificationFixture {
  public:
   QualificationFixture() {
-    std::string pattern = (fs::temp_directory_path() / "larder-bench-qualify-XXXXXX").string();
-    if (::mkdtemp(pattern.data()) == nullptr) std::abort();
-    base_ = pattern;
-    ::setenv("LARDER_ROOT", (base_ + "/root").c_str(), 1);
-    ::setenv("HOME", (base_ + "/home").c_str(), 1);
-    ::setenv("XDG_CACHE_HOME", (base_ + "/cache").c_str(), 1);
-    ::setenv("XDG_STATE_HOME", (base_ + "/state").c_str(), 1);
-    ::setenv("XDG_CONFIG_HOME", (base_ + "/config").c_str(), 1);
-    ::setenv("LARDER_LOG_LEVEL", "0", 1);
     for (int index = 0; index < kAppUpdates; ++index) installApp(index);
     (void)PreferenceStore::setValue(kDefaultsAutoUpdateEnabledKey, true, kDaemonDefaultsID);
-
-    SoftwareMap::Options options;
-    options.persistedStorePath = base_ + "/SoftwareMap";
-    options.discoverApplications = false;
-    options.liveQueries = false;
-    options.periodicReload = false;
-    map_.emplace(std::move(options));
   }
-  ~QualificationFixture() {
-    map_.reset();
-    std::error_code ignored;
-    fs::remove_all(base_, ignored);
-  }
-  QualificationFixture(const QualificationFixture&) = delete;
-  QualificationFixture& operator=(const QualificationFixture&) = delete;
 
   // A controller whose queue starts with the 2,000 updates.
   std::shared_ptr<UpdateController> controllerWithUpdates(bool staged) {
@@ -92,21 +71,13 @@ class QualificationFixture {
     for (int index = 0; index < kAppUpdates; ++index) {
       updates.emplace_back(queuedUpdate(index, staged));
     }
-    const std::string folder = VendFileManager::cacheDirectoryPathWithName(kDaemonDefaultsID);
-    fs::create_directories(folder);
-    bench::writeFixture(folder + "/updates.plist",
-                        PropertyListSerialization::writeBinary(PlistDictionary{
-                            {"updates", updates}, {"incompatibleUpdates", PlistArray{}}}));
-    return UpdateController::make(
-        VendStoreClient::fromDictionary(
-            {{"identifier", std::string(staged ? "bench-staged" : "bench-new")},
-             {"clientType", 0}}),
-        *map_);
+    return platform_.controllerWithUpdates(staged ? "bench-staged" : "bench-new", updates);
   }
 
  private:
   void installApp(int index) const {
-    const std::string path = base_ + "/root/Applications/App" + std::to_string(index) + ".app";
+    const std::string path =
+        platform_.base() + "/root/Applications/App" + std::to_string(index) + ".app";
     fs::create_directories(path + "/bin");
     bench::writeFixture(path + "/bundle.plist",
                         PropertyListSerialization::writeXml(PlistDictionary{
@@ -116,8 +87,7 @@ class QualificationFixture {
                             {"HostBundleExecutable", "App" + std::to_string(index)}}));
   }
 
-  std::string base_;
-  std::optional<SoftwareMap> map_;
+  bench::BenchUpdatePlatform platform_{"larder-bench-qualify"};
 };
 
 QualificationFixture& fixture() {
