@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -156,6 +157,10 @@ class UpdateOperation : public VendOperation {
     bool updateImmortalApps = false;
     bool updateForegroundApps = false;
     AppHelper::Survey survey;
+    // The queue's updates by bundle identifier, the last of each in list
+    // order, when the pass has the list in hand; otherwise the queue is
+    // asked.
+    std::optional<std::map<std::string, LedgerUpdateRef, std::less<>>> updatesByBundleID;
     static DecisionInputs read();
   };
 

@@ -109,13 +109,21 @@ std::vector<LedgerUpdateRef> UpdateOperation::appUpdatesToStageOrInstallNow() {
   // The preferences and the machine are read at the first update that asks
   // and then hold for the pass: a read per update cost over a second for
   // 2,000.
+  const std::shared_ptr<const UpdateQueue::UpdateList> available =
+      controller->updateQueue()->availableUpdates();
   std::optional<DecisionInputs> inputs;
-  const auto decisionInputs = [&inputs]() -> const DecisionInputs& {
-    if (!inputs) inputs = DecisionInputs::read();
+  const auto decisionInputs = [&]() -> const DecisionInputs& {
+    if (!inputs) {
+      inputs = DecisionInputs::read();
+      inputs->updatesByBundleID.emplace();
+      for (const LedgerUpdateRef& update : *available) {
+        if (update->bundleID()) (*inputs->updatesByBundleID)[*update->bundleID()] = update;
+      }
+    }
     return *inputs;
   };
   const auto isAutoUpdatedEnabled = [&] { return decisionInputs().autoUpdateEnabled; };
-  for (const LedgerUpdateRef& update : *controller->updateQueue()->availableUpdates()) {
+  for (const LedgerUpdateRef& update : *available) {
     if (!downloadAssets && !update->isStaged()) {
       TILL_LOG(2,
                "%@: Skipping purchase of update %@ because it is not staged and this operation is "
@@ -215,8 +223,13 @@ bool UpdateOperation::shouldAutoInstallAppUpdate(const std::optional<std::string
     if (!inputs.autoUpdateEnabled) {
       return abortWith(abort, kAbortAutoUpdateDisabled, "auto-update is disabled by preference");
     }
-    LedgerUpdateRef update =
-        controller->updateQueue()->availableUpdateWithBundleIdentifier(*bundleIdentifier);
+    LedgerUpdateRef update;
+    if (inputs.updatesByBundleID) {
+      auto found = inputs.updatesByBundleID->find(*bundleIdentifier);
+      if (found != inputs.updatesByBundleID->end()) update = found->second;
+    } else {
+      update = controller->updateQueue()->availableUpdateWithBundleIdentifier(*bundleIdentifier);
+    }
     const auto oldEnough = UpdatePolicy::Clock::now() -
                            std::chrono::duration_cast<UpdatePolicy::Clock::duration>(
                                std::chrono::duration<double>(inputs.minimumReleaseInterval));
