@@ -17,8 +17,8 @@
 #include "tools/larderctl/OSUpdatesCommand.h"
 #include "tools/larderctl/PreferencesCommand.h"
 #include "tools/larderctl/ProductPrinter.h"
-#include "tools/larderctl/StoreCommands.h"
 #include "tools/larderctl/RunsCommand.h"
+#include "tools/larderctl/StoreCommands.h"
 #include "tools/larderctl/UpdatesCommand.h"
 #include "tools/larderctl/WatchCommand.h"
 
