@@ -209,6 +209,8 @@ class UpdateOperation : public VendOperation {
                                       const LedgerSoftwareUpdateStatus& status);
 
   // --- Qualification helpers ---
+  // "A, B": the display names of the applications that use busy plug-ins.
+  static std::string joinedHostNames(const PlugInHostApps& hosts);
   [[nodiscard]] bool shouldDownloadAppUpdateAssets() const;
   bool runningAppBlocksInstall(const std::string& bundleIdentifier, UpdateAbort* abort,
                                const AppHelper::Survey& survey);

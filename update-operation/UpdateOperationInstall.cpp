@@ -482,10 +482,8 @@ bool UpdateOperation::quitAppInTheWay(const std::string& bundleIdentifier,
   if (!AppHelper::isAppRunningWithBundleID(bundleIdentifier, &appName, &hosts)) return true;
   abort->appName = appName;
   if (hosts && !hosts->empty()) {
-    std::string names;
-    for (const auto& [name, information] : *hosts) names += (names.empty() ? "" : ", ") + name;
     abort->code = kAbortPlugInsInUse;
-    abort->reason = bundleIdentifier + " containing plugIns used by " + names;
+    abort->reason = bundleIdentifier + " containing plugIns used by " + joinedHostNames(*hosts);
     return false;
   }
   std::shared_ptr<AppHelper> helper = appHelperFor({bundleIdentifier});
@@ -628,11 +626,9 @@ std::vector<std::string> UpdateOperation::quitAppsToCloseForOSUpdates(
         continue;
       }
       if (hasHosts) {
-        std::string names;
-        for (const auto& [name, information] : *hosts) names += (names.empty() ? "" : ", ") + name;
         TILL_LOG(1,
                  "%@: Skipping install-later OS update %@ because %@ containing plugIns used by %@",
-                 kSpeaker, update, identifier, names);
+                 kSpeaker, update, identifier, joinedHostNames(*hosts));
       } else {
         TILL_LOG(1, "%@: Skipping install-later OS update %@ because the %@ failed to quit",
                  kSpeaker, update, identifier);

@@ -58,15 +58,6 @@ bool abortByPreference(UpdateAbort* abort, std::int64_t code) {
   return abortWith(abort, code, "Aborted by preference for code " + std::to_string(code));
 }
 
-std::string joinedHostNames(const PlugInHostApps& hosts) {
-  std::string names;
-  for (const auto& [name, information] : hosts) {
-    if (!names.empty()) names += ", ";
-    names += name;
-  }
-  return names;
-}
-
 std::vector<std::string> hostNames(const PlugInHostApps& hosts) {
   std::vector<std::string> names;
   for (const auto& [name, information] : hosts) names.push_back(name);
@@ -85,6 +76,15 @@ bool containsProductKey(const std::vector<SysupQuaymartUpdate>& list,
 }
 
 }  // namespace
+
+std::string UpdateOperation::joinedHostNames(const PlugInHostApps& hosts) {
+  std::string names;
+  for (const auto& [name, information] : hosts) {
+    if (!names.empty()) names += ", ";
+    names += name;
+  }
+  return names;
+}
 
 bool UpdateOperation::shouldDownloadAppUpdateAssets() const {
   const UpdateOperationSettings s = settings();

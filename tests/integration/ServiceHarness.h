@@ -214,6 +214,23 @@ class TemporaryPlatform {
     }
     return path;
   }
+  // Gives the bundle a program that runs sleep from inside the bundle once
+  // it is installed at `installedPath` (the same path by default), so that
+  // the process belongs to the bundle as the running applications see it.
+  static void makeRunnable(const std::string& bundlePath, std::string installedPath = {}) {
+    if (installedPath.empty()) installedPath = bundlePath;
+    const std::string name = std::filesystem::path(bundlePath).stem();
+    std::filesystem::copy_file("/bin/sleep", bundlePath + "/bin/sleep");
+    std::filesystem::copy_file("/bin/sh", bundlePath + "/bin/sh");
+    write(bundlePath + "/bin/" + name,
+          "#!" + installedPath + "/bin/sh\nexec " + installedPath + "/bin/sleep 600\n");
+    std::filesystem::permissions(bundlePath + "/bin/" + name, std::filesystem::perms::owner_all);
+  }
+  // The version the bundle's information list gives.
+  static std::string bundleVersion(const std::string& bundlePath) {
+    auto info = PropertyListSerialization::read(*FileIO::read(bundlePath + "/bundle.plist"));
+    return *(*info)["HostBundleShortVersionString"].string();
+  }
   static void writePurchaseRecord(const std::string& bundlePath, const std::string& identifier,
                                   const std::string& version, std::uint64_t itemIdentifier,
                                   std::int64_t versionIdentifier) {

@@ -30,11 +30,7 @@ class UpdateRunServiceTest : public StoreAndServiceTest {
                                       .bundleIdentifier = "com.example.e2e.notes",
                                       .version = "1.0",
                                       .itemIdentifier = kNotesID});
-    fs::copy_file("/bin/sleep", notes_ + "/bin/sleep");
-    fs::copy_file("/bin/sh", notes_ + "/bin/sh");
-    std::ofstream(notes_ + "/bin/Notes")
-        << "#!" << notes_ << "/bin/sh\nexec " << notes_ << "/bin/sleep 600\n";
-    fs::permissions(notes_ + "/bin/Notes", fs::perms::owner_all);
+    TemporaryPlatform::makeRunnable(notes_);
     catalogue_.addAccount(
         {.accountID = 1, .orvaneID = "ada@example.org", .password = "pw", .opaqueID = "account-1"});
     catalogue_.addItem({.wareID = kNotesID,
@@ -77,11 +73,6 @@ class UpdateRunServiceTest : public StoreAndServiceTest {
     return nlohmann::json::parse(listed.output)["updates"];
   }
 
-  std::string installedVersion() const {
-    auto info = PropertyListSerialization::read(*FileIO::read(notes_ + "/bundle.plist"));
-    return *(*info)["HostBundleShortVersionString"].string();
-  }
-
   std::string notes_;
   pid_t pid_ = -1;
 };
@@ -117,7 +108,7 @@ TEST_F(UpdateRunServiceTest, AReportStagesTheUpdateOfARunningAppAndTheNextInstal
   ASSERT_EQ(updates.size(), 1U) << service_->log();
   EXPECT_EQ(updates[0]["isStaged"], true);
   EXPECT_EQ(updates[0]["autoUpdateAbortCode"], 3);
-  EXPECT_EQ(installedVersion(), "1.0");
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(notes_), "1.0");
   EXPECT_NE(RunningApplication::withPid(pid_), nullptr) << "the running app was touched";
   const LarderctlRun runs = run({"runs"});
   EXPECT_EQ(runs.status, 0) << runs.errors;
@@ -128,7 +119,7 @@ TEST_F(UpdateRunServiceTest, AReportStagesTheUpdateOfARunningAppAndTheNextInstal
   ::kill(pid_, SIGKILL);
   ASSERT_TRUE(eventually([&] { return RunningApplication::withPid(pid_) == nullptr; }));
   backgroundRun();
-  EXPECT_EQ(installedVersion(), "2.0") << service_->log();
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(notes_), "2.0") << service_->log();
   EXPECT_TRUE(listedUpdates().empty());
   const LarderctlRun product = run({"--json", "product", "--bundle-id", "com.example.e2e.notes"});
   EXPECT_EQ(nlohmann::json::parse(product.output)["bundleVersion"], "2.0") << product.output;

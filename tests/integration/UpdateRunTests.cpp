@@ -89,7 +89,7 @@ class UpdateRunTest : public InProcessRuntimeTest {
                                                       .bundleIdentifier = identifier,
                                                       .version = "1.0",
                                                       .itemIdentifier = wareID});
-    makeRunnable(path, path);
+    TemporaryPlatform::makeRunnable(path);
     catalogue_.addItem(
         {.wareID = wareID,
          .bundleID = identifier,
@@ -101,18 +101,6 @@ class UpdateRunTest : public InProcessRuntimeTest {
     return path;
   }
 
-  // The program runs sleep from inside the bundle once it is installed at
-  // `installedPath`, so that the process belongs to the bundle as the
-  // running applications see it.
-  static void makeRunnable(const std::string& bundlePath, const std::string& installedPath) {
-    const std::string name = fs::path(bundlePath).stem();
-    fs::copy_file("/bin/sleep", bundlePath + "/bin/sleep");
-    fs::copy_file("/bin/sh", bundlePath + "/bin/sh");
-    std::ofstream(bundlePath + "/bin/" + name)
-        << "#!" << installedPath << "/bin/sh\nexec " << installedPath << "/bin/sleep 600\n";
-    fs::permissions(bundlePath + "/bin/" + name, fs::perms::owner_all);
-  }
-
   // Version 2.0 for the store, runnable where 1.0 is installed.
   std::string runnableBundle(const std::string& name, const std::string& identifier,
                              std::uint64_t wareID, const std::string& installedPath) {
@@ -121,7 +109,7 @@ class UpdateRunTest : public InProcessRuntimeTest {
                                                       .bundleIdentifier = identifier,
                                                       .version = "2.0",
                                                       .itemIdentifier = wareID});
-    makeRunnable(path, installedPath);
+    TemporaryPlatform::makeRunnable(path, installedPath);
     return path;
   }
 
@@ -174,11 +162,6 @@ class UpdateRunTest : public InProcessRuntimeTest {
     return controller_->updateQueue()->availableUpdateWithItemIdentifier(item);
   }
 
-  static std::string installedVersion(const std::string& path) {
-    auto info = PropertyListSerialization::read(*FileIO::read(path + "/bundle.plist"));
-    return *(*info)["HostBundleShortVersionString"].string();
-  }
-
   static PlistDictionary auditEntry(const UpdateOperation& run, std::uint64_t item) {
     const PlistDictionary audit = run.auditInfo();
     auto apps = audit.find("appUpdates");
@@ -205,7 +188,7 @@ TEST_F(UpdateRunTest, ARunningAppIsStagedWithCode3AndInstalledByTheRunAfterItQui
   EXPECT_TRUE(update->isStaged());
   EXPECT_EQ(update->autoUpdateAbortCode(), UpdateOperation::kAbortAppRunning);
   EXPECT_TRUE(update->firstAutoUpdateAttemptDate());
-  EXPECT_EQ(installedVersion(notes), "1.0");
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(notes), "1.0");
   EXPECT_NE(RunningApplication::withPid(pid), nullptr) << "the running app was touched";
   EXPECT_EQ(auditEntry(*first, kNotesID)["abortCode"].int64Value(), 3);
   EXPECT_EQ(*auditEntry(*first, kNotesID)["abortReason"].string(), "the app is running");
@@ -213,7 +196,7 @@ TEST_F(UpdateRunTest, ARunningAppIsStagedWithCode3AndInstalledByTheRunAfterItQui
   // Nothing changed: the next run that only installs leaves it alone.
   auto unchanged = backgroundRun(false, true);
   runToTheEnd(*unchanged);
-  EXPECT_EQ(installedVersion(notes), "1.0");
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(notes), "1.0");
   EXPECT_EQ(queued(kNotesID)->autoUpdateAbortCode(), UpdateOperation::kAbortAppRunning);
 
   ::kill(pid, SIGKILL);
@@ -222,7 +205,7 @@ TEST_F(UpdateRunTest, ARunningAppIsStagedWithCode3AndInstalledByTheRunAfterItQui
   const std::size_t addedBefore = changes_->added_;
   auto second = backgroundRun(false, true);
   runToTheEnd(*second);
-  EXPECT_EQ(installedVersion(notes), "2.0");
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(notes), "2.0");
   EXPECT_EQ(queued(kNotesID), nullptr) << "an installed update stays listed";
   EXPECT_TRUE(auditEntry(*second, kNotesID)["shouldInstall"].boolValue());
   ASSERT_TRUE(eventually([&] {
@@ -240,8 +223,8 @@ TEST_F(UpdateRunTest, AnAppThatIsNotRunningIsStagedAndInstalledInOneRun) {
   startEverything();
   auto run = backgroundRun(true, true);
   runToTheEnd(*run);
-  EXPECT_EQ(installedVersion(notes), "2.0");
-  EXPECT_EQ(installedVersion(atlas), "2.0");
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(notes), "2.0");
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(atlas), "2.0");
   EXPECT_EQ(queued(kNotesID), nullptr);
   EXPECT_EQ(queued(kAtlasID), nullptr);
   EXPECT_EQ(run->runState().autoInstalledAppUpdates.size(), 2U);
@@ -281,7 +264,7 @@ TEST_P(UpdateRunFailureTest, LeavesTheOldVersionAndTheUpdateListedWithItsFailure
   startSignedIn();
   auto run = backgroundRun(true, true);
   runToTheEnd(*run);
-  EXPECT_EQ(installedVersion(notes), "1.0");
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(notes), "1.0");
   launch(notes);
   LedgerUpdateRef update = queued(kNotesID);
   ASSERT_TRUE(update);
@@ -331,7 +314,7 @@ TEST_F(UpdateRunTest, APreflightRefusalBeforeStagingIs7AndOneAtInstallIs5) {
   LedgerUpdateRef staged = queued(kAtlasID);
   EXPECT_TRUE(staged->isStaged());
   EXPECT_EQ(staged->autoUpdateAbortCode(), UpdateOperation::kAbortPreflight);
-  EXPECT_EQ(installedVersion(atlas), "1.0");
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(atlas), "1.0");
   EXPECT_EQ(*auditEntry(*run, kAtlasID)["abortReason"].string(),
             "preflight returned warning or error");
   // The audit of the refusal before staging keeps the preflight's own code.
@@ -414,7 +397,7 @@ TEST_F(UpdateRunTest, TheLockOfAllRunsIsNotHeldWhileARunDownloads) {
 
   store_.reset();  // the stalled download fails, and the first run ends
   first.join();
-  EXPECT_EQ(installedVersion(platform_.root() + "/Applications/Notes.app"), "1.0");
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(platform_.root() + "/Applications/Notes.app"), "1.0");
   other->updateQueue()->finishPendingWrites();
 }
 
@@ -623,7 +606,7 @@ TEST_F(UpdateRunTest, AtTheChosenMomentTheAppIsQuitInstalledAndStartedAgain) {
                          .dimWakeQuitTimeout = std::chrono::milliseconds(500)};
   });
   runToTheEnd(*run);
-  EXPECT_EQ(installedVersion(notes), "2.0");
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(notes), "2.0");
   EXPECT_EQ(RunningApplication::withPid(notesPid), nullptr);
   ASSERT_TRUE(eventually([&] {
     return RunningApplication::runningApplicationsWithBundleIdentifier("com.example.notes")
@@ -634,7 +617,7 @@ TEST_F(UpdateRunTest, AtTheChosenMomentTheAppIsQuitInstalledAndStartedAgain) {
     launched_.push_back(app->pid());
   }
 
-  EXPECT_EQ(installedVersion(atlas), "1.0");
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(atlas), "1.0");
   EXPECT_NE(RunningApplication::withPid(atlasPid), nullptr);
   EXPECT_EQ(queued(kAtlasID)->autoUpdateAbortCode(), UpdateOperation::kAbortDidNotTerminate);
   EXPECT_EQ(*auditEntry(*run, kAtlasID)["abortReason"].string(), "running app did not terminate");
