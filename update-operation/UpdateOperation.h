@@ -246,7 +246,7 @@ class UpdateOperation : public VendOperation {
                                     const PlistValue& systemVersion);
   void installStagedDownload(const TillDownloadRef& download);
   bool quitAppInTheWay(const std::string& bundleIdentifier, const TillDownloadRef& download,
-                       UpdateAbort* abort);
+                       UpdateAbort* abort, const AppHelper::Survey& survey);
   void performDownload(const TillDownloadRef& download, DownloadReply reply);
 
   // --- OS updates ---

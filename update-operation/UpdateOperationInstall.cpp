@@ -438,10 +438,14 @@ void UpdateOperation::installStagedDownload(const TillDownloadRef& download) {
   UpdateAbort abort;
   bool shouldInstall = true;
   if (!settings().userInitiated) {
+    // One look at the machine serves the decision and the quit after it.
+    const DecisionInputs inputs = DecisionInputs::read();
     shouldInstall = shouldAutoInstallAppUpdate(
-        bundleIdentifier.empty() ? std::nullopt : std::optional(bundleIdentifier), download,
-        &abort);
-    if (shouldInstall) shouldInstall = quitAppInTheWay(bundleIdentifier, download, &abort);
+        bundleIdentifier.empty() ? std::nullopt : std::optional(bundleIdentifier), download, &abort,
+        inputs);
+    if (shouldInstall) {
+      shouldInstall = quitAppInTheWay(bundleIdentifier, download, &abort, inputs.survey);
+    }
   }
   std::shared_ptr<UpdateOperationController> controller = updateController();
   if (!shouldInstall) {
@@ -476,10 +480,13 @@ void UpdateOperation::installStagedDownload(const TillDownloadRef& download) {
 }
 
 bool UpdateOperation::quitAppInTheWay(const std::string& bundleIdentifier,
-                                      const TillDownloadRef& download, UpdateAbort* abort) {
+                                      const TillDownloadRef& download, UpdateAbort* abort,
+                                      const AppHelper::Survey& survey) {
   std::optional<std::string> appName;
   std::optional<PlugInHostApps> hosts;
-  if (!AppHelper::isAppRunningWithBundleID(bundleIdentifier, &appName, &hosts)) return true;
+  if (!AppHelper::isAppRunningWithBundleID(bundleIdentifier, &appName, &hosts, survey)) {
+    return true;
+  }
   abort->appName = appName;
   if (hosts && !hosts->empty()) {
     abort->code = kAbortPlugInsInUse;
