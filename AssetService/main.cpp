@@ -14,7 +14,7 @@
 #include "AssetService/ServiceEntry.h"
 #include "AssetService/ServiceListener.h"
 #include "AssetService/StoreRuntimeInterface.h"
-#include "notifications/UserNotificationCenterDelegate.h"
+#include "notifications/activation/UserNotificationCenterDelegate.h"
 #include "platform/dispatch/DispatchSemaphore.h"
 #include "platform/dispatch/RunLoop.h"
 #include "platform/log/TillLogManager.h"

@@ -2,12 +2,13 @@
 # Builds every libFuzzer target with clang under ASan/UBSan and runs each
 # over its corpus for a bounded time; the build is also the lock-annotation
 # check. Usage: scripts/fuzz.sh [seconds-per-target] [build-dir]
+# LARDER_BUILD_TYPE picks the CMake build type (RelWithDebInfo unless set).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 seconds=${1:-60}
 build=${2:-build-fuzz}
 ./scripts/install-deps.sh
-cmake -S . -B "$build" -G Ninja -DCMAKE_CXX_COMPILER=clang++ -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+cmake -S . -B "$build" -G Ninja -DCMAKE_CXX_COMPILER=clang++ -DCMAKE_BUILD_TYPE="${LARDER_BUILD_TYPE:-RelWithDebInfo}" \
   -DLARDER_FUZZ=ON -DLARDER_SANITIZE=address -DLARDER_TESTS=OFF -DLARDER_BENCH=OFF
 # clang also checks the lock annotations here (-Wthread-safety is an error),
 # so the tools are built too: everything with a lock is compiled by clang.

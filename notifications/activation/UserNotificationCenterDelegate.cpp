@@ -1,4 +1,4 @@
-#include "notifications/UserNotificationCenterDelegate.h"
+#include "notifications/activation/UserNotificationCenterDelegate.h"
 
 #include "platform/log/TillLogManager.h"
 
