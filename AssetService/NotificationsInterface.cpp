@@ -35,7 +35,9 @@ void NotificationsInterface::deliveredNotifications(sdbus::MethodCall call) {
   for (const UserNotification& notification : center_->deliveredNotifications()) {
     list.emplace_back(notification.toDictionary());
   }
-  DBusValueCodec::reply(call, "aa{sv}", {std::move(list)});
+  // One argument, the list: spelled out, since a braced list of one array
+  // would be taken for the array itself.
+  DBusValueCodec::reply(call, "aa{sv}", PlistArray{PlistValue(std::move(list))});
 }
 
 // Answered after the delegate has been told, so that a script that
