@@ -58,7 +58,9 @@ std::shared_ptr<UserNotificationCenter> UserNotificationCenter::centerForIdentif
   MutexLock lock(registry.mutex);
   std::shared_ptr<UserNotificationCenter>& center = registry.centers[{identifier, type}];
   if (!center) {
-    center = makeForTesting(identifier, type, listPathFor(identifier));
+    const std::string listPath = listPathFor(identifier);
+    DeliveredNotificationList(listPath).removeLeftovers();
+    center = makeForTesting(identifier, type, listPath);
     if (type == kSystemCenter) center->setServer(std::make_shared<FreedesktopNotificationServer>());
   }
   return center;
@@ -75,7 +77,7 @@ UserNotificationCenter::UserNotificationCenter(std::string identifier, Type type
                                                std::string listPath)
     : identifier_(std::move(identifier)),
       type_(type),
-      list_(std::make_unique<DeliveredNotificationList>(std::move(listPath))),
+      list_(std::make_shared<DeliveredNotificationList>(std::move(listPath))),
       serverQueue_(DispatchQueue::create("UserNotificationCenter.server." + identifier_,
                                          DispatchQueue::Kind::Serial)),
       storeQueue_(DispatchQueue::create("UserNotificationCenter.store." + identifier_,
@@ -90,16 +92,17 @@ UserNotificationCenter::UserNotificationCenter(std::string identifier, Type type
 }
 
 UserNotificationCenter::~UserNotificationCenter() {
-  // A change whose write had not started yet when the last owner let go.
-  std::vector<UserNotification> unwritten;
-  bool dirty = false;
+  // A change whose write had not started yet when the last owner let go;
+  // the list drops the write when it has this revision already.
+  std::vector<UserNotification> last;
+  std::uint64_t revision = 0;
   {
     MutexLock lock(mutex_);
-    dirty = revision_ != writtenRevision_;
-    if (dirty) unwritten = notifications_;
+    revision = revision_;
+    if (revision > 0) last = std::move(notifications_);
   }
-  if (!dirty) return;
-  if (Result<void> written = list_->write(unwritten); !written) {
+  if (revision == 0) return;
+  if (Result<void> written = list_->write(last, revision); !written) {
     TILL_LOG(1, "%@: Could not write %@: %@", kSpeaker, list_->path(), written.errorDescription());
   }
 }
@@ -419,26 +422,23 @@ void UserNotificationCenter::listChangedLocked() {
   if (writeScheduled_) return;
   writeScheduled_ = true;
   storeQueue_->async([weak = weak_from_this()] {
-    // Gone: its destructor wrote the list.
-    if (auto self = weak.lock()) self->writeList();
+    std::vector<UserNotification> snapshot;
+    std::uint64_t revision = 0;
+    std::shared_ptr<DeliveredNotificationList> list;
+    {
+      // Gone: its destructor wrote the list.
+      std::shared_ptr<UserNotificationCenter> self = weak.lock();
+      if (!self) return;
+      MutexLock lock(self->mutex_);
+      self->writeScheduled_ = false;
+      snapshot = self->notifications_;
+      revision = self->revision_;
+      list = self->list_;
+    }
+    if (Result<void> written = list->write(snapshot, revision); !written) {
+      TILL_LOG(1, "%@: Could not write %@: %@", kSpeaker, list->path(), written.errorDescription());
+    }
   });
-}
-
-void UserNotificationCenter::writeList() {
-  std::vector<UserNotification> snapshot;
-  std::uint64_t revision = 0;
-  {
-    MutexLock lock(mutex_);
-    writeScheduled_ = false;
-    snapshot = notifications_;
-    revision = revision_;
-  }
-  if (Result<void> written = list_->write(snapshot); !written) {
-    TILL_LOG(1, "%@: Could not write %@: %@", kSpeaker, list_->path(), written.errorDescription());
-    return;
-  }
-  MutexLock lock(mutex_);
-  writtenRevision_ = std::max(writtenRevision_, revision);
 }
 
 }  // namespace larder

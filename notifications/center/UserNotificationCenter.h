@@ -113,7 +113,6 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
   // The list changed: it goes to its file soon, in one write for the
   // changes that come before the write starts.
   void listChangedLocked() REQUIRES(mutex_);
-  void writeList() EXCLUDES(mutex_);
 
   // Work of the server queue.
   void present(const UserNotification& notification) EXCLUDES(mutex_);
@@ -125,7 +124,9 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
 
   const std::string identifier_;
   const Type type_;
-  const std::unique_ptr<DeliveredNotificationList> list_;
+  // Shared with the writes in the store queue, which must not keep the
+  // center alive.
+  const std::shared_ptr<DeliveredNotificationList> list_;
   // Calls of the server, which may be slow or absent, in the order they
   // were asked for; and the signals of the server after them.
   const std::shared_ptr<DispatchQueue> serverQueue_;
@@ -138,9 +139,8 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
   std::vector<UserNotification> notifications_ GUARDED_BY(mutex_);
   std::weak_ptr<Delegate> delegate_ GUARDED_BY(mutex_);
   std::shared_ptr<NotificationServer> server_ GUARDED_BY(mutex_);
-  // Changes of the list, and the last change that is in the file.
+  // Changes of the list since the center was made.
   std::uint64_t revision_ GUARDED_BY(mutex_) = 0;
-  std::uint64_t writtenRevision_ GUARDED_BY(mutex_) = 0;
   bool writeScheduled_ GUARDED_BY(mutex_) = false;
 };
 
