@@ -370,13 +370,14 @@ void UserNotificationCenter::serverDidInvokeAction(std::uint32_t serverIdentifie
 }
 
 void UserNotificationCenter::serverDidClose(std::uint32_t serverIdentifier, std::uint32_t reason) {
+  // Reasons: 1 expired, 2 dismissed by the user, 3 closed by a call, 4 other.
+  TILL_LOG(3, "%@: The notification server closed %@ (reason %@)", kSpeaker, serverIdentifier,
+           reason);
   MutexLock lock(mutex_);
   UserNotification* record = findShownLocked(serverIdentifier);
   if (!record) return;
   record->displayed = false;
   listChangedLocked();
-  TILL_LOG(3, "%@: Notification %@ closed by the server (reason %@)", kSpeaker, record->identifier,
-           reason);
 }
 
 void UserNotificationCenter::closeOnServerLocked(const UserNotification& notification) {
