@@ -70,12 +70,20 @@ std::vector<std::uint8_t> DeliveredNotificationList::encode(
       PlistDictionary{{"version", kVersion}, {"notifications", std::move(entries)}});
 }
 
+std::vector<std::uint8_t> DeliveredNotificationList::encode(const Records& notifications) {
+  PlistArray entries;
+  entries.reserve(notifications.size());
+  for (const auto& notification : notifications) entries.emplace_back(notification->toDictionary());
+  return PropertyListSerialization::writeBinary(
+      PlistDictionary{{"version", kVersion}, {"notifications", std::move(entries)}});
+}
+
 Result<void> DeliveredNotificationList::write(const std::vector<UserNotification>& notifications) {
   MutexLock lock(mutex_);
   return FileIO::writeAtomically(path_, encode(notifications));
 }
 
-Result<void> DeliveredNotificationList::write(const std::vector<UserNotification>& notifications,
+Result<void> DeliveredNotificationList::write(const Records& notifications,
                                               std::uint64_t revision) {
   MutexLock lock(mutex_);
   if (revision <= writtenRevision_) return {};

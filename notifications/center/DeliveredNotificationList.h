@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <memory>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -23,6 +24,9 @@ namespace larder {
 class DeliveredNotificationList {
  public:
   static constexpr std::int64_t kVersion = 1;
+  // The center's own form of a list: records shared with the list it keeps
+  // in memory, so that taking a copy to write costs no copy of a record.
+  using Records = std::vector<std::shared_ptr<const UserNotification>>;
 
   explicit DeliveredNotificationList(std::string path);
 
@@ -34,8 +38,7 @@ class DeliveredNotificationList {
   [[nodiscard]] std::vector<UserNotification> read() const;
   [[nodiscard]] Result<void> write(const std::vector<UserNotification>& notifications);
   // The same, unless revision `revision` or a later one is already written.
-  [[nodiscard]] Result<void> write(const std::vector<UserNotification>& notifications,
-                                   std::uint64_t revision);
+  [[nodiscard]] Result<void> write(const Records& notifications, std::uint64_t revision);
 
   // Removes the temporary files of writes that a process died in. Only
   // for the one owner of the file, before its first write: the writes of
@@ -44,6 +47,7 @@ class DeliveredNotificationList {
 
   // The bytes `write` puts in the file.
   static std::vector<std::uint8_t> encode(const std::vector<UserNotification>& notifications);
+  static std::vector<std::uint8_t> encode(const Records& notifications);
 
  private:
   const std::string path_;

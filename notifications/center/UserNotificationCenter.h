@@ -102,14 +102,19 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
     std::int64_t menuIndex = UserNotification::kNoAlternateAction;
   };
 
+  // Records are never changed in place: a change puts a changed copy in
+  // the list's slot, so that a copy of the list to write is a copy of
+  // pointers, made quickly under the lock the posters wait for.
+  using Record = std::shared_ptr<const UserNotification>;
+
   UserNotificationCenter(std::string identifier, Type type, std::string listPath);
 
   static std::optional<Action> parseAction(const std::string& actionKey);
   // Takes the notification out of the list if it is there; a copy of it.
-  std::optional<UserNotification> takeLocked(const std::string& notificationIdentifier)
-      REQUIRES(mutex_);
-  UserNotification* findLocked(const std::string& notificationIdentifier) REQUIRES(mutex_);
-  UserNotification* findShownLocked(std::uint32_t serverIdentifier) REQUIRES(mutex_);
+  Record takeLocked(const std::string& notificationIdentifier) REQUIRES(mutex_);
+  // The slot of the notification in the list, or null.
+  Record* findLocked(const std::string& notificationIdentifier) REQUIRES(mutex_);
+  Record* findShownLocked(std::uint32_t serverIdentifier) REQUIRES(mutex_);
   // The list changed: it goes to its file soon, in one write for the
   // changes that come before the write starts.
   void listChangedLocked() REQUIRES(mutex_);
@@ -136,7 +141,7 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
   const std::shared_ptr<DispatchQueue> delegateQueue_;
 
   mutable Mutex mutex_;
-  std::vector<UserNotification> notifications_ GUARDED_BY(mutex_);
+  std::vector<Record> notifications_ GUARDED_BY(mutex_);
   std::weak_ptr<Delegate> delegate_ GUARDED_BY(mutex_);
   std::shared_ptr<NotificationServer> server_ GUARDED_BY(mutex_);
   // Changes of the list since the center was made.
