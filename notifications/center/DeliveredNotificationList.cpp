@@ -20,8 +20,6 @@ constexpr std::size_t kMaxFileBytes = 64u << 20u;
 DeliveredNotificationList::DeliveredNotificationList(std::string path) : path_(std::move(path)) {}
 
 std::vector<UserNotification> DeliveredNotificationList::read() const {
-  // Left by a process that died while writing: never read, only in the way.
-  FileIO::removeStaleTemporaries(path_);
   Result<std::vector<std::uint8_t>> bytes = FileIO::read(path_, kMaxFileBytes);
   if (!bytes) {
     if (bytes.error().code == ENOENT) {
@@ -57,6 +55,10 @@ std::vector<UserNotification> DeliveredNotificationList::read() const {
   return notifications;
 }
 
+void DeliveredNotificationList::removeLeftovers() const {
+  FileIO::removeStaleTemporaries(path_);
+}
+
 std::vector<std::uint8_t> DeliveredNotificationList::encode(
     const std::vector<UserNotification>& notifications) {
   PlistArray entries;
@@ -68,9 +70,26 @@ std::vector<std::uint8_t> DeliveredNotificationList::encode(
       PlistDictionary{{"version", kVersion}, {"notifications", std::move(entries)}});
 }
 
-Result<void> DeliveredNotificationList::write(
-    const std::vector<UserNotification>& notifications) const {
+std::vector<std::uint8_t> DeliveredNotificationList::encode(const Records& notifications) {
+  PlistArray entries;
+  entries.reserve(notifications.size());
+  for (const auto& notification : notifications) entries.emplace_back(notification->toDictionary());
+  return PropertyListSerialization::writeBinary(
+      PlistDictionary{{"version", kVersion}, {"notifications", std::move(entries)}});
+}
+
+Result<void> DeliveredNotificationList::write(const std::vector<UserNotification>& notifications) {
+  MutexLock lock(mutex_);
   return FileIO::writeAtomically(path_, encode(notifications));
+}
+
+Result<void> DeliveredNotificationList::write(const Records& notifications,
+                                              std::uint64_t revision) {
+  MutexLock lock(mutex_);
+  if (revision <= writtenRevision_) return {};
+  Result<void> written = FileIO::writeAtomically(path_, encode(notifications));
+  if (written) writtenRevision_ = revision;
+  return written;
 }
 
 }  // namespace larder

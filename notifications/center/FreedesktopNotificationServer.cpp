@@ -55,6 +55,7 @@ void FreedesktopNotificationServer::disconnectLocked() {
   // The event loop thread goes first: it may be inside a signal handler of
   // the proxy.
   if (connection_) connection_->leaveEventLoop();
+  if (eventLoop_.joinable()) eventLoop_.join();
   proxy_.reset();
   connection_.reset();
 }
@@ -95,7 +96,14 @@ Result<void> FreedesktopNotificationServer::connectLocked() {
           });
     }
     proxy->finishRegistration();
-    connection->enterEventLoopAsync();
+    eventLoop_ = std::thread([bus = connection.get()] {
+      try {
+        bus->enterEventLoop();
+      } catch (const sdbus::Error& error) {
+        TILL_LOG(1, "%@: Lost the session bus: %@: %@", kSpeaker, error.getName(),
+                 error.getMessage());
+      }
+    });
     connection_ = std::move(connection);
     proxy_ = std::move(proxy);
     TILL_LOG(3, "%@: Connected to the session bus", kSpeaker);

@@ -4,6 +4,7 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <thread>
 
 #include "notifications/center/NotificationServer.h"
 #include "platform/system/Mutex.h"
@@ -51,6 +52,10 @@ class FreedesktopNotificationServer final : public NotificationServer {
   std::shared_ptr<const Handlers> handlers_ GUARDED_BY(mutex_);
   std::unique_ptr<sdbus::IConnection> connection_ GUARDED_BY(mutex_);
   std::unique_ptr<sdbus::IProxy> proxy_ GUARDED_BY(mutex_);
+  // Runs the connection's event loop, which delivers the signals. Ours
+  // rather than the library's, so that a bus that goes away ends the
+  // thread instead of the process.
+  std::thread eventLoop_ GUARDED_BY(mutex_);
 };
 
 }  // namespace larder

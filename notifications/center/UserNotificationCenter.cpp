@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <charconv>
+#include <functional>
 #include <map>
 #include <set>
 #include <utility>
@@ -45,6 +46,22 @@ std::string listPathFor(const std::string& identifier) {
   return Environment::stateDirectory() + "/notifications/" + name + ".plist";
 }
 
+// Puts a changed copy of the record in its slot.
+void change(std::shared_ptr<const UserNotification>& slot,
+            const std::function<void(UserNotification&)>& changes) {
+  auto changed = std::make_shared<UserNotification>(*slot);
+  changes(*changed);
+  slot = std::move(changed);
+}
+
+std::vector<UserNotification> values(
+    const std::vector<std::shared_ptr<const UserNotification>>& records) {
+  std::vector<UserNotification> result;
+  result.reserve(records.size());
+  for (const auto& record : records) result.push_back(*record);
+  return result;
+}
+
 VendError activationError(std::int64_t code, std::string message) {
   return VendError::withDomain(std::string(UserNotificationCenter::kErrorDomain), code,
                                std::move(message));
@@ -58,7 +75,9 @@ std::shared_ptr<UserNotificationCenter> UserNotificationCenter::centerForIdentif
   MutexLock lock(registry.mutex);
   std::shared_ptr<UserNotificationCenter>& center = registry.centers[{identifier, type}];
   if (!center) {
-    center = makeForTesting(identifier, type, listPathFor(identifier));
+    const std::string listPath = listPathFor(identifier);
+    DeliveredNotificationList(listPath).removeLeftovers();
+    center = makeForTesting(identifier, type, listPath);
     if (type == kSystemCenter) center->setServer(std::make_shared<FreedesktopNotificationServer>());
   }
   return center;
@@ -75,14 +94,17 @@ UserNotificationCenter::UserNotificationCenter(std::string identifier, Type type
                                                std::string listPath)
     : identifier_(std::move(identifier)),
       type_(type),
-      list_(std::make_unique<DeliveredNotificationList>(std::move(listPath))),
+      list_(std::make_shared<DeliveredNotificationList>(std::move(listPath))),
       serverQueue_(DispatchQueue::create("UserNotificationCenter.server." + identifier_,
                                          DispatchQueue::Kind::Serial)),
       storeQueue_(DispatchQueue::create("UserNotificationCenter.store." + identifier_,
                                         DispatchQueue::Kind::Serial)),
       delegateQueue_(DispatchQueue::create("UserNotificationCenter.delegate." + identifier_,
                                            DispatchQueue::Kind::Serial)) {
-  std::vector<UserNotification> stored = list_->read();
+  std::vector<Record> stored;
+  for (UserNotification& notification : list_->read()) {
+    stored.push_back(std::make_shared<const UserNotification>(std::move(notification)));
+  }
   MutexLock lock(mutex_);
   notifications_ = std::move(stored);
   TILL_LOG(3, "%@: Center %@ (type %@) holds %@ notifications", kSpeaker, identifier_,
@@ -90,16 +112,17 @@ UserNotificationCenter::UserNotificationCenter(std::string identifier, Type type
 }
 
 UserNotificationCenter::~UserNotificationCenter() {
-  // A change whose write had not started yet when the last owner let go.
-  std::vector<UserNotification> unwritten;
-  bool dirty = false;
+  // A change whose write had not started yet when the last owner let go;
+  // the list drops the write when it has this revision already.
+  std::vector<Record> last;
+  std::uint64_t revision = 0;
   {
     MutexLock lock(mutex_);
-    dirty = revision_ != writtenRevision_;
-    if (dirty) unwritten = notifications_;
+    revision = revision_;
+    if (revision > 0) last = std::move(notifications_);
   }
-  if (!dirty) return;
-  if (Result<void> written = list_->write(unwritten); !written) {
+  if (revision == 0) return;
+  if (Result<void> written = list_->write(last, revision); !written) {
     TILL_LOG(1, "%@: Could not write %@: %@", kSpeaker, list_->path(), written.errorDescription());
   }
 }
@@ -154,7 +177,7 @@ UserNotification UserNotificationCenter::deliverNotification(UserNotification no
   notification.alternateActionIndex = UserNotification::kNoAlternateAction;
   {
     MutexLock lock(mutex_);
-    notifications_.push_back(notification);
+    notifications_.push_back(std::make_shared<const UserNotification>(notification));
     listChangedLocked();
   }
   TILL_LOG(2, "%@: Delivered notification %@ \"%@\" in %@", kSpeaker, notification.identifier,
@@ -201,9 +224,11 @@ void UserNotificationCenter::present(const UserNotification& notification) {
   }
   {
     MutexLock lock(mutex_);
-    if (UserNotification* record = findLocked(notification.identifier)) {
-      record->serverIdentifier = *shown;
-      record->displayed = true;
+    if (Record* record = findLocked(notification.identifier)) {
+      change(*record, [&](UserNotification& shownRecord) {
+        shownRecord.serverIdentifier = *shown;
+        shownRecord.displayed = true;
+      });
       listChangedLocked();
       TILL_LOG(3, "%@: Notification %@ shown as %@", kSpeaker, notification.identifier, *shown);
       return;
@@ -218,20 +243,21 @@ void UserNotificationCenter::present(const UserNotification& notification) {
 
 std::vector<UserNotification> UserNotificationCenter::deliveredNotifications() const {
   MutexLock lock(mutex_);
-  return notifications_;
+  return values(notifications_);
 }
 
 std::vector<UserNotification> UserNotificationCenter::displayedNotifications() const {
   MutexLock lock(mutex_);
   std::vector<UserNotification> displayed;
-  std::ranges::copy_if(notifications_, std::back_inserter(displayed),
-                       [](const UserNotification& notification) { return notification.displayed; });
+  for (const Record& record : notifications_) {
+    if (record->displayed) displayed.push_back(*record);
+  }
   return displayed;
 }
 
 void UserNotificationCenter::removeDeliveredNotification(const UserNotification& notification) {
   MutexLock lock(mutex_);
-  std::optional<UserNotification> removed = takeLocked(notification.identifier);
+  const Record removed = takeLocked(notification.identifier);
   if (!removed) return;
   closeOnServerLocked(*removed);
   listChangedLocked();
@@ -239,26 +265,29 @@ void UserNotificationCenter::removeDeliveredNotification(const UserNotification&
 
 void UserNotificationCenter::removeDisplayedNotification(const UserNotification& notification) {
   MutexLock lock(mutex_);
-  UserNotification* record = findLocked(notification.identifier);
-  if (!record || !record->displayed) return;
-  closeOnServerLocked(*record);
-  record->displayed = false;
+  Record* record = findLocked(notification.identifier);
+  if (!record || !(*record)->displayed) return;
+  closeOnServerLocked(**record);
+  change(*record, [](UserNotification& closed) { closed.displayed = false; });
   listChangedLocked();
 }
 
 void UserNotificationCenter::setDeliveredNotifications(
     std::vector<UserNotification> notifications) {
   std::set<std::string, std::less<>> kept;
+  std::vector<Record> records;
+  records.reserve(notifications.size());
   for (UserNotification& notification : notifications) {
     // Every record of the list is reachable by its identifier.
     if (notification.identifier.empty()) notification.identifier = Uuid::generateString();
     kept.insert(notification.identifier);
+    records.push_back(std::make_shared<const UserNotification>(std::move(notification)));
   }
   MutexLock lock(mutex_);
-  for (const UserNotification& old : notifications_) {
-    if (!kept.contains(old.identifier)) closeOnServerLocked(old);
+  for (const Record& old : notifications_) {
+    if (!kept.contains(old->identifier)) closeOnServerLocked(*old);
   }
-  notifications_ = std::move(notifications);
+  notifications_ = std::move(records);
   listChangedLocked();
 }
 
@@ -287,7 +316,7 @@ Result<void> UserNotificationCenter::activate(const std::string& notificationIde
   UserNotification activated;
   {
     MutexLock lock(mutex_);
-    UserNotification* record = findLocked(notificationIdentifier);
+    Record* record = findLocked(notificationIdentifier);
     if (!record) {
       return activationError(
           kUnknownNotificationCode,
@@ -299,14 +328,14 @@ Result<void> UserNotificationCenter::activate(const std::string& notificationIde
                                  notificationIdentifier +
                                  " (known: default, action, other, alternate-N)");
     }
-    const auto entries = static_cast<std::int64_t>(record->alternateActionButtonTitles.size());
+    const auto entries = static_cast<std::int64_t>((*record)->alternateActionButtonTitles.size());
     if (action->kind == Action::kMenuEntry && action->menuIndex >= entries) {
       return activationError(kUnknownActionCode, "Notification " + notificationIdentifier +
                                                      " has " + std::to_string(entries) +
                                                      " menu entries; no entry " +
                                                      std::to_string(action->menuIndex));
     }
-    activated = *record;
+    activated = **record;
     if (action->kind == Action::kContents) {
       activated.activationType = UserNotification::kContentsClicked;
     } else if (action->kind != Action::kOtherButton) {
@@ -320,13 +349,15 @@ Result<void> UserNotificationCenter::activate(const std::string& notificationIde
       // button of a banner, leaves it where it is.
       const bool ends =
           action->kind == Action::kOtherButton ||
-          (action->kind != Action::kContents && record->displayStyle == UserNotification::kAlert);
+          (action->kind != Action::kContents && activated.displayStyle == UserNotification::kAlert);
       if (ends) {
-        closeOnServerLocked(*record);
+        closeOnServerLocked(activated);
         takeLocked(notificationIdentifier);
       } else {
-        record->activationType = activated.activationType;
-        record->alternateActionIndex = activated.alternateActionIndex;
+        change(*record, [&](UserNotification& stays) {
+          stays.activationType = activated.activationType;
+          stays.alternateActionIndex = activated.alternateActionIndex;
+        });
       }
       listChangedLocked();
     }
@@ -355,10 +386,10 @@ void UserNotificationCenter::serverDidInvokeAction(std::uint32_t serverIdentifie
   std::string notificationIdentifier;
   {
     MutexLock lock(mutex_);
-    const UserNotification* record = findShownLocked(serverIdentifier);
+    const Record* record = findShownLocked(serverIdentifier);
     // Another application's notification: the server's signals go to all.
     if (!record) return;
-    notificationIdentifier = record->identifier;
+    notificationIdentifier = (*record)->identifier;
   }
   if (Result<void> activated = activate(notificationIdentifier, actionKey); !activated) {
     TILL_LOG(1, "%@: Ignored action from the notification server: %@", kSpeaker,
@@ -367,13 +398,14 @@ void UserNotificationCenter::serverDidInvokeAction(std::uint32_t serverIdentifie
 }
 
 void UserNotificationCenter::serverDidClose(std::uint32_t serverIdentifier, std::uint32_t reason) {
-  MutexLock lock(mutex_);
-  UserNotification* record = findShownLocked(serverIdentifier);
-  if (!record) return;
-  record->displayed = false;
-  listChangedLocked();
-  TILL_LOG(3, "%@: Notification %@ closed by the server (reason %@)", kSpeaker, record->identifier,
+  // Reasons: 1 expired, 2 dismissed by the user, 3 closed by a call, 4 other.
+  TILL_LOG(3, "%@: The notification server closed %@ (reason %@)", kSpeaker, serverIdentifier,
            reason);
+  MutexLock lock(mutex_);
+  Record* record = findShownLocked(serverIdentifier);
+  if (!record) return;
+  change(*record, [](UserNotification& closed) { closed.displayed = false; });
+  listChangedLocked();
 }
 
 void UserNotificationCenter::closeOnServerLocked(const UserNotification& notification) {
@@ -388,29 +420,31 @@ void UserNotificationCenter::closeOnServerLocked(const UserNotification& notific
   });
 }
 
-UserNotification* UserNotificationCenter::findLocked(const std::string& notificationIdentifier) {
-  auto found =
-      std::ranges::find(notifications_, notificationIdentifier, &UserNotification::identifier);
+UserNotificationCenter::Record* UserNotificationCenter::findLocked(
+    const std::string& notificationIdentifier) {
+  auto found = std::ranges::find_if(notifications_, [&](const Record& record) {
+    return record->identifier == notificationIdentifier;
+  });
   return found == notifications_.end() ? nullptr : &*found;
 }
 
-UserNotification* UserNotificationCenter::findShownLocked(std::uint32_t serverIdentifier) {
+UserNotificationCenter::Record* UserNotificationCenter::findShownLocked(
+    std::uint32_t serverIdentifier) {
   if (serverIdentifier == 0) return nullptr;
   // The newest first: a server that restarted hands its numbers out again.
-  auto found = std::ranges::find_if(
-      notifications_.rbegin(), notifications_.rend(), [&](const UserNotification& notification) {
-        return notification.displayed && notification.serverIdentifier == serverIdentifier;
+  auto found =
+      std::find_if(notifications_.rbegin(), notifications_.rend(), [&](const Record& record) {
+        return record->displayed && record->serverIdentifier == serverIdentifier;
       });
   return found == notifications_.rend() ? nullptr : &*found;
 }
 
-std::optional<UserNotification> UserNotificationCenter::takeLocked(
+UserNotificationCenter::Record UserNotificationCenter::takeLocked(
     const std::string& notificationIdentifier) {
-  auto found =
-      std::ranges::find(notifications_, notificationIdentifier, &UserNotification::identifier);
-  if (found == notifications_.end()) return std::nullopt;
-  UserNotification taken = std::move(*found);
-  notifications_.erase(found);
+  Record* slot = findLocked(notificationIdentifier);
+  if (!slot) return nullptr;
+  Record taken = std::move(*slot);
+  notifications_.erase(notifications_.begin() + (slot - notifications_.data()));
   return taken;
 }
 
@@ -419,26 +453,23 @@ void UserNotificationCenter::listChangedLocked() {
   if (writeScheduled_) return;
   writeScheduled_ = true;
   storeQueue_->async([weak = weak_from_this()] {
-    // Gone: its destructor wrote the list.
-    if (auto self = weak.lock()) self->writeList();
+    std::vector<Record> snapshot;
+    std::uint64_t revision = 0;
+    std::shared_ptr<DeliveredNotificationList> list;
+    {
+      // Gone: its destructor wrote the list.
+      std::shared_ptr<UserNotificationCenter> self = weak.lock();
+      if (!self) return;
+      MutexLock lock(self->mutex_);
+      self->writeScheduled_ = false;
+      snapshot = self->notifications_;
+      revision = self->revision_;
+      list = self->list_;
+    }
+    if (Result<void> written = list->write(snapshot, revision); !written) {
+      TILL_LOG(1, "%@: Could not write %@: %@", kSpeaker, list->path(), written.errorDescription());
+    }
   });
-}
-
-void UserNotificationCenter::writeList() {
-  std::vector<UserNotification> snapshot;
-  std::uint64_t revision = 0;
-  {
-    MutexLock lock(mutex_);
-    writeScheduled_ = false;
-    snapshot = notifications_;
-    revision = revision_;
-  }
-  if (Result<void> written = list_->write(snapshot); !written) {
-    TILL_LOG(1, "%@: Could not write %@: %@", kSpeaker, list_->path(), written.errorDescription());
-    return;
-  }
-  MutexLock lock(mutex_);
-  writtenRevision_ = std::max(writtenRevision_, revision);
 }
 
 }  // namespace larder

@@ -102,18 +102,22 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
     std::int64_t menuIndex = UserNotification::kNoAlternateAction;
   };
 
+  // Records are never changed in place: a change puts a changed copy in
+  // the list's slot, so that a copy of the list to write is a copy of
+  // pointers, made quickly under the lock the posters wait for.
+  using Record = std::shared_ptr<const UserNotification>;
+
   UserNotificationCenter(std::string identifier, Type type, std::string listPath);
 
   static std::optional<Action> parseAction(const std::string& actionKey);
   // Takes the notification out of the list if it is there; a copy of it.
-  std::optional<UserNotification> takeLocked(const std::string& notificationIdentifier)
-      REQUIRES(mutex_);
-  UserNotification* findLocked(const std::string& notificationIdentifier) REQUIRES(mutex_);
-  UserNotification* findShownLocked(std::uint32_t serverIdentifier) REQUIRES(mutex_);
+  Record takeLocked(const std::string& notificationIdentifier) REQUIRES(mutex_);
+  // The slot of the notification in the list, or null.
+  Record* findLocked(const std::string& notificationIdentifier) REQUIRES(mutex_);
+  Record* findShownLocked(std::uint32_t serverIdentifier) REQUIRES(mutex_);
   // The list changed: it goes to its file soon, in one write for the
   // changes that come before the write starts.
   void listChangedLocked() REQUIRES(mutex_);
-  void writeList() EXCLUDES(mutex_);
 
   // Work of the server queue.
   void present(const UserNotification& notification) EXCLUDES(mutex_);
@@ -125,7 +129,9 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
 
   const std::string identifier_;
   const Type type_;
-  const std::unique_ptr<DeliveredNotificationList> list_;
+  // Shared with the writes in the store queue, which must not keep the
+  // center alive.
+  const std::shared_ptr<DeliveredNotificationList> list_;
   // Calls of the server, which may be slow or absent, in the order they
   // were asked for; and the signals of the server after them.
   const std::shared_ptr<DispatchQueue> serverQueue_;
@@ -135,12 +141,11 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
   const std::shared_ptr<DispatchQueue> delegateQueue_;
 
   mutable Mutex mutex_;
-  std::vector<UserNotification> notifications_ GUARDED_BY(mutex_);
+  std::vector<Record> notifications_ GUARDED_BY(mutex_);
   std::weak_ptr<Delegate> delegate_ GUARDED_BY(mutex_);
   std::shared_ptr<NotificationServer> server_ GUARDED_BY(mutex_);
-  // Changes of the list, and the last change that is in the file.
+  // Changes of the list since the center was made.
   std::uint64_t revision_ GUARDED_BY(mutex_) = 0;
-  std::uint64_t writtenRevision_ GUARDED_BY(mutex_) = 0;
   bool writeScheduled_ GUARDED_BY(mutex_) = false;
 };
 
