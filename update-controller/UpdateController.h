@@ -177,6 +177,7 @@ class UpdateController final : public UpdateQueueDelegate,
   [[nodiscard]] std::vector<std::string> appUpdatesToInstallLater() const override;
   [[nodiscard]] bool appUpdatesToInstallLaterIncludesBundleID(
       std::string_view bundleIdentifier) const override;
+  void cancelUpdatesToBeInstalledLater() override;
   [[nodiscard]] bool updateFailureNotificationIsDisplayed() const override;
   [[nodiscard]] UpdateNotificationCatalogue& notificationCatalogue() const override;
   [[nodiscard]] bool shouldOfferDoItLaterForAvailableUpdates() const;

@@ -5,12 +5,16 @@
 
 #include "platform/dispatch/DispatchSemaphore.h"
 #include "platform/log/TillLogManager.h"
+#include "running-apps/AuthorizationController.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/PreferenceKeys.h"
+#include "store-runtime/dialogs/LedgerLocalizedString.h"
+#include "store-runtime/dialogs/VendDialog.h"
 #include "store-runtime/host/LedgerTwilightAgent.h"
 #include "store-runtime/host/PreferenceStore.h"
 #include "store-runtime/services/VendDownloadService.h"
+#include "store-runtime/services/VendUIService.h"
 #include "update-controller/UpdateController.h"
 
 namespace larder {
@@ -78,13 +82,38 @@ bool UpdateController::appUpdatesToInstallLaterIncludesBundleID(
   return std::ranges::find(later, bundleIdentifier) != later.end();
 }
 
+// Asks for the authorization first, as every change of the later lists
+// does, but goes on without it: a cancel must never leave updates armed.
+void UpdateController::cancelUpdatesToBeInstalledLater() {
+  (void)AuthorizationController::sharedInstance().authorizeForSoftwareInstall();
+  SysupQuaymartUpdateController::sharedUpdateController().removeAllUpdatesFromInstallLater();
+  (void)PreferenceStore::setValue(kDefaultsAppUpdatesToInstallLaterKey, PlistArray{},
+                                  kDaemonDefaultsID, PreferenceScope::User);
+  LedgerTwilightAgent::disarmObserver();
+}
+
+// The dialog's texts say whether the updates still have to download before
+// the restart. Blocks until the user answers; with no dialog agent the
+// answer is "not now".
 bool UpdateController::confirmRestartWithUpdatesWillDownload(bool willDownload) {
-  // The restart confirmation belongs to the restart path, which this build
-  // does not have; without it the restart counts as declined, so that the
-  // updates wait for the next logout instead of a restart nobody agreed to.
-  TILL_LOG(1, "%@: No restart confirmation in this build (download %d); restart declined", kSpeaker,
-           willDownload);
-  return false;
+  auto text = [&](std::string key) {
+    if (willDownload) key += "_DOWNLOAD";
+    return LedgerLocalizedString(key, &storeClient_);
+  };
+  const VendDialog dialog = VendDialog::dialogWithDictionary(
+      {{"message", text("CONFIRM_RESTART_TITLE")},
+       {"explanation", text("CONFIRM_RESTART_MESSAGE")},
+       {"okButtonString", text("CONFIRM_RESTART_RESTART_BUTTON")},
+       {"cancelButtonString", text("CONFIRM_RESTART_NOT_NOW_BUTTON")}});
+  auto answered = std::make_shared<DispatchSemaphore>();
+  auto exitCode = std::make_shared<std::atomic<std::int64_t>>(VendDialogButton::kCancel);
+  serviceProxy_->uiService()->displayDialog(dialog, nullptr,
+                                            [answered, exitCode](std::int64_t code) {
+                                              exitCode->store(code);
+                                              answered->signal();
+                                            });
+  answered->wait();
+  return exitCode->load() == VendDialogButton::kOK;
 }
 
 void UpdateController::appendInstalledUpdatesToJournal(const std::vector<LedgerUpdateRef>& apps,

@@ -3,10 +3,12 @@
 // the run record.
 #include "update-operation/UpdateOperation.h"
 
+#include <algorithm>
 #include <cstdio>
 #include <exception>
 #include <utility>
 
+#include "notifications/catalogue/UpdateNotificationCatalogue.h"
 #include "platform/dispatch/DispatchSemaphore.h"
 #include "platform/log/TillLogManager.h"
 #include "platform/plist/PropertyListSerialization.h"
@@ -411,8 +413,27 @@ void UpdateOperation::restartToInstallUpdates() {
   }
 }
 
+// The end of a Do It Later run that did not restart: what was put off and
+// is still not installed is a failure the user hears of, unless it only
+// waits for its time (abort codes 500 to 599). The later lists are emptied
+// either way.
 void UpdateOperation::showDoItLaterFailureAlert() {
-  TILL_LOG(1, "%@: Do It Later failure alert is not part of this build", kSpeaker);
+  std::shared_ptr<UpdateOperationController> controller = updateController();
+  if (!controller) return;
+  const std::shared_ptr<const UpdateQueue::UpdateList> available =
+      controller->updateQueue()->availableUpdates();
+  const bool appLeftUndone = std::ranges::any_of(*available, [&](const LedgerUpdateRef& update) {
+    const std::int64_t code = update->autoUpdateAbortCode();
+    return update->bundleID() &&
+           controller->appUpdatesToInstallLaterIncludesBundleID(*update->bundleID()) &&
+           (code < 500 || code > 599);
+  });
+  const bool osLeftUndone =
+      !SysupQuaymartUpdateController::sharedUpdateController().updatesToBeInstalledLater().empty();
+  controller->cancelUpdatesToBeInstalledLater();
+  if (appLeftUndone || osLeftUndone) {
+    controller->notificationCatalogue().postDoItLaterFailedNotificationWithAuditInfo(auditInfo());
+  }
 }
 
 void UpdateOperation::relaunchTerminatedApplications() {

@@ -57,6 +57,8 @@ class UpdateOperationController : public UpdatePolicy {
   [[nodiscard]] virtual std::vector<std::string> appUpdatesToInstallLater() const = 0;
   [[nodiscard]] virtual bool appUpdatesToInstallLaterIncludesBundleID(
       std::string_view bundleIdentifier) const = 0;
+  // Empties both later lists and disarms the deferred-install agent.
+  virtual void cancelUpdatesToBeInstalledLater() = 0;
   [[nodiscard]] virtual bool updateFailureNotificationIsDisplayed() const = 0;
   // What the controller posts to the user, and takes away.
   [[nodiscard]] virtual UpdateNotificationCatalogue& notificationCatalogue() const = 0;

@@ -9,6 +9,7 @@
 #include <future>
 #include <thread>
 
+#include "notifications/center/UserNotificationCenter.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
 #include "running-apps/PlugInHost.h"
@@ -139,7 +140,10 @@ class UpdateRunTest : public InProcessRuntimeTest {
     map_.emplace(options);
     map_->waitUntilIdle();
     map_->addObserver(changes_);
-    controller_ = UpdateController::make(client, *map_);
+    notifications_ = UserNotificationCenter::makeForTesting(
+        "com.orvane.larderd", UserNotificationCenter::kSystemCenter,
+        platform_.directory() + "/notifications.plist");
+    controller_ = UpdateController::make(client, *map_, notifications_);
   }
 
   // A background run with the tasks that the time tests give it.
@@ -173,6 +177,7 @@ class UpdateRunTest : public InProcessRuntimeTest {
   std::optional<SoftwareMap> map_;
   std::shared_ptr<MapChanges> changes_ = std::make_shared<MapChanges>();
   std::shared_ptr<UpdateController> controller_;
+  std::shared_ptr<UserNotificationCenter> notifications_;
   std::vector<pid_t> launched_;
 };
 
@@ -228,6 +233,12 @@ TEST_F(UpdateRunTest, AnAppThatIsNotRunningIsStagedAndInstalledInOneRun) {
   EXPECT_EQ(queued(kNotesID), nullptr);
   EXPECT_EQ(queued(kAtlasID), nullptr);
   EXPECT_EQ(run->runState().autoInstalledAppUpdates.size(), 2U);
+  // The run tells the user what it updated.
+  const std::vector<UserNotification> told = notifications_->deliveredNotifications();
+  ASSERT_EQ(told.size(), 1U);
+  EXPECT_EQ(told[0].source(), "autoInstalledUpdates");
+  EXPECT_EQ(told[0].title, "2 Apps Updated");
+  EXPECT_NE(told[0].informativeText.find("were updated automatically."), std::string::npos);
 }
 
 // Each way an automatic update can fail leaves the old version installed
@@ -625,6 +636,19 @@ TEST_F(UpdateRunTest, AtTheChosenMomentTheAppIsQuitInstalledAndStartedAgain) {
   EXPECT_EQ(osEntry["abortCode"].int64Value(), UpdateOperation::kAbortDidNotTerminate);
   EXPECT_EQ(*osEntry["abortReason"].string(), "app com.example.atlas did not terminate");
   EXPECT_EQ(SysupQuaymartUpdateController::sharedUpdateController().availableUpdates().size(), 1U);
+
+  // What was put off and is still undone is a failure the user hears of,
+  // with the run's audit; the later lists are emptied.
+  const std::vector<UserNotification> told = notifications_->deliveredNotifications();
+  ASSERT_EQ(told.size(), 1U);
+  const PlistValue userInfo(told[0].userInfo);
+  EXPECT_TRUE(userInfo["isDoItLaterFailure"].boolValue());
+  ASSERT_NE(userInfo["auditInfoCacheKey"].string(), nullptr);
+  const std::optional<PlistDictionary> audit =
+      controller_->cachedUpdateAuditInfoWithKey(*userInfo["auditInfoCacheKey"].string());
+  ASSERT_TRUE(audit.has_value());
+  EXPECT_TRUE(PlistValue(*audit)["appUpdates"][std::to_string(kAtlasID)].dictionary());
+  EXPECT_TRUE(controller_->appUpdatesToInstallLater().empty());
 }
 
 }  // namespace

@@ -5,13 +5,16 @@
 #include <future>
 
 #include "ServiceTestSupport.h"
+#include "notifications/center/UserNotificationCenter.h"
 #include "platform/dispatch/DispatchQueue.h"
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/PreferenceKeys.h"
+#include "store-runtime/dialogs/VendDialogPresenter.h"
 #include "store-runtime/download/VendFileManager.h"
 #include "store-runtime/host/LedgerDistributedNotificationCenter.h"
 #include "store-runtime/host/PlatformStateFile.h"
 #include "store-runtime/host/PreferenceStore.h"
+#include "store-runtime/runtime/VendRuntime.h"
 #include "tests/unit/OSUpdateOffers.h"
 #include "update-controller/UpdateController.h"
 #include "update-operation/UpdateOperation.h"
@@ -106,7 +109,11 @@ class UpdateControllerTest : public ServiceTest {
   UpdateController& controller(std::int64_t clientType = 0) {
     VendStoreClient client = VendStoreClient::fromDictionary(
         {{"identifier", "test-client-" + std::to_string(++clients_)}, {"clientType", clientType}});
-    controller_ = UpdateController::make(client, *map_);
+    controller_ =
+        UpdateController::make(client, *map_,
+                               UserNotificationCenter::makeForTesting(
+                                   "com.orvane.larderd", UserNotificationCenter::kSystemCenter,
+                                   temporary() + "/notifications.plist"));
     return *controller_;
   }
 
@@ -434,6 +441,54 @@ TEST_F(UpdateControllerTest, HidingNeedsAuthorizationAndPassesOverUnknownKeys) {
   updates.unhideAllOSUpdates([&](bool ok) { outcomes.push_back(ok); });
   EXPECT_EQ(SysupQuaymartUpdateController::sharedUpdateController().availableUpdates().size(), 2U);
   EXPECT_EQ(outcomes, (std::vector<bool>{true, true}));
+}
+
+// Answers every dialog with one exit code and keeps what it was shown.
+class AnsweringPresenter final : public VendDialogPresenter {
+ public:
+  explicit AnsweringPresenter(std::int64_t exitCode) : exitCode_(exitCode) {}
+  void present(const VendDialog& dialog, Reply reply) override {
+    {
+      std::lock_guard lock(mutex_);
+      shown_.push_back(dialog.toDictionary());
+    }
+    reply(VendDialogAnswer{exitCode_, {}});
+  }
+  void dismiss(std::string_view, std::int64_t) override {}
+  std::vector<PlistDictionary> shown() {
+    std::lock_guard lock(mutex_);
+    return shown_;
+  }
+
+ private:
+  std::int64_t exitCode_;
+  std::mutex mutex_;
+  std::vector<PlistDictionary> shown_;
+};
+
+TEST_F(UpdateControllerTest, TheRestartIsConfirmedOnlyByItsRestartButton) {
+  UpdateController& updates = controller();
+  struct Case {
+    bool willDownload;
+    std::int64_t exitCode;
+    const char* title;
+    bool confirmed;
+  } const cases[] = {{true, 1, "Download and Restart to Install Updates?", true},
+                     {false, 1, "Restart to Install Updates?", true},
+                     {false, 0, "Restart to Install Updates?", false},
+                     {true, 2, "Download and Restart to Install Updates?", false}};
+  for (const Case& c : cases) {
+    auto presenter = std::make_shared<AnsweringPresenter>(c.exitCode);
+    VendRuntime::shared()->setDialogPresenter(presenter);
+    EXPECT_EQ(updates.confirmRestartWithUpdatesWillDownload(c.willDownload), c.confirmed);
+    ASSERT_EQ(presenter->shown().size(), 1u);
+    const PlistValue shown(presenter->shown()[0]);
+    EXPECT_EQ(*shown["message"].string(), c.title);
+    EXPECT_EQ(*shown["okButtonString"].string(), c.willDownload ? "Download & Restart" : "Restart");
+  }
+  VendRuntime::shared()->setDialogPresenter(nullptr);
+  // Nobody to ask: not now.
+  EXPECT_FALSE(updates.confirmRestartWithUpdatesWillDownload(false));
 }
 
 }  // namespace
