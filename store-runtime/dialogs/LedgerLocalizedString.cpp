@@ -20,4 +20,21 @@ std::string LedgerLocalizedString(std::string_view key, const VendStoreClient* s
       key, std::nullopt, LocalizedStringBundle::tradelineFramework(), "", storeClient);
 }
 
+std::string LedgerFormatLocalizedString(std::string_view format,
+                                        std::initializer_list<std::string_view> arguments) {
+  constexpr std::string_view kPlaceholder = "%@";
+  std::string text;
+  text.reserve(format.size());
+  const std::string_view* next = arguments.begin();
+  std::size_t start = 0;
+  for (std::size_t found = format.find(kPlaceholder); found != std::string_view::npos;
+       found = format.find(kPlaceholder, start)) {
+    text += format.substr(start, found - start);
+    if (next != arguments.end()) text += *next++;
+    start = found + kPlaceholder.size();
+  }
+  text += format.substr(start);
+  return text;
+}
+
 }  // namespace larder

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <initializer_list>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -22,5 +23,12 @@ std::string LedgerLocalizedStringFromTableInBundle(std::string_view key,
 
 // The usual call: no table, no default, the store client framework.
 std::string LedgerLocalizedString(std::string_view key, const VendStoreClient* storeClient);
+
+// A localized text with its "%@" placeholders filled in order. Arguments
+// are taken as they are (a name holding "%@" is not filled again); a
+// placeholder without an argument is left empty, so that a wording with one
+// placeholder more than its caller knows of shows no stray "%@".
+std::string LedgerFormatLocalizedString(std::string_view format,
+                                        std::initializer_list<std::string_view> arguments);
 
 }  // namespace larder
