@@ -115,8 +115,9 @@ class TestPresenter final : public VendDialogPresenter {
 
 class QuitDialogTest : public ::testing::Test {
  protected:
-  QuitDialogTest() { VendRuntime::setShared(runtime_); }
-  ~QuitDialogTest() override { VendRuntime::setShared(nullptr); }
+  void SetUp() override { VendRuntime::setShared(runtime_); }
+  // The next user makes a shared runtime of its own environment.
+  void TearDown() override { VendRuntime::setShared(nullptr); }
 
   std::shared_ptr<TestPresenter> install(std::optional<std::int64_t> exitCode, bool gated = false) {
     auto presenter = std::make_shared<TestPresenter>(exitCode, gated);
