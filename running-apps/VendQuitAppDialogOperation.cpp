@@ -107,6 +107,12 @@ void VendQuitAppDialogOperation::setDidForceFinish(bool didForceFinish) {
 }
 
 void VendQuitAppDialogOperation::run() {
+  // However the run ends, an exception included, a waiting forceFinish
+  // hears of it.
+  struct SignalAtEnd {
+    DispatchSemaphore& ended;
+    ~SignalAtEnd() { ended.signal(); }
+  } const signalAtEnd{runEnded_};
   if (didForceFinish()) {
     TILL_LOG(2, "%@: Dialog %@ not shown: it was finished before it went up", kSpeaker,
              dialog().identifier());
@@ -115,7 +121,6 @@ void VendQuitAppDialogOperation::run() {
   } else {
     VendDialogOperation::run();
   }
-  runEnded_.signal();
 }
 
 PlistDictionary VendQuitAppDialogOperation::dismissalRequest() const {
