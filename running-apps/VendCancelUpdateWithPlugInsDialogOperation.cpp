@@ -30,20 +30,23 @@ VendCancelUpdateWithPlugInsDialogOperation::operationWithDictionary(const PlugIn
                                                                     VendStoreClient storeClient) {
   if (hosts.empty()) return nullptr;
   const std::string appName = nameOfContainingApp(hosts.begin()->second);
-  auto text = [&](std::string_view key) { return LedgerLocalizedString(key, &storeClient); };
   std::string body;
   if (hosts.size() == 1) {
-    body = LedgerFormatLocalizedString(text("CANNOT_UPDATE_BODY"), {appName, hosts.begin()->first});
+    body = LedgerLocalizedStringWithArguments("CANNOT_UPDATE_BODY", &storeClient,
+                                              {appName, hosts.begin()->first});
   } else {
     std::string list = "<br><br><ul>";
     for (const auto& [hostName, info] : hosts) list += "<li>" + hostName + "</li>";
     list += "</ul>";
-    body = LedgerFormatLocalizedString(text("CANNOT_UPDATE_BODY_MULTIPLE"), {appName}) + " " + list;
+    body =
+        LedgerLocalizedStringWithArguments("CANNOT_UPDATE_BODY_MULTIPLE", &storeClient, {appName}) +
+        " " + list;
   }
   const PlistDictionary fields{
-      {"message", LedgerFormatLocalizedString(text("CANNOT_UPDATE_TITLE"), {appName})},
+      {"message",
+       LedgerLocalizedStringWithArguments("CANNOT_UPDATE_TITLE", &storeClient, {appName})},
       {"explanation", body},
-      {"okButtonString", text("CANNOT_UPDATE_DEFAULT_BUTTON")},
+      {"okButtonString", LedgerLocalizedString("CANNOT_UPDATE_DEFAULT_BUTTON", &storeClient)},
   };
   TILL_LOG(2, "%@: %@ cannot be updated while %@ host application(s) use its plug-ins", kSpeaker,
            appName, hosts.size());

@@ -51,7 +51,7 @@ QuitTexts textsForOneApp(const RunningApplication& application,
                          const VendStoreClient& storeClient) {
   const std::string name = nameOf(application);
   auto text = [&](std::string_view key) {
-    return LedgerFormatLocalizedString(LedgerLocalizedString(key, &storeClient), {name});
+    return LedgerLocalizedStringWithArguments(key, &storeClient, {name});
   };
   QuitTexts texts{text("INSTALL_QUIT_APP_TITLE_FORMAT"), text("INSTALL_QUIT_APP_MESSAGE_FORMAT"),
                   text("INSTALL_QUIT_APP_SKIP_BUTTON_FORMAT")};
@@ -67,11 +67,10 @@ QuitTexts textsForApps(const std::vector<std::shared_ptr<RunningApplication>>& a
   // The agent lays the names out as list items.
   std::string list;
   for (const auto& application : apps) list += "<li>" + nameOf(*application);
-  return {
-      LedgerLocalizedString("INSTALL_QUIT_APP_MULTIPLE_TITLE", &storeClient),
-      LedgerFormatLocalizedString(
-          LedgerLocalizedString("INSTALL_QUIT_APP_MULTIPLE_MESSAGE_FORMAT", &storeClient), {list}),
-      LedgerLocalizedString("INSTALL_QUIT_APP_SKIPALL_BUTTON", &storeClient)};
+  return {LedgerLocalizedString("INSTALL_QUIT_APP_MULTIPLE_TITLE", &storeClient),
+          LedgerLocalizedStringWithArguments("INSTALL_QUIT_APP_MULTIPLE_MESSAGE_FORMAT",
+                                             &storeClient, {list}),
+          LedgerLocalizedString("INSTALL_QUIT_APP_SKIPALL_BUTTON", &storeClient)};
 }
 
 }  // namespace

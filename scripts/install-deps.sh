@@ -11,6 +11,7 @@ packages=(
   libgtest-dev libgmock-dev libbenchmark-dev
   clang libclang-rt-14-dev llvm clang-format clang-tidy
   procps curl
+  xvfb xauth dunst
 )
 
 missing=()

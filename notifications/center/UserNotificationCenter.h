@@ -4,6 +4,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "notifications/center/UserNotification.h"
@@ -13,6 +14,7 @@
 namespace larder {
 
 class DeliveredNotificationList;
+class DispatchQueue;
 class NotificationServer;
 
 // The notifications of one poster: those delivered, kept in a list that
@@ -29,6 +31,11 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
     kSystemCenter = 2,
   };
 
+  // The errors of `activate`.
+  static constexpr std::string_view kErrorDomain = "UserNotificationCenter";
+  static constexpr std::int64_t kUnknownNotificationCode = 1;
+  static constexpr std::int64_t kUnknownActionCode = 2;
+
   // Told what the user did with a notification. Called on the center's
   // signal thread, never with a lock of the center held.
   class Delegate {
@@ -37,7 +44,7 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
     // The contents were clicked, or the main button or one of its menu
     // entries was used (see activationType, alternateActionIndex).
     virtual void didActivateNotification(UserNotificationCenter& center,
-                                          const UserNotification& notification) = 0;
+                                         const UserNotification& notification) = 0;
     // The second button of an alert was used.
     virtual void didDismissAlert(UserNotificationCenter& center,
                                  const UserNotification& notification) = 0;
@@ -50,6 +57,10 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
   // use; its list is read from the state folder then.
   static std::shared_ptr<UserNotificationCenter> centerForIdentifier(const std::string& identifier,
                                                                      Type type);
+  // A center of its own, outside the process's set, keeping its list in
+  // `listPath`, and without a server until one is set: for tests.
+  static std::shared_ptr<UserNotificationCenter> makeForTesting(const std::string& identifier,
+                                                                Type type, std::string listPath);
 
   ~UserNotificationCenter();
   UserNotificationCenter(const UserNotificationCenter&) = delete;
@@ -84,10 +95,58 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
   void setServer(std::shared_ptr<NotificationServer> server);
 
  private:
-  UserNotificationCenter(std::string identifier, Type type);
-  // ...
+  // What an action key asks for.
+  struct Action {
+    enum Kind { kContents, kMainButton, kMenuEntry, kOtherButton };
+    Kind kind = kContents;
+    std::int64_t menuIndex = UserNotification::kNoAlternateAction;
+  };
+
+  // Records are never changed in place: a change puts a changed copy in
+  // the list's slot, so that a copy of the list to write is a copy of
+  // pointers, made quickly under the lock the posters wait for.
+  using Record = std::shared_ptr<const UserNotification>;
+
+  UserNotificationCenter(std::string identifier, Type type, std::string listPath);
+
+  static std::optional<Action> parseAction(const std::string& actionKey);
+  // Takes the notification out of the list if it is there; a copy of it.
+  Record takeLocked(const std::string& notificationIdentifier) REQUIRES(mutex_);
+  // The slot of the notification in the list, or null.
+  Record* findLocked(const std::string& notificationIdentifier) REQUIRES(mutex_);
+  Record* findShownLocked(std::uint32_t serverIdentifier) REQUIRES(mutex_);
+  // The list changed: it goes to its file soon, in one write for the
+  // changes that come before the write starts.
+  void listChangedLocked() REQUIRES(mutex_);
+
+  // Work of the server queue.
+  void present(const UserNotification& notification) EXCLUDES(mutex_);
+  void serverDidInvokeAction(std::uint32_t serverIdentifier, const std::string& actionKey)
+      EXCLUDES(mutex_);
+  void serverDidClose(std::uint32_t serverIdentifier, std::uint32_t reason) EXCLUDES(mutex_);
+  // Asks the server to take it off the screen, on the server queue.
+  void closeOnServerLocked(const UserNotification& notification) REQUIRES(mutex_);
+
   const std::string identifier_;
   const Type type_;
+  // Shared with the writes in the store queue, which must not keep the
+  // center alive.
+  const std::shared_ptr<DeliveredNotificationList> list_;
+  // Calls of the server, which may be slow or absent, in the order they
+  // were asked for; and the signals of the server after them.
+  const std::shared_ptr<DispatchQueue> serverQueue_;
+  // Writes of the list file.
+  const std::shared_ptr<DispatchQueue> storeQueue_;
+  // Calls of the delegate, so that they never wait for the server.
+  const std::shared_ptr<DispatchQueue> delegateQueue_;
+
+  mutable Mutex mutex_;
+  std::vector<Record> notifications_ GUARDED_BY(mutex_);
+  std::weak_ptr<Delegate> delegate_ GUARDED_BY(mutex_);
+  std::shared_ptr<NotificationServer> server_ GUARDED_BY(mutex_);
+  // Changes of the list since the center was made.
+  std::uint64_t revision_ GUARDED_BY(mutex_) = 0;
+  bool writeScheduled_ GUARDED_BY(mutex_) = false;
 };
 
 }  // namespace larder

@@ -24,11 +24,15 @@ std::string LedgerLocalizedStringFromTableInBundle(std::string_view key,
 // The usual call: no table, no default, the store client framework.
 std::string LedgerLocalizedString(std::string_view key, const VendStoreClient* storeClient);
 
-// A localized text with its "%@" placeholders filled in order. Arguments
-// are taken as they are (a name holding "%@" is not filled again); a
-// placeholder without an argument is left empty, so that a wording with one
-// placeholder more than its caller knows of shows no stray "%@".
-std::string LedgerFormatLocalizedString(std::string_view format,
-                                        std::initializer_list<std::string_view> arguments);
+// A localised format with its arguments put in: each "%@" takes the next
+// argument, "%%" is a percent sign. Missing arguments leave nothing; extra
+// ones are ignored, so a translation that drops a placeholder still reads.
+std::string LedgerLocalizedFormat(std::string_view format,
+                                  std::initializer_list<std::string_view> arguments);
+
+// The text of `key` with its arguments put in.
+std::string LedgerLocalizedStringWithArguments(std::string_view key,
+                                               const VendStoreClient* storeClient,
+                                               std::initializer_list<std::string_view> arguments);
 
 }  // namespace larder

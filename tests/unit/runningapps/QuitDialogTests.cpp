@@ -122,9 +122,9 @@ class QuitDialogTest : public ::testing::Test {
 };
 
 TEST(LocalizedFormat, FillsPlaceholdersInOrderAndOnlyOnce) {
-  EXPECT_EQ(LedgerFormatLocalizedString("%@ uses %@.", {"A%@", "B"}), "A%@ uses B.");
-  EXPECT_EQ(LedgerFormatLocalizedString("%@ uses %@.", {"A"}), "A uses .");
-  EXPECT_EQ(LedgerFormatLocalizedString("100% of %@", {"it", "more"}), "100% of it");
+  EXPECT_EQ(LedgerLocalizedFormat("%@ uses %@.", {"A%@", "B"}), "A%@ uses B.");
+  EXPECT_EQ(LedgerLocalizedFormat("%@ uses %@.", {"A"}), "A uses .");
+  EXPECT_EQ(LedgerLocalizedFormat("100% of %@", {"it", "more"}), "100% of it");
 }
 
 TEST_F(QuitDialogTest, TheQuitDialogNamesTheAppsAndOffersSkipOnlyWhenAllowed) {
