@@ -8,6 +8,7 @@
 #include "platform/system/ApplicationRegistry.h"
 #include "platform/system/Bundle.h"
 #include "running-apps/PlugInHost.h"
+#include "running-apps/QuitAppDialogPrompt.h"
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/PreferenceKeys.h"
 #include "store-runtime/host/LedgerSystemState.h"
@@ -424,18 +425,15 @@ AppHelper::PromptOutcome AppHelper::askToQuit(bool promptToConfirm) {
   std::vector<SysupQuaymartUpdate> updates;
   {
     MutexLock lock(mutex_);
+    // Made on first use: most take-downs never ask.
+    if (!quitPrompt_) quitPrompt_ = std::make_shared<QuitAppDialogPrompt>(storeClient_);
     prompt = quitPrompt_;
-    quitPromptShowing_ = prompt != nullptr;
+    quitPromptShowing_ = true;
     appsToQuit = appsToTerminate_;
     allowSkip = allowUserToSkipApps_;
     updates = osUpdates_;
   }
-  if (!prompt) {
-    // A dialog that cannot be shown leaves no answer: as a cancel.
-    TILL_LOG(1, "%@: No quit prompt to ask the user with; not terminating %@", kSpeaker,
-             describeApplications(appsToQuit));
-    return PromptOutcome::kStop;
-  }
+  TILL_LOG(2, "%@: Asking the user to quit %@", kSpeaker, describeApplications(appsToQuit));
   bool didForceFinish = false;
   AppHelperQuitPrompt::Answer answer = prompt->run(appsToQuit, allowSkip, updates, &didForceFinish);
   MutexLock lock(mutex_);

@@ -25,9 +25,9 @@ class PlugInHold;
 // it).
 using PlugInHostApps = std::map<std::string, PlistDictionary>;
 
-// What a take-down shows the user before it quits applications. The quit
-// dialog itself is not part of this layer; a helper without one treats a
-// prompted take-down as cancelled.
+// What a take-down shows the user before it quits applications. A helper
+// asks the quit dialog (QuitAppDialogPrompt) unless it was given another
+// prompt; with no dialog agent to show it, the dialog comes back cancelled.
 class AppHelperQuitPrompt {
  public:
   enum class Answer { kNone, kQuit, kSkip, kCancel };
@@ -105,6 +105,7 @@ class AppHelper : public std::enable_shared_from_this<AppHelper> {
   void relaunchTerminatedApps();
   [[nodiscard]] bool needsRelaunch() const;
 
+  // Replaces the quit dialog; for tests.
   void setQuitPrompt(std::shared_ptr<AppHelperQuitPrompt> prompt);
   [[nodiscard]] bool allowUserToSkipApps() const;
   void setAllowUserToSkipApps(bool allow);
@@ -161,6 +162,7 @@ class AppHelper : public std::enable_shared_from_this<AppHelper> {
   const std::vector<std::string> bundleIdentifiers_;
   Applications terminatedApps_ GUARDED_BY(mutex_);
   Applications appsToTerminate_ GUARDED_BY(mutex_);
+  // The quit dialog of the store client unless a test set another.
   std::shared_ptr<AppHelperQuitPrompt> quitPrompt_ GUARDED_BY(mutex_);
   // The prompt is on screen and has not been answered.
   bool quitPromptShowing_ GUARDED_BY(mutex_) = false;

@@ -113,8 +113,8 @@ constexpr std::array kTradelineStrings = {
     Entry{"INSTALL_QUIT_APP_MESSAGE_FORMAT",
           "%@ must quit before it can be updated. Changes you haven't saved may be lost."},
     Entry{"INSTALL_QUIT_APP_MULTIPLE_MESSAGE_FORMAT",
-          "These applications must quit before they can be updated: %@. Changes you haven't "
-          "saved may be lost."},
+          "Changes you haven't saved may be lost. These applications must quit before they can "
+          "be updated:%@"},
     Entry{"INSTALL_QUIT_APP_MULTIPLE_TITLE", "Quit Applications to Update Them?"},
     Entry{"INSTALL_QUIT_APP_SKIPALL_BUTTON", "Skip These Updates"},
     Entry{"INSTALL_QUIT_APP_SKIP_BUTTON_FORMAT", "Skip %@"},
