@@ -235,7 +235,7 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
   // Install later, automatic updates, major OS update.
   {"RemoveUpdateFromInstallLaterWithBundleID", false, nullptr, kNothing},
   {"ShouldOfferDoItLaterForAvailableUpdates", false,
-   CONTROLLER_REPLY("ShouldOfferDoItLaterForAvailableUpdates", UpdateController::shouldOfferDoItLaterForAppUpdates(*c.updateQueue()->availableUpdates(), SysupQuaymartUpdateController::sharedUpdateController().availableUpdates()))},
+   CONTROLLER_REPLY("ShouldOfferDoItLaterForAvailableUpdates", c.shouldOfferDoItLaterForAvailableUpdates())},
   {"InstallAvailableUpdatesLaterWithMode", false, nullptr, kNothing},
   {"AppUpdatesToInstallLater", false, nullptr, kEmpty},
   {"CancelUpdatesToBeInstalledLater", false,

@@ -5,6 +5,7 @@
 
 #include "AssetService/DBusRemoteObjectFactory.h"
 #include "AssetService/DialogAgentRegistry.h"
+#include "AssetService/NotificationsInterface.h"
 #include "AssetService/StoreRuntimeInterface.h"
 #include "client/DBusValueCodec.h"
 #include "client/DistributedNotificationProtocol.h"
@@ -49,6 +50,11 @@ void ServiceListener::setStoreRuntimeInterface(
   storeRuntime_ = std::move(storeRuntime);
 }
 
+void ServiceListener::setNotificationsInterface(
+    std::shared_ptr<NotificationsInterface> notifications) {
+  notifications_ = std::move(notifications);
+}
+
 void ServiceListener::resume() {
   connection_ = connectToBus();
   remoteObjects_ = std::make_shared<DBusRemoteObjectFactory>(*connection_);
@@ -61,6 +67,7 @@ void ServiceListener::resume() {
   }
   if (dialogAgents_) dialogAgents_->exportOn(*object_, *connection_);
   if (storeRuntime_) storeRuntime_->exportOn(*object_);
+  if (notifications_) notifications_->exportOn(*object_);
   object_->registerSignal(std::string(DistributedNotificationProtocol::kInterfaceName),
                           std::string(DistributedNotificationProtocol::kSignal),
                           std::string(DistributedNotificationProtocol::kSignature));

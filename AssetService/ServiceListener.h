@@ -18,6 +18,7 @@
 namespace larder {
 
 class DialogAgentRegistry;
+class NotificationsInterface;
 class StoreRuntimeInterface;
 class SoftwareMap;
 
@@ -38,6 +39,7 @@ class ServiceListener {
   void setDialogAgentRegistry(std::shared_ptr<DialogAgentRegistry> registry);
   // Exported beside the request table on the service object.
   void setStoreRuntimeInterface(std::shared_ptr<StoreRuntimeInterface> storeRuntime);
+  void setNotificationsInterface(std::shared_ptr<NotificationsInterface> notifications);
   // Connects, exports the object, takes the name and starts delivering
   // requests on the bus thread. Throws sdbus::Error when the bus refuses.
   void resume();
@@ -65,6 +67,7 @@ class ServiceListener {
   std::shared_ptr<AssetServiceDelegate> delegate_;
   std::shared_ptr<DialogAgentRegistry> dialogAgents_;
   std::shared_ptr<StoreRuntimeInterface> storeRuntime_;
+  std::shared_ptr<NotificationsInterface> notifications_;
   std::unique_ptr<sdbus::IConnection> connection_;
   std::unique_ptr<sdbus::IObject> object_;
   std::shared_ptr<RemoteObjectFactory> remoteObjects_;

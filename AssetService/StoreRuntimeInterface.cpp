@@ -142,7 +142,8 @@ void StoreRuntimeInterface::downloads(sdbus::MethodCall call) {
   const std::int64_t mask = DBusValueCodec::read(call, "x").int64Value();
   toolProxy().downloadService()->downloadsWithTypeMask(
       mask, [call](const std::vector<std::shared_ptr<TillDownload>>& downloads) mutable {
-        reply(call, "aa{sv}", {downloadList(downloads)});
+        // Spelled out: a braced list of one array would be the array itself.
+        reply(call, "aa{sv}", PlistArray{PlistValue(downloadList(downloads))});
       });
 }
 

@@ -11,6 +11,7 @@
 
 #include "AssetService/AssetServiceDelegate.h"
 #include "AssetService/DialogAgentRegistry.h"
+#include "AssetService/NotificationsInterface.h"
 #include "AssetService/ServiceEntry.h"
 #include "AssetService/ServiceListener.h"
 #include "AssetService/StoreRuntimeInterface.h"
@@ -106,6 +107,7 @@ int main(int argc, const char** argv) {
   VendRuntime::shared()->setDialogPresenter(dialogAgents);
   listener.setDialogAgentRegistry(dialogAgents);
   listener.setStoreRuntimeInterface(std::make_shared<StoreRuntimeInterface>());
+  listener.setNotificationsInterface(std::make_shared<NotificationsInterface>());
   try {
     listener.resume();
   } catch (const std::exception& error) {

@@ -5,6 +5,7 @@
 #include "client/BusFailureText.h"
 #include "client/DBusValueCodec.h"
 #include "client/DialogAgentProtocol.h"
+#include "client/NotificationsProtocol.h"
 #include "client/ServiceError.h"
 #include "client/ServiceRequests.h"
 #include "client/StoreRuntimeProtocol.h"
@@ -75,6 +76,13 @@ PlistArray ServiceClient::callStoreRuntime(const std::string& member, const Plis
   const BusMethod* method = StoreRuntimeProtocol::findMethod(member);
   if (!method) throw ServiceError::unknownRequest(StoreRuntimeProtocol::kInterfaceName, member);
   return callMethod(StoreRuntimeProtocol::kInterfaceName, *method, arguments, timeoutMicroseconds);
+}
+
+PlistArray ServiceClient::callNotifications(const std::string& member, const PlistArray& arguments,
+                                            std::uint64_t timeoutMicroseconds) {
+  const BusMethod* method = NotificationsProtocol::findMethod(member);
+  if (!method) throw ServiceError::unknownRequest(NotificationsProtocol::kInterfaceName, member);
+  return callMethod(NotificationsProtocol::kInterfaceName, *method, arguments, timeoutMicroseconds);
 }
 
 PlistArray ServiceClient::callMethod(std::string_view interfaceName, const BusMethod& method,

@@ -44,6 +44,10 @@ class ServiceClient {
   // The same for the store runtime (SignIn, Purchase, Downloads, ...).
   PlistArray callStoreRuntime(const std::string& member, const PlistArray& arguments,
                               std::uint64_t timeoutMicroseconds = 0);
+  // The same for the delivered notifications (DeliveredNotifications,
+  // ActivateNotification).
+  PlistArray callNotifications(const std::string& member, const PlistArray& arguments,
+                               std::uint64_t timeoutMicroseconds = 0);
 
   // Exports an object at `objectPath` that answers the one method `member`
   // of a callback protocol (the interface kCallbackInterfacePrefix +

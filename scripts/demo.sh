@@ -105,6 +105,20 @@ store_item 400100 Ledgerly com.example.ledgerly 2.6
 store_item 400200 Sketchpad com.example.sketchpad 2.0 "<key>incompatible</key><true/>"
 
 mkdir -p "$XDG_STATE_HOME"
+# A desktop's notification server on a virtual screen, where the machine has
+# one: the service's notifications then appear there (LARDER_DEMO_SCREENSHOT
+# names a PNG file to take of that screen). Without one they are only kept
+# in the service's list.
+notification_server=
+if command -v Xvfb >/dev/null && command -v dunst >/dev/null; then
+  display=":$((90 + RANDOM % 100))"
+  Xvfb "$display" -screen 0 1024x600x24 -nolisten tcp >/dev/null 2>&1 &
+  xserver=$!
+  sleep 0.5
+  DISPLAY="$display" dunst >/dev/null 2>&1 &
+  notification_server="$xserver $!"
+  echo "== a notification server (dunst) shows notifications on the virtual screen $display"
+fi
 echo "== starting larder-store (log: $XDG_STATE_HOME/larder-store.log)"
 "$larder_store" --catalogue "$catalogue" --port 0 >"$demo/store.out" 2>"$XDG_STATE_HOME/larder-store.log" &
 store=$!
@@ -117,7 +131,7 @@ export LARDER_STORE_URL="$(sed -n 's/.*listening on //p' "$demo/store.out")/bag.
 echo "== starting larderd (log: $XDG_STATE_HOME/larderd.log)"
 "$larderd" 2>"$XDG_STATE_HOME/larderd.log" &
 service=$!
-trap 'kill $service $store 2>/dev/null; rm -rf "$demo"' EXIT
+trap 'kill $service $store $notification_server 2>/dev/null; rm -rf "$demo"' EXIT
 for _ in $(seq 50); do
   "$larderctl" products >/dev/null 2>&1 && break
   sleep 0.1
@@ -231,15 +245,27 @@ chmod +x "$ledgerly/bin/Ledgerly"
 "$larderctl" prefs set com.orvane.larderd AutoUpdateEnabled true --type bool
 "$ledgerly/bin/Ledgerly" &
 ledgerly_app=$!
-trap 'kill $service $store $ledgerly_app 2>/dev/null; rm -rf "$demo"' EXIT
+trap 'kill $service $store $ledgerly_app $notification_server 2>/dev/null; rm -rf "$demo"' EXIT
 sleep 0.3
 echo; echo "== automatic updates on, Ledgerly running: a background run stages its update and holds it back"
 background_run
 "$larderctl" runs
 echo; echo "== larderctl updates  (staged; abort code 3: the app is running)"
 "$larderctl" --json updates | grep -o '"autoUpdateAbortCode":[0-9]*\|"isStaged":[a-z]*' | paste -sd' '
+echo; echo "== larderctl notifications  (what the runs told the user so far)"
+"$larderctl" notifications
+if [ -n "${LARDER_DEMO_SCREENSHOT:-}" ] && [ -n "$notification_server" ]; then
+  sleep 1  # let the server draw it
+  if xwd -root -display "$display" | convert xwd:- "$LARDER_DEMO_SCREENSHOT"; then
+    echo "== screenshot of the virtual screen: $LARDER_DEMO_SCREENSHOT"
+  else
+    echo "== no screenshot: it takes xwd (x11-apps) and convert (imagemagick)"
+  fi
+fi
 kill $ledgerly_app; wait $ledgerly_app 2>/dev/null || true
 echo; echo "== Ledgerly has quit: the next background run installs the staged update"
 background_run
 "$larderctl" runs || true
 "$larderctl" product --bundle-id com.example.ledgerly | grep -i version
+echo; echo "== larderctl notifications  (and now: the app that was updated automatically)"
+"$larderctl" notifications

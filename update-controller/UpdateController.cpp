@@ -2,6 +2,8 @@
 // machine and the periodic entry of the update controller.
 #include "update-controller/UpdateController.h"
 
+#include "notifications/catalogue/UpdateNotificationCatalogue.h"
+
 #include <algorithm>
 
 #include "platform/log/TillLogManager.h"
@@ -78,15 +80,20 @@ void UpdateController::finishPendingWritesOfAllControllers() {
   });
 }
 
-std::shared_ptr<UpdateController> UpdateController::make(VendStoreClient storeClient,
-                                                         SoftwareMap& softwareMap) {
-  auto controller = std::make_shared<UpdateController>(std::move(storeClient));
+std::shared_ptr<UpdateController> UpdateController::make(
+    VendStoreClient storeClient, SoftwareMap& softwareMap,
+    std::shared_ptr<UserNotificationCenter> notificationCenter) {
+  auto controller =
+      std::make_shared<UpdateController>(std::move(storeClient), std::move(notificationCenter));
   controller->initWithStoreClient(softwareMap);
   return controller;
 }
 
-UpdateController::UpdateController(VendStoreClient storeClient)
-    : storeClient_(std::move(storeClient)) {}
+UpdateController::UpdateController(VendStoreClient storeClient,
+                                   std::shared_ptr<UserNotificationCenter> notificationCenter)
+    : storeClient_(std::move(storeClient)),
+      notificationCatalogue_(std::make_unique<UpdateNotificationCatalogue>(
+          storeClient_, notificationContext_, std::move(notificationCenter))) {}
 
 UpdateController::~UpdateController() {
   if (availableOSUpdatesObservation_ != 0) {
@@ -207,7 +214,7 @@ void UpdateController::availableUpdatesDidChangeInternal() {
              "%@: _availableUpdatesDidChange removing all updates available notifications "
              "because the badge count is 0",
              kSpeaker);
-    removeUpdatesAvailableNotifications();
+    notificationCatalogue_->removeUpdatesAvailableNotifications();
   }
   auto change = std::make_shared<const AvailableUpdatesChange>(
       availableAppUpdates(),
@@ -330,9 +337,14 @@ void UpdateController::recordSilentInstalls(const PlistDictionary& info) {
       journal.push_back(std::move(record));
     }
     appendCriticalUpdatesToJournal(journal);
-    if (adminInstall) postAdminInstallNotification(count, postLogout);
+    if (adminInstall) notificationCatalogue_->postAdminInstallNotification(count, postLogout);
   }
-  if (!adminInstall) postSilentInstallNotification(count, info);
+  if (!adminInstall) {
+    notificationCatalogue_->postSilentInstallNotification(
+        count, stringOf(info, "autoInstalledUpdatesTitle"),
+        stringOf(info, "autoInstalledUpdatesText"),
+        stringOf(info, "autoInstalledUpdatesURLString"));
+  }
 }
 
 void UpdateController::configureTimedTasks(const PlistDictionary& info,
@@ -429,41 +441,6 @@ void UpdateController::enqueue(const std::shared_ptr<UpdateOperation>& operation
 }
 
 // --- Later parts of the service ---
-
-void UpdateController::postSilentInstallNotification(std::int64_t count,
-                                                     const PlistDictionary& info) const {
-  TILL_LOG(2,
-           "%@: Silent install notification for %@ updates (title %@, text %@, url %@) not posted: "
-           "no notifications in this build",
-           kSpeaker, count, stringOf(info, "autoInstalledUpdatesTitle").value_or(""),
-           stringOf(info, "autoInstalledUpdatesText").value_or(""),
-           stringOf(info, "autoInstalledUpdatesURLString").value_or(""));
-}
-
-void UpdateController::postAdminInstallNotification(std::int64_t count,
-                                                    bool restartRequired) const {
-  TILL_LOG(2,
-           "%@: Admin install notification for %@ updates (restart required %d) not posted: no "
-           "notifications in this build",
-           kSpeaker, count, restartRequired);
-}
-
-void UpdateController::removeUpdatesAvailableNotifications() const {
-  TILL_LOG(3, "%@: No updates available notifications to remove in this build", kSpeaker);
-}
-
-void UpdateController::postNotificationForAutoUpdateOptIn() const {
-  TILL_LOG(2,
-           "%@: Automatic updates opt-in notification not posted: no notifications in this build",
-           kSpeaker);
-}
-
-void UpdateController::postNotificationForAutoUpdateOfRestartRequiredUpdatesOptIn() const {
-  TILL_LOG(2,
-           "%@: Restart-required automatic updates opt-in notification not posted: no "
-           "notifications in this build",
-           kSpeaker);
-}
 
 void UpdateController::appendCriticalUpdatesToJournal(
     const std::vector<PlistDictionary>& entries) const {

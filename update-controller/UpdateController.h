@@ -21,6 +21,7 @@
 #include "store-runtime/services/VendServiceProxy.h"
 #include "store-runtime/sysup/SysupQuaymartUpdateController.h"
 #include "update-controller/ObserverArray.h"
+#include "update-controller/UpdateControllerNotificationContext.h"
 #include "update-controller/VendAvailableUpdatesObserver.h"
 #include "update-controller/VendOSUpdateProgressObserver.h"
 #include "update-controller/VendOSUpdateScanObserver.h"
@@ -31,7 +32,9 @@
 namespace larder {
 
 class SoftwareMap;
+class UpdateNotificationCatalogue;
 class UpdateOperation;
+class UserNotificationCenter;
 
 // The policy centre for the updates of one store client: when the update
 // machinery runs and with which tasks, what the badge counts, who hears of
@@ -68,10 +71,13 @@ class UpdateController final : public UpdateQueueDelegate,
   // A controller outside the registry, over `softwareMap`, which must
   // outlive it: the registry makes its own with the shared map; tests make
   // theirs with a map of their own.
-  static std::shared_ptr<UpdateController> make(VendStoreClient storeClient,
-                                                SoftwareMap& softwareMap);
+  // A null center means the service's own.
+  static std::shared_ptr<UpdateController> make(
+      VendStoreClient storeClient, SoftwareMap& softwareMap,
+      std::shared_ptr<UserNotificationCenter> notificationCenter = nullptr);
   // Use make; public for make_shared only.
-  explicit UpdateController(VendStoreClient storeClient);
+  explicit UpdateController(VendStoreClient storeClient,
+                            std::shared_ptr<UserNotificationCenter> notificationCenter = nullptr);
   ~UpdateController() override;
   UpdateController(const UpdateController&) = delete;
   UpdateController& operator=(const UpdateController&) = delete;
@@ -157,7 +163,6 @@ class UpdateController final : public UpdateQueueDelegate,
   [[nodiscard]] bool isTimeToPostUpdatesAvailableNotification() const;
   [[nodiscard]] bool isTimeToStageAppUpdates() const;
   [[nodiscard]] bool isTimeToAutoUpdate() const;
-  void resetUpdatesAvailableNotificationTimestamp();
   void promptUserToOptInForAutoUpdateWithShowNotification(bool showNotification) override;
   void promptUserToOptInForAutoUpdateOfRestartRequiredUpdatesWithShowNotification(
       bool showNotification) override;
@@ -173,6 +178,8 @@ class UpdateController final : public UpdateQueueDelegate,
   [[nodiscard]] bool appUpdatesToInstallLaterIncludesBundleID(
       std::string_view bundleIdentifier) const override;
   [[nodiscard]] bool updateFailureNotificationIsDisplayed() const override;
+  [[nodiscard]] UpdateNotificationCatalogue& notificationCatalogue() const override;
+  [[nodiscard]] bool shouldOfferDoItLaterForAvailableUpdates() const;
   bool confirmRestartWithUpdatesWillDownload(bool willDownload) override;
   void appendInstalledUpdatesToJournal(const std::vector<LedgerUpdateRef>& appUpdates,
                                        const OSUpdateList& osUpdates) override;
@@ -180,12 +187,14 @@ class UpdateController final : public UpdateQueueDelegate,
     return osUpdateCancelTokens_;
   }
 
-  // Whether the user may be offered to install these later: never on a
-  // machine that destroys its disk seal key on standby; always for app
-  // updates; for OS updates when one is recommended and needs no restart, or
-  // allows it.
-  [[nodiscard]] static bool shouldOfferDoItLaterForAppUpdates(
-      const std::vector<LedgerUpdateRef>& apps, const OSUpdateList& osUpdates);
+  // --- Audits that notifications carry the key of ---
+
+  // Stores the audit as an XML property list in a file of its own; the
+  // key, or nothing when it could not be written.
+  std::optional<std::string> cacheUpdateAuditInfo(const PlistDictionary& auditInfo) const;
+  [[nodiscard]] std::optional<PlistDictionary> cachedUpdateAuditInfoWithKey(
+      std::string_view key) const;
+  [[nodiscard]] static std::string auditInfoCachePath(std::string_view key);
 
  private:
   void initWithStoreClient(SoftwareMap& softwareMap);
@@ -202,13 +211,8 @@ class UpdateController final : public UpdateQueueDelegate,
   void applyPostLogoutResults(const PlistDictionary& info, UpdateOperation& operation) const;
   void configureTimedTasks(const PlistDictionary& info, UpdateOperation& operation) const;
 
-  // The notifications and the journal are not part of this build: what
-  // they would be given is logged, so that the decision can be seen.
-  void postSilentInstallNotification(std::int64_t count, const PlistDictionary& info) const;
-  void postAdminInstallNotification(std::int64_t count, bool restartRequired) const;
-  void removeUpdatesAvailableNotifications() const;
-  void postNotificationForAutoUpdateOptIn() const;
-  void postNotificationForAutoUpdateOfRestartRequiredUpdatesOptIn() const;
+  // The journal is not part of this build: what it would be given is
+  // logged, so that the decision can be seen.
   void appendCriticalUpdatesToJournal(const std::vector<PlistDictionary>& entries) const;
   void confirmPendingUpdatesInJournal(const std::vector<std::string>& productKeys) const;
 
@@ -220,6 +224,8 @@ class UpdateController final : public UpdateQueueDelegate,
   std::atomic<double> lastLogoutRequestedDate_{0};
   std::shared_ptr<OSUpdateCancelTokens> osUpdateCancelTokens_ =
       std::make_shared<OSUpdateCancelTokens>();
+  UpdateControllerNotificationContext notificationContext_{*this};
+  std::unique_ptr<UpdateNotificationCatalogue> notificationCatalogue_;
 
   mutable Mutex osUpdateScanLock_;
   std::atomic<bool> osUpdateScanInProgress_{false};

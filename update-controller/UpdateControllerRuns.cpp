@@ -78,12 +78,6 @@ bool UpdateController::appUpdatesToInstallLaterIncludesBundleID(
   return std::ranges::find(later, bundleIdentifier) != later.end();
 }
 
-bool UpdateController::updateFailureNotificationIsDisplayed() const {
-  // Failure notifications are posted by the notification catalogue, which
-  // this build does not have: none can be on screen.
-  return false;
-}
-
 bool UpdateController::confirmRestartWithUpdatesWillDownload(bool willDownload) {
   // The restart confirmation belongs to the restart path, which this build
   // does not have; without it the restart counts as declined, so that the

@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <cmath>
 
+#include "notifications/catalogue/UpdateNotificationCatalogue.h"
 #include "platform/log/TillLogManager.h"
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/PreferenceKeys.h"
@@ -78,11 +79,6 @@ bool UpdateController::isTimeToAutoUpdate() const {
                                                   autoInstallUpdatesMinimumInterval());
 }
 
-void UpdateController::resetUpdatesAvailableNotificationTimestamp() {
-  (void)PreferenceStore::setValue(kDefaultsDidPostUpdatesAvailableNotificationDateKey,
-                                  UpdatePolicy::plistDateOf(Clock::now()), kDaemonDefaultsID);
-}
-
 // --- Switches ---
 
 void UpdateController::promptUserToOptInForAutoUpdateWithShowNotification(bool showNotification) {
@@ -91,7 +87,7 @@ void UpdateController::promptUserToOptInForAutoUpdateWithShowNotification(bool s
   // Before any answer: a prompt that is never answered counts as refused.
   setAutoUpdateEnabled(false);
   if (showNotification) {
-    postNotificationForAutoUpdateOptIn();
+    notificationCatalogue_->postNotificationForAutoUpdateOptIn();
     return;
   }
   auto text = [this](std::string_view key) { return LedgerLocalizedString(key, &storeClient_); };
@@ -113,7 +109,7 @@ void UpdateController::promptUserToOptInForAutoUpdateOfRestartRequiredUpdatesWit
   MutexLock lock(restartRequiredPromptLock());
   if (!shouldPromptForAutoUpdateOfRestartRequiredUpdatesOptIn()) return;
   setAutoUpdateOfRestartRequiredUpdatesEnabled(false);
-  postNotificationForAutoUpdateOfRestartRequiredUpdatesOptIn();
+  notificationCatalogue_->postNotificationForAutoUpdateOfRestartRequiredUpdatesOptIn();
 }
 
 UpdateController::OSUpdateList
@@ -129,17 +125,6 @@ UpdateController::availableOSUpdatesEligibleForAutoInstallOfRestartRequiredUpdat
     }
   }
   return eligible;
-}
-
-bool UpdateController::shouldOfferDoItLaterForAppUpdates(const std::vector<LedgerUpdateRef>& apps,
-                                                         const OSUpdateList& osUpdates) {
-  if (diskSealKeyIsDestroyedOnStandby()) return false;
-  if (!apps.empty()) return true;
-  SysupQuaymartUpdateController& sysup = SysupQuaymartUpdateController::sharedUpdateController();
-  return std::ranges::any_of(osUpdates, [&](const SysupQuaymartUpdate& update) {
-    return (update.isRecommended() && sysup.actionRequiredForUpdates({update}) == 0) ||
-           update.allowedToUseInstallLater();
-  });
 }
 
 }  // namespace larder

@@ -17,6 +17,7 @@
 namespace larder {
 
 class SoftwareMap;
+class UpdateNotificationCatalogue;
 class UpdateQueue;
 class VendServiceProxy;
 
@@ -57,6 +58,8 @@ class UpdateOperationController : public UpdatePolicy {
   [[nodiscard]] virtual bool appUpdatesToInstallLaterIncludesBundleID(
       std::string_view bundleIdentifier) const = 0;
   [[nodiscard]] virtual bool updateFailureNotificationIsDisplayed() const = 0;
+  // What the controller posts to the user, and takes away.
+  [[nodiscard]] virtual UpdateNotificationCatalogue& notificationCatalogue() const = 0;
   // Blocks on the dialog; true when the user agreed.
   virtual bool confirmRestartWithUpdatesWillDownload(bool willDownload) = 0;
   virtual void promptUserToOptInForAutoUpdateWithShowNotification(bool showNotification) = 0;

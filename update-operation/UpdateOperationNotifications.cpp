@@ -1,9 +1,8 @@
 // The closing step of a background run: which notification the situation
-// calls for. The notification catalogue is not part of this build, so each
-// decision is logged with the notification it stands for, in the words the
-// catalogue will use.
+// calls for, posted through the controller's catalogue.
 #include <algorithm>
 
+#include "notifications/catalogue/UpdateNotificationCatalogue.h"
 #include "platform/log/TillLogManager.h"
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/PreferenceKeys.h"
@@ -19,11 +18,6 @@ namespace larder {
 namespace {
 
 constexpr std::string_view kSpeaker = "UpdateOperation";
-
-void wouldPost(std::string_view notification, const std::string& details) {
-  TILL_LOG(2, "%@: Notification %@ (%@) not shown: no notifications in this build", kSpeaker,
-           notification, details);
-}
 
 bool contains(const PlistArray& identifiers, const std::string& identifier) {
   return std::ranges::any_of(identifiers, [&](const PlistValue& value) {
@@ -67,22 +61,20 @@ void UpdateOperation::validateAndPostAvailableUpdatesNotification() {
   }
   std::shared_ptr<UpdateOperationController> controller = updateController();
   if (!controller) return;
+  UpdateNotificationCatalogue& notifications = controller->notificationCatalogue();
   if (s.shouldUpdateNotificationsOnly) {
-    wouldPost("removeUpdatesAvailableNotificationFromOlderOSVersions", "");
+    notifications.removeUpdatesAvailableNotificationFromOlderOSVersions();
   }
   if (s.criticalOSUpdateCount > 0) {
     if (!s.shouldPostAvailableUpdatesNotification) return;
     if (s.criticalOSUpdatesShouldBeInstalledImmediately) {
-      wouldPost("criticalUpdateInstallNow", "count " + std::to_string(s.criticalOSUpdateCount) +
-                                                ", restart required " +
-                                                std::to_string(s.criticalOSUpdatesRequireRestart));
+      notifications.postCriticalUpdateInstallNowNotification(s.criticalOSUpdateCount,
+                                                             s.criticalOSUpdatesRequireRestart);
     } else {
-      wouldPost("criticalUpdate",
-                "count " + std::to_string(s.criticalOSUpdateCount) + ", title " +
-                    s.criticalOSUpdateNotificationTitle.value_or("") + ", text " +
-                    s.criticalOSUpdateNotificationText.value_or("") + ", delayed auto install " +
-                    std::to_string(s.criticalOSUpdatesHaveDelayedAutoInstall) +
-                    ", restart required " + std::to_string(s.criticalOSUpdatesRequireRestart));
+      notifications.postCriticalUpdateNotification(
+          s.criticalOSUpdateCount, s.criticalOSUpdateNotificationTitle,
+          s.criticalOSUpdateNotificationText, s.criticalOSUpdatesHaveDelayedAutoInstall,
+          s.criticalOSUpdatesRequireRestart);
     }
     return;
   }
@@ -90,7 +82,7 @@ void UpdateOperation::validateAndPostAvailableUpdatesNotification() {
            "%@: softwareUpdateDidFinishBackgroundScanWithMessage: removing all critical update "
            "notification (except post-install) due to critical update count being 0",
            kSpeaker);
-  wouldPost("removeCriticalUpdateNotificationsIncludingPostInstall", "NO");
+  notifications.removeCriticalUpdateNotificationsIncludingPostInstall(false);
 
   bool posted = false;
   const std::uint64_t badgeCount = controller->availableUpdatesBadgeCount();
@@ -112,17 +104,15 @@ void UpdateOperation::validateAndPostAvailableUpdatesNotification() {
   } else if (badgeCount == 0) {
     TILL_LOG(2, "%@: Removing all updates available notifications because the badge count is 0",
              kSpeaker);
-    wouldPost("removeUpdatesAvailableNotifications", "");
+    notifications.removeUpdatesAvailableNotifications();
   }
 
   if (s.shouldUpdateNotificationsOnly && !s.postLogoutFailedUpdates.empty()) {
-    wouldPost("updatesFailedToInstallPostLogout",
-              std::to_string(s.postLogoutFailedUpdates.size()) + " updates");
+    notifications.postUpdatesFailedToInstallPostLogoutNotification(s.postLogoutFailedUpdates);
     return;
   }
   if (s.shouldUpdateNotificationsOnly && !s.postLogoutInstalledLaterUpdates.empty()) {
-    wouldPost("doItLaterSuccess",
-              std::to_string(s.postLogoutInstalledLaterUpdates.size()) + " updates");
+    notifications.postDoItLaterSuccessNotificationWithUpdates(s.postLogoutInstalledLaterUpdates);
     return;
   }
   if (s.shouldUpdateNotificationsOnly && !s.postLogoutInstalledUpdates.empty() &&
@@ -134,7 +124,7 @@ void UpdateOperation::validateAndPostAvailableUpdatesNotification() {
   if (!posted && !autoInstalled.empty()) {
     TILL_LOG(2, "%@: Posting auto installed app updates notification for %@", kSpeaker,
              describeList(autoInstalled));
-    wouldPost("autoInstalledUpdates", describeList(autoInstalled));
+    notifications.postNotificationForAutoInstalledUpdates(autoInstalled);
   }
 }
 
@@ -169,8 +159,8 @@ bool UpdateOperation::postAvailableUpdatesNotification(UpdateOperationController
   if (!appUpdates.empty() || !osUpdates.empty()) {
     TILL_LOG(2, "%@: Notifying the user of %@ updates - %@ / %@", kSpeaker, newOnly ? "NEW" : "ALL",
              describeList(appUpdates), describeList(osUpdates));
-    wouldPost("updatesAvailable", describeList(appUpdates) + " / " + describeList(osUpdates) +
-                                      ", restart required " + std::to_string(restartRequired));
+    controller.notificationCatalogue().postUpdatesAvailableNotification(
+        appUpdates, osUpdates, restartRequired, auditInfo());
     return true;
   }
   if (newOnly) {

@@ -3,6 +3,7 @@
 // question is asked.
 #include "update-operation/UpdatePolicy.h"
 
+#include <algorithm>
 #include <cmath>
 #include <cstdlib>
 
@@ -15,6 +16,7 @@
 #include "store-runtime/host/LedgerSystemSettings.h"
 #include "store-runtime/host/PreferenceStore.h"
 #include "store-runtime/host/VendDevice.h"
+#include "store-runtime/sysup/SysupQuaymartUpdateController.h"
 
 namespace larder {
 
@@ -167,6 +169,24 @@ bool UpdatePolicy::diskSealKeyIsDestroyedOnStandby() {
   const PlistDictionary settings = LedgerSystemSettings::systemPowerSettings();
   auto found = settings.find("DestroyDiskSealKeyOnStandby");
   return found != settings.end() && found->second.isBoolean() && found->second.boolValue();
+}
+
+void UpdatePolicy::resetUpdatesAvailableNotificationTimestamp() {
+  (void)PreferenceStore::setValue(kDefaultsDidPostUpdatesAvailableNotificationDateKey,
+                                  plistDateOf(Clock::now()), kDaemonDefaultsID);
+}
+
+bool UpdatePolicy::shouldOfferDoItLaterForAppUpdates(
+    const std::vector<LedgerUpdateRef>& appUpdates,
+    const std::vector<SysupQuaymartUpdate>& osUpdates) {
+  if (diskSealKeyIsDestroyedOnStandby()) return false;
+  if (!appUpdates.empty()) return true;
+  const SysupQuaymartUpdateController& sysup =
+      SysupQuaymartUpdateController::sharedUpdateController();
+  return std::ranges::any_of(osUpdates, [&](const SysupQuaymartUpdate& update) {
+    return (update.isRecommended() && sysup.actionRequiredForUpdates({update}) == 0) ||
+           update.allowedToUseInstallLater();
+  });
 }
 
 }  // namespace larder

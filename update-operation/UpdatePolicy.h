@@ -2,8 +2,11 @@
 
 #include <chrono>
 #include <string_view>
+#include <vector>
 
 #include "platform/value/PlistValue.h"
+#include "store-runtime/records/LedgerUpdate.h"
+#include "store-runtime/records/SysupQuaymartUpdate.h"
 
 namespace larder {
 
@@ -43,6 +46,16 @@ class UpdatePolicy {
   [[nodiscard]] static bool shouldPromptForAutoUpdateOfRestartRequiredUpdatesOptIn();
   [[nodiscard]] static bool lastDoItLaterLogoutFailed();
   static void setLastDoItLaterLogoutFailed(bool failed);
+  // The updates available notification went out now; the next one is due
+  // an interval later.
+  static void resetUpdatesAvailableNotificationTimestamp();
+  // Whether the user can put these updates off to later: any app update
+  // can, an OS update when it is recommended and needs no restart, or when
+  // it allows it. Never on a machine that destroys its disk seal key on
+  // standby.
+  [[nodiscard]] static bool shouldOfferDoItLaterForAppUpdates(
+      const std::vector<LedgerUpdateRef>& appUpdates,
+      const std::vector<SysupQuaymartUpdate>& osUpdates);
 
   // --- Questions about the machine ---
   static bool runningOnACPower();

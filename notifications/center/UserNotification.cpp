@@ -39,8 +39,9 @@ void readInteger(const PlistDictionary& dictionary, std::string_view key, std::i
 }  // namespace
 
 std::string UserNotification::source() const {
-  const PlistValue& value = PlistValue(userInfo)["Source"];
-  return value.isString() ? *value.string() : std::string();
+  auto found = userInfo.find("Source");
+  return found != userInfo.end() && found->second.string() ? *found->second.string()
+                                                           : std::string();
 }
 
 PlistDictionary UserNotification::toDictionary() const {

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <initializer_list>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -22,5 +23,16 @@ std::string LedgerLocalizedStringFromTableInBundle(std::string_view key,
 
 // The usual call: no table, no default, the store client framework.
 std::string LedgerLocalizedString(std::string_view key, const VendStoreClient* storeClient);
+
+// A localised format with its arguments put in: each "%@" takes the next
+// argument, "%%" is a percent sign. Missing arguments leave nothing; extra
+// ones are ignored, so a translation that drops a placeholder still reads.
+std::string LedgerLocalizedFormat(std::string_view format,
+                                  std::initializer_list<std::string_view> arguments);
+
+// The text of `key` with its arguments put in.
+std::string LedgerLocalizedStringWithArguments(std::string_view key,
+                                               const VendStoreClient* storeClient,
+                                               std::initializer_list<std::string_view> arguments);
 
 }  // namespace larder

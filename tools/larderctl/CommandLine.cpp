@@ -194,6 +194,25 @@ void CommandLine::addUpdateCommands() {
   app_.add_subcommand("runs",
                       "show what the update machinery is doing and what its last background run "
                       "decided for each update (exit status 3: no run recorded yet)");
+  auto* notifications = app_.add_subcommand(
+      "notifications",
+      "list the notifications the service delivered (exit status 3: none), or act on one as the "
+      "desktop's notification server would");
+  auto* activate = notifications->add_option("--activate", activateNotification,
+                                             "the identifier of the notification to act on");
+  notifications
+      ->add_option("--action", notificationAction,
+                   "what the user did: default (clicked the contents, when not given), action "
+                   "(the main button), other (the second button), or N (entry N of the main "
+                   "button's menu)")
+      ->needs(activate)
+      ->check([](const std::string& word) {
+        const bool number =
+            !word.empty() && word.find_first_not_of("0123456789") == std::string::npos;
+        return number || word == "default" || word == "action" || word == "other"
+                   ? std::string()
+                   : "must be default, action, other or a menu entry number";
+      });
 }
 
 void CommandLine::addOtherCommands() {

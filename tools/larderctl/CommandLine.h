@@ -66,6 +66,9 @@ class CommandLine {
   std::string dmapFile;
   // background-scan
   std::optional<std::string> backgroundScanInfo;
+  // notifications
+  std::optional<std::string> activateNotification;
+  std::optional<std::string> notificationAction;
   // prefs get|set|delete
   PreferencesOptions preferences;
   // The subcommand of a command that has them ("get" of "prefs get").

@@ -21,8 +21,8 @@ std::string StoreCommands::describeDownload(const PlistValue& download) {
   return line;
 }
 
-int StoreCommands::reportFailure(std::string_view what, const PlistValue& error) const {
-  if (json_) {
+int StoreCommands::reportFailure(std::string_view what, const PlistValue& error, bool json) {
+  if (json) {
     std::cout << JsonConversion::toJson(error).dump() << std::endl;
   } else {
     const std::string* description = error["description"].string();

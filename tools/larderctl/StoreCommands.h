@@ -20,6 +20,9 @@ class StoreCommands {
 
   // "<item>  <bundle identifier>  <version>  <title>" of a download record.
   static std::string describeDownload(const PlistValue& download);
+  // Prints the service's error for `what` (as JSON with `json`) and gives
+  // the failure exit status.
+  static int reportFailure(std::string_view what, const PlistValue& error, bool json);
 
   // Without a password, reads it from the first line of standard input.
   int signIn(const std::string& accountName, std::optional<std::string> password);
@@ -32,7 +35,9 @@ class StoreCommands {
   int downloads(std::int64_t typeMask);
 
  private:
-  int reportFailure(std::string_view what, const PlistValue& error) const;
+  int reportFailure(std::string_view what, const PlistValue& error) const {
+    return reportFailure(what, error, json_);
+  }
 
   ServiceClient& client_;
   bool json_;

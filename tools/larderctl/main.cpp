@@ -14,6 +14,7 @@
 #include "tools/larderctl/DialogCommand.h"
 #include "tools/larderctl/DmapDumpCommand.h"
 #include "tools/larderctl/ExitStatus.h"
+#include "tools/larderctl/NotificationsCommand.h"
 #include "tools/larderctl/OSUpdatesCommand.h"
 #include "tools/larderctl/PreferencesCommand.h"
 #include "tools/larderctl/ProductPrinter.h"
@@ -148,6 +149,14 @@ int runChosen(const CommandLine& line) {
   }
   if (line.chose("badge")) return runBadge(line);
   if (line.chose("background-scan")) return runBackgroundScan(line);
+  if (line.chose("notifications")) {
+    ServiceClient client = connect(line.global);
+    NotificationsCommand command(client, line.global.json);
+    if (line.activateNotification) {
+      return command.activate(*line.activateNotification, line.notificationAction);
+    }
+    return command.list();
+  }
   if (line.chose("runs")) {
     ServiceClient client = connect(line.global);
     return RunsCommand(client, line.global.json).run();
