@@ -115,6 +115,7 @@ TEST_F(UserNotificationCenterTest, ListSurvivesTheCenterAndARemovalClosesTheStor
   auto newServer = std::make_shared<FakeNotificationServer>();
   again->setServer(newServer);
   EXPECT_EQ(again->deliveredNotifications(), before);
+  EXPECT_EQ(again->deliveredNotifications()[0].source(), "update-controller");
   EXPECT_EQ(again->deliveredNotifications()[0].activationType, UserNotification::kContentsClicked);
   EXPECT_EQ(again->deliveredNotifications()[1].style, UserNotification::kPostInstallStyle);
   EXPECT_EQ(again->deliveredNotifications()[1].serverIdentifier, 2u);
