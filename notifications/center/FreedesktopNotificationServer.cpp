@@ -1,5 +1,8 @@
 #include "notifications/center/FreedesktopNotificationServer.h"
 
+#include <systemd/sd-bus.h>
+
+#include <cstring>
 #include <map>
 
 #include <sdbus-c++/sdbus-c++.h>
@@ -29,6 +32,22 @@ VendError serverError(const sdbus::Error& error) {
                                meansNoServer(error) ? NotificationServer::kNoServerCode
                                                     : NotificationServer::kCallFailedCode,
                                error.getName() + ": " + error.getMessage());
+}
+
+// sdbus-c++ 1.2 does not free its bus object when a connection to a given
+// address fails, and a center retries at each call while there is no bus:
+// a bus of our own, freed either way, asks first whether anyone answers.
+Result<void> probeAddress(const std::string& address) {
+  sd_bus* bus = nullptr;
+  int result = sd_bus_new(&bus);
+  if (result >= 0) result = sd_bus_set_address(bus, address.c_str());
+  if (result >= 0) result = sd_bus_set_bus_client(bus, 1);
+  if (result >= 0) result = sd_bus_start(bus);
+  sd_bus_flush_close_unref(bus);
+  if (result >= 0) return {};
+  return VendError::withDomain(std::string(NotificationServer::kErrorDomain),
+                               NotificationServer::kNoServerCode,
+                               "No session bus at " + address + ": " + std::strerror(-result));
 }
 
 std::map<std::string, sdbus::Variant> hintsOf(const NotificationRequest& request) {
@@ -74,6 +93,9 @@ void FreedesktopNotificationServer::setHandlers(Handlers handlers) {
 
 Result<void> FreedesktopNotificationServer::connectLocked() {
   if (proxy_) return {};
+  if (!busAddress_.empty()) {
+    if (Result<void> answers = probeAddress(busAddress_); !answers) return answers;
+  }
   try {
     std::unique_ptr<sdbus::IConnection> connection =
         busAddress_.empty() ? sdbus::createSessionBusConnection()

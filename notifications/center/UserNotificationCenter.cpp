@@ -77,7 +77,7 @@ std::shared_ptr<UserNotificationCenter> UserNotificationCenter::centerForIdentif
   if (!center) {
     const std::string listPath = listPathFor(identifier);
     DeliveredNotificationList(listPath).removeLeftovers();
-    center = makeForTesting(identifier, type, listPath);
+    center = make(identifier, type, listPath);
     if (type == kSystemCenter) center->setServer(std::make_shared<FreedesktopNotificationServer>());
   }
   return center;
@@ -85,6 +85,12 @@ std::shared_ptr<UserNotificationCenter> UserNotificationCenter::centerForIdentif
 
 std::shared_ptr<UserNotificationCenter> UserNotificationCenter::makeForTesting(
     const std::string& identifier, Type type, std::string listPath) {
+  return make(identifier, type, std::move(listPath));
+}
+
+std::shared_ptr<UserNotificationCenter> UserNotificationCenter::make(const std::string& identifier,
+                                                                     Type type,
+                                                                     std::string listPath) {
   // The constructor is private; make_shared cannot reach it.
   return std::shared_ptr<UserNotificationCenter>(
       new UserNotificationCenter(identifier, type, std::move(listPath)));

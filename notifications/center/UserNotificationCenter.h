@@ -108,6 +108,8 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
   using Record = std::shared_ptr<const UserNotification>;
 
   UserNotificationCenter(std::string identifier, Type type, std::string listPath);
+  static std::shared_ptr<UserNotificationCenter> make(const std::string& identifier, Type type,
+                                                      std::string listPath);
 
   static std::optional<Action> parseAction(const std::string& actionKey);
   // Takes the notification out of the list if it is there; a copy of it.

@@ -89,8 +89,18 @@ TEST_F(UserNotificationCenterTest, ListSurvivesTheCenterAndARemovalClosesTheStor
   std::vector<UserNotification> before;
   {
     auto center = makeCenter();
-    deliverShown(*center, makeNotification("One"));
-    deliverShown(*center, makeNotification("Two", UserNotification::kAlert, {"Tonight"}));
+    const UserNotification one = deliverShown(*center, makeNotification("One"));
+    // Every field away from its default, so that each must survive.
+    UserNotification two = makeNotification("Two", UserNotification::kAlert, {"Tonight"});
+    two.hasActionButton = false;
+    two.imageURL = "file:///usr/share/icons/larder.png";
+    two.poofsOnCancel = false;
+    two.alwaysShowAlternateActionMenu = true;
+    two.style = UserNotification::kPostInstallStyle;
+    two.clearable = true;
+    deliverShown(*center, two);
+    // A click on the contents is kept on the record.
+    ASSERT_TRUE(center->activate(one.identifier, "default"));
     // A record that was never shown, with nothing of the server's.
     UserNotification hidden = makeNotification("Hidden");
     hidden.userInfo["hidden"] = true;
@@ -105,7 +115,9 @@ TEST_F(UserNotificationCenterTest, ListSurvivesTheCenterAndARemovalClosesTheStor
   auto newServer = std::make_shared<FakeNotificationServer>();
   again->setServer(newServer);
   EXPECT_EQ(again->deliveredNotifications(), before);
-  EXPECT_EQ(again->deliveredNotifications()[1].userInfo, before[1].userInfo);
+  EXPECT_EQ(again->deliveredNotifications()[0].source(), "update-controller");
+  EXPECT_EQ(again->deliveredNotifications()[0].activationType, UserNotification::kContentsClicked);
+  EXPECT_EQ(again->deliveredNotifications()[1].style, UserNotification::kPostInstallStyle);
   EXPECT_EQ(again->deliveredNotifications()[1].serverIdentifier, 2u);
 
   again->removeDeliveredNotification(before[1]);
@@ -193,6 +205,18 @@ TEST_F(UserNotificationCenterTest, UnknownNotificationsAndKeysAreErrorsThatChang
   const std::vector<RecordingDelegate::Call> calls = delegate_->waitForCalls(1);
   ASSERT_EQ(calls.size(), 1u);
   EXPECT_EQ(calls[0].notification.activationType, UserNotification::kContentsClicked);
+}
+
+TEST_F(UserNotificationCenterTest, WithoutADelegateAnActivationIsOnlyLogged) {
+  LogLines log;
+  auto center = UserNotificationCenter::makeForTesting(
+      "com.example.tests", UserNotificationCenter::kApplicationCenter, listPath());
+  const UserNotification alert =
+      center->deliverNotification(makeNotification("Alert", UserNotification::kAlert));
+  ASSERT_TRUE(center->activate(alert.identifier, "other"));
+  EXPECT_TRUE(log.has(2, "UserNotificationCenter: Notification " + alert.identifier +
+                             " activated with \"other\"; no delegate to tell"));
+  EXPECT_EQ(center->deliveredNotifications(), std::vector<UserNotification>{alert});
 }
 
 TEST_F(UserNotificationCenterTest, ServerSignalsActivateAndCloseTheirNotifications) {
