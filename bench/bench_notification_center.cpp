@@ -15,6 +15,7 @@
 #include <chrono>
 #include <filesystem>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -140,6 +141,34 @@ void BM_ThousandPostsAndRemovals(benchmark::State& state) {
   state.counters["file_bytes_at_1000"] = static_cast<double>(largestFile);
 }
 BENCHMARK(BM_ThousandPostsAndRemovals)->Iterations(5)->Unit(benchmark::kMillisecond)->UseRealTime();
+
+// 1,000 posts in a row, each taking away the one before it, as the
+// catalogue replaces a kind: the file stays at one notification, and one
+// write of it (encoding, write, fsync, rename) is what each change costs.
+void BM_PostsReplacingEachOther(benchmark::State& state) {
+  testing::TemporaryFolder folder("larder-bench-notifications");
+  const std::string path = folder / "list.plist";
+  auto center = UserNotificationCenter::makeForTesting("com.example.bench",
+                                                       UserNotificationCenter::kSystemCenter, path);
+  center->setServer(std::make_shared<testing::FakeNotificationServer>());
+  std::optional<UserNotification> previous;
+  for (int index = 0; index < 1000; ++index) {
+    UserNotification delivered = center->deliverNotification(typicalNotification(index));
+    if (previous) center->removeDeliveredNotification(*previous);
+    previous = delivered;
+  }
+  const std::vector<UserNotification> kept = center->deliveredNotifications();
+  if (!waitFor([&] { return DeliveredNotificationList(path).read().size() == kept.size(); })) {
+    state.SkipWithError("the list file never caught up");
+  }
+  DeliveredNotificationList list(folder / "steady.plist");
+  for (auto _ : state) {
+    if (!list.write(kept)) state.SkipWithError("cannot write the list");
+  }
+  state.counters["notifications_kept"] = static_cast<double>(kept.size());
+  state.counters["file_bytes"] = static_cast<double>(std::filesystem::file_size(path));
+}
+BENCHMARK(BM_PostsReplacingEachOther)->Unit(benchmark::kMillisecond)->UseRealTime();
 
 // One write of the list file (encoding, write, fsync, rename), its
 // encoding alone, and one read of it (at the start of the service), for

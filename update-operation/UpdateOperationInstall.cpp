@@ -9,12 +9,14 @@
 #include "platform/log/TillLogManager.h"
 #include "platform/system/ApplicationRegistry.h"
 #include "running-apps/AuthorizationController.h"
+#include "running-apps/VendCancelUpdateWithPlugInsDialogOperation.h"
 #include "software-map/SoftwareMap.h"
 #include "store-runtime/dialogs/LedgerLocalizedString.h"
 #include "store-runtime/host/LedgerRootHelper.h"
 #include "store-runtime/host/LedgerSystemState.h"
 #include "store-runtime/records/VendPurchaseRecord.h"
 #include "store-runtime/services/VendDownloadService.h"
+#include "store-runtime/services/VendOperationQueue.h"
 #include "store-runtime/services/VendOrvaneIDLookupOperation.h"
 #include "store-runtime/services/VendServiceProxy.h"
 #include "store-runtime/services/VendTransactionService.h"
@@ -117,12 +119,16 @@ void UpdateOperation::performUserInteractionRequiredForAppUpdates(
     std::optional<PlugInHostApps> hosts;
     if (AppHelper::isAppRunningWithBundleID(identifier, nullptr, &hosts) && hosts &&
         !hosts->empty()) {
-      // The dialog that explains which application holds the plug-in is
-      // shown by the notification layer of a later build; the request
-      // stops here either way.
       TILL_LOG(1, "%@: Cancelling the update: plug-ins of %@ are in use by %@", kSpeaker,
                identifier, PlistValue(PlistDictionary(hosts->begin(), hosts->end())));
       cancelEverything();
+      // The user learns which applications hold the plug-ins; nobody waits
+      // for the answer, which changes nothing.
+      if (std::shared_ptr<VendDialogOperation> dialog =
+              VendCancelUpdateWithPlugInsDialogOperation::operationWithDictionary(*hosts,
+                                                                                 storeClient())) {
+        VendOperationQueue::mainQueue().addOperation(dialog);
+      }
       return;
     }
   }

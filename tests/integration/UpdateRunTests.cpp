@@ -19,6 +19,8 @@
 #include "software-map/VendSoftwareMapObserver.h"
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/PreferenceKeys.h"
+#include "store-runtime/dialogs/LedgerLocalizedString.h"
+#include "store-runtime/dialogs/VendDialogPresenter.h"
 #include "store-runtime/download/VendFileManager.h"
 #include "store-runtime/host/PlatformStateFile.h"
 #include "store-runtime/host/PreferenceStore.h"
@@ -29,6 +31,7 @@
 #include "update-controller/UpdateController.h"
 #include "update-controller/VendOSUpdateProgressObserver.h"
 #include "update-operation/UpdateOperation.h"
+#include "update-operation/VendUpdateDelegate.h"
 #include "update-queue/UpdateQueue.h"
 
 namespace larder::testing {
@@ -410,6 +413,88 @@ TEST_F(UpdateRunTest, TheLockOfAllRunsIsNotHeldWhileARunDownloads) {
   first.join();
   EXPECT_EQ(TemporaryPlatform::bundleVersion(platform_.root() + "/Applications/Notes.app"), "1.0");
   other->updateQueue()->finishPendingWrites();
+}
+
+// Keeps every dialog the runtime shows and answers each with OK.
+class DialogRecorder final : public VendDialogPresenter {
+ public:
+  void present(const VendDialog& dialog, Reply reply) override {
+    {
+      std::lock_guard lock(mutex_);
+      shown_.push_back(dialog.toDictionary());
+    }
+    reply(VendDialogAnswer{VendDialogButton::kOK, {}});
+  }
+  void dismiss(std::string_view, std::int64_t) override {}
+  std::vector<PlistDictionary> shown() {
+    std::lock_guard lock(mutex_);
+    return shown_;
+  }
+
+ private:
+  std::mutex mutex_;
+  std::vector<PlistDictionary> shown_;
+};
+
+class RecordingUpdateDelegate final : public VendUpdateDelegate {
+ public:
+  void appUpdateFinishedPurchase(const LedgerUpdateRef& update, bool success,
+                                 const OptionalError& error,
+                                 const std::optional<TillPurchaseResponse>&) override {
+    std::lock_guard lock(mutex_);
+    finished_.emplace_back(update->itemIdentifierValue(),
+                           success ? 0 : (error ? error->code : 1));
+  }
+  std::vector<std::pair<std::uint64_t, std::int64_t>> finished() {
+    std::lock_guard lock(mutex_);
+    return finished_;
+  }
+
+ private:
+  std::mutex mutex_;
+  std::vector<std::pair<std::uint64_t, std::int64_t>> finished_;
+};
+
+// A run the user started stops when a plug-in of the app is in use by
+// another application, and tells the user which one.
+TEST_F(UpdateRunTest, AUserStartedRunStopsAtABusyPlugInAndNamesItsHost) {
+  const std::string atlas = installWithUpdate("Atlas", "com.example.atlas", kAtlasID);
+  const std::string host = platform_.installBundle(
+      {.folder = applications(), .name = "Viewer", .bundleIdentifier = "com.example.viewer"});
+  startEverything();
+  auto dialogs = std::make_shared<DialogRecorder>();
+  runtime_->setDialogPresenter(dialogs);
+  DispatchSemaphore checked;
+  controller_->updateQueue()->checkForUpdatesWithCompletionHandler(
+      [&](bool, const auto&, const auto&, const auto&) { checked.signal(); });
+  checked.wait();
+  launch(atlas);
+  ASSERT_TRUE(PlugInHost::addBusyPlugIn({{"containingIdentifier", "com.example.atlas"},
+                                         {"containingPath", atlas},
+                                         {"plugInIdentifier", "com.example.atlas.ext"},
+                                         {"plugInPath", atlas + "/plugins/Ext.app"},
+                                         {"hostIdentifier", "com.example.viewer"},
+                                         {"hostPath", host},
+                                         {"service-pid", 4242}}));
+  auto delegate = std::make_shared<RecordingUpdateDelegate>();
+  auto run = std::make_shared<UpdateOperation>(
+      controller_->storeClient(), std::weak_ptr<UpdateOperationController>(controller_));
+  run->changeSettings([&](UpdateOperationSettings& s) {
+    s.userInitiated = true;
+    s.appUpdatesToInstall = std::vector<LedgerUpdateRef>{queued(kAtlasID)};
+    s.osUpdatesToInstall = std::vector<SysupQuaymartUpdate>{};
+    s.updateDelegate = delegate;
+  });
+  runToTheEnd(*run);
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(atlas), "1.0");
+  EXPECT_EQ(delegate->finished(),
+            (std::vector<std::pair<std::uint64_t, std::int64_t>>{{kAtlasID, -128}}));
+  ASSERT_TRUE(eventually([&] { return !dialogs->shown().empty(); }));
+  const PlistValue dialog(dialogs->shown().front());
+  EXPECT_EQ(*dialog["message"].string(),
+            LedgerLocalizedStringWithArguments("CANNOT_UPDATE_TITLE", nullptr, {"Atlas"}));
+  EXPECT_EQ(*dialog["explanation"].string(),
+            LedgerLocalizedStringWithArguments("CANNOT_UPDATE_BODY", nullptr, {"Atlas", "Viewer"}));
 }
 
 // The decisions over one update, each case set up as the machine would be.
