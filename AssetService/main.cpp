@@ -16,6 +16,7 @@
 #include "AssetService/ServiceListener.h"
 #include "AssetService/StoreRuntimeInterface.h"
 #include "notifications/activation/UserNotificationCenterDelegate.h"
+#include "notifications/center/UserNotificationCenter.h"
 #include "platform/dispatch/DispatchSemaphore.h"
 #include "platform/dispatch/RunLoop.h"
 #include "platform/log/TillLogManager.h"
@@ -52,13 +53,14 @@ void tellAboutIgnoredArguments(int argc, const char** argv, const char* serviceN
                LARDER_VERSION, words.c_str(), serviceName);
 }
 
-// Waits, at most `kStopWriteBound`, for what the map and the update queues
-// have queued for the disk.
+// Waits, at most `kStopWriteBound`, for what the map, the update queues and
+// the notification centers have queued for the disk.
 bool finishPendingWrites() {
   auto finished = std::make_shared<larder::DispatchSemaphore>();
   std::thread([finished] {
     larder::SoftwareMap::sharedInstance().finishPendingWrites();
     larder::UpdateController::finishPendingWritesOfAllControllers();
+    larder::UserNotificationCenter::finishPendingWritesOfAllCenters();
     finished->signal();
   }).detach();
   return finished->waitFor(kStopWriteBound);

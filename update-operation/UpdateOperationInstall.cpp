@@ -126,7 +126,7 @@ void UpdateOperation::performUserInteractionRequiredForAppUpdates(
       // for the answer, which changes nothing.
       if (std::shared_ptr<VendDialogOperation> dialog =
               VendCancelUpdateWithPlugInsDialogOperation::operationWithDictionary(*hosts,
-                                                                                 storeClient())) {
+                                                                                  storeClient())) {
         VendOperationQueue::mainQueue().addOperation(dialog);
       }
       return;

@@ -454,6 +454,24 @@ UserNotificationCenter::Record UserNotificationCenter::takeLocked(
   return taken;
 }
 
+// The write queued last is the one that carries the last change, and the
+// store queue is serial: once an empty task has run, it has too.
+void UserNotificationCenter::finishPendingWrites() {
+  storeQueue_->sync([] {});
+}
+
+void UserNotificationCenter::finishPendingWritesOfAllCenters() {
+  std::vector<std::shared_ptr<UserNotificationCenter>> centers;
+  {
+    CenterRegistry& registry = centerRegistry();
+    MutexLock lock(registry.mutex);
+    for (const auto& [key, center] : registry.centers) centers.push_back(center);
+  }
+  for (const std::shared_ptr<UserNotificationCenter>& center : centers) {
+    center->finishPendingWrites();
+  }
+}
+
 void UserNotificationCenter::listChangedLocked() {
   ++revision_;
   if (writeScheduled_) return;

@@ -90,6 +90,11 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
   // keys are errors; the delegate is told of the rest.
   Result<void> activate(const std::string& notificationIdentifier, const std::string& actionKey);
 
+  // Returns once the changes made so far are in the list file.
+  void finishPendingWrites();
+  // The same for every center of the process, at a stop of the service.
+  static void finishPendingWritesOfAllCenters();
+
   // Replaces the connection to the desktop's notification server (tests;
   // the service keeps the session bus's). Null: nothing is shown.
   void setServer(std::shared_ptr<NotificationServer> server);

@@ -442,8 +442,7 @@ class RecordingUpdateDelegate final : public VendUpdateDelegate {
                                  const OptionalError& error,
                                  const std::optional<TillPurchaseResponse>&) override {
     std::lock_guard lock(mutex_);
-    finished_.emplace_back(update->itemIdentifierValue(),
-                           success ? 0 : (error ? error->code : 1));
+    finished_.emplace_back(update->itemIdentifierValue(), success ? 0 : (error ? error->code : 1));
   }
   std::vector<std::pair<std::uint64_t, std::int64_t>> finished() {
     std::lock_guard lock(mutex_);
