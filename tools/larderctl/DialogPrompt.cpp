@@ -56,10 +56,27 @@ DialogPrompt::DialogPrompt(const PlistDictionary& fields, std::ostream& out)
   signIn_ = kind != fields_.end() && kind->second.int64Value() == DialogAgentProtocol::kSignInKind;
 }
 
+std::string DialogPrompt::plainText(std::string_view markup) {
+  static constexpr std::pair<std::string_view, std::string_view> kTags[] = {
+      {"<br>", "\n"}, {"<li>", "\n  - "}, {"</li>", ""}, {"<ul>", ""}, {"</ul>", ""}};
+  std::string text;
+  for (std::size_t i = 0; i < markup.size();) {
+    const auto* tag = std::ranges::find_if(
+        kTags, [&](const auto& entry) { return markup.substr(i).starts_with(entry.first); });
+    if (tag == std::end(kTags)) {
+      text += markup[i++];
+    } else {
+      text += tag->second;
+      i += tag->first.size();
+    }
+  }
+  return text;
+}
+
 void DialogPrompt::show() {
   out_ << "\n== " << textField(fields_, "message") << " ==\n";
   if (std::string explanation = textField(fields_, "explanation"); !explanation.empty()) {
-    out_ << explanation << "\n";
+    out_ << plainText(explanation) << "\n";
   }
   if (std::string content = textField(fields_, "content"); !content.empty()) {
     out_ << "\n" << content << "\n";

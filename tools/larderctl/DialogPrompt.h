@@ -28,6 +28,9 @@ class DialogPrompt {
   std::optional<DialogAgentProtocol::Answer> take(const std::string& line);
   // The answer when the input ends before the dialog is complete.
   static DialogAgentProtocol::Answer endOfInputAnswer();
+  // The text of a dialog for a terminal: the few markup tags that dialogs
+  // use become line breaks and list items; other text stays as it is.
+  static std::string plainText(std::string_view markup);
   // The next line is a password, which should not be echoed.
   [[nodiscard]] bool wantsSecret() const { return step_ == Step::kPassword; }
 

@@ -10,6 +10,7 @@
 #include "client/ServiceRequests.h"
 #include "tests/unit/ScopedEnvironment.h"
 #include "tools/larderctl/CallArguments.h"
+#include "tools/larderctl/DialogPrompt.h"
 #include "tools/larderctl/Spinner.h"
 #include "tools/larderctl/ValueText.h"
 
@@ -114,6 +115,14 @@ TEST(SpinnerTest, TheLineTurnsAndCountsTheSeconds) {
   EXPECT_EQ(Spinner::render("asking the store", 0, std::chrono::seconds(0)), "- asking the store");
   EXPECT_EQ(Spinner::render("asking the store", 5, std::chrono::seconds(12)),
             "\\ asking the store (12 s)");
+}
+
+TEST(DialogPromptText, TheListsOfTheQuitAndCannotUpdateDialogsReadAsLines) {
+  EXPECT_EQ(DialogPrompt::plainText("Quit these:<li>Notes<li>Atlas"),
+            "Quit these:\n  - Notes\n  - Atlas");
+  EXPECT_EQ(DialogPrompt::plainText("In use by: <br><br><ul><li>Viewer</li><li>Editor</li></ul>"),
+            "In use by: \n\n\n  - Viewer\n  - Editor");
+  EXPECT_EQ(DialogPrompt::plainText("a < b and <b>bold</b>"), "a < b and <b>bold</b>");
 }
 
 }  // namespace
