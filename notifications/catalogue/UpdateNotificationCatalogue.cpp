@@ -142,9 +142,8 @@ std::vector<LedgerUpdateRef> UpdateNotificationCatalogue::suiteUpdatesIncludedIn
   std::vector<LedgerUpdateRef> suite;
   std::ranges::copy_if(appUpdates, std::back_inserter(suite),
                        [](const LedgerUpdateRef& update) { return suiteRank(update).has_value(); });
-  std::ranges::stable_sort(suite, {}, [](const LedgerUpdateRef& update) {
-    return *suiteRank(update);
-  });
+  std::ranges::stable_sort(suite, {},
+                           [](const LedgerUpdateRef& update) { return *suiteRank(update); });
   return suite;
 }
 
@@ -184,10 +183,10 @@ void UpdateNotificationCatalogue::setFirstNotificationTexts(
                            : "UPDATES_AVAILABLE_HEARTHANVIL_NOTIFICATION_TEXT_AND_OTHERS_FORMAT",
                {names, localizedNumber(others)});
   } else {
-    notification.informativeText =
-        format(appUpdates.size() == 1 ? "UPDATES_AVAILABLE_HEARTHANVIL_NOTIFICATION_TEXT_SINGLE_FORMAT"
-                                      : "UPDATES_AVAILABLE_HEARTHANVIL_NOTIFICATION_TEXT_FORMAT",
-               {names});
+    notification.informativeText = format(
+        appUpdates.size() == 1 ? "UPDATES_AVAILABLE_HEARTHANVIL_NOTIFICATION_TEXT_SINGLE_FORMAT"
+                               : "UPDATES_AVAILABLE_HEARTHANVIL_NOTIFICATION_TEXT_FORMAT",
+        {names});
   }
 }
 
@@ -204,8 +203,7 @@ void UpdateNotificationCatalogue::setRegularTexts(UserNotification& notification
                       (autoUpdate && !osUpdates.empty() && !action) ||
                       (autoRestart && !osUpdates.empty() && action);
   if (!failed) {
-    TILL_LOG(1, "%@: Auto update is NOT enabled, posting updates available notification",
-             kSpeaker);
+    TILL_LOG(1, "%@: Auto update is NOT enabled, posting updates available notification", kSpeaker);
     notification.title = text("UPDATES_AVAILABLE_NOTIFICATION_TITLE");
     if (restartRequired) {
       notification.informativeText =
@@ -221,9 +219,8 @@ void UpdateNotificationCatalogue::setRegularTexts(UserNotification& notification
   TILL_LOG(1, "%@: Auto update is enabled, posting auto update failed notification", kSpeaker);
   notification.userInfo.insert_or_assign("isAutoUpdateFailure", true);
   notification.title = text("UPDATES_AVAILABLE_AUTOUPDATE_FAILED_NOTIFICATION_TITLE");
-  const bool appRunning = std::ranges::any_of(appUpdates, [](const LedgerUpdateRef& update) {
-    return update->autoUpdateAbortCode() == 3;
-  });
+  const bool appRunning = std::ranges::any_of(
+      appUpdates, [](const LedgerUpdateRef& update) { return update->autoUpdateAbortCode() == 3; });
   std::string_view key = "UPDATES_AVAILABLE_AUTOUPDATE_FAILED_NOTIFICATION_TEXT_GENERIC";
   if (restartRequired && !autoRestart) {
     key = laterOffered ? "UPDATES_AVAILABLE_AUTOUPDATE_FAILED_NOTIFICATION_TEXT_RESTART"
@@ -244,10 +241,9 @@ void UpdateNotificationCatalogue::setUpdatesAvailableButtons(UserNotification& n
   if (laterOffered) {
     notification.otherButtonTitle = install;
     notification.actionButtonTitle = text("UPDATE_NOTIFICATION_LATER_BUTTON");
-    notification.alternateActionButtonTitles =
-        laterOptions({"UPDATE_NOTIFICATION_LATER_OPTION_1HOUR",
-                      "UPDATE_NOTIFICATION_LATER_OPTION_TONIGHT",
-                      "UPDATE_NOTIFICATION_LATER_OPTION_REMIND"});
+    notification.alternateActionButtonTitles = laterOptions(
+        {"UPDATE_NOTIFICATION_LATER_OPTION_1HOUR", "UPDATE_NOTIFICATION_LATER_OPTION_TONIGHT",
+         "UPDATE_NOTIFICATION_LATER_OPTION_REMIND"});
   } else {
     notification.actionButtonTitle = install;
     notification.otherButtonTitle = text("UPDATE_NOTIFICATION_DETAILS_BUTTON");
@@ -324,11 +320,12 @@ void UpdateNotificationCatalogue::postFailure(bool postLogout,
   notification.actionButtonTitle = text("UPDATE_NOTIFICATION_INSTALL_BUTTON");
   notification.userInfo.emplace("alternateActionsIncludeInstallNow", true);
   if (context_.shouldOfferDoItLaterForAvailableUpdates()) {
-    notification.alternateActionButtonTitles = laterOptions(
-        {action ? "UPDATE_NOTIFICATION_LATER_OPTION_RESTART_NOW"
-                : "UPDATE_NOTIFICATION_LATER_OPTION_NOW",
-         "UPDATE_NOTIFICATION_LATER_OPTION_1HOUR_SHORT",
-         "UPDATE_NOTIFICATION_LATER_OPTION_TONIGHT_SHORT", "UPDATE_NOTIFICATION_LATER_OPTION_REMIND"});
+    notification.alternateActionButtonTitles =
+        laterOptions({action ? "UPDATE_NOTIFICATION_LATER_OPTION_RESTART_NOW"
+                             : "UPDATE_NOTIFICATION_LATER_OPTION_NOW",
+                      "UPDATE_NOTIFICATION_LATER_OPTION_1HOUR_SHORT",
+                      "UPDATE_NOTIFICATION_LATER_OPTION_TONIGHT_SHORT",
+                      "UPDATE_NOTIFICATION_LATER_OPTION_REMIND"});
     notification.alwaysShowAlternateActionMenu = true;
   }
   const PlistValue described(notification.toDictionary());
@@ -373,13 +370,13 @@ void UpdateNotificationCatalogue::postCriticalUpdateNotification(
   if (text) {
     notification.informativeText = *text;
   } else if (one) {
-    notification.informativeText = this->text(restartRequired
-                                                  ? "CRITICAL_UPDATE_RESTART_NOTIFICATION_TEXT"
-                                                  : "CRITICAL_UPDATE_NOTIFICATION_TEXT");
+    notification.informativeText =
+        this->text(restartRequired ? "CRITICAL_UPDATE_RESTART_NOTIFICATION_TEXT"
+                                   : "CRITICAL_UPDATE_NOTIFICATION_TEXT");
   } else {
-    notification.informativeText = this->text(restartRequired
-                                                  ? "CRITICAL_UPDATES_RESTART_NOTIFICATION_TEXT"
-                                                  : "CRITICAL_UPDATES_NOTIFICATION_TEXT");
+    notification.informativeText =
+        this->text(restartRequired ? "CRITICAL_UPDATES_RESTART_NOTIFICATION_TEXT"
+                                   : "CRITICAL_UPDATES_NOTIFICATION_TEXT");
   }
   notification.actionButtonTitle = this->text(
       restartRequired ? "UPDATE_NOTIFICATION_RESTART_BUTTON" : "UPDATE_NOTIFICATION_UPDATE_BUTTON");
@@ -407,9 +404,9 @@ void UpdateNotificationCatalogue::postCriticalUpdateInstallNowNotification(std::
     notification.informativeText = text(restartRequired ? "CRITICAL_UPDATE_INSTALL_NOW_RESTART_TEXT"
                                                         : "CRITICAL_UPDATE_INSTALL_NOW_TEXT");
   } else {
-    notification.informativeText = text(restartRequired
-                                            ? "CRITICAL_UPDATES_INSTALL_NOW_RESTART_TEXT"
-                                            : "CRITICAL_UPDATES_INSTALL_NOW_TEXT");
+    notification.informativeText =
+        text(restartRequired ? "CRITICAL_UPDATES_INSTALL_NOW_RESTART_TEXT"
+                             : "CRITICAL_UPDATES_INSTALL_NOW_TEXT");
   }
   // The one button dismisses, and dismissing starts the install.
   notification.hasActionButton = false;
@@ -479,14 +476,14 @@ void UpdateNotificationCatalogue::postNotificationForAutoInstalledUpdates(
   notification.hasActionButton = false;
   notification.userInfo = userInfoIncludingStoreClient(kSourceAutoInstalledUpdates, false);
   if (updates.size() == 1) {
-    notification.title =
-        format("AUTOUPDATE_POSTUPDATE_NOTIFICATION_TITLE_SINGLE", {updates[0]->title().value_or("")});
+    notification.title = format("AUTOUPDATE_POSTUPDATE_NOTIFICATION_TITLE_SINGLE",
+                                {updates[0]->title().value_or("")});
     notification.informativeText = text("AUTOUPDATE_POSTUPDATE_NOTIFICATION_TEXT_SINGLE");
     deliver(std::move(notification));
     return;
   }
-  notification.title =
-      format("AUTOUPDATE_POSTUPDATE_NOTIFICATION_TITLE_MULTIPLE", {localizedNumber(updates.size())});
+  notification.title = format("AUTOUPDATE_POSTUPDATE_NOTIFICATION_TITLE_MULTIPLE",
+                              {localizedNumber(updates.size())});
   // At most two names; the last of the list is joined with "and".
   std::string body;
   std::size_t names = 0;
@@ -509,45 +506,45 @@ void UpdateNotificationCatalogue::postNotificationForAutoInstalledUpdates(
 }
 
 void UpdateNotificationCatalogue::postNotificationForAutoUpdateOptIn() {
+  postOptIn(kSourceAutoUpdateOptIn, "AUTOUPDATE_OPTIN_NOTIFICATION_");
+}
+
+void UpdateNotificationCatalogue::postNotificationForAutoUpdateOfRestartRequiredUpdatesOptIn() {
+  postOptIn(kSourceRestartRequiredOptIn, "AUTOUPDATE_RESTARTREQUIRED_OPTIN_NOTIFICATION_");
+}
+
+// The two offers differ in their source and their texts, whose keys share
+// a prefix.
+void UpdateNotificationCatalogue::postOptIn(std::string_view source, std::string_view keyPrefix) {
+  auto keyed = [&](std::string_view suffix) { return text(std::string(keyPrefix) += suffix); };
   UserNotification notification = alertNotification();
-  notification.userInfo = userInfoIncludingStoreClient(kSourceAutoUpdateOptIn, false);
-  notification.title = text("AUTOUPDATE_OPTIN_NOTIFICATION_TITLE");
-  notification.informativeText = text("AUTOUPDATE_OPTIN_NOTIFICATION_BODY");
-  notification.actionButtonTitle = text("AUTOUPDATE_OPTIN_NOTIFICATION_ENABLE");
-  notification.otherButtonTitle = text("AUTOUPDATE_OPTIN_NOTIFICATION_CLOSE");
+  notification.userInfo = userInfoIncludingStoreClient(source, false);
+  notification.title = keyed("TITLE");
+  notification.informativeText = keyed("BODY");
+  notification.actionButtonTitle = keyed("ENABLE");
+  notification.otherButtonTitle = keyed("CLOSE");
   // At most one offer is around.
   removeSources({kSourceAutoUpdateOptIn, kSourceRestartRequiredOptIn});
   deliver(std::move(notification));
 }
 
-void UpdateNotificationCatalogue::postNotificationForAutoUpdateOfRestartRequiredUpdatesOptIn() {
-  UserNotification notification = alertNotification();
-  notification.userInfo = userInfoIncludingStoreClient(kSourceRestartRequiredOptIn, false);
-  notification.title = text("AUTOUPDATE_RESTARTREQUIRED_OPTIN_NOTIFICATION_TITLE");
-  notification.informativeText = text("AUTOUPDATE_RESTARTREQUIRED_OPTIN_NOTIFICATION_BODY");
-  notification.actionButtonTitle = text("AUTOUPDATE_RESTARTREQUIRED_OPTIN_NOTIFICATION_ENABLE");
-  notification.otherButtonTitle = text("AUTOUPDATE_RESTARTREQUIRED_OPTIN_NOTIFICATION_CLOSE");
-  removeSources({kSourceAutoUpdateOptIn, kSourceRestartRequiredOptIn});
-  deliver(std::move(notification));
-}
-
 void UpdateNotificationCatalogue::postOtherUsersLoggedInLaterHelperNotification() {
-  removeSources({kSourceLaterHelper});
-  UserNotification notification = alertNotification();
-  notification.hasActionButton = false;
-  notification.userInfo = userInfoIncludingStoreClient(kSourceLaterHelper, false);
-  notification.title = text("DOITLATER_HELPER_OTHER_USERS_TITLE");
-  notification.informativeText = text("DOITLATER_HELPER_OTHER_USERS_TEXT");
-  deliver(std::move(notification));
+  postLaterHelper("DOITLATER_HELPER_OTHER_USERS_TITLE", "DOITLATER_HELPER_OTHER_USERS_TEXT");
 }
 
 void UpdateNotificationCatalogue::postPowerLaterHelperNotification() {
+  postLaterHelper("DOITLATER_HELPER_POWER_TITLE", "DOITLATER_HELPER_POWER_TEXT");
+}
+
+// What would keep a Do It Later install from happening.
+void UpdateNotificationCatalogue::postLaterHelper(std::string_view titleKey,
+                                                  std::string_view textKey) {
   removeSources({kSourceLaterHelper});
   UserNotification notification = alertNotification();
   notification.hasActionButton = false;
   notification.userInfo = userInfoIncludingStoreClient(kSourceLaterHelper, false);
-  notification.title = text("DOITLATER_HELPER_POWER_TITLE");
-  notification.informativeText = text("DOITLATER_HELPER_POWER_TEXT");
+  notification.title = text(titleKey);
+  notification.informativeText = text(textKey);
   deliver(std::move(notification));
 }
 
@@ -555,34 +552,30 @@ void UpdateNotificationCatalogue::postPowerLaterHelperNotification() {
 
 void UpdateNotificationCatalogue::removeDeliveredNotificationsWithSource(
     std::string_view source, const std::optional<std::string>& excludingOSVersion) {
-  auto goes = [&](const UserNotification& notification) {
-    if (notification.source() != source) return false;
-    return !excludingOSVersion ||
-           stringOf(notification.userInfo, "osVersion") != excludingOSVersion;
-  };
-  for (const UserNotification& notification : center_->deliveredNotifications()) {
-    if (!goes(notification)) continue;
-    if (excludingOSVersion) {
-      TILL_LOG(1,
-               "%@: Removing delivered notification with info %@ as its osVersion info (%@) "
-               "doesn't match the specified OS version (%@)",
-               kSpeaker, PlistValue(notification.userInfo),
-               stringOf(notification.userInfo, "osVersion").value_or("(null)"),
-               *excludingOSVersion);
+  // First the list, then the screen: a notification can be on screen
+  // after it left the list.
+  for (const bool onScreen : {false, true}) {
+    const std::vector<UserNotification> notifications =
+        onScreen ? center_->displayedNotifications() : center_->deliveredNotifications();
+    for (const UserNotification& notification : notifications) {
+      const std::optional<std::string> osVersion = stringOf(notification.userInfo, "osVersion");
+      if (notification.source() != source ||
+          (excludingOSVersion && osVersion == excludingOSVersion)) {
+        continue;
+      }
+      if (excludingOSVersion) {
+        TILL_LOG(1,
+                 "%@: Removing %@ notification with info %@ as its osVersion info (%@) doesn't "
+                 "match the specified OS version (%@)",
+                 kSpeaker, onScreen ? "on-screen" : "delivered", PlistValue(notification.userInfo),
+                 osVersion.value_or("(null)"), *excludingOSVersion);
+      }
+      if (onScreen) {
+        center_->removeDisplayedNotification(notification);
+      } else {
+        center_->removeDeliveredNotification(notification);
+      }
     }
-    center_->removeDeliveredNotification(notification);
-  }
-  for (const UserNotification& notification : center_->displayedNotifications()) {
-    if (!goes(notification)) continue;
-    if (excludingOSVersion) {
-      TILL_LOG(1,
-               "%@: Removing on-screen notification with info %@ as its osVersion info (%@) "
-               "doesn't match the specified OS version (%@)",
-               kSpeaker, PlistValue(notification.userInfo),
-               stringOf(notification.userInfo, "osVersion").value_or("(null)"),
-               *excludingOSVersion);
-    }
-    center_->removeDisplayedNotification(notification);
   }
 }
 

@@ -60,9 +60,9 @@ class UpdateNotificationCatalogue {
                                         const std::optional<PlistDictionary>& auditInfo);
   void postUpdatesFailedToInstallPostLogoutNotification(
       const std::vector<PlistDictionary>& failedUpdates);
-  void postDoItLaterFailedNotificationWithAuditInfo(const std::optional<PlistDictionary>& auditInfo);
-  void postDoItLaterSuccessNotificationWithUpdates(
-      const std::vector<PlistDictionary>& updates);
+  void postDoItLaterFailedNotificationWithAuditInfo(
+      const std::optional<PlistDictionary>& auditInfo);
+  void postDoItLaterSuccessNotificationWithUpdates(const std::vector<PlistDictionary>& updates);
   void postCriticalUpdateNotification(std::int64_t count, const std::optional<std::string>& title,
                                       const std::optional<std::string>& text,
                                       bool delayedAutoInstall, bool restartRequired);
@@ -119,6 +119,8 @@ class UpdateNotificationCatalogue {
                        bool laterOffered) const;
   void setUpdatesAvailableButtons(UserNotification& notification, bool restartRequired,
                                   bool laterOffered) const;
+  void postOptIn(std::string_view source, std::string_view keyPrefix);
+  void postLaterHelper(std::string_view titleKey, std::string_view textKey);
   void postFailure(bool postLogout, const std::optional<PlistDictionary>& auditInfo);
   [[nodiscard]] std::optional<std::string> cacheAuditInfo(
       const std::optional<PlistDictionary>& auditInfo, std::string_view notificationName);

@@ -14,17 +14,10 @@ namespace {
 
 class NotificationServiceTest : public StoreAndServiceTest {
  protected:
-  // Sends the agent's report `info`, as if the notification intervals had
-  // passed, and waits until the run it starts has ended.
-  void backgroundRun(const std::string& info) {
+  // The agent's report `info`, as if the notification intervals had passed.
+  void reportAfterTheInterval(const std::string& info) {
     run({"prefs", "delete", "com.orvane.larderd", "DidPostUpdatesAvailableNotificationDate"});
-    const std::size_t before = service_->logLines("autoupdate.operation_run").size();
-    const LarderctlRun report = run({"background-scan", "--info", info});
-    ASSERT_EQ(report.status, 0) << report.errors;
-    ASSERT_TRUE(
-        eventually([&] { return service_->logLines("autoupdate.operation_run").size() > before; },
-                   std::chrono::seconds(60)))
-        << service_->log();
+    backgroundRun(info);
   }
 
   nlohmann::json delivered() {
@@ -37,7 +30,7 @@ TEST_F(NotificationServiceTest, ARunsNotificationIsShownReplacedKeptAcrossAResta
   RecordingNotificationServer server(bus_.address(), 41);
   start();
 
-  backgroundRun(R"({"criticalUpdatesCount": 1})");
+  reportAfterTheInterval(R"({"criticalUpdatesCount": 1})");
   std::vector<RecordingNotificationServer::NotifyCall> shown = server.waitForNotifyCalls(1);
   ASSERT_EQ(shown.size(), 1u) << service_->log();
   const RecordingNotificationServer::NotifyCall expected{
@@ -62,7 +55,7 @@ TEST_F(NotificationServiceTest, ARunsNotificationIsShownReplacedKeptAcrossAResta
   EXPECT_EQ(list[0]["userInfo"]["storeClientIdentifier"], "com.orvane.quaymart");
 
   // A second report replaces it: the first is closed, the new one shown.
-  backgroundRun(R"({"criticalUpdatesCount": 2})");
+  reportAfterTheInterval(R"({"criticalUpdatesCount": 2})");
   shown = server.waitForNotifyCalls(2);
   ASSERT_EQ(shown.size(), 2u) << service_->log();
   EXPECT_EQ(shown[1].summary, "Important Updates Available");
@@ -76,7 +69,7 @@ TEST_F(NotificationServiceTest, ARunsNotificationIsShownReplacedKeptAcrossAResta
   EXPECT_EQ(list[0]["serverIdentifier"], 42);
 
   // Nothing left to update: the notification goes, from the server too.
-  backgroundRun("{}");
+  reportAfterTheInterval("{}");
   EXPECT_EQ(server.waitForCloseCalls(2), (std::vector<std::uint32_t>{41, 42})) << service_->log();
   EXPECT_TRUE(delivered().empty());
   EXPECT_EQ(run({"notifications"}).status, 3);
@@ -84,7 +77,7 @@ TEST_F(NotificationServiceTest, ARunsNotificationIsShownReplacedKeptAcrossAResta
 
 TEST_F(NotificationServiceTest, AnActivationNamesItsNotificationAndAKnownAction) {
   start();
-  backgroundRun(R"({"criticalUpdatesCount": 1})");
+  reportAfterTheInterval(R"({"criticalUpdatesCount": 1})");
   const nlohmann::json list = delivered();
   ASSERT_EQ(list.size(), 1u) << service_->log();
   EXPECT_EQ(list[0]["displayed"], false);  // no server on this bus: recorded only

@@ -64,6 +64,20 @@ class StoreAndServiceTest : public ::testing::Test {
                         merged);
   }
 
+  // Sends the software update agent's report (`info`, or a scan's when
+  // empty) and waits until the run it starts has ended.
+  void backgroundRun(const std::string& info = {}) {
+    const std::size_t before = service_->logLines("autoupdate.operation_run").size();
+    std::vector<std::string> arguments{"background-scan"};
+    if (!info.empty()) arguments.insert(arguments.end(), {"--info", info});
+    const LarderctlRun report = run(arguments);
+    ASSERT_EQ(report.status, 0) << report.errors;
+    ASSERT_TRUE(
+        eventually([&] { return service_->logLines("autoupdate.operation_run").size() > before; },
+                   std::chrono::seconds(60)))
+        << service_->log();
+  }
+
   StoreCatalogueBuilder catalogue_;
   std::unique_ptr<StoreServerProcess> store_;
   TemporaryPlatform platform_;

@@ -57,17 +57,6 @@ class UpdateRunServiceTest : public StoreAndServiceTest {
     if (pid_ > 0) ::kill(pid_, SIGKILL);
   }
 
-  // Sends the agent's report and waits until the run it starts has ended.
-  void backgroundRun() {
-    const std::size_t before = service_->logLines("autoupdate.operation_run").size();
-    const LarderctlRun report = run({"background-scan"});
-    ASSERT_EQ(report.status, 0) << report.errors;
-    ASSERT_TRUE(
-        eventually([&] { return service_->logLines("autoupdate.operation_run").size() > before; },
-                   std::chrono::seconds(60)))
-        << service_->log();
-  }
-
   nlohmann::json listedUpdates() {
     const LarderctlRun listed = run({"--json", "updates"});
     return nlohmann::json::parse(listed.output)["updates"];

@@ -20,13 +20,13 @@
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/PreferenceKeys.h"
 #include "store-runtime/dialogs/LedgerLocalizedString.h"
-#include "store-runtime/dialogs/VendDialogPresenter.h"
 #include "store-runtime/download/VendFileManager.h"
 #include "store-runtime/host/PlatformStateFile.h"
 #include "store-runtime/host/PreferenceStore.h"
 #include "store-runtime/services/VendOperationQueue.h"
 #include "store-runtime/sysup/SysupQuaymartUpdateController.h"
 #include "tests/integration/InProcessRuntime.h"
+#include "tests/unit/AnsweringDialogPresenter.h"
 #include "tests/unit/OSUpdateOffers.h"
 #include "update-controller/UpdateController.h"
 #include "update-controller/VendOSUpdateProgressObserver.h"
@@ -124,6 +124,17 @@ class UpdateRunTest : public InProcessRuntimeTest {
     launched_.push_back(*pid);
     EXPECT_TRUE(eventually([&] { return RunningApplication::withPid(*pid) != nullptr; }));
     return *pid;
+  }
+
+  // Viewer, at `host`, runs a plug-in of Atlas, at `atlas`.
+  static bool viewerUsesAPlugInOf(const std::string& atlas, const std::string& host) {
+    return PlugInHost::addBusyPlugIn({{"containingIdentifier", "com.example.atlas"},
+                                      {"containingPath", atlas},
+                                      {"plugInIdentifier", "com.example.atlas.ext"},
+                                      {"plugInPath", atlas + "/plugins/Ext.app"},
+                                      {"hostIdentifier", "com.example.viewer"},
+                                      {"hostPath", host},
+                                      {"service-pid", 4242}});
   }
 
   void startEverything() {
@@ -415,27 +426,6 @@ TEST_F(UpdateRunTest, TheLockOfAllRunsIsNotHeldWhileARunDownloads) {
   other->updateQueue()->finishPendingWrites();
 }
 
-// Keeps every dialog the runtime shows and answers each with OK.
-class DialogRecorder final : public VendDialogPresenter {
- public:
-  void present(const VendDialog& dialog, Reply reply) override {
-    {
-      std::lock_guard lock(mutex_);
-      shown_.push_back(dialog.toDictionary());
-    }
-    reply(VendDialogAnswer{VendDialogButton::kOK, {}});
-  }
-  void dismiss(std::string_view, std::int64_t) override {}
-  std::vector<PlistDictionary> shown() {
-    std::lock_guard lock(mutex_);
-    return shown_;
-  }
-
- private:
-  std::mutex mutex_;
-  std::vector<PlistDictionary> shown_;
-};
-
 class RecordingUpdateDelegate final : public VendUpdateDelegate {
  public:
   void appUpdateFinishedPurchase(const LedgerUpdateRef& update, bool success,
@@ -461,20 +451,14 @@ TEST_F(UpdateRunTest, AUserStartedRunStopsAtABusyPlugInAndNamesItsHost) {
   const std::string host = platform_.installBundle(
       {.folder = applications(), .name = "Viewer", .bundleIdentifier = "com.example.viewer"});
   startEverything();
-  auto dialogs = std::make_shared<DialogRecorder>();
+  auto dialogs = std::make_shared<AnsweringDialogPresenter>();
   runtime_->setDialogPresenter(dialogs);
   DispatchSemaphore checked;
   controller_->updateQueue()->checkForUpdatesWithCompletionHandler(
       [&](bool, const auto&, const auto&, const auto&) { checked.signal(); });
   checked.wait();
   launch(atlas);
-  ASSERT_TRUE(PlugInHost::addBusyPlugIn({{"containingIdentifier", "com.example.atlas"},
-                                         {"containingPath", atlas},
-                                         {"plugInIdentifier", "com.example.atlas.ext"},
-                                         {"plugInPath", atlas + "/plugins/Ext.app"},
-                                         {"hostIdentifier", "com.example.viewer"},
-                                         {"hostPath", host},
-                                         {"service-pid", 4242}}));
+  ASSERT_TRUE(viewerUsesAPlugInOf(atlas, host));
   auto delegate = std::make_shared<RecordingUpdateDelegate>();
   auto run = std::make_shared<UpdateOperation>(
       controller_->storeClient(), std::weak_ptr<UpdateOperationController>(controller_));
@@ -517,13 +501,7 @@ TEST_F(UpdateRunTest, EveryAbortCodeOfTheDecisionsIsReachedWithItsReason) {
   checked.wait();
   launch(notes);
   RunningApplicationFacts::setQuittingLosesData("com.example.notes", "unsaved work");
-  ASSERT_TRUE(PlugInHost::addBusyPlugIn({{"containingIdentifier", "com.example.atlas"},
-                                         {"containingPath", atlas},
-                                         {"plugInIdentifier", "com.example.atlas.ext"},
-                                         {"plugInPath", atlas + "/plugins/Ext.app"},
-                                         {"hostIdentifier", "com.example.viewer"},
-                                         {"hostPath", host},
-                                         {"service-pid", 4242}}));
+  ASSERT_TRUE(viewerUsesAPlugInOf(atlas, host));
   struct Case {
     std::string name;
     std::optional<std::string> bundleID;

@@ -9,12 +9,12 @@
 #include "platform/dispatch/DispatchQueue.h"
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/PreferenceKeys.h"
-#include "store-runtime/dialogs/VendDialogPresenter.h"
 #include "store-runtime/download/VendFileManager.h"
 #include "store-runtime/host/LedgerDistributedNotificationCenter.h"
 #include "store-runtime/host/PlatformStateFile.h"
 #include "store-runtime/host/PreferenceStore.h"
 #include "store-runtime/runtime/VendRuntime.h"
+#include "tests/unit/AnsweringDialogPresenter.h"
 #include "tests/unit/OSUpdateOffers.h"
 #include "update-controller/UpdateController.h"
 #include "update-operation/UpdateOperation.h"
@@ -443,29 +443,6 @@ TEST_F(UpdateControllerTest, HidingNeedsAuthorizationAndPassesOverUnknownKeys) {
   EXPECT_EQ(outcomes, (std::vector<bool>{true, true}));
 }
 
-// Answers every dialog with one exit code and keeps what it was shown.
-class AnsweringPresenter final : public VendDialogPresenter {
- public:
-  explicit AnsweringPresenter(std::int64_t exitCode) : exitCode_(exitCode) {}
-  void present(const VendDialog& dialog, Reply reply) override {
-    {
-      std::lock_guard lock(mutex_);
-      shown_.push_back(dialog.toDictionary());
-    }
-    reply(VendDialogAnswer{exitCode_, {}});
-  }
-  void dismiss(std::string_view, std::int64_t) override {}
-  std::vector<PlistDictionary> shown() {
-    std::lock_guard lock(mutex_);
-    return shown_;
-  }
-
- private:
-  std::int64_t exitCode_;
-  std::mutex mutex_;
-  std::vector<PlistDictionary> shown_;
-};
-
 TEST_F(UpdateControllerTest, TheRestartIsConfirmedOnlyByItsRestartButton) {
   UpdateController& updates = controller();
   struct Case {
@@ -478,7 +455,7 @@ TEST_F(UpdateControllerTest, TheRestartIsConfirmedOnlyByItsRestartButton) {
                      {false, 0, "Restart to Install Updates?", false},
                      {true, 2, "Download and Restart to Install Updates?", false}};
   for (const Case& c : cases) {
-    auto presenter = std::make_shared<AnsweringPresenter>(c.exitCode);
+    auto presenter = std::make_shared<AnsweringDialogPresenter>(c.exitCode);
     VendRuntime::shared()->setDialogPresenter(presenter);
     EXPECT_EQ(updates.confirmRestartWithUpdatesWillDownload(c.willDownload), c.confirmed);
     ASSERT_EQ(presenter->shown().size(), 1u);
