@@ -13,8 +13,9 @@ namespace {
 constexpr std::string_view kSpeaker = "NotificationsInterface";
 
 std::shared_ptr<UserNotificationCenter> serviceCenter() {
-  return UserNotificationCenter::centerForIdentifier("com.orvane.larderd",
-                                                     UserNotificationCenter::kSystemCenter);
+  return UserNotificationCenter::centerForIdentifier(
+      std::string(UserNotificationCenter::kServiceIdentifier),
+      UserNotificationCenter::kSystemCenter);
 }
 
 }  // namespace

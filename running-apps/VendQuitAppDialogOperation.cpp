@@ -1,24 +1,13 @@
 #include "running-apps/VendQuitAppDialogOperation.h"
 
-#include <unistd.h>
-
 #include <algorithm>
-#include <chrono>
 #include <filesystem>
 
-#include "platform/log/TillLogManager.h"
 #include "store-runtime/dialogs/LedgerLocalizedString.h"
 
 namespace larder {
 
 namespace {
-
-constexpr std::string_view kSpeaker = "VendQuitAppDialogOperation";
-
-// A dismissal that reaches the presenter before the dialog does finds
-// nothing to take down, so it is sent again until the run has ended.
-constexpr std::chrono::milliseconds kDismissalRetryInterval{100};
-constexpr int kDismissalAttempts = 50;
 
 std::string nameOf(const RunningApplication& application) {
   if (application.localizedName() && !application.localizedName()->empty()) {
@@ -105,51 +94,9 @@ void VendQuitAppDialogOperation::setDidForceFinish(bool didForceFinish) {
   didForceFinish_ = didForceFinish;
 }
 
-void VendQuitAppDialogOperation::run() {
-  // However the run ends, an exception included, a waiting forceFinish
-  // hears of it.
-  struct SignalAtEnd {
-    DispatchSemaphore& ended;
-    ~SignalAtEnd() { ended.signal(); }
-  } const signalAtEnd{runEnded_};
-  if (didForceFinish()) {
-    TILL_LOG(2, "%@: Dialog %@ not shown: it was finished before it went up", kSpeaker,
-             dialog().identifier());
-    setError(VendError::make(VendError::kCancelledCode, std::nullopt,
-                             "The dialog was finished before it was shown."));
-  } else {
-    VendDialogOperation::run();
-  }
-}
-
-PlistDictionary VendQuitAppDialogOperation::dismissalRequest() const {
-  const std::string ok = dialog().okButton() ? dialog().okButton()->title : std::string();
-  const std::string cancel =
-      dialog().cancelButton() ? dialog().cancelButton()->title : std::string();
-  // No exit code: the dialog is to end with no button chosen. The
-  // identifier is what the presenter finds the dialog by; the rest tells a
-  // person reading the log which dialog went.
-  return {{"identifier", dialog().identifier()},
-          {"pid", static_cast<std::int64_t>(::getpid())},
-          {"okButton", ok},
-          {"cancelButton", cancel},
-          {"message", dialog().message()},
-          {"title", dialog().message()}};
-}
-
 void VendQuitAppDialogOperation::forceFinish() {
   setDidForceFinish(true);
-  const PlistDictionary request = dismissalRequest();
-  for (int attempt = 0; attempt < kDismissalAttempts; ++attempt) {
-    VendDialog::dismissDialogWithDictionary(request);
-    if (runEnded_.waitFor(kDismissalRetryInterval)) {
-      // Left signalled for any other caller waiting on the same end.
-      runEnded_.signal();
-      return;
-    }
-  }
-  TILL_LOG(1, "%@: Dialog %@ is still up after %@ dismissals", kSpeaker, dialog().identifier(),
-           kDismissalAttempts);
+  dismissWithExitCode(VendDialog::kNoButtonExitCode);
 }
 
 }  // namespace larder

@@ -4,7 +4,6 @@
 #include <optional>
 #include <vector>
 
-#include "platform/dispatch/DispatchSemaphore.h"
 #include "platform/system/Mutex.h"
 #include "running-apps/RunningApplication.h"
 #include "store-runtime/records/SysupQuaymartUpdate.h"
@@ -34,20 +33,12 @@ class VendQuitAppDialogOperation : public VendDialogOperation {
   void setDidForceFinish(bool didForceFinish);
 
   // Takes the dialog down without an answer; any thread, while `run`
-  // blocks on another. Returns once the run has ended (or, should the
-  // presenter never let the dialog go, after a few seconds of trying).
+  // blocks on another. Returns at once.
   void forceFinish();
 
- protected:
-  void run() override;
-
  private:
-  [[nodiscard]] PlistDictionary dismissalRequest() const;
-
   mutable Mutex mutex_;
   bool didForceFinish_ GUARDED_BY(mutex_) = false;
-  // Signalled once when `run` has ended; `forceFinish` waits on it.
-  DispatchSemaphore runEnded_;
 };
 
 }  // namespace larder

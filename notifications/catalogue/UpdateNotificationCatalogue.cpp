@@ -20,7 +20,6 @@ namespace larder {
 namespace {
 
 constexpr std::string_view kSpeaker = "UpdateController";
-constexpr std::string_view kServiceCenterIdentifier = "com.orvane.larderd";
 
 // Icons by their freedesktop names, which every icon theme carries.
 constexpr std::string_view kUpdatesIcon = "software-update-available";
@@ -78,7 +77,7 @@ UpdateNotificationCatalogue::UpdateNotificationCatalogue(
       context_(context),
       center_(center ? std::move(center)
                      : UserNotificationCenter::centerForIdentifier(
-                           std::string(kServiceCenterIdentifier),
+                           std::string(UserNotificationCenter::kServiceIdentifier),
                            UserNotificationCenter::kSystemCenter)) {}
 
 // --- Builders ---
@@ -552,14 +551,24 @@ void UpdateNotificationCatalogue::postLaterHelper(std::string_view titleKey,
 
 void UpdateNotificationCatalogue::removeDeliveredNotificationsWithSource(
     std::string_view source, const std::optional<std::string>& excludingOSVersion) {
-  // First the list, then the screen: a notification can be on screen
-  // after it left the list.
+  removeNotifications({source}, excludingOSVersion);
+}
+
+void UpdateNotificationCatalogue::removeSources(std::initializer_list<std::string_view> sources) {
+  removeNotifications(sources, std::nullopt);
+}
+
+// One walk over the list, then one over the screen, for every source: a
+// notification can be on screen after it left the list.
+void UpdateNotificationCatalogue::removeNotifications(
+    std::initializer_list<std::string_view> sources,
+    const std::optional<std::string>& excludingOSVersion) {
   for (const bool onScreen : {false, true}) {
     const std::vector<UserNotification> notifications =
         onScreen ? center_->displayedNotifications() : center_->deliveredNotifications();
     for (const UserNotification& notification : notifications) {
       const std::optional<std::string> osVersion = stringOf(notification.userInfo, "osVersion");
-      if (notification.source() != source ||
+      if (std::ranges::find(sources, notification.source()) == sources.end() ||
           (excludingOSVersion && osVersion == excludingOSVersion)) {
         continue;
       }
@@ -579,10 +588,6 @@ void UpdateNotificationCatalogue::removeDeliveredNotificationsWithSource(
   }
 }
 
-void UpdateNotificationCatalogue::removeSources(std::initializer_list<std::string_view> sources) {
-  for (std::string_view source : sources) removeDeliveredNotificationsWithSource(source, {});
-}
-
 void UpdateNotificationCatalogue::removeUpdatesAvailableNotifications() {
   removeSources({kSourceAppUpdate});
 }
@@ -593,8 +598,11 @@ void UpdateNotificationCatalogue::removeUpdatesAvailableNotificationFromOlderOSV
 
 void UpdateNotificationCatalogue::removeCriticalUpdateNotificationsIncludingPostInstall(
     bool includingPostInstall) {
-  removeSources({kSourceCriticalUpdate, kSourceCriticalInstallNow});
-  if (includingPostInstall) removeSources({kSourceCriticalPostInstall});
+  if (includingPostInstall) {
+    removeSources({kSourceCriticalUpdate, kSourceCriticalInstallNow, kSourceCriticalPostInstall});
+  } else {
+    removeSources({kSourceCriticalUpdate, kSourceCriticalInstallNow});
+  }
 }
 
 // --- Questions ---

@@ -125,6 +125,8 @@ class UpdateNotificationCatalogue {
   [[nodiscard]] std::optional<std::string> cacheAuditInfo(
       const std::optional<PlistDictionary>& auditInfo, std::string_view notificationName);
   void removeSources(std::initializer_list<std::string_view> sources);
+  void removeNotifications(std::initializer_list<std::string_view> sources,
+                           const std::optional<std::string>& excludingOSVersion);
   void deliver(UserNotification notification);
   static bool updateNotificationsAreRestricted();
   static void selfDidPostUpdatesAvailableNotification();

@@ -31,6 +31,9 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
     kSystemCenter = 2,
   };
 
+  // The identifier of the service's own center.
+  static constexpr std::string_view kServiceIdentifier = "com.orvane.larderd";
+
   // The errors of `activate`.
   static constexpr std::string_view kErrorDomain = "UserNotificationCenter";
   static constexpr std::int64_t kUnknownNotificationCode = 1;

@@ -19,10 +19,6 @@ constexpr std::array<std::string_view, 8> kOwnKeys{
     "identifier",         "message",           "explanation", "okButtonString",
     "cancelButtonString", "otherButtonString", "kind",        "content"};
 
-// A dialog taken down from outside without an exit code ends with no
-// button chosen, so that the waiting side can tell it from a user's answer.
-constexpr std::int64_t kNoButtonExitCode = -1;
-
 std::string textFor(const PlistDictionary& dictionary, std::string_view key) {
   auto found = dictionary.find(key);
   if (found == dictionary.end()) return {};

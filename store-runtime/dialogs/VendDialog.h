@@ -30,6 +30,9 @@ class VendDialog {
   // What kind of answer the agent is asked for. A sign-in dialog also
   // answers with "accountName" and "password".
   enum Kind : std::int64_t { kAlert = 0, kSignIn = 1, kFirmwareWarning = 2, kLicenseAgreement = 3 };
+  // The exit code of a dialog taken down from outside without a choice: no
+  // button has it, so the waiting side can tell it from a user's answer.
+  static constexpr std::int64_t kNoButtonExitCode = -1;
 
   static VendDialog dialogWithDictionary(const PlistDictionary& dictionary);
   // Takes down, from outside, the shown dialog with this identifier.

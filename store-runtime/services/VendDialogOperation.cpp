@@ -13,7 +13,8 @@ namespace {
 
 constexpr std::string_view kSpeaker = "VendDialogOperation";
 
-// How often a waiting operation looks whether it has been cancelled.
+// How often a waiting operation looks whether it has been cancelled or
+// taken down.
 constexpr std::chrono::milliseconds kCancelPollInterval{100};
 
 // Lives as long as the longer of the waiting operation and the reply, so a
@@ -49,12 +50,34 @@ bool VendDialogOperation::performDefaultActions() const {
   return performDefaultActions_;
 }
 
+void VendDialogOperation::dismissWithExitCode(std::int64_t exitCode) {
+  {
+    MutexLock lock(mutex_);
+    dismissalExitCode_ = exitCode;
+  }
+  // At once, for a dialog that is up; the waiting run sends it again for
+  // one still on its way.
+  serviceProxy()->uiService()->dismissDialog(dialog_, exitCode);
+}
+
+std::optional<std::int64_t> VendDialogOperation::dismissalExitCode() const {
+  MutexLock lock(mutex_);
+  return dismissalExitCode_;
+}
+
 void VendDialogOperation::run() {
   if (isCancelled()) {
     TILL_LOG(2, "%@: Dialog %@ not shown: the operation was cancelled", kSpeaker,
              dialog_.identifier());
     setError(VendError::make(VendError::kCancelledCode, std::nullopt,
                              "The dialog was not shown: the operation was cancelled."));
+    return;
+  }
+  if (dismissalExitCode()) {
+    TILL_LOG(2, "%@: Dialog %@ not shown: it was taken down before it went up", kSpeaker,
+             dialog_.identifier());
+    setError(VendError::make(VendError::kCancelledCode, std::nullopt,
+                             "The dialog was taken down before it was shown."));
     return;
   }
   TILL_LOG(3, "%@: Running dialog %@ \"%@\" (default actions %@)", kSpeaker, dialog_.identifier(),
@@ -78,6 +101,9 @@ std::int64_t VendDialogOperation::waitForExitCode() {
       TILL_LOG(2, "%@: Operation cancelled; taking dialog %@ down", kSpeaker, dialog_.identifier());
       ui->dismissDialog(dialog_, VendDialogButton::kCancel);
       dismissedOnCancel = true;
+    }
+    if (const std::optional<std::int64_t> exitCode = dismissalExitCode()) {
+      ui->dismissDialog(dialog_, *exitCode);
     }
   }
   MutexLock lock(pending->mutex);

@@ -37,17 +37,27 @@ class VendDialogOperation : public VendOperation {
   void setPerformDefaultActions(bool performDefaultActions);
   [[nodiscard]] bool performDefaultActions() const;
 
+  // Takes the dialog down from outside, as if `exitCode` had been chosen
+  // (`VendDialog::kNoButtonExitCode` ends it with no choice); any thread,
+  // does not wait for the dialog. A dismissal can reach the presenter
+  // before the dialog does, so the waiting run sends it again until the
+  // dialog has come back; a dialog taken down before it went up is never
+  // shown.
+  void dismissWithExitCode(std::int64_t exitCode);
+
  protected:
   void run() override;
 
  private:
   std::int64_t waitForExitCode();
+  [[nodiscard]] std::optional<std::int64_t> dismissalExitCode() const;
   void recordExitCode(std::int64_t exitCode);
 
   VendDialog dialog_;
   mutable Mutex mutex_;
   std::optional<VendDialogButton> selectedButton_ GUARDED_BY(mutex_);
   bool performDefaultActions_ GUARDED_BY(mutex_) = true;
+  std::optional<std::int64_t> dismissalExitCode_ GUARDED_BY(mutex_);
 };
 
 }  // namespace larder
