@@ -136,7 +136,7 @@ struct AbsentServerCase {
   std::string busAddress;
 };
 
-TEST(FreedesktopNotificationServerAbsentTest, PostIsRecordedAndReturnsAtOnce) {
+TEST(FreedesktopNotificationServerAbsentTest, PostIsRecordedAndLoggedWithNoServer) {
   PrivateSessionBus bus;
   const std::vector<AbsentServerCase> cases{
       {"no server on the bus", ""},
@@ -153,10 +153,9 @@ TEST(FreedesktopNotificationServerAbsentTest, PostIsRecordedAndReturnsAtOnce) {
         row.busAddress.empty() ? bus.address() : row.busAddress));
     UserNotification notification;
     notification.title = "Nobody sees this";
-    const auto start = Clock::now();
+    // That the post does not wait for the server is proven in the center's
+    // unit tests with a server held busy, and measured in its benchmark.
     const UserNotification delivered = center->deliverNotification(notification);
-    const auto elapsed = Clock::now() - start;
-    EXPECT_LT(elapsed, std::chrono::milliseconds(20));
 
     const std::string line =
         "UserNotificationCenter: No notification server on the session bus; notification " +

@@ -14,6 +14,7 @@
 #include "store-runtime/host/PlatformStateFile.h"
 #include "store-runtime/host/PreferenceStore.h"
 #include "store-runtime/runtime/VendRuntime.h"
+#include "store-runtime/services/VendOperationQueue.h"
 #include "tests/unit/AnsweringDialogPresenter.h"
 #include "tests/unit/OSUpdateOffers.h"
 #include "update-controller/UpdateController.h"
@@ -98,6 +99,9 @@ class UpdateControllerTest : public ServiceTest {
     map_->waitUntilIdle();
   }
   void TearDown() override {
+    // A run that a report enqueued ends inside the test, not at the exit
+    // of the process, where the shared facilities it uses are torn down.
+    VendOperationQueue::mainQueue().waitUntilAllOperationsAreFinished();
     controller_.reset();
     // The framework tells its observers on the global queue: the telling
     // that a test's last change started ends before the test does.
