@@ -16,7 +16,6 @@
 namespace larder::testing {
 namespace {
 
-using Clock = std::chrono::steady_clock;
 
 UserNotification alertWithMenu() {
   UserNotification notification;
