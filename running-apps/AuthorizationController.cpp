@@ -6,6 +6,7 @@
 #include "store-runtime/host/LedgerAuthorizationService.h"
 #include "store-runtime/host/LedgerSystemState.h"
 #include "store-runtime/host/VendManagedRestrictions.h"
+#include "store-runtime/sysup/SysupQuaymartUpdateController.h"
 
 namespace larder {
 
@@ -44,6 +45,12 @@ bool AuthorizationController::authorizeForSoftwareInstall() {
   if (authorization_) return true;
   if (!attemptNonInteractiveAuthorization() && !attemptInteractiveAuthorization()) {
     TILL_LOG(1, "%@: Unable to get authorization for software install", kSpeaker);
+  }
+  if (authorization_) {
+    // This platform has no package installer of its own to register with
+    // yet; the system update framework is the one installer there is.
+    TILL_LOG(1, "%@: authorizing CrateInstallClient and SysupQuaymartUpdateController", kSpeaker);
+    SysupQuaymartUpdateController::sharedUpdateController().setAuthorization(*authorization_);
   }
   return authorization_.has_value();
 }

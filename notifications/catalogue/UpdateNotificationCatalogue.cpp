@@ -10,6 +10,7 @@
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/PreferenceKeys.h"
 #include "store-runtime/dialogs/LedgerLocalizedString.h"
+#include "store-runtime/host/LedgerTwilightAgent.h"
 #include "store-runtime/host/PreferenceStore.h"
 #include "store-runtime/host/VendDevice.h"
 #include "store-runtime/host/VendManagedRestrictions.h"
@@ -533,6 +534,35 @@ void UpdateNotificationCatalogue::postOtherUsersLoggedInLaterHelperNotification(
 
 void UpdateNotificationCatalogue::postPowerLaterHelperNotification() {
   postLaterHelper("DOITLATER_HELPER_POWER_TITLE", "DOITLATER_HELPER_POWER_TEXT");
+}
+
+std::int64_t UpdateNotificationCatalogue::showRestartCountdownNotification() {
+  // One left over from a service that ended during a countdown answers
+  // nothing any more.
+  removeSources({kSourceRestartCountdown});
+  UserNotification notification = alertNotification();
+  notification.poofsOnCancel = false;
+  notification.userInfo = userInfoIncludingStoreClient(kSourceRestartCountdown, false);
+  notification.title = text("RESTART_COUNTDOWN_NOTIFICATION_TITLE");
+  notification.informativeText = text("RESTART_COUNTDOWN_NOTIFICATION_TEXT");
+  notification.actionButtonTitle = text("RESTART_COUNTDOWN_NOTIFICATION_RESTART_BUTTON");
+  notification.otherButtonTitle = text("RESTART_COUNTDOWN_NOTIFICATION_LATER_BUTTON");
+  const UserNotification posted = center_->deliverNotification(std::move(notification));
+  const std::int64_t result = LedgerTwilightAgent::showRestartCountdownNotification();
+  center_->removeDeliveredNotification(posted);
+  TILL_LOG(2, "%@: Restart countdown notification %@ ended with %ld", kSpeaker, posted.identifier,
+           result);
+  return result;
+}
+
+std::optional<std::int64_t> UpdateNotificationCatalogue::restartCountdownAnswer(
+    const UserNotification& notification, bool dismissed) {
+  if (notification.source() != kSourceRestartCountdown) return std::nullopt;
+  if (dismissed) return kCountdownLater;
+  if (notification.activationType == UserNotification::kActionButtonClicked) {
+    return kCountdownRestartNow;
+  }
+  return std::nullopt;
 }
 
 // What would keep a Do It Later install from happening.

@@ -39,6 +39,11 @@ class UpdateNotificationCatalogue {
   static constexpr std::string_view kSourceRestartRequiredOptIn = "autoUpdateRestartRequiredOptIn";
   static constexpr std::string_view kSourceLaterHelper = "DoItLaterHelper";
   static constexpr std::string_view kSourceMajorOSUpdate = "MajorOSUpdate";
+  static constexpr std::string_view kSourceRestartCountdown = "RestartCountdown";
+
+  // The restart countdown's results for its two buttons.
+  static constexpr std::int64_t kCountdownRestartNow = 1;
+  static constexpr std::int64_t kCountdownLater = 3;
 
   // The link of the updates page in the store application.
   static constexpr std::string_view kUpdatesPageURL =
@@ -76,6 +81,20 @@ class UpdateNotificationCatalogue {
   void postNotificationForAutoUpdateOfRestartRequiredUpdatesOptIn();
   void postOtherUsersLoggedInLaterHelperNotification();
   void postPowerLaterHelperNotification();
+
+  // Shows the restart countdown as a notification ("Restart Now", result 1;
+  // "Later", result 3), waits for the deferred-install agent's countdown to
+  // end (LedgerTwilightAgent::showRestartCountdownNotification: an answer,
+  // or the time running out, which restarts), takes the notification away
+  // and returns the result. Blocks its caller meanwhile. It goes out also
+  // under the restriction on update notifications: a restart the user
+  // chose is not to come unannounced.
+  std::int64_t showRestartCountdownNotification();
+  // What an activation of the countdown answers: 1 for its main button, 3
+  // for its second; nothing for any other notification or a click on the
+  // contents.
+  static std::optional<std::int64_t> restartCountdownAnswer(const UserNotification& notification,
+                                                            bool dismissed);
 
   // --- Removals ---
   // Takes away, from the list and from the screen, the notifications of

@@ -125,6 +125,11 @@ constexpr std::array kTradelineStrings = {
     Entry{"OVP_INVITE_NOTIFICATION_CLOSE_BUTTON", "Close"},
     Entry{"OVP_INVITE_NOTIFICATION_ENROLL_BUTTON", "Enroll"},
     Entry{"OVP_INVITE_NOTIFICATION_TITLE_FORMAT", "Invitation from %@"},
+    Entry{"RESTART_COUNTDOWN_NOTIFICATION_LATER_BUTTON", "Later"},
+    Entry{"RESTART_COUNTDOWN_NOTIFICATION_RESTART_BUTTON", "Restart Now"},
+    Entry{"RESTART_COUNTDOWN_NOTIFICATION_TEXT",
+          "Your computer will restart shortly to finish installing updates."},
+    Entry{"RESTART_COUNTDOWN_NOTIFICATION_TITLE", "Restarting to Install Updates"},
     Entry{"SOFTWARE_LICENSE_AGREEMENT_TITLE", "Software License Agreement"},
     Entry{"UPDATEFAILED_DIALOG_AVAILABLE_UPDATES_CHANGED_BODY",
           "The available updates changed while your updates were being prepared. Review the "

@@ -62,6 +62,10 @@ std::int64_t LedgerDimWakeThermalEmergencyCount() {
   return systemState()["dimWakeThermalEmergencyCount"].int64Value();
 }
 
+bool LedgerIsMainDisplayAsleep() {
+  return systemState()["displayAsleep"].boolValue();
+}
+
 bool LedgerOnRecoveryPartition() {
   return Environment::variableIfSet("__OSINSTALL_ENVIRONMENT").has_value();
 }

@@ -21,6 +21,11 @@ bool LedgerIsDimWake();
 // "dimWakeThermalEmergencyCount" (integer) of the same file; 0 when absent.
 std::int64_t LedgerDimWakeThermalEmergencyCount();
 
+// The main display sleeps, so a countdown put on it would go unseen. This
+// platform has no such state; it is "displayAsleep" (boolean) of the same
+// file, false when absent.
+bool LedgerIsMainDisplayAsleep();
+
 // The process runs from an OS install environment: the variable
 // __OSINSTALL_ENVIRONMENT is set, to any value, the empty one included.
 bool LedgerOnRecoveryPartition();

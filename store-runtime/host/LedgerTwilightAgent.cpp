@@ -116,4 +116,50 @@ void LedgerTwilightAgent::disarmObserver() {
   });
 }
 
+void LedgerTwilightAgent::answerRestartCountdown(std::int64_t result) {
+  TILL_LOG(2, "%@: The user answered the restart countdown with %ld", kSpeaker, result);
+  stateFile().updateDictionary(
+      [result](PlistDictionary& state) { state[std::string(kCountdownAnswerKey)] = result; });
+}
+
+namespace {
+
+bool sameDate(const PlistValue& stored, PlistDate date) {
+  return stored.date() && stored.date()->secondsSince1970 == date.secondsSince1970;
+}
+
+}  // namespace
+
+std::optional<LedgerTwilightAgent::Arming> LedgerTwilightAgent::currentArming() {
+  PlistValue state(stateFile().readDictionary());
+  if (!state[kArmedKey].boolValue() || !state[kArmedModeKey].isNumber() ||
+      !state[kArmedDateKey].date()) {
+    return std::nullopt;
+  }
+  Arming arming{state[kArmedModeKey].int64Value(), *state[kArmedDateKey].date()};
+  arming.handled = sameDate(state[kHandledArmedDateKey], arming.date);
+  arming.sawLimitedPower = sameDate(state[kLimitedPowerArmedDateKey], arming.date);
+  return arming;
+}
+
+bool LedgerTwilightAgent::markArmingHandled(PlistDate armedDate, std::string_view outcome) {
+  bool marked = false;
+  stateFile().updateDictionary([&](PlistDictionary& state) {
+    if (!sameDate(PlistValue(state)[kArmedDateKey], armedDate)) return;
+    state[std::string(kHandledArmedDateKey)] = armedDate;
+    state[std::string(kLaterOutcomeKey)] = std::string(outcome);
+    state[std::string(kLaterOutcomeDateKey)] = currentDate();
+    marked = true;
+  });
+  TILL_LOG(2, "%@: Later install %@%@", kSpeaker, outcome,
+           marked ? "" : ", but the agent was armed anew meanwhile");
+  return marked;
+}
+
+void LedgerTwilightAgent::noteLimitedPowerDuringArming(PlistDate armedDate) {
+  stateFile().updateDictionary([armedDate](PlistDictionary& state) {
+    state[std::string(kLimitedPowerArmedDateKey)] = armedDate;
+  });
+}
+
 }  // namespace larder

@@ -8,6 +8,7 @@
 #include "platform/log/TillLogManager.h"
 #include "platform/system/Mutex.h"
 #include "platform/system/Uuid.h"
+#include "store-runtime/host/LedgerSessionRestart.h"
 #include "store-runtime/host/PlatformStateFile.h"
 #include "store-runtime/sysup/SysupOperationPacer.h"
 #include "store-runtime/sysup/SysupStateReader.h"
@@ -159,6 +160,18 @@ class SysupQuaymartUpdateController::Implementation {
   // The state of the current file, parsed once per version of it.
   std::shared_ptr<const SysupUpdateState> currentState() { return reader_.read(stateFile()); }
 
+  // The first authorization stays: the process is given one at most.
+  bool setAuthorization(std::vector<std::string> rights) {
+    MutexLock lock(mutex_);
+    if (authorization_) return false;
+    authorization_ = std::move(rights);
+    return true;
+  }
+  std::optional<std::vector<std::string>> authorization() {
+    MutexLock lock(mutex_);
+    return authorization_;
+  }
+
  private:
   static bool storeScanResult(const PlatformStateFile& file, bool includingPrerelease) {
     std::size_t found = 0;
@@ -227,6 +240,7 @@ class SysupQuaymartUpdateController::Implementation {
   std::shared_ptr<DispatchQueue> workQueue_;
   Mutex mutex_;
   std::map<CancelToken, std::shared_ptr<SysupOperationPacer>> operations_ GUARDED_BY(mutex_);
+  std::optional<std::vector<std::string>> authorization_ GUARDED_BY(mutex_);
   SysupStateReader reader_;
   SysupUpdateObservers observers_{[this] { return reader_.read(stateFile())->availableUpdates(); }};
 };
@@ -391,7 +405,35 @@ bool SysupQuaymartUpdateController::installUpdatesAfterNextLogout(const UpdateLi
   });
   TILL_LOG(2, "%@: Install after logout of %zu updates: %@", kSpeaker, updates.size(),
            allAvailable ? "recorded" : "refused, not all are available");
-  return stored && allAvailable;
+  if (!stored || !allAvailable) return false;
+  if (restartingNow) endSessionForPostLogoutInstall(updates);
+  return true;
+}
+
+// The install happens at the logout; an update that needs a restart takes
+// the machine down with it.
+void SysupQuaymartUpdateController::endSessionForPostLogoutInstall(const UpdateList& updates) {
+  std::vector<std::string> keys;
+  bool restart = false;
+  for (const SysupQuaymartUpdate& update : updates) {
+    keys.push_back(update.productKey());
+    restart = restart || restartRequiredForProductKey(update.productKey());
+  }
+  LedgerSessionRestart::request(
+      restart ? LedgerSessionRestart::Kind::kRestart : LedgerSessionRestart::Kind::kLogout, keys);
+}
+
+void SysupQuaymartUpdateController::setAuthorization(std::vector<std::string> authorization) {
+  const std::size_t count = authorization.size();
+  if (implementation_->setAuthorization(std::move(authorization))) {
+    TILL_LOG(2, "%@: Authorized with %zu rights", kSpeaker, count);
+  } else {
+    TILL_LOG(1, "%@: An authorization is already set; the new one is ignored", kSpeaker);
+  }
+}
+
+std::optional<std::vector<std::string>> SysupQuaymartUpdateController::authorization() const {
+  return implementation_->authorization();
 }
 
 PlistDictionary SysupQuaymartUpdateController::takePostLogoutResults() {

@@ -121,6 +121,8 @@ class SysupQuaymartUpdateController {
 
   [[nodiscard]] bool isDownloadRequiredForPostLogoutUpdates(const UpdateList& updates) const;
   // Records the request; false when an update is no longer available.
+  // With `restartingNow`, the session is then ended (LedgerSessionRestart):
+  // a restart when one of the updates needs it, a logout otherwise.
   bool installUpdatesAfterNextLogout(const UpdateList& updates, bool restartingNow,
                                      bool nowIsLater);
 
@@ -133,7 +135,14 @@ class SysupQuaymartUpdateController {
   // that has only a product key.
   [[nodiscard]] bool restartRequiredForProductKey(std::string_view productKey) const;
 
+  // The authorization to install with: the rights the authorization
+  // controller was granted. The process gets one, once; a second is
+  // ignored with a log line.
+  void setAuthorization(std::vector<std::string> authorization);
+  [[nodiscard]] std::optional<std::vector<std::string>> authorization() const;
+
  private:
+  void endSessionForPostLogoutInstall(const UpdateList& updates);
   SysupQuaymartUpdateController();
   ~SysupQuaymartUpdateController();
   class Implementation;

@@ -224,6 +224,16 @@ void CommandLine::addOtherCommands() {
                           "software update agent does");
   backgroundScan->add_option("--info", backgroundScanInfo,
                              "send this JSON object instead of scanning");
+  auto* laterAgent = app_.add_subcommand(
+      "later-agent",
+      "the deferred-install agent: when the armed moment of a later install has come, tell the "
+      "service (NowIsLaterWithModeCountdownDeferred), or that it passed unused");
+  laterAgent
+      ->add_flag("--once", laterAgentOnce,
+                 "decide once and exit; the systemd timer larder-later.timer repeats it")
+      ->required();
+  laterAgent->add_option("--now", laterAgentNow,
+                         "decide as if it were this moment (ISO 8601; UTC without a zone)");
 }
 
 void CommandLine::addPreferenceCommands() {

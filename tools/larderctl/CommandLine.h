@@ -66,6 +66,9 @@ class CommandLine {
   std::string dmapFile;
   // background-scan
   std::optional<std::string> backgroundScanInfo;
+  // later-agent
+  bool laterAgentOnce = false;
+  std::optional<std::string> laterAgentNow;
   // notifications
   std::optional<std::string> activateNotification;
   std::optional<std::string> notificationAction;

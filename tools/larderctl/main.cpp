@@ -14,6 +14,7 @@
 #include "tools/larderctl/DialogCommand.h"
 #include "tools/larderctl/DmapDumpCommand.h"
 #include "tools/larderctl/ExitStatus.h"
+#include "tools/larderctl/LaterAgentCommand.h"
 #include "tools/larderctl/NotificationsCommand.h"
 #include "tools/larderctl/OSUpdatesCommand.h"
 #include "tools/larderctl/PreferencesCommand.h"
@@ -132,6 +133,13 @@ int runBackgroundScan(const CommandLine& line) {
   return BackgroundScanCommand(line.global.json).run(client, given);
 }
 
+int runLaterAgent(const CommandLine& line) {
+  // A wrong --now is a usage error, found before anything is decided.
+  const LaterAgentCommand::Clock::time_point now =
+      LaterAgentCommand::momentFrom(line.laterAgentNow);
+  return LaterAgentCommand(line.global.json, [&line] { return connect(line.global); }).run(now);
+}
+
 int runChosen(const CommandLine& line) {
   if (line.chose("dmap-dump")) return DmapDumpCommand(line.global.json).run(line.dmapFile);
   if (line.chose("prefs")) {
@@ -149,6 +157,7 @@ int runChosen(const CommandLine& line) {
   }
   if (line.chose("badge")) return runBadge(line);
   if (line.chose("background-scan")) return runBackgroundScan(line);
+  if (line.chose("later-agent")) return runLaterAgent(line);
   if (line.chose("notifications")) {
     ServiceClient client = connect(line.global);
     NotificationsCommand command(client, line.global.json);
