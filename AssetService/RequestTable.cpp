@@ -38,6 +38,10 @@ PlistArray wireForms(const std::vector<SysupQuaymartUpdate>& updates) {
   return wire;
 }
 
+PlistArray stringArray(const std::vector<std::string>& strings) {
+  return {strings.begin(), strings.end()};
+}
+
 std::vector<std::string> texts(const Arguments& arguments, std::size_t index) {
   std::vector<std::string> values;
   if (const PlistArray* array = arguments.at(index).array()) {
@@ -62,10 +66,11 @@ void withController(AssetServiceInterface& interface, std::string_view member,
 }
 
 // A request answered by the controller with one value.
-#define CONTROLLER_REPLY(member, expression)                                             \
-  [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {              \
-    (void)a;                                                                             \
-    withController(i, member, r, [&](UpdateController& c) { answer(r, {expression}); }); \
+#define CONTROLLER_REPLY(member, expression)                                                \
+  [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {                 \
+    (void)a;                                                                                \
+    withController(i, member, r,                                                            \
+                   [&]([[maybe_unused]] UpdateController& c) { answer(r, {expression}); }); \
   }
 // A request the controller carries out without a reply.
 #define CONTROLLER_CALL(member, statement)                                  \
@@ -233,15 +238,20 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
    CONTROLLER_CALL("SoftwareUpdateDidFinishBackgroundScanWithInfo", c.softwareUpdateDidFinishBackgroundScanWithInfo(a.at(0).dictionary() ? *a.at(0).dictionary() : PlistDictionary{}))},
 
   // Install later, automatic updates, major OS update.
-  {"RemoveUpdateFromInstallLaterWithBundleID", false, nullptr, kNothing},
+  {"RemoveUpdateFromInstallLaterWithBundleID", false,
+   CONTROLLER_CALL("RemoveUpdateFromInstallLaterWithBundleID", c.removeUpdateFromInstallLaterWithBundleID(text(a, 0)))},
   {"ShouldOfferDoItLaterForAvailableUpdates", false,
    CONTROLLER_REPLY("ShouldOfferDoItLaterForAvailableUpdates", c.shouldOfferDoItLaterForAvailableUpdates())},
-  {"InstallAvailableUpdatesLaterWithMode", false, nullptr, kNothing},
-  {"AppUpdatesToInstallLater", false, nullptr, kEmpty},
+  {"InstallAvailableUpdatesLaterWithMode", false,
+   CONTROLLER_CALL("InstallAvailableUpdatesLaterWithMode", c.installAvailableUpdatesLaterWithMode(a.at(0).int64Value()))},
+  {"AppUpdatesToInstallLater", false,
+   CONTROLLER_REPLY("AppUpdatesToInstallLater", stringArray(c.appUpdatesToInstallLater()))},
   {"CancelUpdatesToBeInstalledLater", false,
-   nullptr, kNothing},
-  {"NowIsLaterWithModeCountdownDeferred", false, nullptr, kNothing},
-  {"LaterDidNotOccurWithDueToACPower", false, nullptr, kNothing},
+   CONTROLLER_CALL("CancelUpdatesToBeInstalledLater", c.cancelUpdatesToBeInstalledLater())},
+  {"NowIsLaterWithModeCountdownDeferred", false,
+   CONTROLLER_CALL("NowIsLaterWithModeCountdownDeferred", c.nowIsLaterWithMode(a.at(0).int64Value(), a.at(1).boolValue()))},
+  {"LaterDidNotOccurWithDueToACPower", false,
+   CONTROLLER_CALL("LaterDidNotOccurWithDueToACPower", c.laterDidNotOccurWithDueToACPower(a.at(0).boolValue()))},
   {"InstalledUpdatesJournal", false, nullptr, kEmpty},
   {"IsAutoUpdateEnabled", false,
    CONTROLLER_REPLY("IsAutoUpdateEnabled", UpdateController::isAutoUpdatedEnabled())},

@@ -101,7 +101,7 @@ class UpdateController final : public UpdateQueueDelegate,
   void availableUpdatesDidChange() override;
   void disableDockBadgeUpdates() override;
   void enableDockBadgeUpdates() override;
-  void clearAvailableUpdatesBadgeCount();
+  void clearAvailableUpdatesBadgeCount() override;
   // The badge count last sent, if any.
   [[nodiscard]] std::optional<std::uint64_t> lastDockBadgeCount() const;
 
@@ -174,10 +174,6 @@ class UpdateController final : public UpdateQueueDelegate,
   [[nodiscard]] bool updatesAreInProgress() const override;
   void didRequestPostLogoutInstallOfUpdates() override;
   [[nodiscard]] bool hasRecentlyRequestedPostLogoutInstall() const;
-  [[nodiscard]] std::vector<std::string> appUpdatesToInstallLater() const override;
-  [[nodiscard]] bool appUpdatesToInstallLaterIncludesBundleID(
-      std::string_view bundleIdentifier) const override;
-  void cancelUpdatesToBeInstalledLater() override;
   [[nodiscard]] bool updateFailureNotificationIsDisplayed() const override;
   [[nodiscard]] UpdateNotificationCatalogue& notificationCatalogue() const override;
   [[nodiscard]] bool shouldOfferDoItLaterForAvailableUpdates() const;
@@ -187,6 +183,30 @@ class UpdateController final : public UpdateQueueDelegate,
   [[nodiscard]] const std::shared_ptr<OSUpdateCancelTokens>& osUpdateCancelTokens() const override {
     return osUpdateCancelTokens_;
   }
+
+  // --- Do It Later ---
+
+  // Modes of Do It Later.
+  static constexpr std::int64_t kLaterTonight = 1;
+  static constexpr std::int64_t kLaterInAnHour = 2;
+  static constexpr std::int64_t kLaterRemindTomorrow = 3;
+
+  // The user's wish to have the available updates installed later: tonight
+  // or in an hour fills the later lists and arms the deferred-install agent;
+  // tomorrow only makes the updates-available notification come due then.
+  void installAvailableUpdatesLaterWithMode(std::int64_t mode) override;
+  void installAvailableUpdatesLaterWithMode(std::int64_t mode, bool userInitiated);
+  [[nodiscard]] std::vector<std::string> appUpdatesToInstallLater() const override;
+  [[nodiscard]] bool appUpdatesToInstallLaterIncludesBundleID(
+      std::string_view bundleIdentifier) const override;
+  void removeUpdateFromInstallLaterWithBundleID(std::string_view bundleIdentifier);
+  [[nodiscard]] bool hasUpdatesToBeInstalledLater() const;
+  void cancelUpdatesToBeInstalledLater() override;
+  // The deferred-install agent's moment has come: a run installs what was
+  // put off. Returns the run enqueued, for tests.
+  std::shared_ptr<UpdateOperation> nowIsLaterWithMode(std::int64_t mode, bool countdownDeferred);
+  // The moment passed unused; the user hears why, the lists stay.
+  void laterDidNotOccurWithDueToACPower(bool dueToACPower);
 
   // --- Audits that notifications carry the key of ---
 
@@ -214,6 +234,13 @@ class UpdateController final : public UpdateQueueDelegate,
 
   // The journal is not part of this build: what it would be given is
   // logged, so that the decision can be seen.
+  // Do It Later steps.
+  [[nodiscard]] OSUpdateList osUpdatesToInstallLater();
+  bool userAcceptsAgreement(const SysupQuaymartUpdate& update, bool firmware);
+  void addAppUpdatesToInstallLater(const std::vector<LedgerUpdateRef>& updates);
+  void writeAppUpdatesToInstallLater(const std::vector<std::string>& bundleIdentifiers) const
+      REQUIRES(installLaterLock_);
+
   void appendCriticalUpdatesToJournal(const std::vector<PlistDictionary>& entries) const;
   void confirmPendingUpdatesInJournal(const std::vector<std::string>& productKeys) const;
 
@@ -227,6 +254,10 @@ class UpdateController final : public UpdateQueueDelegate,
       std::make_shared<OSUpdateCancelTokens>();
   UpdateControllerNotificationContext notificationContext_{*this};
   std::unique_ptr<UpdateNotificationCatalogue> notificationCatalogue_;
+
+  // Serialises the read, change and write of the stored later list, which
+  // the client's requests and the runs change from different threads.
+  mutable Mutex installLaterLock_;
 
   mutable Mutex osUpdateScanLock_;
   std::atomic<bool> osUpdateScanInProgress_{false};

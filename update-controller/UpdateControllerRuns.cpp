@@ -1,18 +1,14 @@
 // What the controller tells the runs it makes: whether updates are under
-// way, which app updates the user put off, and where installs are recorded.
+// way, whether the user agrees to a restart, and where installs are recorded.
 #include <algorithm>
 #include <chrono>
 
 #include "platform/dispatch/DispatchSemaphore.h"
 #include "platform/log/TillLogManager.h"
-#include "running-apps/AuthorizationController.h"
 #include "software-map/SoftwareMap.h"
-#include "store-runtime/core/DaemonDefaults.h"
-#include "store-runtime/core/PreferenceKeys.h"
 #include "store-runtime/dialogs/LedgerLocalizedString.h"
 #include "store-runtime/dialogs/VendDialog.h"
 #include "store-runtime/host/LedgerTwilightAgent.h"
-#include "store-runtime/host/PreferenceStore.h"
 #include "store-runtime/services/VendDownloadService.h"
 #include "store-runtime/services/VendUIService.h"
 #include "update-controller/UpdateController.h"
@@ -62,34 +58,6 @@ void UpdateController::didRequestPostLogoutInstallOfUpdates() {
 bool UpdateController::hasRecentlyRequestedPostLogoutInstall() const {
   const double requested = lastLogoutRequestedDate_.load();
   return requested > 0 && secondsSinceEpoch() - requested < kPostLogoutRequestSeconds;
-}
-
-std::vector<std::string> UpdateController::appUpdatesToInstallLater() const {
-  std::vector<std::string> identifiers;
-  const PlistValue value = PreferenceStore::valueForKey(kDefaultsAppUpdatesToInstallLaterKey,
-                                                        kDaemonDefaultsID, PreferenceScope::User);
-  if (const PlistArray* array = value.array()) {
-    for (const PlistValue& element : *array) {
-      if (const std::string* identifier = element.string()) identifiers.push_back(*identifier);
-    }
-  }
-  return identifiers;
-}
-
-bool UpdateController::appUpdatesToInstallLaterIncludesBundleID(
-    std::string_view bundleIdentifier) const {
-  const std::vector<std::string> later = appUpdatesToInstallLater();
-  return std::ranges::find(later, bundleIdentifier) != later.end();
-}
-
-// Asks for the authorization first, as every change of the later lists
-// does, but goes on without it: a cancel must never leave updates armed.
-void UpdateController::cancelUpdatesToBeInstalledLater() {
-  (void)AuthorizationController::sharedInstance().authorizeForSoftwareInstall();
-  SysupQuaymartUpdateController::sharedUpdateController().removeAllUpdatesFromInstallLater();
-  (void)PreferenceStore::setValue(kDefaultsAppUpdatesToInstallLaterKey, PlistArray{},
-                                  kDaemonDefaultsID, PreferenceScope::User);
-  LedgerTwilightAgent::disarmObserver();
 }
 
 // The dialog's texts say whether the updates still have to download before

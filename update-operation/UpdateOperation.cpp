@@ -391,57 +391,6 @@ void UpdateOperation::resetTimestamps() {
   }
 }
 
-// --- Restart and Do It Later ---
-
-bool UpdateOperation::prepareSystemForDoItLater() {
-  // Runs at the moment the user chose are made by the install-later store,
-  // which this build does not have; nothing makes such a run yet.
-  TILL_LOG(1, "%@: Preparation for Do It Later is not part of this build; going on", kSpeaker);
-  return true;
-}
-
-void UpdateOperation::restartToInstallUpdates() {
-  TILL_LOG(1,
-           "%@: Restart to install %@ is not part of this build; the updates wait for the next "
-           "logout",
-           kSpeaker, describeList(runState().osUpdatesToInstallOnRestart));
-  if (SysupQuaymartUpdateController::sharedUpdateController().installUpdatesAfterNextLogout(
-          runState().osUpdatesToInstallOnRestart, false, settings().nowIsLater)) {
-    if (std::shared_ptr<UpdateOperationController> controller = updateController()) {
-      controller->didRequestPostLogoutInstallOfUpdates();
-    }
-  }
-}
-
-// The end of a Do It Later run that did not restart: what was put off and
-// is still not installed is a failure the user hears of, unless it only
-// waits for its time (abort codes 500 to 599). The later lists are emptied
-// either way.
-void UpdateOperation::showDoItLaterFailureAlert() {
-  std::shared_ptr<UpdateOperationController> controller = updateController();
-  if (!controller) return;
-  const std::shared_ptr<const UpdateQueue::UpdateList> available =
-      controller->updateQueue()->availableUpdates();
-  const bool appLeftUndone = std::ranges::any_of(*available, [&](const LedgerUpdateRef& update) {
-    const std::int64_t code = update->autoUpdateAbortCode();
-    return update->bundleID() &&
-           controller->appUpdatesToInstallLaterIncludesBundleID(*update->bundleID()) &&
-           (code < 500 || code > 599);
-  });
-  const bool osLeftUndone =
-      !SysupQuaymartUpdateController::sharedUpdateController().updatesToBeInstalledLater().empty();
-  controller->cancelUpdatesToBeInstalledLater();
-  if (appLeftUndone || osLeftUndone) {
-    controller->notificationCatalogue().postDoItLaterFailedNotificationWithAuditInfo(auditInfo());
-  }
-}
-
-void UpdateOperation::relaunchTerminatedApplications() {
-  for (const std::shared_ptr<AppHelper>& helper : runState().relaunchAppHelpers) {
-    if (helper->needsRelaunch()) helper->relaunchTerminatedApps();
-  }
-}
-
 // --- The audit file ---
 
 std::string UpdateOperation::auditFilePath() {

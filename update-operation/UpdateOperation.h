@@ -195,8 +195,18 @@ class UpdateOperation : public VendOperation {
   void checkUpdateQueue(UpdateQueue& queue);
   void resetTimestamps();
   void considerRestartRequiredAutoInstall(UpdateOperationController& controller);
+  // --- Restart and Do It Later ---
   bool prepareSystemForDoItLater();
+  bool downloadLaterUpdatesNow(const std::vector<SysupQuaymartUpdate>& later);
+  void takeFinalSnapshot();
+  bool quitAllApplicationsForRestart(const std::vector<SysupQuaymartUpdate>& later);
+  void auditUpdatesBlockedByApplications(
+      const std::vector<SysupQuaymartUpdate>& later,
+      const std::vector<std::shared_ptr<RunningApplication>>& blockers);
+  // Shows the countdown and acts on the user's choice; true to restart.
+  bool shouldRestartAfterShowingRestartCountdown();
   void restartToInstallUpdates();
+  void showUpdatesChangedDialog();
   void showDoItLaterFailureAlert();
   void relaunchTerminatedApplications();
   void writeAuditInfoToDisk() const;

@@ -44,6 +44,7 @@ class UpdateOperationController : public UpdatePolicy {
   [[nodiscard]] virtual SoftwareMap& softwareMap() const = 0;
 
   virtual void disableDockBadgeUpdates() = 0;
+  virtual void clearAvailableUpdatesBadgeCount() = 0;
   virtual void enableDockBadgeUpdates() = 0;
   [[nodiscard]] virtual std::uint64_t availableUpdatesBadgeCount() const = 0;
 
@@ -59,6 +60,9 @@ class UpdateOperationController : public UpdatePolicy {
       std::string_view bundleIdentifier) const = 0;
   // Empties both later lists and disarms the deferred-install agent.
   virtual void cancelUpdatesToBeInstalledLater() = 0;
+  // The user's choice at the end of a restart countdown: 1 tonight, 2 in an
+  // hour, 3 remind tomorrow.
+  virtual void installAvailableUpdatesLaterWithMode(std::int64_t mode) = 0;
   [[nodiscard]] virtual bool updateFailureNotificationIsDisplayed() const = 0;
   // What the controller posts to the user, and takes away.
   [[nodiscard]] virtual UpdateNotificationCatalogue& notificationCatalogue() const = 0;

@@ -256,7 +256,9 @@ TEST_F(CloudLibraryTest, FirstFetchLeavesOutWhatTheClientHoldsAndKindsItDidNotAs
 TEST_F(CloudLibraryTest, StoreThatNeverAnswersTimesOutAndTheNextTickPollsAgain) {
   writeLibrary({revision(4, {libraryItem(3001, "Never seen")})},
                {{"update-polling-frequency-secs", 1}});
-  startStore({"daap-update=stall"}, 1);
+  // Short enough for three polls in the wait below, long enough for the
+  // bag and the sign-in on a loaded machine.
+  startStore({"daap-update=stall"}, 3);
   signIn();
   auto client = makeClient();
   client->startUpdatingWithLocalVersion(1);

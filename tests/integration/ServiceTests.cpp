@@ -349,7 +349,10 @@ TEST_F(ServiceTest, ObserversHearChangesAndAGoneClientCostsNothing) {
   auto updater = connectClient(bus);
   updater->call("ProductAtPathWillBeUpdatedToBundleVersionStoreVersion",
                 {foo, "2.0", std::int64_t{9}});
-  TemporaryPlatform::writePurchaseRecord(foo, "com.example.foo", "2.0", 5, 9);
+  // The whole bundle is replaced, as an install does: a scan that comes
+  // after the announcement finds 2.0 too, not a record that says 2.0 beside
+  // an information list that still says 1.0.
+  platform.installBundle({applications(), "Foo", "com.example.foo", "2.0", 5, 9});
   updater->call("ProductAtPathWasUpdatedToBundleVersionStoreVersion",
                 {foo, true, "2.0", std::int64_t{9}});
 

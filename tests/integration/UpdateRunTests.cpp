@@ -21,6 +21,7 @@
 #include "store-runtime/core/PreferenceKeys.h"
 #include "store-runtime/dialogs/LedgerLocalizedString.h"
 #include "store-runtime/download/VendFileManager.h"
+#include "store-runtime/host/LedgerTwilightAgent.h"
 #include "store-runtime/host/PlatformStateFile.h"
 #include "store-runtime/host/PreferenceStore.h"
 #include "store-runtime/services/VendOperationQueue.h"
@@ -711,6 +712,83 @@ TEST_F(UpdateRunTest, AtTheChosenMomentTheAppIsQuitInstalledAndStartedAgain) {
   ASSERT_TRUE(audit.has_value());
   EXPECT_TRUE(PlistValue(*audit)["appUpdates"][std::to_string(kAtlasID)].dictionary());
   EXPECT_TRUE(controller_->appUpdatesToInstallLater().empty());
+}
+
+// A restart-required OS update put off to later: each way through the
+// preparation, the countdown and the request to install after logout.
+TEST_F(UpdateRunTest, ADoItLaterRestartIsPreparedCountedDownAndHandedToTheFramework) {
+  struct Case {
+    const char* name;
+    std::int64_t mode;
+    bool deferred;
+    int users;
+    bool displayAsleep;
+    std::optional<std::int64_t> countdownAnswer;
+    bool restartRequested;
+    std::int64_t countdowns;
+    bool logoutFailed;
+    std::optional<std::int64_t> armedAfter;
+  } const cases[] = {
+      {"in an hour, alone", 2, false, 1, false, std::nullopt, true, 1, false, 2},
+      {"in an hour, others logged in", 2, false, 2, false, std::nullopt, false, 0, true,
+       std::nullopt},
+      {"tonight, countdown deferred, display asleep", 1, true, 1, true, std::nullopt, true, 1,
+       false, 1},
+      // The choice is stored by a new later request, and the same run's end
+      // empties the lists again, as the end of every Do It Later run
+      // without restart does.
+      {"tonight, the user stops the countdown for tonight", 1, true, 1, false, 3, false, 1, true,
+       std::nullopt},
+  };
+  startEverything();
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    offerOSUpdates(PlistArray{PlistDictionary{{"productKey", "KERNEL-3"},
+                                              {"isRecommended", true},
+                                              {"restartRequired", true},
+                                              {"allowedToUseInstallLater", true}}});
+    ASSERT_TRUE(PlatformStateFile::named("sessions.plist").updateValue([&](PlistValue& value) {
+      PlistArray sessions;
+      for (int user = 0; user < c.users; ++user) {
+        sessions.emplace_back(
+            PlistDictionary{{"user", "u" + std::to_string(user)}, {"state", "active"}});
+      }
+      value = sessions;
+    }));
+    ASSERT_TRUE(PlatformStateFile::named("system-state.plist")
+                    .updateDictionary(
+                        [&](PlistDictionary& state) { state["displayAsleep"] = c.displayAsleep; }));
+    ASSERT_TRUE(
+        PlatformStateFile::named("twilight.plist").updateDictionary([&](PlistDictionary& state) {
+          state = {};
+          if (c.countdownAnswer) state["countdownAnswer"] = *c.countdownAnswer;
+        }));
+    ASSERT_TRUE(PlatformStateFile::named(SysupQuaymartUpdateController::kStateFileName)
+                    .updateDictionary([](PlistDictionary& state) { state.erase("postLogout"); }));
+    UpdatePolicy::setLastDoItLaterLogoutFailed(false);
+    controller_->installAvailableUpdatesLaterWithMode(c.mode);
+
+    auto restartRequests = [] {
+      const PlistValue requests(PlatformStateFile::named("restart-requests.plist").read());
+      return requests.array() ? requests.array()->size() : 0;
+    };
+    const std::size_t requestsBefore = restartRequests();
+    std::shared_ptr<UpdateOperation> run = controller_->nowIsLaterWithMode(c.mode, c.deferred);
+    VendOperationQueue::mainQueue().waitUntilAllOperationsAreFinished();
+
+    const PlistValue postLogout(
+        PlatformStateFile::named(SysupQuaymartUpdateController::kStateFileName).readDictionary());
+    EXPECT_EQ(postLogout["postLogout"]["KERNEL-3"]["restartingNow"].boolValue(),
+              c.restartRequested);
+    EXPECT_EQ(restartRequests(), requestsBefore + (c.restartRequested ? 1 : 0));
+    const PlistValue agent(PlatformStateFile::named("twilight.plist").readDictionary());
+    EXPECT_EQ(agent["countdownCount"].int64Value(), c.countdowns);
+    EXPECT_EQ(UpdatePolicy::lastDoItLaterLogoutFailed(), c.logoutFailed);
+    EXPECT_EQ(LedgerTwilightAgent::armedMode(), c.armedAfter);
+    // Only a night restart takes the snapshot, and keeps it for the restart.
+    EXPECT_EQ(run->runState().didSnapshotTAL, c.restartRequested && c.mode == 1);
+    controller_->cancelUpdatesToBeInstalledLater();
+  }
 }
 
 }  // namespace

@@ -190,6 +190,7 @@ void CommandLine::addUpdateCommands() {
       ->expected(1, -1);
   osUpdates->add_flag("--unhide-all", this->osUpdates.unhideAll,
                       "show every hidden OS update again");
+  addLaterCommand();
   app_.add_subcommand("badge", "print the count the store application shows on its badge");
   app_.add_subcommand("runs",
                       "show what the update machinery is doing and what its last background run "
@@ -213,6 +214,19 @@ void CommandLine::addUpdateCommands() {
                    ? std::string()
                    : "must be default, action, other or a menu entry number";
       });
+}
+
+void CommandLine::addLaterCommand() {
+  auto* later = app_.add_subcommand(
+      "later",
+      "install the available updates later: tonight, in an hour, or be reminded tomorrow; "
+      "--list shows what waits (exit status 3: nothing), --cancel drops it");
+  auto* when = later->add_option("when", this->later.when, "tonight, hour or tomorrow")
+                   ->check(CLI::IsMember({"tonight", "hour", "tomorrow"}));
+  auto* list = later->add_flag("--list", this->later.list, "show what waits for later");
+  auto* cancel = later->add_flag("--cancel", this->later.cancel, "install nothing later");
+  when->excludes(cancel);
+  list->excludes(cancel);
 }
 
 void CommandLine::addOtherCommands() {

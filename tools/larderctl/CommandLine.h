@@ -8,6 +8,7 @@
 
 #include "tools/larderctl/DialogAgentCommand.h"
 #include "tools/larderctl/DialogCommand.h"
+#include "tools/larderctl/LaterCommand.h"
 #include "tools/larderctl/OSUpdatesCommand.h"
 #include "tools/larderctl/PreferencesOptions.h"
 
@@ -72,6 +73,8 @@ class CommandLine {
   // notifications
   std::optional<std::string> activateNotification;
   std::optional<std::string> notificationAction;
+  // later
+  LaterOptions later;
   // prefs get|set|delete
   PreferencesOptions preferences;
   // The subcommand of a command that has them ("get" of "prefs get").
@@ -82,6 +85,7 @@ class CommandLine {
   void addSoftwareMapCommands();
   void addDialogCommands();
   void addStoreCommands();
+  void addLaterCommand();
   void addOtherCommands();
   void addPreferenceCommands();
   void addUpdateCommands();

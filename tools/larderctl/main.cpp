@@ -15,6 +15,7 @@
 #include "tools/larderctl/DmapDumpCommand.h"
 #include "tools/larderctl/ExitStatus.h"
 #include "tools/larderctl/LaterAgentCommand.h"
+#include "tools/larderctl/LaterCommand.h"
 #include "tools/larderctl/NotificationsCommand.h"
 #include "tools/larderctl/OSUpdatesCommand.h"
 #include "tools/larderctl/PreferencesCommand.h"
@@ -165,6 +166,10 @@ int runChosen(const CommandLine& line) {
       return command.activate(*line.activateNotification, line.notificationAction);
     }
     return command.list();
+  }
+  if (line.chose("later")) {
+    ServiceClient client = connect(line.global);
+    return LaterCommand(client, line.global.json).run(line.later);
   }
   if (line.chose("runs")) {
     ServiceClient client = connect(line.global);

@@ -7,10 +7,13 @@
 #include "ServiceTestSupport.h"
 #include "notifications/center/UserNotificationCenter.h"
 #include "platform/dispatch/DispatchQueue.h"
+#include "platform/system/FileIO.h"
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/PreferenceKeys.h"
+#include "store-runtime/dialogs/LedgerLocalizedString.h"
 #include "store-runtime/download/VendFileManager.h"
 #include "store-runtime/host/LedgerDistributedNotificationCenter.h"
+#include "store-runtime/host/LedgerTwilightAgent.h"
 #include "store-runtime/host/PlatformStateFile.h"
 #include "store-runtime/host/PreferenceStore.h"
 #include "store-runtime/runtime/VendRuntime.h"
@@ -113,11 +116,10 @@ class UpdateControllerTest : public ServiceTest {
   UpdateController& controller(std::int64_t clientType = 0) {
     VendStoreClient client = VendStoreClient::fromDictionary(
         {{"identifier", "test-client-" + std::to_string(++clients_)}, {"clientType", clientType}});
-    controller_ =
-        UpdateController::make(client, *map_,
-                               UserNotificationCenter::makeForTesting(
-                                   "com.orvane.larderd", UserNotificationCenter::kSystemCenter,
-                                   temporary() + "/notifications.plist"));
+    center_ = UserNotificationCenter::makeForTesting(
+        "com.orvane.larderd", UserNotificationCenter::kSystemCenter,
+        temporary() + "/notifications-" + std::to_string(clients_) + ".plist");
+    controller_ = UpdateController::make(client, *map_, center_);
     return *controller_;
   }
 
@@ -137,6 +139,7 @@ class UpdateControllerTest : public ServiceTest {
   }
 
   std::optional<SoftwareMap> map_;
+  std::shared_ptr<UserNotificationCenter> center_;
   std::shared_ptr<UpdateController> controller_;
   int clients_ = 0;
 };
@@ -470,6 +473,185 @@ TEST_F(UpdateControllerTest, TheRestartIsConfirmedOnlyByItsRestartButton) {
   VendRuntime::shared()->setDialogPresenter(nullptr);
   // Nobody to ask: not now.
   EXPECT_FALSE(updates.confirmRestartWithUpdatesWillDownload(false));
+}
+
+// --- Do It Later ---
+
+class DoItLaterTest : public UpdateControllerTest {
+ protected:
+  void SetUp() override {
+    UpdateControllerTest::SetUp();
+    onMains(true);
+    loggedInUsers(1);
+  }
+
+  void onMains(bool mains) const {
+    writeText("sys/class/power_supply/AC/type", "Mains\n");
+    writeText("sys/class/power_supply/AC/online", mains ? "1\n" : "0\n");
+  }
+  void loggedInUsers(int count) const {
+    PlistArray sessions;
+    for (int user = 0; user < count; ++user) {
+      sessions.emplace_back(
+          PlistDictionary{{"user", "user" + std::to_string(user)}, {"state", "active"}});
+    }
+    ASSERT_TRUE(PlatformStateFile::named("sessions.plist").updateValue([&](PlistValue& value) {
+      value = sessions;
+    }));
+  }
+  void writeText(const std::string& rootedPath, std::string_view text) const {
+    const fs::path path = fs::path(temporary()) / "root" / rootedPath;
+    fs::create_directories(path.parent_path());
+    ASSERT_TRUE(FileIO::writeAtomically(path.string(), text));
+  }
+  static std::vector<std::string> osLaterKeys() {
+    std::vector<std::string> keys;
+    for (const SysupQuaymartUpdate& update :
+         SysupQuaymartUpdateController::sharedUpdateController().updatesToBeInstalledLater()) {
+      keys.push_back(update.productKey());
+    }
+    return keys;
+  }
+  static std::vector<std::string> storedAppLater() {
+    std::vector<std::string> identifiers;
+    const PlistValue stored = PreferenceStore::valueForKey(
+        kDefaultsAppUpdatesToInstallLaterKey, kDaemonDefaultsID, PreferenceScope::User);
+    if (const PlistArray* array = stored.array()) {
+      for (const PlistValue& value : *array) identifiers.push_back(*value.string());
+    }
+    return identifiers;
+  }
+  [[nodiscard]] std::vector<std::string> titles() const {
+    std::vector<std::string> list;
+    for (const UserNotification& notification : center_->deliveredNotifications()) {
+      list.push_back(notification.title);
+    }
+    return list;
+  }
+  [[nodiscard]] std::string text(std::string_view key) const {
+    return LedgerLocalizedString(key, &controller_->storeClient());
+  }
+};
+
+// Tomorrow makes the updates-available notification come due in 24 hours
+// whatever its interval, and touches nothing else.
+TEST_F(DoItLaterTest, TomorrowOnlyMakesTheNotificationComeDueInADay) {
+  setPreference(kDefaultsAppUpdatesToInstallLaterKey, PlistArray{"com.example.kept"},
+                kDaemonDefaultsID, PreferenceScope::User);
+  for (const auto& [interval, offset] : {std::pair{604800.0, -518400.0}, {3600.0, 82800.0}}) {
+    setPreference(kDefaultsAvailableUpdatesNotificationIntervalKey, interval, kDaemonDefaultsID,
+                  PreferenceScope::System);
+    UpdateController& updates = controller();
+    updates.installAvailableUpdatesLaterWithMode(UpdateController::kLaterRemindTomorrow);
+    const std::optional<PlistDate> stored = PreferenceStore::dateForKey(
+        kDefaultsDidPostUpdatesAvailableNotificationDateKey, kDaemonDefaultsID);
+    ASSERT_TRUE(stored);
+    EXPECT_NEAR(stored->secondsSince1970 - secondsAgo(0).secondsSince1970, offset, 5);
+    EXPECT_FALSE(updates.isTimeToPostUpdatesAvailableNotification());
+  }
+  EXPECT_FALSE(LedgerTwilightAgent::armedMode());
+  EXPECT_EQ(storedAppLater(), std::vector<std::string>{"com.example.kept"});
+}
+
+// The later lists take every app update of the queue, in place of the
+// earlier list, and the OS updates that may wait: recommended, needing no
+// restart or opted in, texts accepted.
+TEST_F(DoItLaterTest, TonightFillsBothListsAndArmsTheAgent) {
+  PlistDictionary noBundle = appUpdate(3);
+  noBundle.erase("bundle-id");
+  cacheAppUpdates({appUpdate(1), appUpdate(2), noBundle});
+  setPreference(kDefaultsAppUpdatesToInstallLaterKey, PlistArray{"com.example.earlier"},
+                kDaemonDefaultsID, PreferenceScope::User);
+  offerOSUpdates({osUpdate("PLAIN", {{"isRecommended", true}}),
+                  osUpdate("RESTART", {{"isRecommended", true}, {"restartRequired", true}}),
+                  osUpdate("OPTED", {{"isRecommended", true},
+                                     {"restartRequired", true},
+                                     {"allowedToUseInstallLater", true}}),
+                  osUpdate("OPTIONAL"),
+                  osUpdate("FIRMWARE", {{"isRecommended", true}, {"firmwareWarning", "Plug in."}}),
+                  osUpdate("LICENCE", {{"isRecommended", true}, {"licenseAgreement", "Terms."}})});
+  UpdateController& updates = controller();
+  auto presenter = std::make_shared<AnsweringDialogPresenter>(VendDialogButton::kCancel);
+  VendRuntime::shared()->setDialogPresenter(presenter);
+  updates.installAvailableUpdatesLaterWithMode(UpdateController::kLaterTonight);
+  VendRuntime::shared()->setDialogPresenter(nullptr);
+
+  EXPECT_EQ(osLaterKeys(), (std::vector<std::string>{"PLAIN", "OPTED"}));
+  EXPECT_EQ(storedAppLater(), (std::vector<std::string>{"com.example.app1", "com.example.app2"}));
+  EXPECT_EQ(presenter->shown().size(), 2u);  // the firmware warning, then the licence
+  EXPECT_EQ(LedgerTwilightAgent::armedMode(), UpdateController::kLaterTonight);
+  EXPECT_TRUE(updates.hasUpdatesToBeInstalledLater());
+  EXPECT_TRUE(titles().empty());  // on mains power, alone: nothing stands in the way
+
+  updates.removeUpdateFromInstallLaterWithBundleID("com.example.app1");
+  EXPECT_EQ(updates.appUpdatesToInstallLater(), std::vector<std::string>{"com.example.app2"});
+  updates.cancelUpdatesToBeInstalledLater();
+  EXPECT_FALSE(updates.hasUpdatesToBeInstalledLater());
+  EXPECT_FALSE(LedgerTwilightAgent::armedMode());
+}
+
+// What would keep the install from happening is told when the user asked;
+// other users logged in outweigh the battery.
+TEST_F(DoItLaterTest, TheHelperNotificationSaysWhatStandsInTheWay) {
+  offerOSUpdates({osUpdate("PLAIN", {{"isRecommended", true}})});
+  struct Case {
+    bool mains;
+    int users;
+    const char* titleKey;
+  } const cases[] = {{false, 1, "DOITLATER_HELPER_POWER_TITLE"},
+                     {false, 2, "DOITLATER_HELPER_OTHER_USERS_TITLE"},
+                     {true, 2, "DOITLATER_HELPER_OTHER_USERS_TITLE"}};
+  for (const Case& c : cases) {
+    onMains(c.mains);
+    loggedInUsers(c.users);
+    UpdateController& updates = controller();
+    updates.installAvailableUpdatesLaterWithMode(UpdateController::kLaterInAnHour);
+    EXPECT_EQ(titles(), std::vector<std::string>{text(c.titleKey)}) << c.titleKey;
+    EXPECT_EQ(LedgerTwilightAgent::armedMode(), UpdateController::kLaterInAnHour);
+    updates.cancelUpdatesToBeInstalledLater();
+  }
+  // Asked for by the machine rather than the user: armed, nothing posted.
+  onMains(false);
+  loggedInUsers(1);
+  UpdateController& updates = controller();
+  updates.installAvailableUpdatesLaterWithMode(UpdateController::kLaterTonight, false);
+  EXPECT_TRUE(titles().empty());
+  EXPECT_EQ(LedgerTwilightAgent::armedMode(), UpdateController::kLaterTonight);
+}
+
+TEST_F(DoItLaterTest, NothingToPutOffArmsNothing) {
+  offerOSUpdates({osUpdate("OPTIONAL")});
+  controller().installAvailableUpdatesLaterWithMode(UpdateController::kLaterTonight);
+  EXPECT_FALSE(LedgerTwilightAgent::armedMode());
+  EXPECT_TRUE(storedAppLater().empty());
+}
+
+// The agent's moment makes a run of what was put off; a missed moment
+// tells the user why, with the reason in the audit the notification keeps.
+TEST_F(DoItLaterTest, TheAgentsMomentMakesARunAndAMissedOneIsTold) {
+  offerOSUpdates({osUpdate("PLAIN", {{"isRecommended", true}})});
+  UpdateController& updates = controller();
+  updates.installAvailableUpdatesLaterWithMode(UpdateController::kLaterInAnHour);
+  updates.laterDidNotOccurWithDueToACPower(true);
+  const std::vector<UserNotification> delivered = center_->deliveredNotifications();
+  ASSERT_EQ(delivered.size(), 1u);
+  const PlistValue info(delivered.front().userInfo);
+  EXPECT_TRUE(info["isDoItLaterFailure"].boolValue());
+  const std::optional<PlistDictionary> audit =
+      updates.cachedUpdateAuditInfoWithKey(*info["auditInfoCacheKey"].string());
+  ASSERT_TRUE(audit);
+  EXPECT_TRUE(PlistValue(*audit)["missedLaterWindow"].boolValue());
+  EXPECT_TRUE(PlistValue(*audit)["dueToNotBeingOnACPower"].boolValue());
+  EXPECT_EQ(osLaterKeys(), std::vector<std::string>{"PLAIN"});  // the lists stay
+
+  std::shared_ptr<UpdateOperation> run = updates.nowIsLaterWithMode(2, true);
+  const UpdateOperationSettings s = run->settings();
+  EXPECT_TRUE(s.nowIsLater);
+  EXPECT_EQ(s.doItLaterMode, 2);
+  EXPECT_TRUE(s.restartCountdownWasDeferred);
+  ASSERT_TRUE(s.osUpdatesToInstallLater);
+  ASSERT_EQ(s.osUpdatesToInstallLater->size(), 1u);
+  EXPECT_EQ(s.osUpdatesToInstallLater->front().productKey(), "PLAIN");
 }
 
 }  // namespace
