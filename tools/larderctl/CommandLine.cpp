@@ -56,7 +56,8 @@ CommandLine::CommandLine() : app_("talk to the larder store service", "larderctl
   app_.set_version_flag("--version", LARDER_VERSION, "print the version and exit");
   app_.footer(
       "Exit status: 0 success; 1 the operation failed or the service could not be reached; 2 "
-      "the command line was wrong; 3 nothing to do (updates: none available).");
+      "the command line was wrong; 3 nothing to do (updates: none available; install: nothing to "
+      "install).");
   addGlobalOptions();
   addSoftwareMapCommands();
   addDialogCommands();

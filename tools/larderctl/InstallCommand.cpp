@@ -35,9 +35,10 @@ bool isError(const PlistValue& error) {
 
 }  // namespace
 
-InstallCommand::InstallCommand(ServiceClient& client, bool json) : client_(client), json_(json) {
+InstallCommand::InstallCommand(ServiceClient& client, ServiceClient& runner, bool json)
+    : client_(client), runner_(runner), json_(json) {
   // Exported before any start, so that no word of the run can slip by.
-  client_.exportCallbackObject(kDelegatePath, "VendUpdateDelegate",
+  runner_.exportCallbackObject(kDelegatePath, "VendUpdateDelegate",
                                "AppUpdateFinishedPurchaseWithSuccessErrorResponse",
                                "a{sv}ba{sv}a{sv}", [inbox = inbox_](const PlistArray& arguments) {
                                  MutexLock lock(inbox->mutex);
@@ -106,7 +107,7 @@ int InstallCommand::startUpdates(const Choice& choice) {
   // The reply comes when the run has ended; the progress is drawn meanwhile.
   std::future<PlistArray> reply =
       std::async(std::launch::async, [this, apps = choice.apps, os = choice.osUpdates] {
-        return client_.call("StartAppUpdatesAndOSUpdatesWithDelegate",
+        return runner_.call("StartAppUpdatesAndOSUpdatesWithDelegate",
                             {apps, os, std::string(kDelegatePath)}, kRunTimeoutMicroseconds);
       });
   std::map<std::uint64_t, std::string> titles;

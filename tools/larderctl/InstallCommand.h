@@ -32,7 +32,10 @@ class InstallCommand {
   // A run waits for quit dialogs, downloads and installs.
   static constexpr std::uint64_t kRunTimeoutMicroseconds = 3600ULL * 1'000'000ULL;
 
-  InstallCommand(ServiceClient& client, bool json);
+  // `runner` makes the start and hears the delegate, on a connection of
+  // its own, while `client` follows the downloads: a connection is used by
+  // one thread at a time.
+  InstallCommand(ServiceClient& client, ServiceClient& runner, bool json);
 
   int run(const InstallOptions& options);
   // `larderctl cancel KEY...`: cancels the OS update installs of these keys.
@@ -57,6 +60,7 @@ class InstallCommand {
   bool reportOS(const PlistValue& update, bool success, const PlistValue& runError) const;
 
   ServiceClient& client_;
+  ServiceClient& runner_;
   bool json_;
   std::shared_ptr<Inbox> inbox_ = std::make_shared<Inbox>();
 };

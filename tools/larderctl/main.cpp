@@ -164,7 +164,8 @@ int runChosen(const CommandLine& line) {
   }
   if (line.chose("install") || line.chose("cancel")) {
     ServiceClient client = connect(line.global);
-    InstallCommand install(client, line.global.json);
+    ServiceClient runner = connect(line.global);
+    InstallCommand install(client, runner, line.global.json);
     return line.chose("install") ? install.run(line.install) : install.cancel(line.cancelKeys);
   }
   if (line.chose("updates")) {
