@@ -133,5 +133,20 @@ TEST_F(InstallCommandTest, ACancelledQuitChangesNothingAndTheDelegateHearsIt) {
   (void)reply;
 }
 
+// A cancel names product keys; one without a running install is passed
+// over, and the command still succeeds.
+TEST_F(InstallCommandTest, ACancelOfAKeyWithoutInstallIsLoggedAndPassedOver) {
+  start();
+  const LarderctlRun cancelled = run({"cancel", "NOT-RUNNING"});
+  EXPECT_EQ(cancelled.status, 0) << cancelled.errors;
+  EXPECT_TRUE(service_->waitForLog("No cancelToken for update NOT-RUNNING")) << service_->log();
+  const LarderctlRun nothing = run({"install", "--critical"});
+  EXPECT_EQ(nothing.status, 3) << nothing.errors;
+  const LarderctlRun unknown = run({"install", "424242"});
+  EXPECT_EQ(unknown.status, 1);
+  EXPECT_NE(unknown.errors.find("item 424242 is not an available update"), std::string::npos)
+      << unknown.errors;
+}
+
 }  // namespace
 }  // namespace larder::testing

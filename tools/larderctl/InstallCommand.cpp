@@ -219,8 +219,10 @@ int InstallCommand::installByTags(const InstallOptions& options) {
 }
 
 int InstallCommand::cancel(const std::vector<std::string>& productKeys) {
+  // One argument, the array: spelled out, since braces around a lone
+  // array would copy it instead.
   client_.call("CancelOSUpdatesWithProductKeys",
-               {PlistArray(productKeys.begin(), productKeys.end())});
+               PlistArray{PlistValue(PlistArray(productKeys.begin(), productKeys.end()))});
   if (!json_) {
     std::cout << "asked to cancel the installs of " << productKeys.size() << " OS update"
               << (productKeys.size() == 1 ? "" : "s") << std::endl;

@@ -149,14 +149,16 @@ class UpdateControllerStartTest : public ServiceTest {
                       state = {{"freeBytes", freeBytes}, {"timeoutSeconds", timeoutSeconds}};
                     }));
   }
-  // Two OS updates of 1000 bytes each, offered and found by a scan.
+  // Two OS updates of 1000 bytes each, offered and found by a scan; both
+  // carry the tag "notes", and each its own product key as a tag.
   static UpdateController::OSUpdateList offeredOSUpdates(PlistDictionary extra = {}) {
     PlistArray catalog;
     for (const char* key : {"A", "B"}) {
       PlistDictionary entry{{"productKey", key},
                             {"title", std::string("Update ") + key},
                             {"versionString", "1"},
-                            {"downloadSize", 1000}};
+                            {"downloadSize", 1000},
+                            {"tags", PlistArray{"notes", key}}};
       for (const auto& [name, value] : extra) entry[name] = value;
       catalog.emplace_back(std::move(entry));
     }
@@ -326,7 +328,7 @@ TEST_F(UpdateControllerStartTest, ARefusedStartReachesDelegateObserversAndHandle
 }
 
 TEST_F(UpdateControllerStartTest, TagInstallsFallBackToThePurchaseUnlessOneUpdateMatches) {
-  offeredOSUpdates({{"tags", PlistArray{"notes"}}});
+  offeredOSUpdates();
   setPower(true, "Normal");
   setFreeSpace(1'000'000);
   TillPurchase fallback = TillPurchase::purchaseWithBuyParameters("itemId=7001");
@@ -339,7 +341,7 @@ TEST_F(UpdateControllerStartTest, TagInstallsFallBackToThePurchaseUnlessOneUpdat
     const char* name;
     std::vector<std::string> tags;
     bool withFallback;
-    std::int64_t expectedCode;  // 0 when the purchase was made
+    std::int64_t expectedCode;  // 0 when the purchase was made, -1 when the update installs
     const char* expectedLog;
   };
   const Case cases[] = {
@@ -373,8 +375,18 @@ TEST_F(UpdateControllerStartTest, TagInstallsFallBackToThePurchaseUnlessOneUpdat
     DispatchQueue::globalQueue().barrierSync([] {});
     std::lock_guard lock(mutex);
     ASSERT_EQ(outcomes.size(), 1U);
-    if (c.expectedLog) EXPECT_TRUE(log.hasOnce(c.expectedLog));
-    if (c.expectedCode != 0) {
+    // The fallback's line exactly once; the run's line starts with its text.
+    if (c.expectedCode == -1) {
+      EXPECT_EQ(log.countContaining(c.expectedLog), 1U) << log.dump();
+    } else if (c.expectedLog) {
+      EXPECT_TRUE(log.hasOnce(c.expectedLog));
+    }
+    if (c.expectedCode == -1) {
+      EXPECT_TRUE(outcomes[0].success);
+      EXPECT_EQ(outcomes[0].identifier, "B");
+      EXPECT_FALSE(outcomes[0].error);
+      EXPECT_EQ(log.countContaining("Falling back to purchase"), 0U);
+    } else if (c.expectedCode != 0) {
       EXPECT_FALSE(outcomes[0].success);
       ASSERT_TRUE(outcomes[0].error);
       EXPECT_EQ(outcomes[0].error->code, c.expectedCode);
