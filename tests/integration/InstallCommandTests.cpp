@@ -148,5 +148,43 @@ TEST_F(InstallCommandTest, ACancelOfAKeyWithoutInstallIsLoggedAndPassedOver) {
       << unknown.errors;
 }
 
+// The one OS update that carries the tags is installed; with none, the
+// fallback purchase is made, and without one the command fails with the
+// service's code 27.
+TEST_F(InstallCommandTest, ATagInstallStartsTheOneTaggedOSUpdateElseThePurchaseOrFails) {
+  const std::string framework = platform_.root() + "/var/lib/larder-platform";
+  std::filesystem::create_directories(framework);
+  ASSERT_TRUE(FileIO::writeAtomically(
+      framework + "/system-updates.plist",
+      PropertyListSerialization::writeXml(
+          PlistDictionary{{"catalog", PlistArray{PlistDictionary{{"productKey", "MAPS-1"},
+                                                                 {"title", "Maps Data"},
+                                                                 {"tags", PlistArray{"maps"}},
+                                                                 {"installSeconds", 0.1}}}}})));
+  start();
+  const LarderctlRun tagged = run({"install", "--tags", "maps"});
+  EXPECT_EQ(tagged.status, 0) << tagged.errors << service_->log();
+  EXPECT_NE(tagged.output.find("installing MAPS-1"), std::string::npos) << tagged.output;
+  EXPECT_TRUE(eventually([&] {
+    const auto state =
+        PropertyListSerialization::read(*FileIO::read(framework + "/system-updates.plist"));
+    return state && !(*state)["installed"]["MAPS-1"].isNull();
+  })) << service_->log();
+
+  const LarderctlRun untagged = run({"install", "--tags", "nowhere"});
+  EXPECT_EQ(untagged.status, 1);
+  EXPECT_NE(untagged.errors.find("(code 27)"), std::string::npos) << untagged.errors;
+
+  // With a fallback the item is purchased instead, and its download installed.
+  ASSERT_EQ(run({"signin", "ada@example.org", "--password", "pw"}).status, 0);
+  const LarderctlRun purchased =
+      run({"install", "--tags", "nowhere", "--fallback-item", std::to_string(kNotesID)});
+  EXPECT_EQ(purchased.status, 0) << purchased.errors << service_->log();
+  EXPECT_NE(purchased.output.find("installing " + std::to_string(kNotesID)), std::string::npos)
+      << purchased.output;
+  EXPECT_TRUE(eventually([&] { return TemporaryPlatform::bundleVersion(notes_) == "2.0"; }))
+      << service_->log();
+}
+
 }  // namespace
 }  // namespace larder::testing

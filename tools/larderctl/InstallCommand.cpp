@@ -195,7 +195,7 @@ bool InstallCommand::reportOS(const PlistValue& update, bool success,
 int InstallCommand::installByTags(const InstallOptions& options) {
   PlistDictionary fallback;
   if (options.fallbackItem) {
-    fallback = {{"buyParameters", "itemId=" + std::to_string(*options.fallbackItem)},
+    fallback = {{"buyParams", "itemId=" + std::to_string(*options.fallbackItem)},
                 {"itemIdentifier", *options.fallbackItem}};
   }
   const PlistArray reply = client_.call(
