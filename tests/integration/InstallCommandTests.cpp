@@ -186,5 +186,29 @@ TEST_F(InstallCommandTest, ATagInstallStartsTheOneTaggedOSUpdateElseThePurchaseO
       << service_->log();
 }
 
+// --all picks every available app and OS update; with the app not running
+// no dialog is needed, and a line tells of each.
+TEST_F(InstallCommandTest, AllInstallsEveryAvailableAppAndOSUpdate) {
+  const std::string framework = platform_.root() + "/var/lib/larder-platform";
+  std::filesystem::create_directories(framework);
+  ASSERT_TRUE(FileIO::writeAtomically(
+      framework + "/system-updates.plist",
+      PropertyListSerialization::writeXml(PlistDictionary{
+          {"catalog",
+           PlistArray{PlistDictionary{
+               {"productKey", "SEC-2"}, {"title", "Security"}, {"installSeconds", 0.1}}}},
+          {"available", PlistArray{"SEC-2"}}})));
+  start();
+  ASSERT_EQ(run({"signin", "ada@example.org", "--password", "pw"}).status, 0);
+  ASSERT_EQ(run({"updates", "--check"}).status, 0);
+  const LarderctlRun all = run({"install", "--all"});
+  EXPECT_EQ(all.status, 0) << all.errors << service_->log();
+  EXPECT_NE(all.output.find("updated Notes to 2.0"), std::string::npos) << all.output;
+  EXPECT_NE(all.output.find("installed OS update SEC-2 (Security)"), std::string::npos)
+      << all.output;
+  EXPECT_EQ(TemporaryPlatform::bundleVersion(notes_), "2.0");
+  EXPECT_EQ(run({"install", "--all"}).status, 3) << "nothing is left to install";
+}
+
 }  // namespace
 }  // namespace larder::testing
