@@ -144,7 +144,8 @@ class UpdateController final : public UpdateQueueDelegate,
   // update hears of it through the delegate, the OS updates through the
   // progress observers, and the handler gets a cancellation that keeps the
   // check's title and message. The delegate is kept until the run has
-  // ended.
+  // ended. Absent app updates leave the choice to the run's qualification;
+  // absent OS updates are none.
   void startAppUpdates(const std::optional<std::vector<LedgerUpdateRef>>& apps,
                        const std::optional<OSUpdateList>& osUpdates,
                        std::shared_ptr<VendUpdateDelegate> delegate,

@@ -256,7 +256,9 @@ void UpdateController::startAppInstallWithUpdates(const OSUpdateList& updates,
                                                               storeClient_);
   // An install of the same update that is already running gives way.
   cancelOSUpdates(updates);
-  startAppUpdates(std::nullopt, updates, nullptr, nullptr);
+  // No apps is an empty list, not an absent one: an absent list would let
+  // the run qualify every available app update, which nobody asked for.
+  startAppUpdates(std::vector<LedgerUpdateRef>{}, updates, nullptr, nullptr);
   if (completion) completion(true, update.productKey(), std::nullopt, std::nullopt);
 }
 
