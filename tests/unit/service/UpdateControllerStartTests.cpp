@@ -256,6 +256,8 @@ TEST_F(UpdateControllerStartTest, RefusedRightsStopBeforePowerAndDisk) {
                      checked ? "" : checked.error().title().value_or("").c_str(),
                      dialogs->shown().size(), log.countContaining("FreeSpaceRequest:"));
         std::fflush(stderr);
+        // The child ends here, so it tears its own fixture down first.
+        TearDown();
         std::_Exit(0);
       },
       ::testing::ExitedWithCode(0), "code=4 title=Authorization failed dialogs=0 room=0");
