@@ -141,6 +141,12 @@ std::shared_ptr<VendOSUpdateProgressObserver> AssetServiceInterface::osUpdatePro
   return remoteObjects_->osUpdateProgressObserver(peer_, objectPath);
 }
 
+std::shared_ptr<VendUpdateDelegate> AssetServiceInterface::updateDelegate(
+    const std::string& objectPath) const {
+  if (!namesAnObject(objectPath) || !remoteObjects_) return nullptr;
+  return remoteObjects_->updateDelegate(peer_, objectPath);
+}
+
 bool AssetServiceInterface::isBookClient() const {
   std::optional<VendStoreClient> client = storeClient();
   return client && client->clientType() == VendStoreClient::kBookApplication;

@@ -61,6 +61,8 @@ class AssetServiceInterface {
       const std::string& objectPath) const;
   [[nodiscard]] std::shared_ptr<VendOSUpdateProgressObserver> osUpdateProgressObserver(
       const std::string& objectPath) const;
+  [[nodiscard]] std::shared_ptr<VendUpdateDelegate> updateDelegate(
+      const std::string& objectPath) const;
   // The update queue of the connection's store client; nullptr without one.
   [[nodiscard]] std::shared_ptr<UpdateQueue> updateQueue() const;
   // Book clients ask for book updates where others ask for app updates.

@@ -147,6 +147,19 @@ class DBusOSUpdateProgressObserver final : public VendOSUpdateProgressObserver, 
   }
 };
 
+class DBusUpdateDelegate final : public VendUpdateDelegate, DBusCallbackObject {
+ public:
+  using DBusCallbackObject::DBusCallbackObject;
+  void appUpdateFinishedPurchase(const LedgerUpdateRef& update, bool success,
+                                 const OptionalError& error,
+                                 const std::optional<TillPurchaseResponse>& response) override {
+    send("AppUpdateFinishedPurchaseWithSuccessErrorResponse", "a{sv}ba{sv}a{sv}",
+         {update ? update->toDictionary() : PlistDictionary{}, success,
+          error ? error->toDictionary() : PlistDictionary{},
+          response ? response->toDictionary() : PlistDictionary{}});
+  }
+};
+
 }  // namespace
 
 DBusRemoteObjectFactory::DBusRemoteObjectFactory(sdbus::IConnection& connection)
@@ -178,6 +191,12 @@ std::shared_ptr<VendOSUpdateProgressObserver> DBusRemoteObjectFactory::osUpdateP
     const std::string& peer, const std::string& objectPath) {
   return std::make_shared<DBusOSUpdateProgressObserver>(connection_, sendQueue_, peer, objectPath,
                                                         "VendOSUpdateProgressObserver");
+}
+
+std::shared_ptr<VendUpdateDelegate> DBusRemoteObjectFactory::updateDelegate(
+    const std::string& peer, const std::string& objectPath) {
+  return std::make_shared<DBusUpdateDelegate>(connection_, sendQueue_, peer, objectPath,
+                                              "VendUpdateDelegate");
 }
 
 }  // namespace larder

@@ -31,6 +31,8 @@ class DBusRemoteObjectFactory final : public RemoteObjectFactory {
       const std::string& peer, const std::string& objectPath) override;
   std::shared_ptr<VendOSUpdateProgressObserver> osUpdateProgressObserver(
       const std::string& peer, const std::string& objectPath) override;
+  std::shared_ptr<VendUpdateDelegate> updateDelegate(const std::string& peer,
+                                                     const std::string& objectPath) override;
 
  private:
   sdbus::IConnection& connection_;

@@ -7,6 +7,7 @@
 #include "update-controller/VendAvailableUpdatesObserver.h"
 #include "update-controller/VendOSUpdateProgressObserver.h"
 #include "update-controller/VendOSUpdateScanObserver.h"
+#include "update-operation/VendUpdateDelegate.h"
 
 namespace larder {
 
@@ -25,6 +26,8 @@ class RemoteObjectFactory {
       const std::string& peer, const std::string& objectPath) = 0;
   virtual std::shared_ptr<VendOSUpdateProgressObserver> osUpdateProgressObserver(
       const std::string& peer, const std::string& objectPath) = 0;
+  virtual std::shared_ptr<VendUpdateDelegate> updateDelegate(const std::string& peer,
+                                                             const std::string& objectPath) = 0;
 };
 
 }  // namespace larder

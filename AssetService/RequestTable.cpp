@@ -52,6 +52,46 @@ std::vector<std::string> texts(const Arguments& arguments, std::size_t index) {
   return values;
 }
 
+// The queue's own record of each update the client sent, where it has one:
+// the run then works from what the store said, not from the client's copy.
+std::vector<LedgerUpdateRef> appUpdates(const AssetServiceInterface& interface,
+                                        const Arguments& arguments, std::size_t index) {
+  std::vector<LedgerUpdateRef> updates;
+  const std::shared_ptr<UpdateQueue> queue = interface.updateQueue();
+  if (const PlistArray* array = arguments.at(index).array()) {
+    for (const PlistValue& value : *array) {
+      if (!value.dictionary()) continue;
+      LedgerUpdateRef update = LedgerUpdate::fromDictionary(*value.dictionary());
+      if (!update) continue;
+      if (queue) {
+        if (LedgerUpdateRef queued =
+                queue->availableUpdateWithItemIdentifier(update->itemIdentifierValue())) {
+          update = std::move(queued);
+        }
+      }
+      updates.push_back(std::move(update));
+    }
+  }
+  return updates;
+}
+
+std::vector<SysupQuaymartUpdate> osUpdates(const Arguments& arguments, std::size_t index) {
+  std::vector<SysupQuaymartUpdate> updates;
+  if (const PlistArray* array = arguments.at(index).array()) {
+    for (const PlistValue& value : *array) {
+      if (!value.dictionary()) continue;
+      if (auto update = SysupQuaymartUpdate::fromDictionary(*value.dictionary())) {
+        updates.push_back(std::move(*update));
+      }
+    }
+  }
+  return updates;
+}
+
+PlistDictionary wireForm(const OptionalError& error) {
+  return error ? error->toDictionary() : PlistDictionary{};
+}
+
 // Runs `work` with the update controller of the connection's client. Without
 // a client there is none: a caller that waits for a reply hears why.
 template <typename Work>
@@ -63,6 +103,36 @@ void withController(AssetServiceInterface& interface, std::string_view member,
     return;
   }
   work(*controller);
+}
+
+// The checks in front of the start may hold the connection's queue for as
+// long as the user takes over a dialog. The reply keeps the client's
+// delegate alive until the run has ended and told it everything.
+void startAppUpdates(AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {
+  withController(i, "StartAppUpdatesAndOSUpdatesWithDelegate", r, [&](UpdateController& c) {
+    std::shared_ptr<VendUpdateDelegate> delegate = i.updateDelegate(text(a, 2));
+    c.startAppUpdates(appUpdates(i, a, 0), osUpdates(a, 1), delegate,
+                      [r, delegate](bool success, const OptionalError& error) {
+                        answer(r, {success, wireForm(error)});
+                      });
+  });
+}
+
+// An empty purchase dictionary is no fallback.
+void startAppInstallWithTags(AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {
+  withController(i, "StartAppInstallWithTagsFallbackPurchase", r, [&](UpdateController& c) {
+    std::optional<TillPurchase> fallback;
+    if (const PlistDictionary* fields = a.at(1).dictionary(); fields && !fields->empty()) {
+      fallback = TillPurchase::fromDictionary(*fields);
+    }
+    c.startAppInstallWithTags(
+        texts(a, 0), std::move(fallback),
+        [r](bool success, const std::optional<std::string>& identifier,
+            const std::optional<TillPurchaseResponse>& response, const OptionalError& error) {
+          answer(r, {success, identifier.value_or(""),
+                     response ? response->toDictionary() : PlistDictionary{}, wireForm(error)});
+        });
+  });
 }
 
 // A request answered by the controller with one value.
@@ -190,9 +260,8 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
    CONTROLLER_CALL("AddAvailableUpdatesObserver", c.addAvailableUpdatesObserver(i.availableUpdatesObserver(text(a, 0))))},
   {"RemoveAvailableUpdatesObserver", false,
    CONTROLLER_CALL("RemoveAvailableUpdatesObserver", c.removeAvailableUpdatesObserver(i.availableUpdatesObserver(text(a, 0))))},
-  {"StartAppUpdatesAndOSUpdatesWithDelegate", false, nullptr, kErrorReply},
-  {"StartAppInstallWithTagsFallbackPurchase", false,
-   nullptr, kErrorReply},
+  {"StartAppUpdatesAndOSUpdatesWithDelegate", false, startAppUpdates},
+  {"StartAppInstallWithTagsFallbackPurchase", false, startAppInstallWithTags},
   {"CheckForUpdatesWithUserHasSeenUpdates", false,
    [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {
      i.checkForUpdatesWithUserHasSeenUpdates(a.at(0).boolValue(), r);
@@ -220,8 +289,10 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
    CONTROLLER_CALL("AddOSUpdateProgressObserver", c.addOSUpdateProgressObserver(i.osUpdateProgressObserver(text(a, 0))))},
   {"RemoveOSUpdateProgressObserver", false,
    CONTROLLER_CALL("RemoveOSUpdateProgressObserver", c.removeOSUpdateProgressObserver(i.osUpdateProgressObserver(text(a, 0))))},
-  {"CancelOSUpdates", true, nullptr, kNothing},
-  {"CancelOSUpdatesWithProductKeys", true, nullptr, kNothing},
+  {"CancelOSUpdates", true,
+   CONTROLLER_CALL("CancelOSUpdates", c.cancelOSUpdates(osUpdates(a, 0)))},
+  {"CancelOSUpdatesWithProductKeys", true,
+   CONTROLLER_CALL("CancelOSUpdatesWithProductKeys", c.cancelOSUpdatesWithProductKeys(texts(a, 0)))},
   {"OsUpdateScanInProgress", true,
    CONTROLLER_REPLY("OsUpdateScanInProgress", c.osUpdateScanInProgress())},
   {"HideOSUpdatesWithProductKeys", false,

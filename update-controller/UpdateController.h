@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "platform/dispatch/DispatchQueue.h"
+#include "platform/error/Result.h"
 #include "platform/error/VendError.h"
 #include "platform/system/Mutex.h"
 #include "platform/value/PlistValue.h"
@@ -18,6 +19,8 @@
 #include "store-runtime/host/LedgerPowerSource.h"
 #include "store-runtime/records/LedgerSoftwareUpdateStatus.h"
 #include "store-runtime/records/SysupQuaymartUpdate.h"
+#include "store-runtime/records/TillPurchase.h"
+#include "store-runtime/records/TillPurchaseResponse.h"
 #include "store-runtime/services/VendServiceProxy.h"
 #include "store-runtime/sysup/SysupQuaymartUpdateController.h"
 #include "update-controller/ObserverArray.h"
@@ -26,6 +29,7 @@
 #include "update-controller/VendOSUpdateProgressObserver.h"
 #include "update-controller/VendOSUpdateScanObserver.h"
 #include "update-operation/UpdateOperationController.h"
+#include "update-operation/VendUpdateDelegate.h"
 #include "update-queue/UpdateQueue.h"
 #include "update-queue/UpdateQueueDelegate.h"
 
@@ -52,6 +56,13 @@ class UpdateController final : public UpdateQueueDelegate,
   using OSUpdatePredicate = SysupQuaymartUpdateController::Predicate;
   using ScanCompletionHandler = std::function<void(const OptionalError& error)>;
   using SuccessHandler = std::function<void(bool success)>;
+  using StartCompletionHandler = std::function<void(bool success, const OptionalError& error)>;
+  // Success, the identifier of what is being installed (the product key of
+  // an OS update, or the decimal item identifier of a purchase), the
+  // purchase's response, and the error.
+  using TagInstallCompletionHandler = std::function<void(
+      bool success, const std::optional<std::string>& identifier,
+      const std::optional<TillPurchaseResponse>& response, const OptionalError& error)>;
 
   // A scan shows up as in progress after this long even when it was started
   // quietly.
@@ -123,6 +134,58 @@ class UpdateController final : public UpdateQueueDelegate,
   void startObservingPowerSourceWithCallback(std::function<void()> callback);
   void stopObservingPowerSource();
   [[nodiscard]] bool isObservingPowerSource() const;
+
+  // --- Starting updates ---
+
+  // The user's own start of chosen updates. The rights, power and disk
+  // checks come first and block the calling thread for as long as their
+  // prompts and the free space request take; on success one user-started
+  // run is enqueued, whose end reaches the handler. On failure every app
+  // update hears of it through the delegate, the OS updates through the
+  // progress observers, and the handler gets a cancellation that keeps the
+  // check's title and message. The delegate is kept until the run has
+  // ended. Absent app updates leave the choice to the run's qualification;
+  // absent OS updates are none.
+  void startAppUpdates(const std::optional<std::vector<LedgerUpdateRef>>& apps,
+                       const std::optional<OSUpdateList>& osUpdates,
+                       std::shared_ptr<VendUpdateDelegate> delegate,
+                       StartCompletionHandler completion);
+  // Installs the OS update that carries all the tags, scanning for it when
+  // none is known; without exactly one, the fallback purchase is made. The
+  // handler is called once, on the global queue, and does not wait for
+  // the install.
+  void startAppInstallWithTags(const std::vector<std::string>& tags,
+                               std::optional<TillPurchase> fallbackPurchase,
+                               TagInstallCompletionHandler completion);
+  // The two halves of the above: the matches found, and the purchase.
+  void startAppInstallWithUpdates(const OSUpdateList& updates,
+                                  std::optional<TillPurchase> fallbackPurchase,
+                                  TagInstallCompletionHandler completion);
+  void startAppInstallWithPurchase(const TillPurchase& purchase,
+                                   TagInstallCompletionHandler completion);
+  // For notification activation: a user-started run over everything
+  // available (or only the critical OS updates), which makes its own
+  // decisions; no checks here. The run enqueued is returned.
+  std::shared_ptr<UpdateOperation> installAllAvailableUpdates();
+  std::shared_ptr<UpdateOperation> installAvailableCriticalUpdates();
+  void cancelOSUpdates(const OSUpdateList& osUpdates);
+  // A key without a token is logged and passed over; a token that serves
+  // several keys is cancelled once.
+  void cancelOSUpdatesWithProductKeys(const std::vector<std::string>& productKeys);
+
+  // The checks in front of a user-started install: rights (when
+  // `requiresAuthorization`), then power, then disk. App updates alone face
+  // only the rights.
+  Result<void> canInstallAppUpdates(const std::vector<LedgerUpdateRef>& apps,
+                                    const OSUpdateList& osUpdates, bool requiresAuthorization);
+  [[nodiscard]] static bool hasCriticalUpdates(const OSUpdateList& osUpdates);
+  // True on mains power or without a battery warning; otherwise asks the
+  // user, and plugging in while asked counts as "continue". Blocks on the
+  // dialog. The argument does not change the decision.
+  bool hasAdequatePowerOrUserConfirmsWithCriticalUpdates(bool hasCriticalUpdates);
+  // Asks the platform to make room for the updates and waits for its final
+  // answer; the free space request bounds the wait.
+  bool checkAndReclaimFreeDiskSpaceForUpdates(const OSUpdateList& osUpdates);
 
   // --- OS update scans and hiding ---
 
@@ -222,6 +285,10 @@ class UpdateController final : public UpdateQueueDelegate,
   void availableUpdatesDidChangeInternal();
   void sendBadgeMessage(std::uint64_t count) const;
   void enqueue(const std::shared_ptr<UpdateOperation>& operation) const;
+  void refuseStart(const std::vector<LedgerUpdateRef>& apps, const OSUpdateList& osUpdates,
+                   const std::shared_ptr<VendUpdateDelegate>& delegate,
+                   const StartCompletionHandler& completion, const VendError& checkError) const;
+  std::shared_ptr<UpdateOperation> enqueueUserStartedRun(bool criticalOnly);
   [[nodiscard]] std::vector<LedgerUpdateRef> availableAppUpdates() const;
   void sendOSUpdateScanForTags(const std::vector<std::string>& tags, bool finished,
                                float percentComplete, const OptionalError& error) const;

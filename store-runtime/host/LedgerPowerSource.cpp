@@ -1,5 +1,6 @@
 #include "store-runtime/host/LedgerPowerSource.h"
 
+#include <algorithm>
 #include <charconv>
 #include <cmath>
 #include <exception>
@@ -66,6 +67,22 @@ std::optional<double> secondsLeftInBattery(const std::string& supply) {
     if (amount && rate) return *amount / *rate * kSecondsPerHour;
   }
   return std::nullopt;
+}
+
+// One battery's warning: the driver's own word first, since it knows the
+// cell's chemistry; the percentage only when it gives none.
+std::optional<std::int64_t> warningLevelOfBattery(const std::string& supply) {
+  const std::string level = firstWordOfAttribute(supply + "/capacity_level");
+  if (level == "Critical") return LedgerPowerSource::kFinalWarning;
+  if (level == "Low") return LedgerPowerSource::kEarlyWarning;
+  if (!level.empty() && level != "Unknown") return LedgerPowerSource::kNoWarning;
+  const std::string word = firstWordOfAttribute(supply + "/capacity");
+  std::int64_t percent = 0;
+  const auto [end, code] = std::from_chars(word.data(), word.data() + word.size(), percent);
+  if (word.empty() || code != std::errc{} || end != word.data() + word.size()) return std::nullopt;
+  if (percent <= LedgerPowerSource::kFinalWarningPercent) return LedgerPowerSource::kFinalWarning;
+  if (percent <= LedgerPowerSource::kEarlyWarningPercent) return LedgerPowerSource::kEarlyWarning;
+  return LedgerPowerSource::kNoWarning;
 }
 
 // What the observation shares with its timer's work, which may outlive the observation by
@@ -164,6 +181,27 @@ double LedgerPowerSource::remainingTimeEstimateInSupplyFolder(const std::string&
   }
   TILL_LOG(3, "%@: Remaining time %@ s", kSpeaker, anyEstimate ? total : kUnknownRemainingTime);
   return anyEstimate ? total : kUnknownRemainingTime;
+}
+
+std::int64_t LedgerPowerSource::batteryWarningLevel() {
+  return batteryWarningLevelInSupplyFolder(supplyFolder());
+}
+
+std::int64_t LedgerPowerSource::batteryWarningLevelInSupplyFolder(const std::string& folder) {
+  if (BackgroundActivityPowerSource::mainsPowerInSupplyFolder(folder)) return kNoWarning;
+  std::optional<std::int64_t> least;
+  std::error_code code;
+  std::filesystem::directory_iterator iterator(folder, code);
+  for (std::filesystem::directory_iterator end; !code && iterator != end;
+       iterator.increment(code)) {
+    const std::string supply = iterator->path().string();
+    if (!isSystemBattery(supply)) continue;
+    if (std::optional<std::int64_t> level = warningLevelOfBattery(supply)) {
+      least = least ? std::min(*least, *level) : *level;
+    }
+  }
+  TILL_LOG(3, "%@: Battery warning level %@", kSpeaker, least.value_or(kNoWarning));
+  return least.value_or(kNoWarning);
 }
 
 std::unique_ptr<LedgerPowerSource::Observation> LedgerPowerSource::observeLimitedPowerChanges(

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <chrono>
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <string>
@@ -30,6 +31,26 @@ class LedgerPowerSource {
   static double remainingTimeEstimate();
   // The same rule applied to one folder of supplies.
   static double remainingTimeEstimateInSupplyFolder(const std::string& folder);
+
+  // The warning the machine gives about its battery.
+  enum BatteryWarningLevel : std::int64_t {
+    kNoWarning = 1,
+    kEarlyWarning = 2,
+    kFinalWarning = 3,
+  };
+  // Below these percentages of charge a battery whose driver names no
+  // capacity level is low (early warning) or critical (final warning).
+  static constexpr std::int64_t kEarlyWarningPercent = 10;
+  static constexpr std::int64_t kFinalWarningPercent = 5;
+
+  // kNoWarning on mains power or without a system battery. Otherwise each
+  // battery's level comes from its driver's "capacity_level" ("Low" early,
+  // "Critical" final), or failing that from its "capacity" percentage and
+  // the thresholds above; the machine warns only as much as its fullest
+  // battery, since it draws on whichever still holds charge.
+  static std::int64_t batteryWarningLevel();
+  // The same rule applied to one folder of supplies.
+  static std::int64_t batteryWarningLevelInSupplyFolder(const std::string& folder);
 
   // Calls `callback` on the main run loop each time the machine moves
   // between mains and limited power, until the returned source is released.

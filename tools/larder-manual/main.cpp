@@ -59,7 +59,7 @@ int main(int argc, char** argv) {
                     {{"EXIT STATUS",
                       "0\nsuccess\n\n1\nthe operation failed, or the service could not be "
                       "reached\n\n2\nthe command line was wrong; nothing was tried\n\n3\nnothing "
-                      "to do: updates found none",
+                      "to do: updates found none, install had nothing to install",
                       true},
                      {"ENVIRONMENT", kEnvironment, true},
                      {"SEE ALSO", "larderd(8)"}});

@@ -56,7 +56,8 @@ CommandLine::CommandLine() : app_("talk to the larder store service", "larderctl
   app_.set_version_flag("--version", LARDER_VERSION, "print the version and exit");
   app_.footer(
       "Exit status: 0 success; 1 the operation failed or the service could not be reached; 2 "
-      "the command line was wrong; 3 nothing to do (updates: none available).");
+      "the command line was wrong; 3 nothing to do (updates: none available; install: nothing to "
+      "install).");
   addGlobalOptions();
   addSoftwareMapCommands();
   addDialogCommands();
@@ -182,6 +183,30 @@ void CommandLine::addStoreCommands() {
 }
 
 void CommandLine::addUpdateCommands() {
+  auto* install = app_.add_subcommand(
+      "install",
+      "install available updates now, as the user's own start: app updates by item, OS updates "
+      "by product key, everything available, the critical OS updates, or the OS update that "
+      "carries tags (exit status 1: an update failed; 3: nothing to install)");
+  install->add_option("ITEM", this->install.items, "item identifiers of available app updates");
+  install->add_option("--os", this->install.osKeys, "product keys of available OS updates")
+      ->expected(1, -1);
+  auto* all = install->add_flag("--all", this->install.all, "every available app and OS update");
+  auto* critical = install->add_flag("--critical", this->install.critical,
+                                     "the available OS updates marked critical");
+  all->excludes(critical);
+  auto* tags = install
+                   ->add_option("--tags", this->install.tags,
+                                "install the one OS update that carries all these tags")
+                   ->expected(1, -1);
+  install
+      ->add_option("--fallback-item", this->install.fallbackItem,
+                   "with --tags: the item to purchase when not exactly one update matches")
+      ->needs(tags);
+  tags->excludes(all)->excludes(critical);
+  auto* cancel =
+      app_.add_subcommand("cancel", "cancel the running installs of OS updates, by product key");
+  cancel->add_option("KEY", cancelKeys, "product keys of OS updates")->required();
   auto* osUpdates = app_.add_subcommand(
       "os-updates", "list the OS updates the system offers (exit status 3: none)");
   osUpdates->add_flag("--scan", this->osUpdates.scan,

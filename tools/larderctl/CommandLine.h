@@ -8,6 +8,7 @@
 
 #include "tools/larderctl/DialogAgentCommand.h"
 #include "tools/larderctl/DialogCommand.h"
+#include "tools/larderctl/InstallOptions.h"
 #include "tools/larderctl/LaterCommand.h"
 #include "tools/larderctl/OSUpdatesCommand.h"
 #include "tools/larderctl/PreferencesOptions.h"
@@ -61,6 +62,9 @@ class CommandLine {
   bool checkFirst = false;
   // os-updates
   OSUpdatesOptions osUpdates;
+  // install, cancel
+  InstallOptions install;
+  std::vector<std::string> cancelKeys;
   // watch
   bool watchBadge = false;
   // dmap-dump

@@ -14,6 +14,7 @@
 #include "tools/larderctl/DialogCommand.h"
 #include "tools/larderctl/DmapDumpCommand.h"
 #include "tools/larderctl/ExitStatus.h"
+#include "tools/larderctl/InstallCommand.h"
 #include "tools/larderctl/LaterAgentCommand.h"
 #include "tools/larderctl/LaterCommand.h"
 #include "tools/larderctl/NotificationsCommand.h"
@@ -174,6 +175,12 @@ int runChosen(const CommandLine& line) {
   if (line.chose("runs")) {
     ServiceClient client = connect(line.global);
     return RunsCommand(client, line.global.json).run();
+  }
+  if (line.chose("install") || line.chose("cancel")) {
+    ServiceClient client = connect(line.global);
+    ServiceClient runner = connect(line.global);
+    InstallCommand install(client, runner, line.global.json);
+    return line.chose("install") ? install.run(line.install) : install.cancel(line.cancelKeys);
   }
   if (line.chose("updates")) {
     ServiceClient client = connect(line.global);

@@ -130,6 +130,60 @@ TEST_F(MachineStateTest, RemainingTimeFollowsTheSuppliesRule) {
   }
 }
 
+TEST_F(MachineStateTest, BatteryWarningComesFromTheDriversWordElseTheCharge) {
+  struct Case {
+    const char* name;
+    Supplies supplies;
+    std::int64_t expected;
+  };
+  auto battery = [](Supply attributes) {
+    attributes["type"] = "Battery";
+    return attributes;
+  };
+  const std::vector<Case> cases = {
+      {"mains power never warns",
+       {{"AC", {{"type", "Mains"}, {"online", "1"}}},
+        {"BAT0", battery({{"capacity_level", "Critical"}})}},
+       LedgerPowerSource::kNoWarning},
+      {"no battery", {{"AC", kUnpluggedAdapter}}, LedgerPowerSource::kNoWarning},
+      {"driver says low",
+       {{"BAT0", battery({{"capacity_level", "Low"}, {"capacity", "80"}})}},
+       LedgerPowerSource::kEarlyWarning},
+      {"driver says critical",
+       {{"BAT0", battery({{"capacity_level", "Critical"}})}},
+       LedgerPowerSource::kFinalWarning},
+      {"driver says normal at a low charge",
+       {{"BAT0", battery({{"capacity_level", "Normal"}, {"capacity", "3"}})}},
+       LedgerPowerSource::kNoWarning},
+      {"unknown level falls back to the charge",
+       {{"BAT0", battery({{"capacity_level", "Unknown"}, {"capacity", "10"}})}},
+       LedgerPowerSource::kEarlyWarning},
+      {"charge at the final threshold",
+       {{"BAT0", battery({{"capacity", "5"}})}},
+       LedgerPowerSource::kFinalWarning},
+      {"charge above the early threshold",
+       {{"BAT0", battery({{"capacity", "11"}})}},
+       LedgerPowerSource::kNoWarning},
+      {"the fullest battery decides",
+       {{"BAT0", battery({{"capacity_level", "Critical"}})},
+        {"BAT1", battery({{"capacity", "8"}})}},
+       LedgerPowerSource::kEarlyWarning},
+      {"a mouse's empty battery is not the machine's",
+       {{"BAT0", battery({{"capacity", "60"}})},
+        {"hidpp_battery_0", battery({{"scope", "Device"}, {"capacity_level", "Critical"}})}},
+       LedgerPowerSource::kNoWarning},
+      {"unreadable charge gives no warning",
+       {{"BAT0", battery({{"capacity", "low"}})}},
+       LedgerPowerSource::kNoWarning},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    std::filesystem::remove_all(rooted("sys"));
+    installSupplies(c.supplies);
+    EXPECT_EQ(LedgerPowerSource::batteryWarningLevel(), c.expected);
+  }
+}
+
 // Counts the callbacks of one observation and notes the thread they ran on.
 struct CallbackLog {
   std::atomic<int> calls{0};

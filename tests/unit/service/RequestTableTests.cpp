@@ -78,7 +78,9 @@ constexpr std::string_view kHandledRequests =
     "serHasSeenAllUpdatesCheckForOtherUpdates "
     "AddOSUpdateScanObserver RemoveOSUpdateScanObserver "
     "SoftwareUpdateDidFinishBackgroundScanWithInfo "
-    "PromptUserToOptInForAutoUpdateWithShowNotification";
+    "PromptUserToOptInForAutoUpdateWithShowNotification "
+    "StartAppUpdatesAndOSUpdatesWithDelegate StartAppInstallWithTagsFallbackPurchase "
+    "CancelOSUpdates CancelOSUpdatesWithProductKeys";
 constexpr std::string_view kEmptyReplyRequests =
     "WillInteractivelyPurchaseItemIdentifier AppUpdatesToInstallLater "
     "InstalledUpdatesJournal UpdateAutoInfoWithToken MajorOSUpdateHasDownloadedToPath "
@@ -86,14 +88,12 @@ constexpr std::string_view kEmptyReplyRequests =
     "BookWithInfo HasSampleWithItemIdentifier PurchasedItems";
 // Some of these have a handler for the part this build has (the client type).
 constexpr std::string_view kRefusedRequests =
-    "StartAppUpdatesAndOSUpdatesWithDelegate StartAppInstallWithTagsFallbackPurchase "
     "RedownloadWithItemIdentifierBundleIdentifierStoreClientType "
     "ProcessMDMManifestURLOptionsStoreClientType "
     "AccountLessDownloadWithItemIdentifierBundleIdentifierExternalVersionIdentifierOptions "
     "PollForPurchasedBooks";
 constexpr std::string_view kSilentRequests =
-    "DidInteractivelyPurchaseItemIdentifierSuccess CancelOSUpdates "
-    "CancelOSUpdatesWithProductKeys RemoveUpdateFromInstallLaterWithBundleID "
+    "DidInteractivelyPurchaseItemIdentifierSuccess RemoveUpdateFromInstallLaterWithBundleID "
     "InstallAvailableUpdatesLaterWithMode CancelUpdatesToBeInstalledLater "
     "NowIsLaterWithModeCountdownDeferred LaterDidNotOccurWithDueToACPower "
     "ManagedOSInstallWakeUpReceived DownloadSetupHeraldForTagsBundleIdentifier "
@@ -210,6 +210,10 @@ class NoRemoteObjects final : public RemoteObjectFactory {
   }
   std::shared_ptr<VendOSUpdateProgressObserver> osUpdateProgressObserver(
       const std::string&, const std::string&) override {
+    return nullptr;
+  }
+  std::shared_ptr<VendUpdateDelegate> updateDelegate(const std::string&,
+                                                     const std::string&) override {
     return nullptr;
   }
 };
