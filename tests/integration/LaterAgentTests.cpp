@@ -4,6 +4,7 @@
 // the arguments of the two requests exactly as they come over the bus.
 #include <gtest/gtest.h>
 
+#include <ctime>
 #include <filesystem>
 #include <fstream>
 #include <nlohmann/json.hpp>
@@ -95,26 +96,59 @@ class LaterAgentTest : public StoreAndServiceTest {
   }
 };
 
-TEST_F(LaterAgentTest, TheHourPassesAndLarderdHearsOnce) {
-  arm(2, "2026-01-01T10:00:00Z");
+// End to end: the user puts a restart-required OS update off by an hour;
+// when the agent's clock has passed the hour, larderd runs the Do It Later,
+// the countdown runs out, and the framework holds the install for the
+// logout that the recorded restart request stands for.
+TEST_F(LaterAgentTest, InAnHourTheAgentBringsTheRestartIntoTheInstall) {
+  const std::string framework = platform_.root() + "/var/lib/larder-platform";
+  std::filesystem::create_directories(framework);
+  ASSERT_TRUE(PlatformStateFile(framework + "/system-updates.plist")
+                  .updateDictionary([](PlistDictionary& state) {
+                    state["catalog"] =
+                        PlistArray{PlistDictionary{{"productKey", "KERNEL-9"},
+                                                   {"isRecommended", true},
+                                                   {"restartRequired", true},
+                                                   {"allowedToUseInstallLater", true}}};
+                  }));
+  power(true);
   startService(kNoStoreURL);
-  const std::string request = "nowIsLaterWithMode:countdownDeferred:";
+  ASSERT_EQ(run({"os-updates", "--scan"}).status, 0);
+  const LarderctlRun later = run({"later", "hour"});
+  ASSERT_EQ(later.status, 0) << later.errors;
+  EXPECT_NE(later.output.find("os  KERNEL-9"), std::string::npos) << later.output;
+  EXPECT_EQ(PlistValue(twilight().readDictionary())["armedMode"].int64Value(), 2);
 
-  const LarderctlRun early = agent("2026-01-01T10:59:00Z");
-  ASSERT_EQ(early.status, 0) << early.errors;
-  EXPECT_EQ(early.output, "mode 2: wait\n");
-
-  const LarderctlRun due = agent("2026-01-01T11:00:01Z");
+  const auto inAnHour = [](int extraSeconds) {
+    const std::time_t moment = std::time(nullptr) + 3600 + extraSeconds;
+    char text[32];
+    std::strftime(text, sizeof text, "%Y-%m-%dT%H:%M:%SZ", std::gmtime(&moment));
+    return std::string(text);
+  };
+  EXPECT_EQ(agent(inAnHour(-120)).output, "mode 2: wait\n");
+  const LarderctlRun due = agent(inAnHour(60));
   ASSERT_EQ(due.status, 0) << due.errors;
   EXPECT_EQ(due.output, "mode 2: fire\n");
-  // The request is answered after larderd has handled it, which it logs.
-  EXPECT_EQ(service_->logLines(request).size(), 1u) << service_->log();
   EXPECT_EQ(PlistValue(twilight().readDictionary())["laterOutcome"], PlistValue("fired"));
 
-  const LarderctlRun again = agent("2026-01-01T12:00:00Z");
-  ASSERT_EQ(again.status, 0) << again.errors;
-  EXPECT_EQ(again.output, "mode 2: nothing\n");
-  EXPECT_EQ(service_->logLines(request).size(), 1u) << "never twice for one arming";
+  const PlatformStateFile requests(framework + "/restart-requests.plist");
+  ASSERT_TRUE(eventually(
+      [&] {
+        const PlistValue recorded = requests.read();
+        return recorded.array() && !recorded.array()->empty();
+      },
+      std::chrono::seconds(30)))
+      << service_->log();
+  const PlistValue request = (*requests.read().array())[0];
+  EXPECT_EQ(request["kind"], PlistValue("restart"));
+  EXPECT_EQ(request["productKeys"], PlistValue(PlistArray{"KERNEL-9"}));
+  const PlistValue postLogout = PlistValue(PlatformStateFile(framework + "/system-updates.plist")
+                                               .readDictionary())["postLogout"]["KERNEL-9"];
+  EXPECT_TRUE(postLogout["restartingNow"].boolValue());
+  EXPECT_TRUE(postLogout["nowIsLater"].boolValue());
+  EXPECT_EQ(PlistValue(twilight().readDictionary())["countdownCount"].int64Value(), 1);
+
+  EXPECT_EQ(agent(inAnHour(600)).output, "mode 2: nothing\n") << "never twice for one arming";
 }
 
 TEST_F(LaterAgentTest, TonightOnBatteryPassesUnusedAndOnMainsFires) {

@@ -80,9 +80,12 @@ constexpr std::string_view kHandledRequests =
     "SoftwareUpdateDidFinishBackgroundScanWithInfo "
     "PromptUserToOptInForAutoUpdateWithShowNotification "
     "StartAppUpdatesAndOSUpdatesWithDelegate StartAppInstallWithTagsFallbackPurchase "
-    "CancelOSUpdates CancelOSUpdatesWithProductKeys";
+    "CancelOSUpdates CancelOSUpdatesWithProductKeys AppUpdatesToInstallLater "
+    "RemoveUpdateFromInstallLaterWithBundleID InstallAvailableUpdatesLaterWithMode "
+    "CancelUpdatesToBeInstalledLater NowIsLaterWithModeCountdownDeferred "
+    "LaterDidNotOccurWithDueToACPower";
 constexpr std::string_view kEmptyReplyRequests =
-    "WillInteractivelyPurchaseItemIdentifier AppUpdatesToInstallLater "
+    "WillInteractivelyPurchaseItemIdentifier "
     "InstalledUpdatesJournal UpdateAutoInfoWithToken MajorOSUpdateHasDownloadedToPath "
     "CheckSHDownloadStatus CountOfBooksWithInfo SortedBooksWithInfo BookAtIndexWithInfo "
     "BookWithInfo HasSampleWithItemIdentifier PurchasedItems";
@@ -93,10 +96,8 @@ constexpr std::string_view kRefusedRequests =
     "AccountLessDownloadWithItemIdentifierBundleIdentifierExternalVersionIdentifierOptions "
     "PollForPurchasedBooks";
 constexpr std::string_view kSilentRequests =
-    "DidInteractivelyPurchaseItemIdentifierSuccess RemoveUpdateFromInstallLaterWithBundleID "
-    "InstallAvailableUpdatesLaterWithMode CancelUpdatesToBeInstalledLater "
-    "NowIsLaterWithModeCountdownDeferred LaterDidNotOccurWithDueToACPower "
-    "ManagedOSInstallWakeUpReceived DownloadSetupHeraldForTagsBundleIdentifier "
+    "DidInteractivelyPurchaseItemIdentifierSuccess ManagedOSInstallWakeUpReceived "
+    "DownloadSetupHeraldForTagsBundleIdentifier "
     "AccountLessDownloadHeartbeat AddLibraryObserver RemoveLibraryObserver "
     "RedownloadBooksWithItemIdentifiersAccountID PollForPurchasedItems";
 
