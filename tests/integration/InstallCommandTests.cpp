@@ -17,7 +17,12 @@ namespace larder::testing {
 namespace {
 
 constexpr std::uint64_t kNotesID = 7201;
-constexpr char kNotesBundleID[] = "com.example.e2e.install.notes";
+// One identifier per test: the tests run side by side in processes of
+// their own, and running applications are found machine-wide by identifier.
+std::string notesBundleID() {
+  return std::string("com.example.e2e.install.") +
+         ::testing::UnitTest::GetInstance()->current_test_info()->name();
+}
 
 class InstallCommandTest : public StoreAndServiceTest {
  protected:
@@ -25,7 +30,7 @@ class InstallCommandTest : public StoreAndServiceTest {
     StoreAndServiceTest::SetUp();
     notes_ = platform_.installBundle({.folder = applications(),
                                       .name = "Notes",
-                                      .bundleIdentifier = kNotesBundleID,
+                                      .bundleIdentifier = notesBundleID(),
                                       .version = "1.0",
                                       .itemIdentifier = kNotesID});
     TemporaryPlatform::makeRunnable(notes_);
@@ -37,12 +42,12 @@ class InstallCommandTest : public StoreAndServiceTest {
     std::filesystem::create_directories(packed);
     const std::string notes2 = platform_.installBundle({.folder = packed,
                                                         .name = "Notes",
-                                                        .bundleIdentifier = kNotesBundleID,
+                                                        .bundleIdentifier = notesBundleID(),
                                                         .version = "2.0",
                                                         .itemIdentifier = kNotesID});
     TemporaryPlatform::makeRunnable(notes2, notes_);
     catalogue_.addItem({.wareID = kNotesID,
-                        .bundleID = kNotesBundleID,
+                        .bundleID = notesBundleID(),
                         .title = "Notes",
                         .version = "2.0",
                         .bundlePath = notes2,
@@ -50,7 +55,7 @@ class InstallCommandTest : public StoreAndServiceTest {
   }
   void TearDown() override {
     for (const auto& app :
-         RunningApplication::runningApplicationsWithBundleIdentifier(kNotesBundleID)) {
+         RunningApplication::runningApplicationsWithBundleIdentifier(notesBundleID())) {
       ::kill(app->pid(), SIGKILL);
     }
   }
@@ -92,7 +97,7 @@ TEST_F(InstallCommandTest, AnAgreedQuitUpdatesTheRunningAppAndRelaunchesIt) {
   EXPECT_EQ(TemporaryPlatform::bundleVersion(notes_), "2.0") << service_->log();
   EXPECT_TRUE(eventually([&] { return RunningApplication::withPid(pid_) == nullptr; }));
   EXPECT_TRUE(eventually([&] {
-    return !RunningApplication::runningApplicationsWithBundleIdentifier(kNotesBundleID).empty();
+    return !RunningApplication::runningApplicationsWithBundleIdentifier(notesBundleID()).empty();
   })) << "not relaunched\n"
       << service_->log();
   EXPECT_EQ(listedUpdates(), 0U);
