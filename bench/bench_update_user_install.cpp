@@ -23,6 +23,7 @@
 
 #include "bench/BenchFiles.h"
 #include "bench/BenchProcesses.h"
+#include "bench/BenchStoreProcess.h"
 #include "bench/BenchUpdatePlatform.h"
 #include "platform/dispatch/DispatchSemaphore.h"
 #include "platform/plist/PropertyListSerialization.h"
@@ -84,48 +85,6 @@ fs::path writeBundle(const fs::path& folder, const std::string& version,
   return bundle;
 }
 
-int waitFor(pid_t pid) {
-  int status = 0;
-  if (pid < 0 || ::waitpid(pid, &status, 0) != pid) return -1;
-  return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-}
-
-// larder-store on a free loopback port, stopped with the object.
-class Store {
- public:
-  explicit Store(const fs::path& catalogue) {
-    int ends[2];
-    if (::pipe(ends) != 0) throw std::runtime_error("pipe");
-    pid_ = bench::spawn(
-        {LARDER_STORE_PATH, "--catalogue", catalogue.string(), "--port", "0", "--exit-with-parent"},
-        {}, ends[1]);
-    ::close(ends[1]);
-    FILE* output = ::fdopen(ends[0], "r");
-    char line[512] = {};
-    const std::string text = std::fgets(line, sizeof(line), output) ? line : "";
-    std::fclose(output);
-    constexpr std::string_view kListening = "larder-store listening on ";
-    if (pid_ < 0 || !text.starts_with(kListening)) {
-      throw std::runtime_error("larder-store did not start: " + text);
-    }
-    baseURL_ = text.substr(kListening.size());
-    while (!baseURL_.empty() && std::isspace(static_cast<unsigned char>(baseURL_.back()))) {
-      baseURL_.pop_back();
-    }
-  }
-  ~Store() {
-    ::kill(pid_, SIGTERM);
-    waitFor(pid_);
-  }
-  Store(const Store&) = delete;
-  Store& operator=(const Store&) = delete;
-  [[nodiscard]] std::string bagURL() const { return baseURL_ + "/bag.plist"; }
-
- private:
-  pid_t pid_ = -1;
-  std::string baseURL_;
-};
-
 // The user who agrees to every dialog at once.
 class AgreeingPresenter final : public VendDialogPresenter {
  public:
@@ -175,13 +134,13 @@ void BM_UserStartedInstallOf50MiBToRelaunch(benchmark::State& state) {
                                                      {"storeFrontID", "143441"},
                                                      {"opaqueID", "account-1"}}}));
   const fs::path packed = writeBundle(base + "/packed", "2.0", installed, kPayloadBytes);
-  if (waitFor(bench::spawn(
+  if (bench::waitFor(bench::spawn(
           {LARDER_STORE_PATH, "pack", packed.string(), (item / "Notes.tar").string()}, {}, -1)) !=
       0) {
     state.SkipWithError("larder-store pack failed");
     return;
   }
-  Store store(catalogue);
+  bench::StoreProcess store(LARDER_STORE_PATH, catalogue);
   VendRuntimeConfiguration configuration;
   configuration.bagURL = store.bagURL();
   configuration.stateDirectory = base + "/state/larder";

@@ -29,6 +29,7 @@
 
 #include "bench/BenchFiles.h"
 #include "bench/BenchProcesses.h"
+#include "bench/BenchStoreProcess.h"
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
 #include "software-map/SoftwareMap.h"
@@ -97,12 +98,6 @@ fs::path writeBundle(const fs::path& folder, int index, const std::string& versi
   return bundle;
 }
 
-int waitFor(pid_t pid) {
-  int status = 0;
-  if (pid < 0 || ::waitpid(pid, &status, 0) != pid) return -1;
-  return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-}
-
 void prepare(const fs::path& dir) {
   fs::remove_all(dir);
   const fs::path catalogue = dir / "catalogue";
@@ -119,7 +114,7 @@ void prepare(const fs::path& dir) {
     const fs::path item = catalogue / "items" / std::to_string(wareID(index));
     fs::create_directories(item);
     const std::string package = appName(index) + ".tar";
-    if (waitFor(bench::spawn(
+    if (bench::waitFor(bench::spawn(
             {LARDER_STORE_PATH, "pack", bundle.string(), (item / package).string()}, {}, -1)) !=
         0) {
       throw std::runtime_error("larder-store pack " + bundle.string() + " failed");
@@ -136,43 +131,6 @@ void prepare(const fs::path& dir) {
   }
   fs::remove_all(dir / "bundles");
 }
-
-// larder-store on a free loopback port, stopped with the object.
-class Store {
- public:
-  explicit Store(const fs::path& catalogue) {
-    int ends[2];
-    if (::pipe(ends) != 0) throw std::runtime_error("pipe");
-    pid_ = bench::spawn(
-        {LARDER_STORE_PATH, "--catalogue", catalogue.string(), "--port", "0", "--exit-with-parent"},
-        {}, ends[1]);
-    ::close(ends[1]);
-    FILE* output = ::fdopen(ends[0], "r");
-    char line[512] = {};
-    const std::string text = std::fgets(line, sizeof(line), output) ? line : "";
-    std::fclose(output);
-    constexpr std::string_view kListening = "larder-store listening on ";
-    if (pid_ < 0 || !text.starts_with(kListening)) {
-      throw std::runtime_error("larder-store did not start: " + text);
-    }
-    baseURL_ = text.substr(kListening.size());
-    while (!baseURL_.empty() && std::isspace(static_cast<unsigned char>(baseURL_.back()))) {
-      baseURL_.pop_back();
-    }
-  }
-  ~Store() {
-    ::kill(pid_, SIGTERM);
-    waitFor(pid_);
-  }
-  Store(const Store&) = delete;
-  Store& operator=(const Store&) = delete;
-
-  [[nodiscard]] std::string bagURL() const { return baseURL_ + "/bag.plist"; }
-
- private:
-  pid_t pid_ = -1;
-  std::string baseURL_;
-};
 
 bool signIn(const VendStoreClient& client) {
   VendServiceProxy proxy(client);
@@ -214,7 +172,7 @@ int run(const fs::path& dir) {
     throw std::runtime_error("cannot switch automatic updates on");
   }
 
-  Store store(dir / "catalogue");
+  bench::StoreProcess store(LARDER_STORE_PATH, dir / "catalogue");
   VendRuntimeConfiguration configuration;
   configuration.bagURL = store.bagURL();
   configuration.stateDirectory = (work / "home/.local/state/larder").string();
