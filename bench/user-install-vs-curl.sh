@@ -30,6 +30,7 @@
 # --bin DIR  where larderd, larderctl and larder-store are (default: the
 #            build folder beside this script)
 set -euo pipefail
+shopt -s inherit_errexit
 
 runs=7
 keep=0
@@ -61,7 +62,7 @@ readonly bundle_id=com.example.bench.userinstall.$$
 work=$(mktemp -d "${TMPDIR:-/tmp}/larder-user-install.XXXXXX")
 readonly work
 readonly app=$work/root/Applications/Notes.app
-bus_pid= store_pid= service_pid= agent_pid=
+bus_pid='' store_pid='' service_pid='' agent_pid='' first_pid=''
 
 stop_pid() {
   [ -n "$1" ] || return 0
@@ -82,6 +83,11 @@ cleanup() {
   fi
 }
 trap cleanup EXIT
+
+fail() {
+  echo "$0: $*" >&2
+  exit 1
+}
 
 # Waits up to $1 seconds for the command that follows to succeed.
 wait_until() {
@@ -186,7 +192,8 @@ export XDG_CONFIG_HOME=$work/home/.config
 "$bin/larder-store" --catalogue "$work/catalogue" --port 0 \
   >"$work/logs/store.out" 2>"$work/logs/store.err" &
 store_pid=$!
-wait_until 20 grep -q '^larder-store listening on ' "$work/logs/store.out"
+wait_until 20 grep -q '^larder-store listening on ' "$work/logs/store.out" ||
+  fail "larder-store did not start: $(cat "$work/logs/store.err")"
 base=$(sed -n 's/^larder-store listening on //p' "$work/logs/store.out")
 readonly url=$base/assets/$ware/Notes.tar
 
@@ -199,13 +206,14 @@ LARDER_STORE_URL=$base/bag.plist "$bin/larderd" 2> >(
 ) &
 service_pid=$!
 # Serving on the bus, and its first look at the disk done.
-wait_until 20 service_serving
-wait_until 20 grep -qs 'Software map rebuild took' "$work/logs/larderd.log"
+wait_until 20 service_serving || fail "larderd did not serve on the bus"
+wait_until 20 grep -qs 'Software map rebuild took' "$work/logs/larderd.log" ||
+  fail "larderd did not look at the disk"
 
 lctl signin "$account" --password "$password" >"$work/logs/signin.out"
 lctl agent --answer ok >"$work/logs/agent.out" 2>"$work/logs/agent.err" &
 agent_pid=$!
-wait_until 20 grep -qs registered "$work/logs/agent.err"
+wait_until 20 grep -qs registered "$work/logs/agent.err" || fail "the agent did not register"
 
 # --- the two commands -------------------------------------------------------
 
@@ -214,15 +222,21 @@ wait_until 20 grep -qs registered "$work/logs/agent.err"
 reset_to_installed() {
   local pid
   for pid in $(app_pids); do kill -KILL "$pid" 2>/dev/null || true; done
-  wait_until 10 test -z "$(app_pids)"
+  wait_until 10 no_app || fail "the app did not stop"
   rm -rf "$app"
   cp -a "$work/pristine/Notes.app" "$app"
   "$app/bin/Notes" </dev/null >/dev/null 2>&1 &
   first_pid=$!
-  wait_until 10 test "$(readlink "/proc/$first_pid/exe" 2>/dev/null)" = "$app/bin/sleep"
+  wait_until 10 first_app_runs || fail "the 1.0 app did not start"
   # The service's live query sees the 1.0 bundle a little after the copy;
   # until then a check finds nothing to update.
-  wait_until 30 update_known
+  wait_until 30 update_known || fail "the service did not learn of the update again"
+}
+no_app() {
+  [ -z "$(app_pids)" ]
+}
+first_app_runs() {
+  [ "$(readlink "/proc/$first_pid/exe" 2>/dev/null)" = "$app/bin/sleep" ]
 }
 update_known() {
   lctl updates --check >"$work/logs/check.out" 2>&1 &&
@@ -231,7 +245,7 @@ update_known() {
 
 # A: prints the seconds, or fails with what went wrong.
 time_install() {
-  local out=$work/logs/install-$1 start end pid relaunched=
+  local out=$work/logs/install-$1 start end pid relaunched=''
   sync -f "$work"
   start=$EPOCHREALTIME
   if ! lctl install "$ware" >"$out.out" 2>"$out.err"; then
@@ -249,6 +263,7 @@ time_install() {
     wait_until 10 relaunched_app || { echo "install $1: the 2.0 app did not run again" >&2; return 1; }
     echo "install $1: the app ran again $(awk -v a="$waited" -v b="$EPOCHREALTIME" 'BEGIN{printf "%.3f", b-a}') s after larderctl returned" >&2
   fi
+  echo "$start $end" >"$out.times"
   awk -v a="$start" -v b="$end" 'BEGIN{printf "%.3f\n", b-a}'
 }
 relaunched_app() {
@@ -259,22 +274,45 @@ relaunched_app() {
 
 # B: prints the seconds, or fails.
 time_curl() {
-  local scratch=$work/curl start end size
+  local scratch=$work/curl start fetched end size
   rm -rf "$scratch"
   mkdir -p "$scratch/unpacked"
   sync -f "$work"
   start=$EPOCHREALTIME
-  curl -sSf -o "$scratch/Notes.tar" "$url" && tar -xf "$scratch/Notes.tar" -C "$scratch/unpacked"
+  curl -sSf -o "$scratch/Notes.tar" "$url"
+  fetched=$EPOCHREALTIME
+  tar -xf "$scratch/Notes.tar" -C "$scratch/unpacked"
   end=$EPOCHREALTIME
   size=$(stat -c %s "$scratch/unpacked/Notes.app/payload.bin")
   [ "$size" = "$payload_bytes" ] || { echo "curl $1: $size bytes unpacked" >&2; return 1; }
   rm -rf "$scratch"
+  awk -v a="$start" -v f="$fetched" -v b="$end" 'BEGIN{printf "%.3f %.3f\n", f-a, b-f}' \
+    >"$work/logs/curl-$1.steps"
   awk -v a="$start" -v b="$end" 'BEGIN{printf "%.3f\n", b-a}'
+}
+
+# Where an install's time went, from the lines of the service's log read
+# between its start and its end: the seconds from the start (or the step
+# before) to the first line of each step, and from the last to the end.
+readonly steps='Enqueuing UpdateOperation|Asking the user to quit|did terminate|Queued download of|Locked applications|Unlocked applications|Re-launching previously terminated'
+readonly step_names='request,rights|run start,pause|dialog,quit|purchase|download,digests|install|run end|relaunch,reply'
+install_steps() {
+  local times
+  read -r -a times <"$work/logs/install-$1.times"
+  awk -v s="${times[0]}" -v e="${times[1]}" -v steps="$steps" '
+    BEGIN { n = split(steps, marker, "|"); k = 1; last = s }
+    $1 >= s && $1 <= e && k <= n && index($0, marker[k]) { took[k] = $1 - last; last = $1; k++ }
+    END {
+      if (k <= n) { print "not found in the log: " marker[k]; exit }
+      took[k] = e - last
+      for (i = 1; i <= k; i++) printf "%s%.3f", (i > 1 ? " " : ""), took[i]
+      print ""
+    }' "$work/logs/larderd.log"
 }
 
 median() {
   sort -g | awk '{v[NR] = $1} END {
-    if (NR % 2) printf "%.3f\n", v[(NR + 1) / 2]; else printf "%.3f\n", (v[NR / 2] + v[NR / 2 + 1]) / 2 }'
+    if (NR == 0) print "-"; else if (NR % 2) printf "%.3f\n", v[(NR + 1) / 2]; else printf "%.3f\n", (v[NR / 2] + v[NR / 2 + 1]) / 2 }'
 }
 
 # --- the rounds -------------------------------------------------------------
@@ -306,4 +344,20 @@ echo "median A (larderctl install, to the relaunched app): $median_a s"
 echo "median B (curl, then tar -xf):                      $median_b s"
 echo "median of the pairs' A/B: $(printf '%s\n' "${ratios[@]}" | median)"
 echo "A/B of the medians:       $(awk -v a="$median_a" -v b="$median_b" 'BEGIN{printf "%.2f", a/b}')"
+awk -v r="$(printf '%s\n' "${ratios[@]}" | median)" 'BEGIN {
+  print "bound of 1.5 x on the median of the pairs: " (r <= 1.5 ? "holds" : "NOT met") }'
 echo "load average at the end:  $(cut -d' ' -f1-3 /proc/loadavg)"
+
+# The steps of each counted install, and their medians.
+echo
+echo "steps of A, seconds: ${step_names//|/  }"
+for round in $(seq 1 "$runs"); do
+  echo "round $round: $(install_steps "$round")"
+done | tee "$work/logs/steps"
+columns=$(tr '|' '\n' <<<"$step_names" | wc -l)
+medians=()
+for column in $(seq 2 $((columns + 1))); do
+  medians+=("$(grep -v 'not found' "$work/logs/steps" | awk -v c=$((column + 1)) '{print $c}' | median)")
+done
+echo "medians: ${medians[*]}"
+echo "B's two steps, medians: curl $(cat "$work"/logs/curl-[0-9]*.steps | awk '{print $1}' | median) s, tar $(cat "$work"/logs/curl-[0-9]*.steps | awk '{print $2}' | median) s"
