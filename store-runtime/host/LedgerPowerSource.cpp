@@ -156,6 +156,18 @@ class PollingObservation final : public LedgerPowerSource::Observation {
   RunLoop::TimerId timer_;
 };
 
+// Calls `visit` with the folder of each battery of the machine in `folder`.
+template <typename Visit>
+void forEachSystemBattery(const std::string& folder, Visit&& visit) {
+  std::error_code code;
+  std::filesystem::directory_iterator iterator(folder, code);
+  for (std::filesystem::directory_iterator end; !code && iterator != end;
+       iterator.increment(code)) {
+    const std::string supply = iterator->path().string();
+    if (isSystemBattery(supply)) visit(supply);
+  }
+}
+
 }  // namespace
 
 double LedgerPowerSource::remainingTimeEstimate() {
@@ -168,17 +180,12 @@ double LedgerPowerSource::remainingTimeEstimateInSupplyFolder(const std::string&
   }
   double total = 0;
   bool anyEstimate = false;
-  std::error_code code;
-  std::filesystem::directory_iterator iterator(folder, code);
-  for (std::filesystem::directory_iterator end; !code && iterator != end;
-       iterator.increment(code)) {
-    const std::string supply = iterator->path().string();
-    if (!isSystemBattery(supply)) continue;
+  forEachSystemBattery(folder, [&](const std::string& supply) {
     if (std::optional<double> seconds = secondsLeftInBattery(supply)) {
       total += *seconds;
       anyEstimate = true;
     }
-  }
+  });
   TILL_LOG(3, "%@: Remaining time %@ s", kSpeaker, anyEstimate ? total : kUnknownRemainingTime);
   return anyEstimate ? total : kUnknownRemainingTime;
 }
@@ -190,16 +197,11 @@ std::int64_t LedgerPowerSource::batteryWarningLevel() {
 std::int64_t LedgerPowerSource::batteryWarningLevelInSupplyFolder(const std::string& folder) {
   if (BackgroundActivityPowerSource::mainsPowerInSupplyFolder(folder)) return kNoWarning;
   std::optional<std::int64_t> least;
-  std::error_code code;
-  std::filesystem::directory_iterator iterator(folder, code);
-  for (std::filesystem::directory_iterator end; !code && iterator != end;
-       iterator.increment(code)) {
-    const std::string supply = iterator->path().string();
-    if (!isSystemBattery(supply)) continue;
+  forEachSystemBattery(folder, [&](const std::string& supply) {
     if (std::optional<std::int64_t> level = warningLevelOfBattery(supply)) {
       least = least ? std::min(*least, *level) : *level;
     }
-  }
+  });
   TILL_LOG(3, "%@: Battery warning level %@", kSpeaker, least.value_or(kNoWarning));
   return least.value_or(kNoWarning);
 }

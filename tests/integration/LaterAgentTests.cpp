@@ -14,6 +14,7 @@
 #include "store-runtime/host/PlatformStateFile.h"
 #include "store-runtime/records/RecordDateText.h"
 #include "tests/integration/StoreAndService.h"
+#include "tests/unit/FakeSystemServices.h"
 
 namespace larder::testing {
 namespace {
@@ -50,23 +51,15 @@ class RecordingLaterService {
   }
   ~RecordingLaterService() { connection_->leaveEventLoop(); }
 
-  // Every call is answered after it is recorded, so once larderctl has
-  // ended, all of its calls are here.
-  std::vector<std::string> calls() const {
-    MutexLock lock(mutex_);
-    return calls_;
-  }
+  // Once larderctl has ended, all of its calls are here.
+  std::vector<std::string> calls() const { return calls_.calls(); }
 
  private:
-  void record(std::string call) {
-    MutexLock lock(mutex_);
-    calls_.push_back(std::move(call));
-  }
+  void record(std::string call) { calls_.add(std::move(call)); }
 
   std::unique_ptr<sdbus::IConnection> connection_;
   std::unique_ptr<sdbus::IObject> object_;
-  mutable Mutex mutex_;
-  std::vector<std::string> calls_ GUARDED_BY(mutex_);
+  CallRecord calls_;
 };
 
 class LaterAgentTest : public StoreAndServiceTest {

@@ -15,6 +15,25 @@
 
 namespace larder::testing {
 
+// The calls a fake service was given, each as one line of text. A call is
+// recorded before it is answered, so every call of a caller that has
+// returned is in.
+class CallRecord {
+ public:
+  void add(std::string call) {
+    MutexLock lock(mutex_);
+    calls_.push_back(std::move(call));
+  }
+  std::vector<std::string> calls() const {
+    MutexLock lock(mutex_);
+    return calls_;
+  }
+
+ private:
+  mutable Mutex mutex_;
+  std::vector<std::string> calls_ GUARDED_BY(mutex_);
+};
+
 class FakePolkitAuthority {
  public:
   // What the authority answers for an action.
@@ -127,25 +146,16 @@ class FakeLogind {
   FakeLogind(const FakeLogind&) = delete;
   FakeLogind& operator=(const FakeLogind&) = delete;
 
-  // The calls so far. A caller's call is recorded before it is answered,
-  // so every call of a caller that has returned is in.
-  std::vector<std::string> calls() const {
-    MutexLock lock(mutex_);
-    return calls_;
-  }
+  std::vector<std::string> calls() const { return calls_.calls(); }
 
  private:
   static constexpr const char* kManager = "org.freedesktop.login1.Manager";
 
-  void record(std::string call) {
-    MutexLock lock(mutex_);
-    calls_.push_back(std::move(call));
-  }
+  void record(std::string call) { calls_.add(std::move(call)); }
 
   std::unique_ptr<sdbus::IConnection> connection_;
   std::unique_ptr<sdbus::IObject> object_;
-  mutable Mutex mutex_;
-  std::vector<std::string> calls_ GUARDED_BY(mutex_);
+  CallRecord calls_;
 };
 
 }  // namespace larder::testing
