@@ -22,7 +22,9 @@
 # Before every A, outside the timing, the app is stopped, the 1.0 bundle
 # put back, the app started again and the update checked for until the
 # service knows it. The order of A and B alternates from round to round, and
-# one round of each is run first as a warm-up, not counted.
+# one round of each is run first as a warm-up, not counted. At the end it
+# prints each pair, the medians and the ratios, and each A cut into its
+# steps by the lines of larderd's log.
 #
 # --runs N   counted rounds (default 7, at least 5)
 # --keep     leave the temporary folder (larderd's log with the time each
