@@ -372,8 +372,22 @@ RunningApplication::runningApplicationsWithBundleIdentifier(std::string_view bun
   });
 }
 
+// A private platform root is a machine of its own: its applications are
+// the bundles inside it or inside the user's home, so that a test or a demo
+// that quits "every application" never reaches the processes of another
+// one beside it, nor the desktop's.
 std::vector<std::shared_ptr<RunningApplication>> RunningApplication::allRunningApplications() {
-  return scan([](const Description&) { return true; });
+  const std::string root = Environment::platformRoot();
+  if (root == "/") return scan([](const Description&) { return true; });
+  const std::string home = Environment::homeDirectory();
+  auto inside = [](std::string_view path, const std::string& folder) {
+    return !folder.empty() && path.size() > folder.size() && path.starts_with(folder) &&
+           path[folder.size()] == '/';
+  };
+  return scan([&](const Description& description) {
+    return description.bundleURL &&
+           (inside(*description.bundleURL, root) || inside(*description.bundleURL, home));
+  });
 }
 
 Result<pid_t> RunningApplication::launchBundle(const std::string& bundlePath) {

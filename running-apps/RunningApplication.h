@@ -56,7 +56,8 @@ class RunningApplication : public std::enable_shared_from_this<RunningApplicatio
   static std::shared_ptr<RunningApplication> withPid(pid_t pid);
   static std::vector<std::shared_ptr<RunningApplication>> runningApplicationsWithBundleIdentifier(
       std::string_view bundleIdentifier);
-  // This user's applications, in pid order.
+  // This user's applications, in pid order; under a platform root other
+  // than "/", only those whose bundle lies inside the root or the home.
   static std::vector<std::shared_ptr<RunningApplication>> allRunningApplications();
 
   // Starts "bin/<HostBundleExecutable>" of the bundle at `bundlePath` in a
