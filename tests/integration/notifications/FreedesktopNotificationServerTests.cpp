@@ -16,7 +16,6 @@
 namespace larder::testing {
 namespace {
 
-
 UserNotification alertWithMenu() {
   UserNotification notification;
   notification.title = "Updates could not be installed";
