@@ -292,8 +292,7 @@ std::shared_ptr<UpdateOperation> UpdateController::softwareUpdateDidFinishBackgr
                                   PreferenceScope::User);
   recordSilentInstalls(info);
 
-  auto operation = std::make_shared<UpdateOperation>(
-      storeClient_, std::weak_ptr<UpdateOperationController>(weak_from_this()));
+  auto operation = makeOperation();
   configureTimedTasks(info, *operation);
   if (valueOf(info, "updateNotificationsOnly").boolValue()) {
     TILL_LOG(2, "%@: updateNotificationsOnly=true, setting updateNotificationsOnly=YES on %@",
@@ -433,6 +432,14 @@ void UpdateController::applyPostLogoutResults(const PlistDictionary& info,
     });
   }
   confirmPendingUpdatesInJournal(confirmedKeys);
+}
+
+std::shared_ptr<UpdateOperation> UpdateController::makeOperation(
+    const std::function<void(UpdateOperationSettings&)>& configure) {
+  auto operation = std::make_shared<UpdateOperation>(
+      storeClient_, std::weak_ptr<UpdateOperationController>(weak_from_this()));
+  if (configure) operation->changeSettings(configure);
+  return operation;
 }
 
 void UpdateController::enqueue(const std::shared_ptr<UpdateOperation>& operation) const {

@@ -38,6 +38,7 @@ namespace larder {
 class SoftwareMap;
 class UpdateNotificationCatalogue;
 class UpdateOperation;
+struct UpdateOperationSettings;
 class UserNotificationCenter;
 
 // The policy centre for the updates of one store client: when the update
@@ -284,6 +285,9 @@ class UpdateController final : public UpdateQueueDelegate,
   void initWithStoreClient(SoftwareMap& softwareMap);
   void availableUpdatesDidChangeInternal();
   void sendBadgeMessage(std::uint64_t count) const;
+  // A run of this controller's client with the settings `configure` makes.
+  std::shared_ptr<UpdateOperation> makeOperation(
+      const std::function<void(UpdateOperationSettings&)>& configure = {});
   void enqueue(const std::shared_ptr<UpdateOperation>& operation) const;
   void refuseStart(const std::vector<LedgerUpdateRef>& apps, const OSUpdateList& osUpdates,
                    const std::shared_ptr<VendUpdateDelegate>& delegate,

@@ -91,18 +91,16 @@ UpdateController::OSUpdateList UpdateController::osUpdatesToInstallLater() {
                kSpeaker, update);
       continue;
     }
-    if (update.firmwareWarning() && !userAcceptsAgreement(update, true)) {
+    // The firmware warning first, then the licence: one declined text
+    // leaves the update out.
+    const char* declined =
+        update.firmwareWarning() && !userAcceptsAgreement(update, true)     ? "firmware warning"
+        : update.licenseAgreement() && !userAcceptsAgreement(update, false) ? "license agreement"
+                                                                            : nullptr;
+    if (declined) {
       TILL_LOG(1,
-               "%@: installAvailableUpdatesLater skipping OS Update %@ because the firmware "
-               "warning was declined",
-               kSpeaker, update);
-      continue;
-    }
-    if (update.licenseAgreement() && !userAcceptsAgreement(update, false)) {
-      TILL_LOG(1,
-               "%@: installAvailableUpdatesLater skipping OS Update %@ because the license "
-               "agreement was declined",
-               kSpeaker, update);
+               "%@: installAvailableUpdatesLater skipping OS Update %@ because the %@ was declined",
+               kSpeaker, update, declined);
       continue;
     }
     later.push_back(update);
@@ -196,9 +194,7 @@ void UpdateController::cancelUpdatesToBeInstalledLater() {
 // The app updates are not handed over: the run reads the stored list.
 std::shared_ptr<UpdateOperation> UpdateController::nowIsLaterWithMode(std::int64_t mode,
                                                                       bool countdownDeferred) {
-  auto operation = std::make_shared<UpdateOperation>(
-      storeClient_, std::weak_ptr<UpdateOperationController>(weak_from_this()));
-  operation->changeSettings([&](UpdateOperationSettings& s) {
+  auto operation = makeOperation([&](UpdateOperationSettings& s) {
     s.doItLaterMode = mode;
     s.restartCountdownWasDeferred = countdownDeferred;
     s.nowIsLater = true;

@@ -146,9 +146,7 @@ void UpdateController::startAppUpdates(const std::optional<std::vector<LedgerUpd
     refuseStart(appList, osList, delegate, completion, checked.error());
     return;
   }
-  auto operation = std::make_shared<UpdateOperation>(
-      storeClient_, std::weak_ptr<UpdateOperationController>(weak_from_this()));
-  operation->changeSettings([&](UpdateOperationSettings& s) {
+  auto operation = makeOperation([&](UpdateOperationSettings& s) {
     s.userInitiated = true;
     s.updateDelegate = delegate;
     if (apps) s.appUpdatesToInstall = *apps;
@@ -296,9 +294,7 @@ std::shared_ptr<UpdateOperation> UpdateController::installAvailableCriticalUpdat
 
 // No checks here: the run makes its own decisions over what is available.
 std::shared_ptr<UpdateOperation> UpdateController::enqueueUserStartedRun(bool criticalOnly) {
-  auto operation = std::make_shared<UpdateOperation>(
-      storeClient_, std::weak_ptr<UpdateOperationController>(weak_from_this()));
-  operation->changeSettings([&](UpdateOperationSettings& s) {
+  auto operation = makeOperation([&](UpdateOperationSettings& s) {
     s.userInitiated = true;
     s.shouldInstallCriticalUpdatesOnly = criticalOnly;
     s.osUpdateCancelTokens = osUpdateCancelTokens_;
