@@ -104,6 +104,16 @@ TEST_F(UpdateRunServiceTest, AReportStagesTheUpdateOfARunningAppAndTheNextInstal
   EXPECT_NE(runs.output.find("Notes (7101)"), std::string::npos) << runs.output;
   EXPECT_NE(runs.output.find("staged, held back: the app is running (code 3)"), std::string::npos)
       << runs.output;
+  // Asked by bundle identifier, the audit's item entry is found through the
+  // listed update.
+  const LarderctlRun why = run({"why", "com.example.e2e.notes"});
+  EXPECT_EQ(why.status, 0) << why.errors;
+  EXPECT_TRUE(why.output.starts_with("Notes (7101): held back: the application was running;"))
+      << why.output;
+  EXPECT_NE(why.output.find("(code 3)"), std::string::npos) << why.output;
+  EXPECT_NE(why.output.find("it is downloaded and ready to install"), std::string::npos)
+      << why.output;
+  EXPECT_EQ(run({"why", "NO-SUCH-UPDATE"}).status, 3);
 
   ::kill(pid_, SIGKILL);
   ASSERT_TRUE(eventually([&] { return RunningApplication::withPid(pid_) == nullptr; }));
@@ -115,6 +125,9 @@ TEST_F(UpdateRunServiceTest, AReportStagesTheUpdateOfARunningAppAndTheNextInstal
   const std::string after = run({"runs"}).output;
   EXPECT_NE(after.find("(7101)"), std::string::npos) << after;
   EXPECT_NE(after.find("installed"), std::string::npos) << after;
+  const LarderctlRun installed = run({"why", "7101"});
+  EXPECT_NE(installed.output.find("7101: installed by the last background run"), std::string::npos)
+      << installed.output << installed.errors;
 }
 
 }  // namespace

@@ -7,6 +7,8 @@
 #include <filesystem>
 #include <fstream>
 #include <future>
+#include <map>
+#include <nlohmann/json.hpp>
 #include <thread>
 
 #include "notifications/center/UserNotificationCenter.h"
@@ -21,6 +23,7 @@
 #include "store-runtime/core/PreferenceKeys.h"
 #include "store-runtime/dialogs/LedgerLocalizedString.h"
 #include "store-runtime/download/VendFileManager.h"
+#include "store-runtime/host/LedgerTraceMessage.h"
 #include "store-runtime/host/LedgerTwilightAgent.h"
 #include "store-runtime/host/PlatformStateFile.h"
 #include "store-runtime/host/PreferenceStore.h"
@@ -254,6 +257,36 @@ TEST_F(UpdateRunTest, AnAppThatIsNotRunningIsStagedAndInstalledInOneRun) {
   EXPECT_EQ(told[0].source(), "autoInstalledUpdates");
   EXPECT_EQ(told[0].title, "2 Apps Updated");
   EXPECT_NE(told[0].informativeText.find("were updated automatically."), std::string::npos);
+}
+
+// Traces name the vendor's own applications only: another vendor's app is
+// "Third Party App" with item 0, also when it is held back.
+TEST_F(UpdateRunTest, TracesOfHeldBackAppsNameOnlyTheVendorsOwn) {
+  const std::string notes = installWithUpdate("Notes", "com.example.notes", kNotesID);
+  const std::string atlas = installWithUpdate("Atlas", "com.orvane.atlas", kAtlasID);
+  startEverything();
+  launch(notes);
+  launch(atlas);
+  auto run = backgroundRun(true, true);
+  runToTheEnd(*run);
+  LedgerTraceMessageWaitUntilWritten();
+  std::map<std::string, nlohmann::json> traced;
+  std::ifstream log(LedgerTraceMessageLogPath());
+  for (std::string line; std::getline(log, line);) {
+    nlohmann::json record = nlohmann::json::parse(line);
+    if (record["domain"] == "com.orvane.Quaymart.autoupdate.app") {
+      traced[record["message"]["bundle_id"]] = record["message"];
+    }
+  }
+  ASSERT_EQ(traced.size(), 2U) << "one trace per held-back app";
+  EXPECT_EQ(traced["com.orvane.atlas"]["ware_id"], kAtlasID);
+  EXPECT_EQ(traced["com.orvane.atlas"]["abort_code"], UpdateOperation::kAbortAppRunning);
+  EXPECT_EQ(traced["com.orvane.atlas"]["result"], "fail");
+  EXPECT_EQ(traced["Third Party App"]["ware_id"], 0);
+  EXPECT_EQ(traced["Third Party App"]["abort_code"], UpdateOperation::kAbortAppRunning);
+  for (const auto& [name, message] : traced) {
+    EXPECT_EQ(message.dump().find("com.example"), std::string::npos) << message.dump();
+  }
 }
 
 // Each way an automatic update can fail leaves the old version installed

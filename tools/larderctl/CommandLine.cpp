@@ -220,6 +220,14 @@ void CommandLine::addUpdateCommands() {
   app_.add_subcommand("runs",
                       "show what the update machinery is doing and what its last background run "
                       "decided for each update (exit status 3: no run recorded yet)");
+  app_.add_subcommand("why",
+                      "explain in words why an update was not installed, from what the service "
+                      "offers, the last background run's decisions and the installed-updates "
+                      "journal (exit status 3: nothing is known of it)")
+      ->add_option("ITEM|KEY", whyTarget,
+                   "an app update's item identifier, bundle identifier or title, or an OS "
+                   "update's product key or title")
+      ->required();
   auto* notifications = app_.add_subcommand(
       "notifications",
       "list the notifications the service delivered (exit status 3: none), or act on one as the "

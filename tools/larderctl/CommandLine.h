@@ -74,6 +74,8 @@ class CommandLine {
   // later-agent
   bool laterAgentOnce = false;
   std::optional<std::string> laterAgentNow;
+  // why
+  std::string whyTarget;
   // notifications
   std::optional<std::string> activateNotification;
   std::optional<std::string> notificationAction;

@@ -33,8 +33,11 @@ const PlistValue* listedUpdate(const PlistArray& listed, const std::string& item
   return nullptr;
 }
 
-std::string localTime(double secondsSince1970) {
-  const std::time_t time = static_cast<std::time_t>(secondsSince1970);
+}  // namespace
+
+std::string RunsCommand::localTime(const PlistValue& date) {
+  if (!date.isDate()) return "-";
+  const std::time_t time = static_cast<std::time_t>(date.date()->secondsSince1970);
   std::tm parts{};
   localtime_r(&time, &parts);
   std::ostringstream text;
@@ -42,7 +45,14 @@ std::string localTime(double secondsSince1970) {
   return text.str();
 }
 
-}  // namespace
+PlistDictionary RunsCommand::readLastAudit() {
+  if (auto bytes = FileIO::read(auditFilePath())) {
+    if (auto value = PropertyListSerialization::read(*bytes); value && value->dictionary()) {
+      return *value->dictionary();
+    }
+  }
+  return {};
+}
 
 std::string RunsCommand::auditFilePath() {
   return Environment::cacheHome() + "/" + std::string(kDaemonDefaultsID) +
@@ -59,12 +69,7 @@ std::string RunsCommand::outcome(const PlistValue& entry, const PlistValue* list
 int RunsCommand::run() {
   const PlistValue downloads = client_.callStoreRuntime("Downloads", {kAllDownloads}).at(0);
   const PlistValue listed = client_.call("AvailableUpdates", {}).at(0);
-  PlistDictionary audit;
-  if (auto bytes = FileIO::read(auditFilePath())) {
-    if (auto value = PropertyListSerialization::read(*bytes); value && value->dictionary()) {
-      audit = *value->dictionary();
-    }
-  }
+  const PlistDictionary audit = readLastAudit();
   if (json_) {
     std::cout << JsonConversion::toJson(PlistDictionary{{"inProgress", downloads},
                                                         {"lastRun", audit},
@@ -96,10 +101,7 @@ void RunsCommand::printInProgress(const PlistArray& downloads) const {
 
 void RunsCommand::printLastRun(const PlistDictionary& audit, const PlistArray& listed) const {
   const PlistValue record(audit);
-  const PlistValue& date = record["runDate"];
-  std::cout << "last background run: "
-            << (date.isDate() ? localTime(date.date()->secondsSince1970) : std::string("-"))
-            << std::endl;
+  std::cout << "last background run: " << localTime(record["runDate"]) << std::endl;
   auto print = [](const std::string& name, const std::string& what) {
     std::cout << "  " << std::left << std::setw(28) << name << what << std::endl;
   };

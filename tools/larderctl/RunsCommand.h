@@ -20,6 +20,11 @@ class RunsCommand {
 
   // "<caches>/com.orvane.larderd/UpdateOperationAudit.plist".
   static std::string auditFilePath();
+  // The audit of the last background run; empty when none was recorded or
+  // the file does not parse.
+  static PlistDictionary readLastAudit();
+  // "2024-05-01 10:00:00" in local time.
+  static std::string localTime(const PlistValue& date);
   // What became of one app update: "installed", "staged", "staged, held
   // back: <reason> (code N)", "held back: <reason> (code N)", "install
   // failed", from its audit entry and its record if it is still listed.

@@ -25,6 +25,7 @@
 #include "tools/larderctl/StoreCommands.h"
 #include "tools/larderctl/UpdatesCommand.h"
 #include "tools/larderctl/WatchCommand.h"
+#include "tools/larderctl/WhyCommand.h"
 
 namespace {
 
@@ -171,6 +172,10 @@ int runChosen(const CommandLine& line) {
   if (line.chose("later")) {
     ServiceClient client = connect(line.global);
     return LaterCommand(client, line.global.json).run(line.later);
+  }
+  if (line.chose("why")) {
+    ServiceClient client = connect(line.global);
+    return WhyCommand(client, line.global.json).run(line.whyTarget);
   }
   if (line.chose("runs")) {
     ServiceClient client = connect(line.global);

@@ -12,6 +12,7 @@
 #include "tools/larderctl/CallArguments.h"
 #include "tools/larderctl/DialogPrompt.h"
 #include "tools/larderctl/Spinner.h"
+#include "tools/larderctl/UpdateExplanation.h"
 #include "tools/larderctl/ValueText.h"
 
 namespace larder {
@@ -109,6 +110,43 @@ TEST(ValueTextTest, DatesInLocalTimeEnumerationsByNameOtherValuesAsTheyAre) {
   EXPECT_EQ(ValueText::of("elapsed", 1.5), "1.5");
   zone.restore();
   ::tzset();
+}
+
+TEST(UpdateExplanationTest, EachCodeSaysWhetherToWaitOrWhatHeldItBackAndQuotesOnlyWhatAddsToIt) {
+  using Kind = UpdateExplanation::Kind;
+  struct Row {
+    std::int64_t code;
+    std::optional<std::string> reason;
+    Kind kind;
+    std::string expected;
+  };
+  const std::vector<Row> rows{
+      {0, std::nullopt, Kind::kApp, "no objection"},
+      {3, "the app is running", Kind::kApp,
+       "held back: the application was running; a background run never quits an application, "
+       "so the update goes in once it has quit, or at once with `larderctl install` (code 3)"},
+      {6, "The account has no payment method.", Kind::kApp,
+       "held back: buying the update failed (\"The account has no payment method.\") (code 6)"},
+      {100, "the app can not be quit safely (unsaved documents)", Kind::kApp,
+       "held back: the application was running and could not be quit safely (\"the app can not "
+       "be quit safely (unsaved documents)\") (code 100)"},
+      {502, "too soon to start auto-update", Kind::kApp,
+       "not yet: it is not yet time for automatic installs (code 502)"},
+      // The same code means another thing for an OS update.
+      {100, std::nullopt, Kind::kOS,
+       "held back: an application that had to quit could not be quit safely (code 100)"},
+      {104, "the update requires restart but other users are logged in", Kind::kOS,
+       "held back: the update needs a restart and other users are logged in (code 104)"},
+      // Codes that only apply to the other kind, or that a preference
+      // imposes, fall back on the recorded reason.
+      {104, std::nullopt, Kind::kApp, "held back: no reason was recorded (code 104)"},
+      {42, "forced by preference", Kind::kOS, "held back: \"forced by preference\" (code 42)"},
+      {550, std::nullopt, Kind::kApp, "not yet: no reason was recorded (code 550)"},
+  };
+  for (const Row& row : rows) {
+    EXPECT_EQ(UpdateExplanation::abortCode(row.code, row.reason, row.kind), row.expected)
+        << "code " << row.code;
+  }
 }
 
 TEST(SpinnerTest, TheLineTurnsAndCountsTheSeconds) {
