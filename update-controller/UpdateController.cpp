@@ -438,6 +438,10 @@ std::shared_ptr<UpdateOperation> UpdateController::makeOperation(
     const std::function<void(UpdateOperationSettings&)>& configure) {
   auto operation = std::make_shared<UpdateOperation>(
       storeClient_, std::weak_ptr<UpdateOperationController>(weak_from_this()));
+  // Every run's installs can be cancelled through the controller, whoever
+  // started the run.
+  operation->changeSettings(
+      [&](UpdateOperationSettings& s) { s.osUpdateCancelTokens = osUpdateCancelTokens_; });
   if (configure) operation->changeSettings(configure);
   return operation;
 }

@@ -169,7 +169,7 @@ class UpdateController final : public UpdateQueueDelegate,
   // decisions; no checks here. The run enqueued is returned.
   std::shared_ptr<UpdateOperation> installAllAvailableUpdates();
   std::shared_ptr<UpdateOperation> installAvailableCriticalUpdates();
-  void cancelOSUpdates(const OSUpdateList& osUpdates);
+  void cancelOSUpdates(const OSUpdateList& osUpdates) override;
   // A key without a token is logged and passed over; a token that serves
   // several keys is cancelled once.
   void cancelOSUpdatesWithProductKeys(const std::vector<std::string>& productKeys);

@@ -151,7 +151,6 @@ void UpdateController::startAppUpdates(const std::optional<std::vector<LedgerUpd
     s.updateDelegate = delegate;
     if (apps) s.appUpdatesToInstall = *apps;
     s.osUpdatesToInstall = osList;
-    s.osUpdateCancelTokens = osUpdateCancelTokens_;
   });
   // The run holds the delegate weakly; the handler keeps it until the end.
   operation->setCompletionHandler([delegate, completion = std::move(completion)](
@@ -297,7 +296,6 @@ std::shared_ptr<UpdateOperation> UpdateController::enqueueUserStartedRun(bool cr
   auto operation = makeOperation([&](UpdateOperationSettings& s) {
     s.userInitiated = true;
     s.shouldInstallCriticalUpdatesOnly = criticalOnly;
-    s.osUpdateCancelTokens = osUpdateCancelTokens_;
   });
   enqueue(operation);
   return operation;

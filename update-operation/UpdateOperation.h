@@ -24,6 +24,7 @@
 namespace larder {
 
 class DispatchQueue;
+class LedgerFileProgress;
 class UpdateQueue;
 class UpdateRunRecord;
 struct VendPurchaseRecord;
@@ -269,6 +270,16 @@ class UpdateOperation : public VendOperation {
   void downloadUpdatesForPostLogoutInstall(std::vector<SysupQuaymartUpdate> updates,
                                            std::function<void(const OptionalError&)> completion);
   void dropFromRestart(const std::vector<SysupQuaymartUpdate>& updates);
+  // --- Progress of OS updates that bring an application ---
+  void publishStatus(const LedgerSoftwareUpdateStatus& status,
+                     const std::vector<SysupQuaymartUpdate>& updates);
+  void endProgressItem(const std::string& identifier, const SysupQuaymartUpdate& update,
+                       const LedgerSoftwareUpdateStatus& status);
+  std::shared_ptr<LedgerFileProgress> progressItemFor(
+      const std::string& identifier, const SysupQuaymartUpdate& update,
+      const std::vector<SysupQuaymartUpdate>& updates);
+  void launchInstalledApplication(const std::string& identifier) const;
+
   void rememberCancelToken(const std::optional<std::string>& token,
                            const std::vector<SysupQuaymartUpdate>& updates,
                            std::string_view startName);
@@ -296,6 +307,9 @@ class UpdateOperation : public VendOperation {
   UpdateOperationSettings settings_ GUARDED_BY(settingsMutex_);
   UpdateOperationRunState runState_ GUARDED_BY(settingsMutex_);
   PlistDictionary auditInfo_ GUARDED_BY(settingsMutex_);
+  // By the bundle identifier the OS update brings.
+  std::map<std::string, std::shared_ptr<LedgerFileProgress>> progressItems_
+      GUARDED_BY(settingsMutex_);
 };
 
 }  // namespace larder

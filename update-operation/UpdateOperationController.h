@@ -77,6 +77,7 @@ class UpdateOperationController : public UpdatePolicy {
   virtual void osUpdatesChangedProgress(const OSUpdateList& osUpdates,
                                         const LedgerSoftwareUpdateStatus& progress) const = 0;
   virtual void didStartOSUpdates(const OSUpdateList& osUpdates) = 0;
+  virtual void cancelOSUpdates(const OSUpdateList& osUpdates) = 0;
   virtual void didFinishOSUpdates(const OSUpdateList& osUpdates) = 0;
   virtual void appendInstalledUpdatesToJournal(const std::vector<LedgerUpdateRef>& appUpdates,
                                                const OSUpdateList& osUpdates) = 0;

@@ -610,10 +610,11 @@ void UpdateOperation::downloadAndInstallOSUpdates(
       DispatchQueue::create("UpdateOperation OS Update Notify Queue", DispatchQueue::Kind::Serial);
   std::optional<std::string> token = sysup.startInstallingUpdates(
       updates, notifyQueue, userInitiated,
-      [this, updates](const PlistDictionary& statusInfo, double percent, bool canCancel) {
+      [this, updates](const PlistDictionary& statusInfo, bool canCancel, double percent) {
         LedgerSoftwareUpdateStatus status =
             LedgerSoftwareUpdateStatus::initWithProgress(percent, statusInfo, canCancel);
         reportOSUpdatesChangedProgress(updates, status);
+        publishStatus(status, updates);
         TILL_LOG(2, "%@: OS Updates install progress: %@", kSpeaker, status);
       },
       [this, updates, controller, relaunchIdentifiers, completion](const OptionalError& error) {
@@ -671,6 +672,7 @@ void UpdateOperation::finishOSUpdateInstall(const std::vector<SysupQuaymartUpdat
     TILL_LOG(2, "%@: Finished installing OS Updates %@", kSpeaker, describeList(updates));
   }
   reportOSUpdatesChangedProgress(updates, status);
+  publishStatus(status, updates);
   std::shared_ptr<UpdateOperationController> controller = updateController();
   if (controller) {
     controller->didFinishOSUpdates(updates);
@@ -701,7 +703,7 @@ void UpdateOperation::downloadUpdatesForPostLogoutInstall(
   std::optional<std::string> token =
       SysupQuaymartUpdateController::sharedUpdateController().startDownloadingPostLogoutUpdates(
           updates, notifyQueue,
-          [this, updates](const PlistDictionary& statusInfo, double percent, bool) {
+          [this, updates](const PlistDictionary& statusInfo, bool, double percent) {
             LedgerSoftwareUpdateStatus status =
                 LedgerSoftwareUpdateStatus::initWithProgress(percent, statusInfo, true);
             reportOSUpdatesChangedProgress(updates, status);

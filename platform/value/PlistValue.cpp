@@ -1,6 +1,7 @@
 #include "platform/value/PlistValue.h"
 
 #include <charconv>
+#include <chrono>
 #include <cmath>
 #include <limits>
 
@@ -197,6 +198,11 @@ const PlistValue& PlistValue::null() {
 
 bool operator==(const PlistValue& a, const PlistValue& b) {
   return a.storage_ == b.storage_;
+}
+
+PlistDate PlistDate::now() {
+  using Seconds = std::chrono::duration<double>;
+  return PlistDate{Seconds(std::chrono::system_clock::now().time_since_epoch()).count()};
 }
 
 }  // namespace larder

@@ -19,6 +19,8 @@ using PlistData = std::vector<std::uint8_t>;
 // An absolute point in time, in seconds since 1970-01-01 UTC.
 struct PlistDate {
   double secondsSince1970 = 0;
+  // The present moment of the system clock.
+  static PlistDate now();
   friend bool operator==(const PlistDate&, const PlistDate&) = default;
 };
 

@@ -19,11 +19,6 @@ PlatformStateFile stateFile() {
   return PlatformStateFile::named("dock.plist");
 }
 
-PlistDate currentDate() {
-  auto since = std::chrono::system_clock::now().time_since_epoch();
-  return PlistDate{std::chrono::duration<double>(since).count()};
-}
-
 PlistDictionary& section(PlistDictionary& state, std::string_view name) {
   PlistValue& value = state[std::string(name)];
   if (!value.isDictionary()) value = PlistDictionary{};
@@ -56,7 +51,7 @@ void recordIcon(std::string_view identifier, std::string_view url,
   PlistDictionary entry{{"identifier", PlistValue(identifier)},
                         {"url", PlistValue(url)},
                         {"storeClient", PlistValue(storeClient.identifier())},
-                        {"date", PlistValue(currentDate())}};
+                        {"date", PlistValue(PlistDate::now())}};
   if (copied) entry["location"] = *copied;
   std::string key = storeClient.identifier() + "/" + std::string(identifier);
   stateFile().updateDictionary(
@@ -96,7 +91,7 @@ void LedgerDockMessaging::createPlaceholderWithName(std::string_view name, std::
     section(state, "placeholders")[std::string(name)] =
         PlistDictionary{{"identifier", PlistValue(identifier)},
                         {"iconData", PlistValue(iconData)},
-                        {"date", PlistValue(currentDate())}};
+                        {"date", PlistValue(PlistDate::now())}};
   });
 }
 
@@ -115,7 +110,7 @@ void LedgerDockMessaging::sendMessageForUpdate(const PlistDictionary& update,
     TILL_LOG(1, "%@: Message for an update without product key or title dropped", kSpeaker);
     return;
   }
-  PlistDictionary entry{{"status", PlistValue(status)}, {"date", PlistValue(currentDate())}};
+  PlistDictionary entry{{"status", PlistValue(status)}, {"date", PlistValue(PlistDate::now())}};
   if (!productKey.isNull()) entry["productKey"] = productKey;
   if (!title.isNull()) entry["title"] = title;
   std::string messageKey = *key;

@@ -15,11 +15,6 @@ PlatformStateFile stateFile() {
   return PlatformStateFile::named("login-service.plist");
 }
 
-PlistDate currentDate() {
-  auto since = std::chrono::system_clock::now().time_since_epoch();
-  return PlistDate{std::chrono::duration<double>(since).count()};
-}
-
 void increment(PlistDictionary& state, std::string_view key) {
   state[std::string(key)] = PlistValue(state)[key].int64Value() + 1;
 }
@@ -32,7 +27,7 @@ int change(PlistDictionary& state, bool take) {
   }
   if (take) {
     state[std::string(LedgerLoginService::kTakenKey)] = true;
-    state[std::string(LedgerLoginService::kDateKey)] = currentDate();
+    state[std::string(LedgerLoginService::kDateKey)] = PlistDate::now();
     increment(state, LedgerLoginService::kTakenCountKey);
     return LedgerLoginService::kSuccess;
   }

@@ -26,11 +26,6 @@ PlatformStateFile stateFile() {
   return PlatformStateFile::named("store-app.plist");
 }
 
-PlistDate currentDate() {
-  auto since = std::chrono::system_clock::now().time_since_epoch();
-  return PlistDate{std::chrono::duration<double>(since).count()};
-}
-
 // Starts `program url`; a detached thread reaps it so that no zombie stays.
 std::optional<pid_t> spawnStoreApplication(const std::string& program, const std::string& url) {
   std::string programArgument = program;
@@ -57,7 +52,7 @@ void recordLaunch(std::string_view url, bool launched) {
     if (!launches.isArray()) launches = PlistArray{};
     PlistArray& list = *launches.array();
     list.push_back(PlistDictionary{{"url", PlistValue(url)},
-                                   {"date", PlistValue(currentDate())},
+                                   {"date", PlistValue(PlistDate::now())},
                                    {"launched", PlistValue(launched)}});
     if (list.size() > LedgerQuaymartLauncher::kRecordedLaunches) {
       list.erase(list.begin(),

@@ -15,14 +15,9 @@ namespace {
 constexpr std::string_view kSpeaker = "LedgerSessionRestart";
 constexpr std::string_view kFileName = "restart-requests.plist";
 
-PlistDate currentDate() {
-  auto since = std::chrono::system_clock::now().time_since_epoch();
-  return PlistDate{std::chrono::duration<double>(since).count()};
-}
-
 bool record(LedgerSessionRestart::Kind kind, const std::vector<std::string>& productKeys) {
   PlistArray keys(productKeys.begin(), productKeys.end());
-  PlistDictionary entry{{"date", currentDate()},
+  PlistDictionary entry{{"date", PlistDate::now()},
                         {"kind", std::string(LedgerSessionRestart::kindName(kind))},
                         {"productKeys", std::move(keys)}};
   return PlatformStateFile(LedgerSessionRestart::requestsFilePath())

@@ -30,11 +30,6 @@ DispatchQueue& traceQueue() {
   return *queue;
 }
 
-PlistDate now() {
-  auto since = std::chrono::system_clock::now().time_since_epoch();
-  return PlistDate{std::chrono::duration<double>(since).count()};
-}
-
 bool writeWholeLine(int fd, const std::string& line) {
   std::size_t written = 0;
   while (written < line.size()) {
@@ -81,7 +76,7 @@ void LedgerTraceMessage(std::string_view domain, const PlistDictionary& message)
   std::string directory = Environment::stateDirectory();
   std::string path = LedgerTraceMessageLogPath();
   traceQueue().async([directory = std::move(directory), path = std::move(path),
-                      domain = std::string(domain), message, date = now()] {
+                      domain = std::string(domain), message, date = PlistDate::now()] {
     appendLine(directory, path, LedgerTraceMessageLine(domain, message, date) + "\n");
   });
 }

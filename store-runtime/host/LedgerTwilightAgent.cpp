@@ -23,11 +23,6 @@ bool storedFlag(std::string_view key) {
   return state[key].boolValue();
 }
 
-PlistDate currentDate() {
-  auto since = std::chrono::system_clock::now().time_since_epoch();
-  return PlistDate{std::chrono::duration<double>(since).count()};
-}
-
 // Takes the user's answer out of the state, if one is there.
 std::optional<std::int64_t> takeCountdownAnswer() {
   if (PlistValue(stateFile().readDictionary())[LedgerTwilightAgent::kCountdownAnswerKey].isNull()) {
@@ -103,7 +98,7 @@ void LedgerTwilightAgent::armObserverWithMode(std::int64_t mode) {
   stateFile().updateDictionary([mode](PlistDictionary& state) {
     state[std::string(kArmedKey)] = true;
     state[std::string(kArmedModeKey)] = mode;
-    state[std::string(kArmedDateKey)] = currentDate();
+    state[std::string(kArmedDateKey)] = PlistDate::now();
   });
 }
 
@@ -148,7 +143,7 @@ bool LedgerTwilightAgent::markArmingHandled(PlistDate armedDate, std::string_vie
     if (!sameDate(PlistValue(state)[kArmedDateKey], armedDate)) return;
     state[std::string(kHandledArmedDateKey)] = armedDate;
     state[std::string(kLaterOutcomeKey)] = std::string(outcome);
-    state[std::string(kLaterOutcomeDateKey)] = currentDate();
+    state[std::string(kLaterOutcomeDateKey)] = PlistDate::now();
     marked = true;
   });
   TILL_LOG(2, "%@: Later install %@%@", kSpeaker, outcome,

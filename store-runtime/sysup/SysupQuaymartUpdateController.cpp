@@ -53,11 +53,6 @@ std::vector<std::string> without(std::vector<std::string> keys, const std::set<s
   return keys;
 }
 
-PlistDate currentDate() {
-  auto since = std::chrono::system_clock::now().time_since_epoch();
-  return PlistDate{std::chrono::duration<double>(since).count()};
-}
-
 DispatchQueue& handlerQueue(const std::shared_ptr<DispatchQueue>& notifyOn) {
   return notifyOn ? *notifyOn : DispatchQueue::globalQueue();
 }
@@ -230,7 +225,7 @@ class SysupQuaymartUpdateController::Implementation {
         return;
       }
       PlistDictionary& installed = state.dictionaryNamed(SysupUpdateState::kInstalledKey);
-      for (const std::string& key : keys) installed[key] = currentDate();
+      for (const std::string& key : keys) installed[key] = PlistDate::now();
       for (std::string_view list : {SysupUpdateState::kAvailableKey, SysupUpdateState::kLaterKey}) {
         state.setKeyList(list, without(state.keyList(list), keys));
       }
@@ -400,7 +395,7 @@ bool SysupQuaymartUpdateController::installUpdatesAfterNextLogout(const UpdateLi
     PlistDictionary& requests = state.dictionaryNamed(SysupUpdateState::kPostLogoutKey);
     for (const SysupQuaymartUpdate& update : updates) {
       requests[update.productKey()] = PlistDictionary{
-          {"date", currentDate()}, {"restartingNow", restartingNow}, {"nowIsLater", nowIsLater}};
+          {"date", PlistDate::now()}, {"restartingNow", restartingNow}, {"nowIsLater", nowIsLater}};
     }
   });
   TILL_LOG(2, "%@: Install after logout of %zu updates: %@", kSpeaker, updates.size(),

@@ -23,6 +23,8 @@
 #include "store-runtime/core/PreferenceKeys.h"
 #include "store-runtime/dialogs/LedgerLocalizedString.h"
 #include "store-runtime/download/VendFileManager.h"
+#include "store-runtime/host/LedgerDockMessaging.h"
+#include "store-runtime/host/LedgerFileProgress.h"
 #include "store-runtime/host/LedgerTraceMessage.h"
 #include "store-runtime/host/LedgerTwilightAgent.h"
 #include "store-runtime/host/PlatformStateFile.h"
@@ -429,6 +431,67 @@ TEST_F(UpdateRunTest, AnOSUpdateWithoutRestartIsInstalledWithProgressAndOneWithR
   for (const std::string& key : progress->keys()) EXPECT_EQ(key, "SEC-1");
   EXPECT_TRUE(controller_->osUpdatesInProgress().empty());
   EXPECT_FALSE(run->runState().shouldRestartToInstallUpdates);
+}
+
+// An OS update that brings an application shows, in a run the user
+// started, as that application being downloaded: a launcher placeholder and
+// a published progress item, gone at the end; a cancel asked for through
+// the published item stops the install.
+TEST_F(UpdateRunTest, AnOSUpdateThatBringsAnAppIsShownAsItsDownloadAndCanBeCancelledThere) {
+  const PlistDictionary mapMaker{{"productKey", "MAPS-1"},
+                                 {"title", "Map Maker"},
+                                 {"isRecommended", true},
+                                 {"installSeconds", 3.0},
+                                 {"tags", PlistArray{"SYSUPBUNDLE:com.example.mapmaker"}}};
+  offerOSUpdates(PlistArray{mapMaker});
+  startEverything();
+  const std::string item = "/Applications/Map Maker.appdownload";
+  auto userRun = [&] {
+    auto run = std::make_shared<UpdateOperation>(
+        controller_->storeClient(), std::weak_ptr<UpdateOperationController>(controller_));
+    run->changeSettings([&](UpdateOperationSettings& s) {
+      s.userInitiated = true;
+      s.appUpdatesToInstall = std::vector<LedgerUpdateRef>{};
+      s.osUpdatesToInstall =
+          SysupQuaymartUpdateController::sharedUpdateController().availableUpdates();
+      s.osUpdateCancelTokens = controller_->osUpdateCancelTokens();
+    });
+    return run;
+  };
+  auto published = [&] {
+    return PlatformStateFile(LedgerFileProgress::stateFilePath()).readDictionary();
+  };
+  auto placeholders = [] {
+    return PlistValue(
+        PlatformStateFile(LedgerDockMessaging::stateFilePath()).readDictionary())["placeholders"];
+  };
+
+  auto cancelled = userRun();
+  auto running = std::async(std::launch::async, [&] { runToTheEnd(*cancelled); });
+  ASSERT_TRUE(eventually([&] { return PlistValue(published())["items"][item].isDictionary(); }));
+  const PlistValue shown = PlistValue(published())["items"][item];
+  EXPECT_EQ(shown["operation"], PlistValue("downloading"));
+  EXPECT_EQ(shown["totalUnitCount"].int64Value(), 100);
+  EXPECT_FALSE(shown["pausable"].boolValue());
+  EXPECT_TRUE(placeholders()["Map Maker"].isDictionary());
+  // What a file manager does: ask for the cancel in the published entry.
+  ASSERT_TRUE(PlatformStateFile(LedgerFileProgress::stateFilePath())
+                  .updateDictionary([&](PlistDictionary& state) {
+                    PlistValue& entry = (*state["items"].dictionary())[item];
+                    (*entry.dictionary())["cancelRequested"] = true;
+                  }));
+  running.get();
+  EXPECT_EQ(SysupQuaymartUpdateController::sharedUpdateController().availableUpdates().size(), 1U)
+      << "the cancelled update was installed";
+  EXPECT_FALSE(PlistValue(published())["items"][item].isDictionary());
+  EXPECT_FALSE(placeholders()["Map Maker"].isDictionary());
+
+  // Left alone, the item follows the install to its end and goes.
+  auto installed = userRun();
+  runToTheEnd(*installed);
+  EXPECT_TRUE(SysupQuaymartUpdateController::sharedUpdateController().availableUpdates().empty());
+  EXPECT_FALSE(PlistValue(published())["items"][item].isDictionary());
+  EXPECT_FALSE(placeholders()["Map Maker"].isDictionary());
 }
 
 TEST_F(UpdateRunTest, TheLockOfAllRunsIsNotHeldWhileARunDownloads) {
