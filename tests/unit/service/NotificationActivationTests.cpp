@@ -55,6 +55,9 @@ struct Case {
   const char* url;          // opened in the store application, or none
   const char* actionTaken;  // of the click trace, or none sent
   Fate fate;
+  // Hours on screen before the activation, and as the trace tells them.
+  int hoursShown = 0;
+  std::int64_t tracedInterval = 0;
 };
 
 PlistDate nowDate() {
@@ -313,7 +316,9 @@ TEST_F(NotificationActivationTest, EachActivationAsksTheControllerOpensTracesAnd
        Call::kNothing,
        kUpdatesPage,
        "LaunchToUpdates",
-       Fate::kOffScreen},
+       Fate::kOffScreen,
+       123,
+       120},
       {"failure, contents",
        info({{"Source", "AppUpdate"},
              {"isPostLogoutUpdateFailure", true},
@@ -362,6 +367,7 @@ TEST_F(NotificationActivationTest, EachActivationAsksTheControllerOpensTracesAnd
     UserNotification activated = deliverShown(c.userInfo, c.menu);
     activated.activationType = c.activationType;
     activated.alternateActionIndex = c.menuIndex;
+    *activated.actualDeliveryDate -= std::chrono::hours(c.hoursShown);
     LogCapture log;
     delegate_->didActivateNotification(*center_, activated);
 
@@ -384,7 +390,7 @@ TEST_F(NotificationActivationTest, EachActivationAsksTheControllerOpensTracesAnd
       EXPECT_EQ(trace["source"], source ? *source : "");
       EXPECT_EQ(trace["button_clicked"], c.activationType == 1 ? "false" : "true");
       EXPECT_EQ(trace["is_critical_update"], userInfo["CriticalUpdate"].boolValue());
-      EXPECT_EQ(trace["displayed_interval"], 0);
+      EXPECT_EQ(trace["displayed_interval"], c.tracedInterval);
       EXPECT_TRUE(log.countContaining("UserNotificationCenterDelegate: Message tracing "
                                       "com.orvane.Quaymart.update_notification.clicked - ",
                                       3) == 1);
@@ -449,6 +455,25 @@ TEST_F(NotificationActivationTest, TheSecondButtonInstallsOrShowsDetailsAndKeeps
                                 1),
             1u)
       << log.dump();
+}
+
+// The one button of the install-now notification installs the critical
+// updates, and its trace tells the time on screen in seconds.
+TEST_F(NotificationActivationTest, TheInstallNowButtonInstallsCriticalUpdatesAndTracesSeconds) {
+  LogCapture log;
+  UserNotification installNow =
+      deliverShown(info({{"Source", "CriticalUpdateInstallNow"}, {"InstallOnDismiss", true}}));
+  center_->removeDeliveredNotification(installNow);
+  *installNow.actualDeliveryDate -= std::chrono::seconds(95);
+  delegate_->didDismissAlert(*center_, installNow);
+  EXPECT_EQ(observedCall(log), Call::kInstallCritical) << log.dump();
+  const std::vector<nlohmann::json> clicks =
+      traces(UserNotificationCenterDelegate::kClickTraceDomain);
+  ASSERT_EQ(clicks.size(), 1u);
+  EXPECT_EQ(clicks[0]["action_taken"], "InstallCriticalUpdates");
+  const std::int64_t seconds = clicks[0]["displayed_interval"];
+  EXPECT_GE(seconds, 95);
+  EXPECT_LT(seconds, 110);
 }
 
 // Snoozing brings back only the restart countdown.
