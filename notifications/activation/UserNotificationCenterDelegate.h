@@ -101,7 +101,7 @@ class UserNotificationCenterDelegate {
 
   [[nodiscard]] std::shared_ptr<UserNotificationCenter> applicationCenter() const;
 
-  // The parts of an activation.
+  // The steps of an activation, by how it came.
   void activateByMainButton(UserNotificationCenter& center, const Activation& activation) const;
   void activateAppUpdateButton(UserNotificationCenter& center, const Activation& activation) const;
   void activateByContentsClick(UserNotificationCenter& center, const Activation& activation) const;

@@ -476,6 +476,37 @@ TEST_F(NotificationActivationTest, TheInstallNowButtonInstallsCriticalUpdatesAnd
   EXPECT_LT(seconds, 110);
 }
 
+// The automatic update offers: the main button switches on and traces a
+// pass, the second button traces a refusal; the switches stay as they were.
+TEST_F(NotificationActivationTest, TheAutomaticUpdateOffersAreAnsweredAndTraced) {
+  forgetCalls();
+  UserNotification restartRequired =
+      deliverShown(info({{"Source", "autoUpdateRestartRequiredOptIn"}}));
+  restartRequired.activationType = UserNotification::kActionButtonClicked;
+  delegate_->didActivateNotification(*center_, restartRequired);
+  EXPECT_TRUE(autoUpdateSwitchedOn());
+  EXPECT_TRUE(PreferenceStore::booleanForKey(kDefaultsAutoUpdateRestartRequiredEnabledKey,
+                                             kDaemonDefaultsID)
+                  .value_or(false));
+  EXPECT_FALSE(listed(restartRequired.identifier));
+
+  forgetCalls();
+  UserNotification refused = deliverShown(info({{"Source", "autoUpdateOptIn"}}));
+  center_->removeDeliveredNotification(refused);
+  delegate_->didDismissAlert(*center_, refused);
+  EXPECT_FALSE(autoUpdateSwitchedOn());
+
+  const std::vector<nlohmann::json> restartRequiredAnswers =
+      traces(UserNotificationCenterDelegate::kRestartRequiredOptInTraceDomain);
+  ASSERT_EQ(restartRequiredAnswers.size(), 1u);
+  EXPECT_EQ(restartRequiredAnswers[0]["result"], "pass");
+  const std::vector<nlohmann::json> answers =
+      traces(UserNotificationCenterDelegate::kOptInTraceDomain);
+  ASSERT_EQ(answers.size(), 1u);
+  EXPECT_EQ(answers[0]["result"], "fail");
+  EXPECT_TRUE(traces(UserNotificationCenterDelegate::kClickTraceDomain).empty());
+}
+
 // Snoozing brings back only the restart countdown.
 TEST_F(NotificationActivationTest, OnlyTheRestartCountdownComesBackFromASnooze) {
   const UserNotification plain = deliverShown(info({{"Source", "AppUpdate"}}));
