@@ -40,6 +40,7 @@ class UpdateNotificationCatalogue;
 class UpdateOperation;
 struct UpdateOperationSettings;
 class UserNotificationCenter;
+struct UserNotification;
 
 // The policy centre for the updates of one store client: when the update
 // machinery runs and with which tasks, what the badge counts, who hears of
@@ -280,6 +281,18 @@ class UpdateController final : public UpdateQueueDelegate,
   [[nodiscard]] std::optional<PlistDictionary> cachedUpdateAuditInfoWithKey(
       std::string_view key) const;
   [[nodiscard]] static std::string auditInfoCachePath(std::string_view key);
+
+  // --- What notification activations ask ---
+
+  // Opens the store application on the details of a failed install: the
+  // audit the notification kept the key of. An empty key still opens the
+  // page, which then finds nothing.
+  void launchQuaymartAndShowUpdateFailureWithAuditInfoCacheKey(std::string_view key) const;
+
+  // --- The major OS update notification's buttons ---
+
+  void didActivateMajorOSUpdateNotification(const UserNotification& notification);
+  void didDismissMajorOSUpdateNotification(const UserNotification& notification);
 
  private:
   void initWithStoreClient(SoftwareMap& softwareMap);

@@ -7,6 +7,7 @@
 #include "platform/plist/PropertyListSerialization.h"
 #include "platform/system/FileIO.h"
 #include "platform/system/Uuid.h"
+#include "store-runtime/host/LedgerQuaymartLauncher.h"
 #include "update-controller/UpdateController.h"
 #include "update-operation/UpdateOperation.h"
 
@@ -15,6 +16,7 @@ namespace larder {
 namespace {
 
 constexpr std::string_view kSpeaker = "UpdateController";
+constexpr std::string_view kUpdateFailureURLPrefix = "quaymart://showUpdateFailure?auditInfoToken=";
 
 }  // namespace
 
@@ -72,6 +74,13 @@ std::optional<PlistDictionary> UpdateController::cachedUpdateAuditInfoWithKey(
     return std::nullopt;
   }
   return *audit->dictionary();
+}
+
+void UpdateController::launchQuaymartAndShowUpdateFailureWithAuditInfoCacheKey(
+    std::string_view key) const {
+  const std::string url = std::string(kUpdateFailureURLPrefix) + std::string(key);
+  TILL_LOG(2, "%@: Showing the update failure details with %@", kSpeaker, url);
+  LedgerQuaymartLauncher::sharedInstance().launchQuaymartWithURL(url);
 }
 
 }  // namespace larder

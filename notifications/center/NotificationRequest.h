@@ -21,6 +21,9 @@ struct NotificationRequest {
   static constexpr std::string_view kMainAction = "action";
   static constexpr std::string_view kOtherAction = "other";
   static constexpr std::string_view kAlternateActionPrefix = "alternate-";
+  // Put away for now. Never offered as a button: it comes from servers
+  // or tools that can snooze.
+  static constexpr std::string_view kSnoozeAction = "snooze";
 
   enum Urgency : std::uint8_t { kLow = 0, kNormal = 1, kCritical = 2 };
   // The server's own default, and never.

@@ -302,6 +302,7 @@ std::optional<UserNotificationCenter::Action> UserNotificationCenter::parseActio
   if (actionKey == NotificationRequest::kDefaultAction) return Action{Action::kContents};
   if (actionKey == NotificationRequest::kMainAction) return Action{Action::kMainButton};
   if (actionKey == NotificationRequest::kOtherAction) return Action{Action::kOtherButton};
+  if (actionKey == NotificationRequest::kSnoozeAction) return Action{Action::kSnooze};
   const std::string_view prefix = NotificationRequest::kAlternateActionPrefix;
   if (!actionKey.starts_with(prefix)) return std::nullopt;
   const char* first = actionKey.data() + prefix.size();
@@ -332,7 +333,7 @@ Result<void> UserNotificationCenter::activate(const std::string& notificationIde
       return activationError(kUnknownActionCode,
                              "Unknown action \"" + actionKey + "\" for notification " +
                                  notificationIdentifier +
-                                 " (known: default, action, other, alternate-N)");
+                                 " (known: default, action, other, alternate-N, snooze)");
     }
     const auto entries = static_cast<std::int64_t>((*record)->alternateActionButtonTitles.size());
     if (action->kind == Action::kMenuEntry && action->menuIndex >= entries) {
@@ -344,21 +345,25 @@ Result<void> UserNotificationCenter::activate(const std::string& notificationIde
     activated = **record;
     if (action->kind == Action::kContents) {
       activated.activationType = UserNotification::kContentsClicked;
-    } else if (action->kind != Action::kOtherButton) {
+    } else if (action->kind != Action::kOtherButton && action->kind != Action::kSnooze) {
       activated.activationType = UserNotification::kActionButtonClicked;
     }
     activated.alternateActionIndex = action->menuIndex;
     delegate = delegate_.lock();
     if (delegate) {
       // A used button ends an alert (the server has closed it); the second
-      // button ends any notification. A click on the contents, or the main
-      // button of a banner, leaves it where it is.
-      const bool ends =
-          action->kind == Action::kOtherButton ||
-          (action->kind != Action::kContents && activated.displayStyle == UserNotification::kAlert);
+      // button ends any notification. A click on the contents, the main
+      // button of a banner or a snooze leaves it in the list.
+      const bool button = action->kind == Action::kMainButton || action->kind == Action::kMenuEntry;
+      const bool ends = action->kind == Action::kOtherButton ||
+                        (button && activated.displayStyle == UserNotification::kAlert);
       if (ends) {
         closeOnServerLocked(activated);
         takeLocked(notificationIdentifier);
+      } else if (action->kind == Action::kSnooze) {
+        // Put away, not ended: it leaves the screen and stays listed.
+        closeOnServerLocked(activated);
+        change(*record, [](UserNotification& away) { away.displayed = false; });
       } else {
         change(*record, [&](UserNotification& stays) {
           stays.activationType = activated.activationType;
@@ -376,10 +381,11 @@ Result<void> UserNotificationCenter::activate(const std::string& notificationIde
   TILL_LOG(2, "%@: Notification %@ activated with \"%@\"", kSpeaker, notificationIdentifier,
            actionKey);
   delegateQueue_->async([self = shared_from_this(), delegate = std::move(delegate),
-                         activated = std::move(activated),
-                         dismissed = action->kind == Action::kOtherButton] {
-    if (dismissed) {
+                         activated = std::move(activated), kind = action->kind] {
+    if (kind == Action::kOtherButton) {
       delegate->didDismissAlert(*self, activated);
+    } else if (kind == Action::kSnooze) {
+      delegate->didSnoozeAlert(*self, activated);
     } else {
       delegate->didActivateNotification(*self, activated);
     }

@@ -51,6 +51,10 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
     // The second button of an alert was used.
     virtual void didDismissAlert(UserNotificationCenter& center,
                                  const UserNotification& notification) = 0;
+    // The alert was put away for now: it is off the screen and still in
+    // the list.
+    virtual void didSnoozeAlert(UserNotificationCenter& center,
+                                const UserNotification& notification) = 0;
     // Asked before a notification is shown; false keeps it in the list only.
     virtual bool shouldPresentNotification(UserNotificationCenter& center,
                                            const UserNotification& notification) = 0;
@@ -89,7 +93,8 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
 
   // What the user does, as the notification server reports it. An action key
   // is "default" (the contents), "action" (the main button), "other" (the
-  // second button) or "alternate-N" (menu entry N). Unknown identifiers and
+  // second button), "alternate-N" (menu entry N) or "snooze" (put away for
+  // now). Unknown identifiers and
   // keys are errors; the delegate is told of the rest.
   Result<void> activate(const std::string& notificationIdentifier, const std::string& actionKey);
 
@@ -105,7 +110,7 @@ class UserNotificationCenter : public std::enable_shared_from_this<UserNotificat
  private:
   // What an action key asks for.
   struct Action {
-    enum Kind { kContents, kMainButton, kMenuEntry, kOtherButton };
+    enum Kind { kContents, kMainButton, kMenuEntry, kOtherButton, kSnooze };
     Kind kind = kContents;
     std::int64_t menuIndex = UserNotification::kNoAlternateAction;
   };

@@ -237,15 +237,19 @@ void CommandLine::addUpdateCommands() {
   notifications
       ->add_option("--action", notificationAction,
                    "what the user did: default (clicked the contents, when not given), action "
-                   "(the main button), other (the second button), or N (entry N of the main "
-                   "button's menu)")
+                   "(the main button), other (the second button), snooze (put it away for "
+                   "now), or N or alternate-N (entry N of the main button's menu)")
       ->needs(activate)
       ->check([](const std::string& word) {
-        const bool number =
-            !word.empty() && word.find_first_not_of("0123456789") == std::string::npos;
-        return number || word == "default" || word == "action" || word == "other"
+        const auto digits = [](std::string_view text) {
+          return !text.empty() && text.find_first_not_of("0123456789") == std::string::npos;
+        };
+        const std::string_view prefix = "alternate-";
+        const bool entry =
+            digits(word) || (word.starts_with(prefix) && digits(word.substr(prefix.size())));
+        return entry || word == "default" || word == "action" || word == "other" || word == "snooze"
                    ? std::string()
-                   : "must be default, action, other or a menu entry number";
+                   : "must be default, action, other, snooze or a menu entry number";
       });
 }
 

@@ -29,7 +29,7 @@ inline bool eventually(const std::function<bool()>& condition,
 class RecordingDelegate final : public UserNotificationCenter::Delegate {
  public:
   struct Call {
-    enum Kind { kActivated, kDismissed };
+    enum Kind { kActivated, kDismissed, kSnoozed };
     Kind kind = kActivated;
     UserNotification notification;
     // Whether the notification was still in the center's list at the call.
@@ -43,6 +43,10 @@ class RecordingDelegate final : public UserNotificationCenter::Delegate {
   void didDismissAlert(UserNotificationCenter& center,
                        const UserNotification& notification) override {
     record(Call::kDismissed, center, notification);
+  }
+  void didSnoozeAlert(UserNotificationCenter& center,
+                      const UserNotification& notification) override {
+    record(Call::kSnoozed, center, notification);
   }
   bool shouldPresentNotification(UserNotificationCenter&,
                                  const UserNotification& notification) override {

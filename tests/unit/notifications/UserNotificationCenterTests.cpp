@@ -157,6 +157,8 @@ TEST_F(UserNotificationCenterTest, ActivationKeysReachTheDelegate) {
       {"alternate-1", kAlert, kActivated, UserNotification::kActionButtonClicked, 1, true},
       {"other", kAlert, kDismissed, UserNotification::kActivationNone, kNone, true},
       {"other", kBanner, kDismissed, UserNotification::kActivationNone, kNone, true},
+      {"snooze", kAlert, kSnoozed, UserNotification::kActivationNone, kNone, false},
+      {"snooze", kBanner, kSnoozed, UserNotification::kActivationNone, kNone, false},
   };
   auto center = makeCenter(UserNotificationCenter::kApplicationCenter);
   for (std::size_t row = 0; row < cases.size(); ++row) {
@@ -244,6 +246,24 @@ TEST_F(UserNotificationCenterTest, ServerSignalsActivateAndCloseTheirNotificatio
   ASSERT_TRUE(eventually([&] { return center->displayedNotifications().empty(); }));
   ASSERT_EQ(center->deliveredNotifications().size(), 1u);
   EXPECT_EQ(center->deliveredNotifications()[0].identifier, banner.identifier);
+  EXPECT_FALSE(center->deliveredNotifications()[0].displayed);
+}
+
+// A snooze puts the notification away: off the screen, still listed.
+TEST_F(UserNotificationCenterTest, ASnoozeClosesOnTheServerAndKeepsTheRecord) {
+  auto center = makeCenter();
+  const UserNotification alert =
+      deliverShown(*center, makeNotification("Alert", UserNotification::kAlert));
+  server_->emitActionInvoked(alert.serverIdentifier, "snooze");
+  const std::vector<RecordingDelegate::Call> calls = delegate_->waitForCalls(1);
+  ASSERT_EQ(calls.size(), 1u);
+  EXPECT_EQ(calls[0].kind, RecordingDelegate::Call::kSnoozed);
+  EXPECT_TRUE(calls[0].wasInList);
+  const std::vector<Call> serverCalls = server_->waitForCalls(2);
+  ASSERT_EQ(serverCalls.size(), 2u);
+  EXPECT_EQ(serverCalls[1].kind, Call::kClose);
+  EXPECT_EQ(serverCalls[1].serverIdentifier, alert.serverIdentifier);
+  ASSERT_EQ(center->deliveredNotifications().size(), 1u);
   EXPECT_FALSE(center->deliveredNotifications()[0].displayed);
 }
 
