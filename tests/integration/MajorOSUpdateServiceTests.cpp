@@ -59,8 +59,8 @@ TEST_F(MajorOSUpdateServiceTest, TheAgentsAnnouncementIsEvaluatedAtOnceWithoutDe
 // An installer that is already there goes straight to the install service;
 // the status and a purchase by hand answer on the bus.
 TEST_F(MajorOSUpdateServiceTest, TheManagedPathAndPurchasesAnswerOnTheBus) {
-  const std::string installer =
-      platform_.installBundle({applications(), "Install Next OS", "com.example.nextos"});
+  const std::string installer = platform_.installBundle(
+      {applications(), "Install Next OS", "com.example.nextos", "1.0", 4242});
   start();
   auto caller = client();
   caller->call("DownloadSetupHeraldForTagsBundleIdentifier",
