@@ -187,7 +187,8 @@ class MajorOSUpdateTest : public ServiceTest {
     std::vector<std::string> types;
     for (const UserNotification& n : center_->deliveredNotifications()) {
       auto type = n.userInfo.find("Type");
-      if (type != n.userInfo.end() && type->second.string()) types.push_back(*type->second.string());
+      if (type != n.userInfo.end() && type->second.string())
+        types.push_back(*type->second.string());
     }
     return types;
   }
@@ -675,8 +676,12 @@ TEST_F(MajorOSUpdateTest, TheInstallServiceStoresTheStateAndSpeaksForTheAgent) {
   updates.daemonDownloadHeartbeat();
   EXPECT_TRUE(log.hasOnce("UpdateController: Heartbeat for MDM-pushed download with itemID: 77"));
 
+  // An app updates notification on screen gives way to the warning.
+  UserNotification appUpdates;
+  appUpdates.userInfo = {{"Source", "AppUpdate"}};
+  center_->deliverNotification(appUpdates);
   updates.managedOSInstallWakeUpReceived();
-  EXPECT_TRUE(center_->deliveredNotifications().empty());
+  EXPECT_EQ(center_->deliveredNotifications().size(), 1U) << "no agent, no warning";
   ASSERT_TRUE(PlatformStateFile(LedgerMajorOSInstallService::stateFilePath())
                   .updateDictionary([](PlistDictionary& state) { state["agentIsActive"] = true; }));
   updates.managedOSInstallWakeUpReceived();
