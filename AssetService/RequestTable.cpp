@@ -149,6 +149,18 @@ void startAppInstallWithTags(AssetServiceInterface& i, const Arguments& a, const
     withController(i, member, r, [&](UpdateController& c) { statement; });  \
   }
 
+// The wire has no absent values: tags that are not an array and an empty
+// bundle identifier stand for the missing parameters.
+void downloadSetupHerald(AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {
+  withController(i, "DownloadSetupHeraldForTagsBundleIdentifier", r, [&](UpdateController& c) {
+    std::optional<std::vector<std::string>> tags;
+    if (a.at(0).array()) tags = texts(a, 0);
+    std::optional<std::string> bundleIdentifier;
+    if (!text(a, 1).empty()) bundleIdentifier = text(a, 1);
+    c.downloadSetupHeraldForTags(tags, bundleIdentifier);
+  });
+}
+
 // Requests that carry a client type of their own set up the connection's
 // store client before anything else; their targets come with later parts
 // of the service.
@@ -281,8 +293,10 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
    }},
   {"UpdatesForTags", false,
    CONTROLLER_CALL("UpdatesForTags", c.updatesForTags(texts(a, 0), [r](const std::vector<SysupQuaymartUpdate>& updates) { answer(r, {wireForms(updates)}); }))},
-  {"WillInteractivelyPurchaseItemIdentifier", false, nullptr, kEmpty},
-  {"DidInteractivelyPurchaseItemIdentifierSuccess", false, nullptr, kNothing},
+  {"WillInteractivelyPurchaseItemIdentifier", false,
+   CONTROLLER_REPLY("WillInteractivelyPurchaseItemIdentifier", c.willInteractivelyPurchaseItemIdentifier(a.at(0).uint64Value()))},
+  {"DidInteractivelyPurchaseItemIdentifierSuccess", false,
+   CONTROLLER_CALL("DidInteractivelyPurchaseItemIdentifierSuccess", c.didInteractivelyPurchaseItemIdentifier(a.at(0).uint64Value(), a.at(1).boolValue()))},
 
   // OS updates.
   {"AddOSUpdateProgressObserver", false,
@@ -331,12 +345,13 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
   {"PromptUserToOptInForAutoUpdateWithShowNotification", false,
    CONTROLLER_CALL("PromptUserToOptInForAutoUpdateWithShowNotification", c.promptUserToOptInForAutoUpdateWithShowNotification(a.at(0).boolValue()))},
   {"UpdateAutoInfoWithToken", false, nullptr, kEmpty},
-  {"MajorOSUpdateHasDownloadedToPath", false, nullptr, kEmpty},
+  {"MajorOSUpdateHasDownloadedToPath", false,
+   CONTROLLER_REPLY("MajorOSUpdateHasDownloadedToPath", c.majorOSUpdateHasDownloadedToPath(text(a, 0)))},
   {"ManagedOSInstallWakeUpReceived", false,
-   nullptr, kNothing},
-  {"DownloadSetupHeraldForTagsBundleIdentifier", false, nullptr, kNothing},
-  {"CheckSHDownloadStatus", false, nullptr,
-   kEmpty},
+   CONTROLLER_CALL("ManagedOSInstallWakeUpReceived", c.managedOSInstallWakeUpReceived())},
+  {"DownloadSetupHeraldForTagsBundleIdentifier", false, downloadSetupHerald},
+  {"CheckSHDownloadStatus", false,
+   CONTROLLER_REPLY("CheckSHDownloadStatus", c.statusForSetupHeraldDownload())},
 
   // Managed distribution.
   {"ShowInviteOrganizationNameStoreClientType", false, setStoreClientFromType<2>},
@@ -345,8 +360,8 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
   {"ProcessMDMManifestURLOptionsStoreClientType", false,
    setStoreClientFromType<2>, kErrorReply},
   {"AccountLessDownloadWithItemIdentifierBundleIdentifierExternalVersionIdentifierOptions", false, nullptr, kErrorReply},
-  {"AccountLessDownloadHeartbeat", false, nullptr,
-   kNothing},
+  {"AccountLessDownloadHeartbeat", false,
+   CONTROLLER_CALL("AccountLessDownloadHeartbeat", c.daemonDownloadHeartbeat())},
 
   // Books.
   {"CountOfBooksWithInfo", false,

@@ -390,7 +390,8 @@ std::vector<std::shared_ptr<RunningApplication>> RunningApplication::allRunningA
   });
 }
 
-Result<pid_t> RunningApplication::launchBundle(const std::string& bundlePath) {
+Result<pid_t> RunningApplication::launchBundle(const std::string& bundlePath,
+                                               const std::vector<std::string>& arguments) {
   std::optional<Bundle> bundle = Bundle::open(bundlePath);
   if (!bundle)
     return VendError::withDomain("RunningApplication", ENOENT, "No bundle at " + bundlePath);
@@ -406,7 +407,10 @@ Result<pid_t> RunningApplication::launchBundle(const std::string& bundlePath) {
   }
   // Everything the children need is made before fork: after it, only
   // async-signal-safe calls are allowed.
-  std::array<char*, 2> argv{executable.data(), nullptr};
+  std::vector<std::string> argumentCopies = arguments;
+  std::vector<char*> argv{executable.data()};
+  for (std::string& argument : argumentCopies) argv.push_back(argument.data());
+  argv.push_back(nullptr);
   Pipe pidPipe;
   Pipe execPipe;
   if (!pidPipe.open() || !execPipe.open()) {

@@ -62,8 +62,10 @@ class RunningApplication : public std::enable_shared_from_this<RunningApplicatio
 
   // Starts "bin/<HostBundleExecutable>" of the bundle at `bundlePath` in a
   // session of its own, not as a child of this process (nobody waits for
-  // it). The pid of the started program.
-  static Result<pid_t> launchBundle(const std::string& bundlePath);
+  // it), with `arguments` after the program's name. The pid of the started
+  // program.
+  static Result<pid_t> launchBundle(const std::string& bundlePath,
+                                    const std::vector<std::string>& arguments = {});
 
   ~RunningApplication();
   RunningApplication(const RunningApplication&) = delete;

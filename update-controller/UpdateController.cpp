@@ -280,12 +280,10 @@ std::shared_ptr<UpdateOperation> UpdateController::softwareUpdateDidFinishBackgr
       return nullptr;
     }
     TILL_LOG(1, "%@: Received notice of new major OS update availability", kSpeaker);
-    // The major OS update is evaluated on the install queue by a later
-    // part of the service; the notice is only acknowledged here.
-    majorOSInstallQueue_->async([path = stringOf(info, "majorOSUpdateAvailableAtPath")] {
-      TILL_LOG(2, "%@: Major OS update notice at %@ left for the major OS update support", kSpeaker,
-               path.value_or(""));
-    });
+    majorOSInstallQueue_->async(
+        [weakSelf = weak_from_this(), path = stringOf(info, "majorOSUpdateAvailableAtPath")] {
+          if (auto self = weakSelf.lock()) self->majorOSUpdateAvailableWithInfoBundlePath(path);
+        });
     return nullptr;
   }
   (void)PreferenceStore::setValue(kDefaultsLastAutoUpdateInvocationKey, now(), kDaemonDefaultsID,
@@ -300,8 +298,9 @@ std::shared_ptr<UpdateOperation> UpdateController::softwareUpdateDidFinishBackgr
     operation->changeSettings(
         [](UpdateOperationSettings& s) { s.shouldUpdateNotificationsOnly = true; });
   } else {
-    majorOSInstallQueue_->async([] {
-      TILL_LOG(3, "%@: Major OS update status left for the major OS update support", kSpeaker);
+    // Every report advances the major OS update: there is no timer of its own.
+    majorOSInstallQueue_->async([weakSelf = weak_from_this()] {
+      if (auto self = weakSelf.lock()) self->checkMajorOSUpdateStatus();
     });
   }
   applyPostLogoutResults(info, *operation);

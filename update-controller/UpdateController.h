@@ -13,9 +13,11 @@
 #include "platform/dispatch/DispatchQueue.h"
 #include "platform/error/Result.h"
 #include "platform/error/VendError.h"
+#include "platform/system/Bundle.h"
 #include "platform/system/Mutex.h"
 #include "platform/value/PlistValue.h"
 #include "store-runtime/core/VendStoreClient.h"
+#include "store-runtime/host/LedgerMajorOSInstallService.h"
 #include "store-runtime/host/LedgerPowerSource.h"
 #include "store-runtime/records/LedgerSoftwareUpdateStatus.h"
 #include "store-runtime/records/SysupQuaymartUpdate.h"
@@ -289,10 +291,59 @@ class UpdateController final : public UpdateQueueDelegate,
   // page, which then finds nothing.
   void launchQuaymartAndShowUpdateFailureWithAuditInfoCacheKey(std::string_view key) const;
 
-  // --- The major OS update notification's buttons ---
+  // --- Major OS update ---
 
+  // The state of a major OS update is one dictionary (preference
+  // "MajorOSUpdate", scope system), written only through the install
+  // service. Everything that changes it runs on the install queue, serially.
+  using MajorOSInstallCancelToken = SysupQuaymartUpdateController::CancelToken;
+  // The longest the install queue waits for the framework to match tags.
+  static constexpr std::chrono::seconds kMajorOSTagLookupTimeout{600};
+  // The pause after a managed install of the installer, for it to be found
+  // among the installed applications.
+  static constexpr std::chrono::seconds kSetupHeraldDiscoveryPause{10};
+
+  // The announcement of a notification bundle: a new state with a random
+  // evaluation date (or an evaluation at once for a delay of 0 or less).
+  void majorOSUpdateAvailableWithInfoBundlePath(const std::optional<std::string>& path);
+  // The evaluation at a background scan report; call on the install queue.
+  void checkMajorOSUpdateStatus();
+  void startMajorOSUpdateBackgroundDownload(const SysupQuaymartUpdate& update,
+                                            const std::string& bundleIdentifier);
+  // The user's answer to a major OS update notification; caller's thread.
   void didActivateMajorOSUpdateNotification(const UserNotification& notification);
   void didDismissMajorOSUpdateNotification(const UserNotification& notification);
+  void majorOSUpdateWillBeDownloadedByDaemonWithItemIdentifier(std::uint64_t itemIdentifier,
+                                                               const PlistValue& versionIdentifier);
+  // True when the caller is not to launch the installer it downloaded.
+  // Blocks on the install queue: never call it from there.
+  bool majorOSUpdateHasDownloadedToPath(const std::string& path);
+  void daemonDownloadHeartbeat();
+  // The managed path: fetch the installer with these tags and hand it to
+  // the install service.
+  void downloadSetupHeraldForTags(const std::optional<std::vector<std::string>>& tags,
+                                  const std::optional<std::string>& bundleIdentifier);
+  // The managed install's "bundleIdentifier", "progress", "state" and
+  // "error". Blocks on the install queue: never call it from there.
+  PlistDictionary statusForSetupHeraldDownload();
+  void startAdminInstallAtPath(const std::string& path);
+  void managedOSInstallWakeUpReceived();
+  void proceedWithMDMMajorOSInstall();
+  // The connection to the install service, made when there is none.
+  std::shared_ptr<MajorOSInstallDaemonInterface> installDaemonConnection();
+  bool willInteractivelyPurchaseItemIdentifier(std::uint64_t itemIdentifier);
+  void didInteractivelyPurchaseItemIdentifier(std::uint64_t itemIdentifier, bool success);
+  [[nodiscard]] std::optional<MajorOSInstallCancelToken> majorOSInstallCancelToken() const;
+  void setMajorOSInstallCancelToken(std::optional<MajorOSInstallCancelToken> token);
+  [[nodiscard]] const std::shared_ptr<DispatchQueue>& majorOSInstallQueue() const {
+    return majorOSInstallQueue_;
+  }
+  // For tests: shorter waits than kMajorOSTagLookupTimeout and
+  // kSetupHeraldDiscoveryPause, and a disk whose free space they choose.
+  // The service never calls these.
+  void setMajorOSUpdateWaitsForTesting(std::chrono::milliseconds tagLookupTimeout,
+                                       std::chrono::milliseconds discoveryPause);
+  void setAvailableDiskSpaceForTesting(std::function<std::uint64_t()> availableDiskSpace);
 
  private:
   void initWithStoreClient(SoftwareMap& softwareMap);
@@ -367,6 +418,40 @@ class UpdateController final : public UpdateQueueDelegate,
   std::shared_ptr<VendServiceProxy> serviceProxy_;
   std::shared_ptr<DispatchQueue> majorOSInstallQueue_;
   SysupQuaymartUpdateController::ObserverToken availableOSUpdatesObservation_ = 0;
+
+  // --- Major OS update ---
+  [[nodiscard]] PlistDictionary readMajorOSUpdatePrefs() const;
+  void writeMajorOSUpdatePrefs(const PlistDictionary& prefs);
+  [[nodiscard]] std::optional<Bundle> majorOSUpdateBundle() const;
+  [[nodiscard]] std::optional<PlistDictionary> majorOSUpdateBundleInfoDictionary() const;
+  void postMajorOSUpdateAvailableNotificationOfType(std::string_view type);
+  // The updates that carry all the tags, or nothing when the framework did
+  // not answer in time. Blocks the install queue meanwhile.
+  [[nodiscard]] std::optional<OSUpdateList> waitForUpdatesForTags(
+      const std::vector<std::string>& tags) const;
+  // One pass of the evaluation; false when it failed and is to be retried.
+  bool evaluateMajorOSUpdateDownload(PlistDictionary& state, const PlistDictionary& info,
+                                     std::optional<std::pair<std::string, std::string>>& trace);
+  void finishMajorOSUpdateBackgroundDownload(const SysupQuaymartUpdate& update,
+                                             const OptionalError& error);
+  void startMDMSetupHeraldInstall(const std::vector<std::string>& tags,
+                                  const std::string& bundleIdentifier);
+  void finishMDMSetupHeraldInstall(const SysupQuaymartUpdate& update, const OptionalError& error,
+                                   const std::string& bundleIdentifier);
+  void openMajorOSUpdateStorePage(const PlistDictionary& info) const;
+  void launchSetupHerald(const PlistDictionary& info) const;
+  [[nodiscard]] std::uint64_t majorOSAvailableDiskSpace() const;
+
+  mutable Mutex majorOSLock_;
+  std::optional<MajorOSInstallCancelToken> majorOSInstallCancelToken_ GUARDED_BY(majorOSLock_);
+  std::shared_ptr<LedgerMajorOSInstallService> installDaemonConnection_ GUARDED_BY(majorOSLock_);
+  std::chrono::milliseconds majorOSTagLookupTimeout_ GUARDED_BY(majorOSLock_) =
+      kMajorOSTagLookupTimeout;
+  std::chrono::milliseconds setupHeraldDiscoveryPause_ GUARDED_BY(majorOSLock_) =
+      kSetupHeraldDiscoveryPause;
+  std::function<std::uint64_t()> availableDiskSpaceForTesting_ GUARDED_BY(majorOSLock_);
+  // Set on the caller's thread, changed by handlers on the install queue.
+  PlistDictionary lastMDMInstallProgress_ GUARDED_BY(majorOSLock_);
 };
 
 }  // namespace larder

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <array>
+#include <filesystem>
 #include <locale>
 #include <sstream>
 
@@ -10,6 +11,7 @@
 #include "store-runtime/core/DaemonDefaults.h"
 #include "store-runtime/core/PreferenceKeys.h"
 #include "store-runtime/dialogs/LedgerLocalizedString.h"
+#include "store-runtime/dialogs/LocalizedStringBundle.h"
 #include "store-runtime/host/LedgerTwilightAgent.h"
 #include "store-runtime/host/PreferenceStore.h"
 #include "store-runtime/host/VendDevice.h"
@@ -25,12 +27,19 @@ constexpr std::string_view kSpeaker = "UpdateController";
 // Icons by their freedesktop names, which every icon theme carries.
 constexpr std::string_view kUpdatesIcon = "software-update-available";
 constexpr std::string_view kCriticalUpdateIcon = "software-update-urgent";
+// The icon the desktop shows for managed settings, standing for the
+// machine's manager.
+constexpr std::string_view kManagedSettingsIcon = "preferences-system";
 
 // The applications of the suite that the first notification under a new
 // major version names, by bundle identifier prefix, in the order they are
 // named.
 constexpr std::array<std::string_view, 4> kSuitePrefixes = {
     "com.orvane.Snapbox", "com.orvane.Loopforge", "com.orvane.Anvil", "com.orvane.ReelcutApp"};
+
+std::string orNull(const std::optional<std::string>& text) {
+  return text.value_or("(null)");
+}
 
 std::optional<std::size_t> suiteRank(const LedgerUpdateRef& update) {
   const std::optional<std::string>& bundleID = update->bundleID();
@@ -574,6 +583,69 @@ void UpdateNotificationCatalogue::postLaterHelper(std::string_view titleKey,
   notification.userInfo = userInfoIncludingStoreClient(kSourceLaterHelper, false);
   notification.title = text(titleKey);
   notification.informativeText = text(textKey);
+  deliver(std::move(notification));
+}
+
+// --- Major OS update ---
+
+UserNotification UpdateNotificationCatalogue::majorOSUpdateNotificationOfType(
+    std::string_view type) const {
+  UserNotification notification = alertNotification();
+  notification.poofsOnCancel = false;
+  notification.userInfo = userInfoIncludingStoreClient(kSourceMajorOSUpdate, true);
+  notification.userInfo.emplace(std::string(kMajorOSUpdateTypeKey), std::string(type));
+  return notification;
+}
+
+// The texts are the update's, not the store's: the bundle comes with the
+// update and speaks for it.
+void UpdateNotificationCatalogue::postMajorOSUpdateAvailableNotificationOfType(
+    std::string_view type, const std::optional<Bundle>& bundle) {
+  UserNotification notification = majorOSUpdateNotificationOfType(type);
+  auto textOf = [&](std::string_view word) -> std::optional<std::string> {
+    if (!bundle) return std::nullopt;
+    return LocalizedStringBundle::atPath(bundle->path())
+        .textForKey(std::string(type) + "." + std::string(word), std::nullopt, std::nullopt);
+  };
+  const std::optional<std::string> title = textOf("Title");
+  const std::optional<std::string> body = textOf("InformativeText");
+  const std::optional<std::string> otherButton = textOf("OtherButtonText");
+  const std::optional<std::string> actionButton = textOf("ActionButtonText");
+  if (!title || !body || !otherButton) {
+    TILL_LOG(1,
+             "%@: ERROR: Unable to show major OS update notification due to missing strings: %@ "
+             ": %@ : %@ : %@",
+             kSpeaker, orNull(title), orNull(body), orNull(otherButton), orNull(actionButton));
+    return;
+  }
+  notification.title = *title;
+  notification.informativeText = *body;
+  notification.otherButtonTitle = *otherButton;
+  notification.hasActionButton = actionButton.has_value();
+  if (actionButton) notification.actionButtonTitle = *actionButton;
+  if (const std::optional<std::string> badge = textOf("BadgeKey"); badge && !badge->empty()) {
+    const std::string icon =
+        bundle->path() + "/" + std::string(Bundle::kResourcesFolder) + "/" + *badge + ".icns";
+    std::error_code error;
+    if (std::filesystem::is_regular_file(icon, error)) notification.imageURL = icon;
+  }
+  removeSources({kSourceMajorOSUpdate});
+  TILL_LOG(1, "%@: (Major OS Update) deliverNotification:%@ of type %@", kSpeaker,
+           PlistValue(notification.toDictionary()), type);
+  deliver(std::move(notification));
+}
+
+void UpdateNotificationCatalogue::postMajorOSUpdateMDMInstallNotification() {
+  removeSources({kSourceAppUpdate, kSourceAutoInstalledUpdates, kSourceClaimedButNotDownloaded});
+  UserNotification notification = majorOSUpdateNotificationOfType(kMajorOSUpdatePending);
+  notification.title = text("ADMIN_INSTALLED_POST_LOGOUT_UPDATE_POSTINSTALL_NOTIFICATION_TITLE");
+  notification.informativeText =
+      text("ADMIN_INSTALLED_POST_LOGOUT_UPDATE_POSTINSTALL_NOTIFICATION_TEXT");
+  notification.otherButtonTitle = text("UPDATE_NOTIFICATION_RESTART_BUTTON");
+  notification.hasActionButton = false;
+  notification.imageURL = kManagedSettingsIcon;
+  TILL_LOG(1, "%@: (Major OS Update) deliverNotification:%@ of type %@", kSpeaker,
+           PlistValue(notification.toDictionary()), kMajorOSUpdatePending);
   deliver(std::move(notification));
 }
 

@@ -10,6 +10,7 @@
 
 #include "notifications/catalogue/UpdateNotificationContext.h"
 #include "notifications/center/UserNotification.h"
+#include "platform/system/Bundle.h"
 #include "store-runtime/core/VendStoreClient.h"
 
 namespace larder {
@@ -82,6 +83,25 @@ class UpdateNotificationCatalogue {
   void postOtherUsersLoggedInLaterHelperNotification();
   void postPowerLaterHelperNotification();
 
+  // --- Major OS update ---
+  // The values of "Type" in a major OS update notification's user info.
+  static constexpr std::string_view kMajorOSUpdateTypeKey = "Type";
+  static constexpr std::string_view kMajorOSUpdateAvailableForDownload =
+      "UpdateAvailableForDownloadNotification";
+  static constexpr std::string_view kMajorOSUpdateAutoDownloaded =
+      "UpdateAutoDownloadedNotification";
+  static constexpr std::string_view kMajorOSUpdatePending = "MajorOSUpdatePendingNotification";
+  // The texts come from the notification bundle's own string table, keyed
+  // "<type>.Title", "<type>.InformativeText", "<type>.OtherButtonText",
+  // "<type>.ActionButtonText" and "<type>.BadgeKey" (the name of an "icns"
+  // resource for the icon). Without a title, a text or the second button's
+  // text (or without a bundle) nothing is posted.
+  void postMajorOSUpdateAvailableNotificationOfType(std::string_view type,
+                                                    const std::optional<Bundle>& bundle);
+  // The warning that a managed install of a major OS update is about to
+  // restart the machine.
+  void postMajorOSUpdateMDMInstallNotification();
+
   // Shows the restart countdown as a notification ("Restart Now", result 1;
   // "Later", result 3), waits for the deferred-install agent's countdown to
   // end (LedgerTwilightAgent::showRestartCountdownNotification: an answer,
@@ -123,6 +143,7 @@ class UpdateNotificationCatalogue {
   [[nodiscard]] UserNotification bannerNotification() const;
   [[nodiscard]] UserNotification alertNotification() const;
   [[nodiscard]] UserNotification criticalUpdateNotification() const;
+  [[nodiscard]] UserNotification majorOSUpdateNotificationOfType(std::string_view type) const;
   [[nodiscard]] PlistDictionary userInfoIncludingStoreClient(std::string_view source,
                                                              bool withOSVersion) const;
   // The menu of the later options, ending with the automatic update offer

@@ -83,11 +83,14 @@ constexpr std::string_view kHandledRequests =
     "CancelOSUpdates CancelOSUpdatesWithProductKeys AppUpdatesToInstallLater "
     "RemoveUpdateFromInstallLaterWithBundleID InstallAvailableUpdatesLaterWithMode "
     "CancelUpdatesToBeInstalledLater NowIsLaterWithModeCountdownDeferred "
-    "LaterDidNotOccurWithDueToACPower";
+    "LaterDidNotOccurWithDueToACPower "
+    "WillInteractivelyPurchaseItemIdentifier DidInteractivelyPurchaseItemIdentifierSuccess "
+    "MajorOSUpdateHasDownloadedToPath ManagedOSInstallWakeUpReceived "
+    "DownloadSetupHeraldForTagsBundleIdentifier CheckSHDownloadStatus "
+    "AccountLessDownloadHeartbeat";
 constexpr std::string_view kEmptyReplyRequests =
-    "WillInteractivelyPurchaseItemIdentifier "
-    "InstalledUpdatesJournal UpdateAutoInfoWithToken MajorOSUpdateHasDownloadedToPath "
-    "CheckSHDownloadStatus CountOfBooksWithInfo SortedBooksWithInfo BookAtIndexWithInfo "
+    "InstalledUpdatesJournal UpdateAutoInfoWithToken "
+    "CountOfBooksWithInfo SortedBooksWithInfo BookAtIndexWithInfo "
     "BookWithInfo HasSampleWithItemIdentifier PurchasedItems";
 // Some of these have a handler for the part this build has (the client type).
 constexpr std::string_view kRefusedRequests =
@@ -96,9 +99,7 @@ constexpr std::string_view kRefusedRequests =
     "AccountLessDownloadWithItemIdentifierBundleIdentifierExternalVersionIdentifierOptions "
     "PollForPurchasedBooks";
 constexpr std::string_view kSilentRequests =
-    "DidInteractivelyPurchaseItemIdentifierSuccess ManagedOSInstallWakeUpReceived "
-    "DownloadSetupHeraldForTagsBundleIdentifier "
-    "AccountLessDownloadHeartbeat AddLibraryObserver RemoveLibraryObserver "
+    "AddLibraryObserver RemoveLibraryObserver "
     "RedownloadBooksWithItemIdentifiersAccountID PollForPurchasedItems";
 
 std::set<std::string_view> allRequestNames() {
