@@ -42,6 +42,17 @@ PlistArray stringArray(const std::vector<std::string>& strings) {
   return {strings.begin(), strings.end()};
 }
 
+PlistArray journalEntries(const std::vector<PlistDictionary>& entries) {
+  return {entries.begin(), entries.end()};
+}
+
+// A token names a file of the audit cache folder: one that could lead out
+// of it is no token the service gave, and answers as an unknown one does.
+PlistDictionary auditInfoForToken(const UpdateController& controller, const std::string& token) {
+  if (token.empty() || token.find('/') != std::string::npos) return {};
+  return controller.cachedUpdateAuditInfoWithKey(token).value_or(PlistDictionary{});
+}
+
 std::vector<std::string> texts(const Arguments& arguments, std::size_t index) {
   std::vector<std::string> values;
   if (const PlistArray* array = arguments.at(index).array()) {
@@ -323,14 +334,16 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
    CONTROLLER_CALL("NowIsLaterWithModeCountdownDeferred", c.nowIsLaterWithMode(a.at(0).int64Value(), a.at(1).boolValue()))},
   {"LaterDidNotOccurWithDueToACPower", false,
    CONTROLLER_CALL("LaterDidNotOccurWithDueToACPower", c.laterDidNotOccurWithDueToACPower(a.at(0).boolValue()))},
-  {"InstalledUpdatesJournal", false, nullptr, kEmpty},
+  {"InstalledUpdatesJournal", false,
+   CONTROLLER_REPLY("InstalledUpdatesJournal", journalEntries(c.installedUpdatesJournal()))},
   {"IsAutoUpdateEnabled", false,
    CONTROLLER_REPLY("IsAutoUpdateEnabled", UpdateController::isAutoUpdatedEnabled())},
   {"ShouldPromptForAutoUpdateOptIn", false,
    CONTROLLER_REPLY("ShouldPromptForAutoUpdateOptIn", UpdateController::shouldPromptForAutoUpdateOptIn())},
   {"PromptUserToOptInForAutoUpdateWithShowNotification", false,
    CONTROLLER_CALL("PromptUserToOptInForAutoUpdateWithShowNotification", c.promptUserToOptInForAutoUpdateWithShowNotification(a.at(0).boolValue()))},
-  {"UpdateAutoInfoWithToken", false, nullptr, kEmpty},
+  {"UpdateAutoInfoWithToken", false,
+   CONTROLLER_REPLY("UpdateAutoInfoWithToken", auditInfoForToken(c, text(a, 0)))},
   {"MajorOSUpdateHasDownloadedToPath", false, nullptr, kEmpty},
   {"ManagedOSInstallWakeUpReceived", false,
    nullptr, kNothing},

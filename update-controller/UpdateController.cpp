@@ -17,6 +17,7 @@
 #include "store-runtime/host/PreferenceStore.h"
 #include "store-runtime/services/VendOperationQueue.h"
 #include "update-operation/UpdateOperation.h"
+#include "update-queue/journal/UpdateJournal.h"
 
 namespace larder {
 
@@ -447,18 +448,20 @@ void UpdateController::enqueue(const std::shared_ptr<UpdateOperation>& operation
   VendOperationQueue::mainQueue().addOperation(operation);
 }
 
-// --- Later parts of the service ---
+// --- The installed-updates journal ---
 
 void UpdateController::appendCriticalUpdatesToJournal(
     const std::vector<PlistDictionary>& entries) const {
-  TILL_LOG(2, "%@: %@ silently installed updates not journaled: no journal in this build", kSpeaker,
-           entries.size());
+  UpdateJournal::sharedJournal().appendCriticalUpdates(entries);
 }
 
 void UpdateController::confirmPendingUpdatesInJournal(
     const std::vector<std::string>& productKeys) const {
-  TILL_LOG(3, "%@: %@ post-logout installs not confirmed: no journal in this build", kSpeaker,
-           productKeys.size());
+  UpdateJournal::sharedJournal().confirmPendingUpdates(productKeys);
+}
+
+std::vector<PlistDictionary> UpdateController::installedUpdatesJournal() const {
+  return UpdateJournal::sharedJournal().installedUpdatesJournal();
 }
 
 }  // namespace larder

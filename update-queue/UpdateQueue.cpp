@@ -15,6 +15,7 @@
 #include "store-runtime/download/VendFileManager.h"
 #include "store-runtime/services/VendOperationQueue.h"
 #include "update-queue/LoadUpdateQueueOperation.h"
+#include "update-queue/journal/UpdateJournal.h"
 
 namespace larder {
 namespace {
@@ -349,9 +350,9 @@ void UpdateQueue::didFinishDownloadForUpdateWithItemIdentifier(std::uint64_t ite
 }
 
 void UpdateQueue::appendInstalledUpdateToJournal(const LedgerUpdateRef& update) {
-  // The installed-updates journal is not kept yet; until it is, the record
-  // of the installed update goes to the log, where support can find it.
-  TILL_LOG(1, "%@: Installed update %@ (no update journal to append it to)", kSpeaker, update);
+  // Called inside the queue's barrier: the journal never calls back into
+  // the queue, so this cannot wait for itself.
+  UpdateJournal::sharedJournal().appendInstalledUpdates({update}, {});
 }
 
 bool UpdateQueue::removeAvailableUpdatesWithItemIdentifier(std::uint64_t itemIdentifier,

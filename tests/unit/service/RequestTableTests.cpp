@@ -83,10 +83,9 @@ constexpr std::string_view kHandledRequests =
     "CancelOSUpdates CancelOSUpdatesWithProductKeys AppUpdatesToInstallLater "
     "RemoveUpdateFromInstallLaterWithBundleID InstallAvailableUpdatesLaterWithMode "
     "CancelUpdatesToBeInstalledLater NowIsLaterWithModeCountdownDeferred "
-    "LaterDidNotOccurWithDueToACPower";
+    "LaterDidNotOccurWithDueToACPower InstalledUpdatesJournal UpdateAutoInfoWithToken";
 constexpr std::string_view kEmptyReplyRequests =
-    "WillInteractivelyPurchaseItemIdentifier "
-    "InstalledUpdatesJournal UpdateAutoInfoWithToken MajorOSUpdateHasDownloadedToPath "
+    "WillInteractivelyPurchaseItemIdentifier MajorOSUpdateHasDownloadedToPath "
     "CheckSHDownloadStatus CountOfBooksWithInfo SortedBooksWithInfo BookAtIndexWithInfo "
     "BookWithInfo HasSampleWithItemIdentifier PurchasedItems";
 // Some of these have a handler for the part this build has (the client type).
