@@ -42,8 +42,8 @@ PlistArray stringArray(const std::vector<std::string>& strings) {
   return {strings.begin(), strings.end()};
 }
 
-PlistArray journalEntries(const std::vector<PlistDictionary>& entries) {
-  return {entries.begin(), entries.end()};
+PlistArray journalEntries(std::vector<PlistDictionary> entries) {
+  return {std::make_move_iterator(entries.begin()), std::make_move_iterator(entries.end())};
 }
 
 // A token names a file of the audit cache folder: one that could lead out

@@ -28,10 +28,6 @@ std::optional<std::string> productKeyOf(const PlistDictionary& entry) {
   return *found->second.string();
 }
 
-PlistValue asValue(const UpdateJournal::Entries& entries) {
-  return PlistArray(entries.begin(), entries.end());
-}
-
 PlistValue asValue(const std::vector<std::string>& strings) {
   return PlistArray(strings.begin(), strings.end());
 }
@@ -86,10 +82,13 @@ UpdateJournal::Entries UpdateJournal::readPrunedLocked(bool ignorePending) const
   }
   // Items that are not dictionaries make no entry; they are gone at the
   // next write.
-  if (const PlistArray* items = (*document)[kEntriesKey].array()) {
+  // Moved out of the parsed document, which goes at the end of the read.
+  PlistDictionary* top = document->dictionary();
+  const auto list = top ? top->find(kEntriesKey) : PlistDictionary::iterator{};
+  if (PlistArray* items = top && list != top->end() ? list->second.array() : nullptr) {
     entries.reserve(items->size());
-    for (const PlistValue& item : *items) {
-      if (const PlistDictionary* entry = item.dictionary()) entries.push_back(*entry);
+    for (PlistValue& item : *items) {
+      if (PlistDictionary* entry = item.dictionary()) entries.push_back(std::move(*entry));
     }
   }
 
@@ -170,7 +169,7 @@ void UpdateJournal::appendLocked(Entries added) {
   Entries entries = readPrunedLocked(false);
   entries.insert(entries.end(), std::make_move_iterator(added.begin()),
                  std::make_move_iterator(added.end()));
-  writeLocked(entries);
+  writeLocked(std::move(entries));
 }
 
 void UpdateJournal::confirmPendingUpdates(const std::vector<std::string>& productKeys) {
@@ -208,14 +207,17 @@ void UpdateJournal::confirmPendingUpdates(const std::vector<std::string>& produc
   for (auto key = confirmedOrder.rbegin(); key != confirmedOrder.rend(); ++key) {
     entries.push_back(std::move(confirmed.at(*key)));
   }
-  writeLocked(entries);
+  writeLocked(std::move(entries));
 }
 
-void UpdateJournal::writeLocked(const Entries& entries) const {
+void UpdateJournal::writeLocked(Entries entries) const {
   // The binary writer takes every value an entry can hold, so there is no
   // encoding failure to report.
-  const PlistData bytes = PropertyListSerialization::writeBinary(
-      PlistDictionary{{std::string(kEntriesKey), asValue(entries)}});
+  // Moved, not copied: a braced list would copy every entry once more.
+  PlistDictionary document;
+  document.emplace(std::string(kEntriesKey), PlistArray(std::make_move_iterator(entries.begin()),
+                                                        std::make_move_iterator(entries.end())));
+  const PlistData bytes = PropertyListSerialization::writeBinary(document);
   const std::string file = path();
   // Temporaries of a writer killed mid-write; none of ours is under way
   // while the lock is held.

@@ -86,7 +86,7 @@ class UpdateJournal {
   // The file's entries, the stale ones at the front pruned; a missing or
   // damaged file gives none.
   [[nodiscard]] Entries readPrunedLocked(bool ignorePending) const REQUIRES(mutex_);
-  void writeLocked(const Entries& entries) const REQUIRES(mutex_);
+  void writeLocked(Entries entries) const REQUIRES(mutex_);
   void appendLocked(Entries added) REQUIRES(mutex_);
   // The entry of one OS update, or nullopt for a part of a bundle.
   [[nodiscard]] std::optional<PlistDictionary> entryOf(const SysupQuaymartUpdate& update) const;
