@@ -67,7 +67,9 @@ class UpdateJournalTest : public ServiceTest {
   PlistArray fileEntries() const {
     Result<std::vector<std::uint8_t>> bytes = FileIO::read(path());
     if (!bytes) return {};
-    EXPECT_EQ(std::string(bytes->begin(), bytes->begin() + 8), "bplist00");
+    const std::size_t head = std::min<std::size_t>(bytes->size(), 8);
+    EXPECT_EQ(std::string(bytes->begin(), bytes->begin() + static_cast<std::ptrdiff_t>(head)),
+              "bplist00");
     PlistValue document = PropertyListSerialization::read(*bytes).value_or(PlistValue());
     EXPECT_EQ(document.dictionary() ? document.dictionary()->size() : 0U, 1U);
     const PlistArray* entries = document["autoInstalledUpdates"].array();
