@@ -1,10 +1,12 @@
 #include "platform/plist/BinaryPlistWriter.h"
 
+#include <algorithm>
 #include <array>
 #include <bit>
 #include <limits>
 #include <optional>
 #include <unordered_map>
+#include <utility>
 #include <vector>
 
 #include "platform/plist/Utf8.h"
@@ -71,6 +73,12 @@ void appendBigEndian(PlistData& out, std::uint64_t value, unsigned width) {
   }
 }
 
+void putBigEndian(std::uint8_t* at, std::uint64_t value, unsigned width) {
+  for (unsigned index = 0; index < width; ++index) {
+    at[index] = static_cast<std::uint8_t>(value >> ((width - 1 - index) * 8));
+  }
+}
+
 // Non-negative integers take the fewest bytes; 1-, 2- and 4-byte integers
 // are unsigned in this format and 8-byte ones signed, so negative values
 // always take 8.
@@ -105,6 +113,51 @@ void appendUid(PlistData& out, std::uint64_t value) {
   out.push_back(static_cast<std::uint8_t>((kTypeUid << 4) | (width - 1)));
   appendBigEndian(out, value, width);
 }
+
+// Strings already numbered, by their text. Open addressing over one flat
+// array: a journal of 10,000 entries holds some 70,000 distinct strings, and
+// a node-based map spent more time allocating its nodes than encoding them.
+class StringNumbers {
+ public:
+  // The number of `text`, or `candidate` when it had none; then true.
+  std::pair<std::uint64_t, bool> findOrAdd(std::string_view text, std::uint64_t candidate) {
+    if ((count_ + 1) * 2 > slots_.size()) grow();
+    const std::size_t hash = std::hash<std::string_view>{}(text);
+    for (std::size_t index = hash & mask_;; index = (index + 1) & mask_) {
+      Slot& slot = slots_[index];
+      if (slot.number == kEmpty) {
+        slot = {hash, candidate, text};
+        ++count_;
+        return {candidate, true};
+      }
+      if (slot.hash == hash && slot.text == text) return {slot.number, false};
+    }
+  }
+
+ private:
+  static constexpr std::uint64_t kEmpty = std::numeric_limits<std::uint64_t>::max();
+  struct Slot {
+    std::size_t hash = 0;
+    std::uint64_t number = kEmpty;
+    std::string_view text;
+  };
+
+  void grow() {
+    const std::size_t size = std::max<std::size_t>(64, slots_.size() * 2);
+    std::vector<Slot> old = std::exchange(slots_, std::vector<Slot>(size));
+    mask_ = slots_.size() - 1;
+    for (const Slot& slot : old) {
+      if (slot.number == kEmpty) continue;
+      std::size_t index = slot.hash & mask_;
+      while (slots_[index].number != kEmpty) index = (index + 1) & mask_;
+      slots_[index] = slot;
+    }
+  }
+
+  std::vector<Slot> slots_;
+  std::size_t mask_ = 0;
+  std::size_t count_ = 0;
+};
 
 // One entry of the object table. Scalars are encoded as soon as they are
 // numbered (their bytes do not depend on the reference width), so the value
@@ -216,9 +269,9 @@ class BinaryEncoder {
   }
 
   std::uint64_t referenceForString(std::string_view text) {
-    const auto [entry, inserted] = strings_.try_emplace(text, objects_.size());
-    if (inserted) newScalar([&] { appendString(text); });
-    return entry->second;
+    const auto [number, added] = strings_.findOrAdd(text, objects_.size());
+    if (added) newScalar([&] { appendString(text); });
+    return number;
   }
 
   std::uint64_t referenceForInteger(const PlistValue& value) {
@@ -265,7 +318,11 @@ class BinaryEncoder {
     }
     const std::uint64_t offsetTableOffset = out_.size();
     const unsigned offsetWidth = byteWidthFor(offsets.back());
-    for (const std::uint64_t offset : offsets) appendBigEndian(out_, offset, offsetWidth);
+    std::uint8_t* table = grow(offsets.size() * offsetWidth);
+    for (const std::uint64_t offset : offsets) {
+      putBigEndian(table, offset, offsetWidth);
+      table += offsetWidth;
+    }
     writeTrailer(offsetWidth, offsetTableOffset);
   }
 
@@ -273,9 +330,19 @@ class BinaryEncoder {
     appendMarker(out_, object.containerType, object.count);
     const std::size_t referencesPerEntry = object.containerType == kTypeDictionary ? 2 : 1;
     const std::size_t end = object.begin + object.count * referencesPerEntry;
+    std::uint8_t* at = grow((end - object.begin) * referenceWidth_);
     for (std::size_t index = object.begin; index < end; ++index) {
-      appendBigEndian(out_, references_[index], referenceWidth_);
+      putBigEndian(at, references_[index], referenceWidth_);
+      at += referenceWidth_;
     }
+  }
+
+  // Room for `bytes` more at the end of the output, to be filled in place:
+  // one size check for a whole reference list instead of one per byte.
+  std::uint8_t* grow(std::size_t bytes) {
+    const std::size_t at = out_.size();
+    out_.resize(at + bytes);
+    return out_.data() + at;
   }
 
   void writeTrailer(unsigned offsetWidth, std::uint64_t offsetTableOffset) {
@@ -294,7 +361,7 @@ class BinaryEncoder {
   std::vector<std::uint64_t> references_;
   std::vector<std::uint64_t> valueReferences_;
   PlistData scalarBytes_;
-  std::unordered_map<std::string_view, std::uint64_t> strings_;
+  StringNumbers strings_;
   std::unordered_map<std::uint64_t, std::uint64_t> signedIntegers_;
   std::unordered_map<std::uint64_t, std::uint64_t> unsignedIntegers_;
   std::array<std::optional<std::uint64_t>, 2> booleans_;

@@ -69,29 +69,58 @@ UpdateJournal::Entries UpdateJournal::installedUpdatesJournalIgnoringPendingUpda
 }
 
 UpdateJournal::Entries UpdateJournal::readPrunedLocked(bool ignorePending) const {
+  const Entries& entries = currentEntriesLocked();
+  Entries kept;
+  const auto first = entries.begin() + static_cast<std::ptrdiff_t>(firstKeptIndex(entries));
+  kept.reserve(static_cast<std::size_t>(entries.end() - first));
+  std::copy_if(first, entries.end(), std::back_inserter(kept),
+               [ignorePending](const PlistDictionary& entry) {
+                 return !ignorePending || !isPending(entry);
+               });
+  return kept;
+}
+
+UpdateJournal::Entries UpdateJournal::takePrunedLocked() {
+  currentEntriesLocked();
+  Entries entries = std::move(cachedEntries_);
+  cachedEntries_.clear();
+  cachedIdentity_.reset();
+  entries.erase(entries.begin(),
+                entries.begin() + static_cast<std::ptrdiff_t>(firstKeptIndex(entries)));
+  return entries;
+}
+
+const UpdateJournal::Entries& UpdateJournal::currentEntriesLocked() const {
   const std::string file = path();
-  Entries entries;
+  const std::optional<FileIdentity> before = FileIO::identity(file);
+  if (before && before == cachedIdentity_) return cachedEntries_;
+  cachedIdentity_.reset();
+  cachedEntries_.clear();
   Result<std::vector<std::uint8_t>> bytes = FileIO::read(file);
-  if (!bytes) return entries;  // no journal yet
+  if (!bytes) return cachedEntries_;  // no journal yet
   Result<PlistValue> document = PropertyListSerialization::read(*bytes);
   if (!document) {
     // The next change replaces it with its own entries alone.
     TILL_LOG(1, "%@: Update journal at %@ does not parse and counts as empty - %@", kSpeaker, file,
              document.errorDescription());
-    return entries;
-  }
-  // Items that are not dictionaries make no entry; they are gone at the
-  // next write.
-  // Moved out of the parsed document, which goes at the end of the read.
-  PlistDictionary* top = document->dictionary();
-  const auto list = top ? top->find(kEntriesKey) : PlistDictionary::iterator{};
-  if (PlistArray* items = top && list != top->end() ? list->second.array() : nullptr) {
-    entries.reserve(items->size());
-    for (PlistValue& item : *items) {
-      if (PlistDictionary* entry = item.dictionary()) entries.push_back(std::move(*entry));
+  } else if (PlistDictionary* top = document->dictionary()) {
+    // Items that are not dictionaries make no entry; they are gone at the
+    // next write. Moved out of the parsed document, which goes at the end.
+    const auto list = top->find(kEntriesKey);
+    if (PlistArray* items = list != top->end() ? list->second.array() : nullptr) {
+      cachedEntries_.reserve(items->size());
+      for (PlistValue& item : *items) {
+        if (PlistDictionary* entry = item.dictionary()) cachedEntries_.push_back(std::move(*entry));
+      }
     }
   }
+  // Cached only when the file did not change while it was read: a version
+  // replaced in between would be remembered under the wrong identity.
+  if (before && FileIO::identity(file) == before) cachedIdentity_ = before;
+  return cachedEntries_;
+}
 
+std::size_t UpdateJournal::firstKeptIndex(const Entries& entries) const {
   // The list is oldest first, so the stale entries are at its front. The
   // walk stops at the first recent entry and at the first without a date:
   // an older entry behind either stays until they have gone.
@@ -101,10 +130,7 @@ UpdateJournal::Entries UpdateJournal::readPrunedLocked(bool ignorePending) const
     const PlistDate* date = found == entry.end() ? nullptr : found->second.date();
     return date == nullptr || !(date->secondsSince1970 < cutoff);
   });
-  entries.erase(entries.begin(), firstKept);
-
-  if (ignorePending) std::erase_if(entries, isPending);
-  return entries;
+  return static_cast<std::size_t>(firstKept - entries.begin());
 }
 
 // --- Changes ---
@@ -166,7 +192,7 @@ std::optional<PlistDictionary> UpdateJournal::entryOf(const SysupQuaymartUpdate&
 void UpdateJournal::appendLocked(Entries added) {
   // Pending entries are read too and written back: the confirmation after
   // the next logout looks for them in the file.
-  Entries entries = readPrunedLocked(false);
+  Entries entries = takePrunedLocked();
   entries.insert(entries.end(), std::make_move_iterator(added.begin()),
                  std::make_move_iterator(added.end()));
   writeLocked(std::move(entries));
@@ -176,7 +202,7 @@ void UpdateJournal::confirmPendingUpdates(const std::vector<std::string>& produc
   TILL_LOG(2, "%@: Confirming pending updates in journal with installedProductKeys = %@", kSpeaker,
            asValue(productKeys));
   MutexLock lock(mutex_);
-  Entries entries = readPrunedLocked(false);
+  Entries entries = takePrunedLocked();
   // Walked newest first, so that the newest entry of a product is the one
   // kept; the confirmed ones are added back in the order they stood.
   std::map<std::string, PlistDictionary, std::less<>> confirmed;
@@ -210,22 +236,33 @@ void UpdateJournal::confirmPendingUpdates(const std::vector<std::string>& produc
   writeLocked(std::move(entries));
 }
 
-void UpdateJournal::writeLocked(Entries entries) const {
+void UpdateJournal::writeLocked(Entries entries) {
   // The binary writer takes every value an entry can hold, so there is no
   // encoding failure to report.
   // Moved, not copied: a braced list would copy every entry once more.
   PlistDictionary document;
-  document.emplace(std::string(kEntriesKey), PlistArray(std::make_move_iterator(entries.begin()),
-                                                        std::make_move_iterator(entries.end())));
+  PlistValue& list =
+      document
+          .emplace(std::string(kEntriesKey), PlistArray(std::make_move_iterator(entries.begin()),
+                                                        std::make_move_iterator(entries.end())))
+          .first->second;
   const PlistData bytes = PropertyListSerialization::writeBinary(document);
   const std::string file = path();
   // Temporaries of a writer killed mid-write; none of ours is under way
   // while the lock is held.
   FileIO::removeStaleTemporaries(file);
-  if (Result<void> written = FileIO::writeAtomically(file, bytes); !written) {
+  FileIdentity written;
+  if (Result<void> result = FileIO::writeAtomically(file, bytes, &written); !result) {
     TILL_LOG(1, "%@: Failed to write to the auto update journal", kSpeaker);
-    TILL_LOG(3, "%@: %@: %@", kSpeaker, file, written.errorDescription());
+    TILL_LOG(3, "%@: %@: %@", kSpeaker, file, result.errorDescription());
+    return;  // nothing cached: the next call reads what the file holds
   }
+  // The entries written are the version the file now holds; moved back
+  // out of the document, which goes at the end of the write.
+  cachedEntries_.clear();
+  cachedEntries_.reserve(list.array()->size());
+  for (PlistValue& item : *list.array()) cachedEntries_.push_back(std::move(*item.dictionary()));
+  cachedIdentity_ = written;
 }
 
 }  // namespace larder

@@ -6,6 +6,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/system/FileIO.h"
 #include "platform/system/Mutex.h"
 #include "platform/value/PlistValue.h"
 #include "store-runtime/records/LedgerUpdate.h"
@@ -23,8 +24,12 @@ namespace larder {
 // entries stay in the file (every change reads them) but are left out of
 // what the store application is shown.
 //
-// Nothing of the journal stays in memory: each call reads the file, and each
-// change writes it whole. One lock covers every read, change and write, so
+// The file is the truth: each call checks its identity (inode, size,
+// modification time) and parses it again when it is not the version last
+// read or written here, so a change made by another process is seen. The
+// entries of that version stay in memory, so that a read after our own
+// write, and a change after it, do not parse again. Each change writes the
+// file whole. One lock covers every read, change and write, so
 // that two changes that meet never lose an entry; writes are atomic, so a
 // process killed at any moment leaves the old file or the new one. Nothing
 // here calls into the update queue, whose barrier a caller may hold.
@@ -84,9 +89,16 @@ class UpdateJournal {
 
  private:
   // The file's entries, the stale ones at the front pruned; a missing or
-  // damaged file gives none.
+  // damaged file gives none. A copy of the cached version.
   [[nodiscard]] Entries readPrunedLocked(bool ignorePending) const REQUIRES(mutex_);
-  void writeLocked(Entries entries) const REQUIRES(mutex_);
+  // The same, taken out of the cache for a change that writes them back.
+  [[nodiscard]] Entries takePrunedLocked() REQUIRES(mutex_);
+  // The entries of the file as it is now, parsed only when it is not the
+  // version cached.
+  const Entries& currentEntriesLocked() const REQUIRES(mutex_);
+  // Index of the first entry the prune keeps.
+  [[nodiscard]] std::size_t firstKeptIndex(const Entries& entries) const;
+  void writeLocked(Entries entries) REQUIRES(mutex_);
   void appendLocked(Entries added) REQUIRES(mutex_);
   // The entry of one OS update, or nullopt for a part of a bundle.
   [[nodiscard]] std::optional<PlistDictionary> entryOf(const SysupQuaymartUpdate& update) const;
@@ -95,6 +107,10 @@ class UpdateJournal {
   std::string fixedPath_;
   Clock clock_;
   mutable Mutex mutex_;
+  // The parsed entries of the file version `cachedIdentity_` names; no
+  // version is cached when it is empty.
+  mutable std::optional<FileIdentity> cachedIdentity_ GUARDED_BY(mutex_);
+  mutable Entries cachedEntries_ GUARDED_BY(mutex_);
 };
 
 }  // namespace larder

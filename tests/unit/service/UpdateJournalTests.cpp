@@ -4,6 +4,7 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <spawn.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -35,7 +36,10 @@ PlistDictionary entryAged(double ageSeconds, std::string name) {
 std::vector<std::string> titles(const UpdateJournal::Entries& entries) {
   std::vector<std::string> names;
   for (const PlistDictionary& entry : entries) {
-    const std::string* title = PlistValue(entry)["title"].string();
+    // Looked up in the entry itself: a pointer into a temporary copy would
+    // dangle once the copy goes.
+    const auto found = entry.find("title");
+    const std::string* title = found == entry.end() ? nullptr : found->second.string();
     names.push_back(title ? *title : "?");
   }
   return names;
@@ -234,6 +238,45 @@ TEST_F(UpdateJournalTest, AMissingFileIsEmptyAndTheFirstAppendMakesItsFolders) {
   EXPECT_EQ(UpdateJournal::sharedJournal().path(),
             temporary() + "/elsewhere/larder/Quaymart/updatejournal.plist")
       << "looked up at each use";
+}
+
+// The version written here is kept in memory, and the file's identity
+// decides whether it is still the file's: a replacement by another process
+// (new inode) or a rewrite in place of another size is read again, while a
+// file whose identity is unchanged is not parsed at all.
+TEST_F(UpdateJournalTest, TheKeptVersionAnswersOnlyWhileTheFileIsTheOneWrittenHere) {
+  journal_->appendCriticalUpdates({entryAged(kDay, "ours")});
+  ASSERT_EQ(titles(journal_->installedUpdatesJournal()), std::vector<std::string>{"ours"});
+
+  // Garbage of the same size in place, its modification time put back: the
+  // identity is the one written here, so the kept entries answer.
+  const std::optional<FileIdentity> written = FileIO::identity(path());
+  ASSERT_TRUE(written);
+  struct stat status {};
+  ASSERT_EQ(::stat(path().c_str(), &status), 0);
+  writeText(path(), std::string(written->size, 'x'));
+  const timespec times[2] = {status.st_atim, status.st_mtim};
+  ASSERT_EQ(::utimensat(AT_FDCWD, path().c_str(), times, 0), 0);
+  ASSERT_EQ(FileIO::identity(path()), written);
+  LogCapture log;
+  EXPECT_EQ(titles(journal_->installedUpdatesJournal()), std::vector<std::string>{"ours"});
+  EXPECT_EQ(log.countContaining("does not parse", 1), 0U) << "not parsed again";
+
+  // Another process replaces the file with the same number of entries.
+  const std::string replacement = path() + ".other";
+  writeBytes(replacement, PropertyListSerialization::writeBinary(PlistDictionary{
+                              {"autoInstalledUpdates", PlistArray{entryAged(kDay, "theirs")}}}));
+  fs::rename(replacement, path());
+  EXPECT_EQ(titles(journal_->installedUpdatesJournal()), std::vector<std::string>{"theirs"});
+  journal_->appendCriticalUpdates({entryAged(0, "next")});
+  EXPECT_EQ(titles(journal_->installedUpdatesJournal()),
+            (std::vector<std::string>{"theirs", "next"}))
+      << "a change starts from the file's version";
+
+  // A rewrite in place that keeps the inode but not the size.
+  writeEntries({entryAged(kDay, "rewritten in place"), entryAged(0, "by another writer")});
+  EXPECT_EQ(titles(journal_->installedUpdatesJournal()),
+            (std::vector<std::string>{"rewritten in place", "by another writer"}));
 }
 
 TEST_F(UpdateJournalTest, AFileThatDoesNotParseOrHasAnotherShapeCountsAsEmpty) {
