@@ -115,48 +115,55 @@ void appendUid(PlistData& out, std::uint64_t value) {
 }
 
 // Strings already numbered, by their text. Open addressing over one flat
-// array: a journal of 10,000 entries holds some 70,000 distinct strings, and
-// a node-based map spent more time allocating its nodes than encoding them.
+// array of 8-byte slots that point into a list of the strings: a journal of
+// 10,000 entries holds some 70,000 distinct strings, and a node-based map
+// spent more time allocating its nodes than encoding them (a table of whole
+// string views spent it faulting in its pages).
 class StringNumbers {
  public:
   // The number of `text`, or `candidate` when it had none; then true.
   std::pair<std::uint64_t, bool> findOrAdd(std::string_view text, std::uint64_t candidate) {
-    if ((count_ + 1) * 2 > slots_.size()) grow();
+    if ((strings_.size() + 1) * 2 > slots_.size()) grow();
     const std::size_t hash = std::hash<std::string_view>{}(text);
+    const auto tag = static_cast<std::uint32_t>(hash >> 32);
     for (std::size_t index = hash & mask_;; index = (index + 1) & mask_) {
       Slot& slot = slots_[index];
-      if (slot.number == kEmpty) {
-        slot = {hash, candidate, text};
-        ++count_;
+      if (slot.string == kEmpty) {
+        slot = {static_cast<std::uint32_t>(strings_.size()), tag};
+        strings_.push_back({text, candidate, hash});
         return {candidate, true};
       }
-      if (slot.hash == hash && slot.text == text) return {slot.number, false};
+      const Known& known = strings_[slot.string];
+      if (slot.tag == tag && known.text == text) return {known.number, false};
     }
   }
 
  private:
-  static constexpr std::uint64_t kEmpty = std::numeric_limits<std::uint64_t>::max();
+  static constexpr std::uint32_t kEmpty = std::numeric_limits<std::uint32_t>::max();
   struct Slot {
-    std::size_t hash = 0;
-    std::uint64_t number = kEmpty;
+    std::uint32_t string = kEmpty;  // into strings_
+    std::uint32_t tag = 0;          // the hash's high half, to skip most comparisons
+  };
+  struct Known {
     std::string_view text;
+    std::uint64_t number;
+    std::size_t hash;
   };
 
   void grow() {
-    const std::size_t size = std::max<std::size_t>(64, slots_.size() * 2);
-    std::vector<Slot> old = std::exchange(slots_, std::vector<Slot>(size));
+    slots_.assign(std::max<std::size_t>(1024, slots_.size() * 2), Slot{});
     mask_ = slots_.size() - 1;
-    for (const Slot& slot : old) {
-      if (slot.number == kEmpty) continue;
-      std::size_t index = slot.hash & mask_;
-      while (slots_[index].number != kEmpty) index = (index + 1) & mask_;
-      slots_[index] = slot;
+    for (std::size_t string = 0; string < strings_.size(); ++string) {
+      std::size_t index = strings_[string].hash & mask_;
+      while (slots_[index].string != kEmpty) index = (index + 1) & mask_;
+      slots_[index] = {static_cast<std::uint32_t>(string),
+                       static_cast<std::uint32_t>(strings_[string].hash >> 32)};
     }
   }
 
   std::vector<Slot> slots_;
+  std::vector<Known> strings_;
   std::size_t mask_ = 0;
-  std::size_t count_ = 0;
 };
 
 // One entry of the object table. Scalars are encoded as soon as they are
@@ -173,7 +180,9 @@ class BinaryEncoder {
  public:
   PlistData encode(const PlistValue& root) {
     const PlistValue emptyDictionary{PlistDictionary{}};
-    referenceFor(root.isNull() ? emptyDictionary : root);  // object 0
+    const PlistValue& top = root.isNull() ? emptyDictionary : root;
+    reserveFor(top);
+    referenceFor(top);  // object 0
     for (std::size_t index = 0; index < containerValues_.size(); ++index) {
       collectMembers(index);
     }
@@ -183,6 +192,36 @@ class BinaryEncoder {
   }
 
  private:
+  // Room for the objects and references of a tree shaped as `root`'s
+  // first level is: growing the tables of a large list, copy after copy,
+  // cost more than this look at one element of each.
+  void reserveFor(const PlistValue& root) {
+    std::size_t values = 1;
+    auto membersOf = [](const PlistValue& value) -> std::size_t {
+      if (const PlistArray* elements = value.array()) return elements->size();
+      if (const PlistDictionary* entries = value.dictionary()) return entries->size() * 2;
+      return 0;
+    };
+    auto forEachMember = [](const PlistValue& value, auto visit) {
+      if (const PlistArray* elements = value.array()) {
+        for (const PlistValue& element : *elements) visit(element);
+      } else if (const PlistDictionary* entries = value.dictionary()) {
+        for (const auto& entry : *entries) visit(entry.second);
+      }
+    };
+    // Two levels down, each list guessed from its first element's size.
+    forEachMember(root, [&](const PlistValue& member) {
+      const std::size_t count = membersOf(member);
+      values += count;
+      if (const PlistArray* elements = member.array(); elements && !elements->empty()) {
+        values += count * membersOf(elements->front());
+      }
+    });
+    objects_.reserve(values);
+    references_.reserve(values);
+    scalarBytes_.reserve(values * 16);
+  }
+
   // Numbers the members of the container, creating objects for the ones not
   // seen before. Breadth-first over a worklist, so nesting depth costs no
   // stack.
