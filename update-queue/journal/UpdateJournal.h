@@ -28,8 +28,10 @@ namespace larder {
 // modification time) and parses it again when it is not the version last
 // read or written here, so a change made by another process is seen. The
 // entries of that version stay in memory, so that a read after our own
-// write, and a change after it, do not parse again. Each change writes the
-// file whole. One lock covers every read, change and write, so
+// write, and a change after it, do not parse again. (A rewrite in place
+// that keeps the size and lands within the same tick of the file system's
+// clock would not be seen; every writer of this file replaces it by rename.)
+// Each change writes the file whole. One lock covers every read, change and write, so
 // that two changes that meet never lose an entry; writes are atomic, so a
 // process killed at any moment leaves the old file or the new one. Nothing
 // here calls into the update queue, whose barrier a caller may hold.
