@@ -25,6 +25,14 @@ void answer(const ReplyHandler& reply, PlistArray outArguments) {
   if (reply) reply(std::move(outArguments));
 }
 
+// One value moved into the answer: a braced list would copy it, and a
+// journal of 10,000 entries is a deep copy of 2.6 MB.
+void answerWith(const ReplyHandler& reply, PlistValue value) {
+  PlistArray outArguments;
+  outArguments.push_back(std::move(value));
+  answer(reply, std::move(outArguments));
+}
+
 const std::string& text(const Arguments& arguments, std::size_t index) {
   static const std::string kEmptyText;
   const std::string* value = arguments.at(index).string();
@@ -40,6 +48,17 @@ PlistArray wireForms(const std::vector<SysupQuaymartUpdate>& updates) {
 
 PlistArray stringArray(const std::vector<std::string>& strings) {
   return {strings.begin(), strings.end()};
+}
+
+PlistArray journalEntries(std::vector<PlistDictionary> entries) {
+  return {std::make_move_iterator(entries.begin()), std::make_move_iterator(entries.end())};
+}
+
+// A token names a file of the audit cache folder: one that could lead out
+// of it is no token the service gave, and answers as an unknown one does.
+PlistDictionary auditInfoForToken(const UpdateController& controller, const std::string& token) {
+  if (token.empty() || token.find('/') != std::string::npos) return {};
+  return controller.cachedUpdateAuditInfoWithKey(token).value_or(PlistDictionary{});
 }
 
 std::vector<std::string> texts(const Arguments& arguments, std::size_t index) {
@@ -136,11 +155,11 @@ void startAppInstallWithTags(AssetServiceInterface& i, const Arguments& a, const
 }
 
 // A request answered by the controller with one value.
-#define CONTROLLER_REPLY(member, expression)                                                \
-  [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {                 \
-    (void)a;                                                                                \
-    withController(i, member, r,                                                            \
-                   [&]([[maybe_unused]] UpdateController& c) { answer(r, {expression}); }); \
+#define CONTROLLER_REPLY(member, expression)                                                  \
+  [](AssetServiceInterface& i, const Arguments& a, const ReplyHandler& r) {                   \
+    (void)a;                                                                                  \
+    withController(i, member, r,                                                              \
+                   [&]([[maybe_unused]] UpdateController& c) { answerWith(r, expression); }); \
   }
 // A request the controller carries out without a reply.
 #define CONTROLLER_CALL(member, statement)                                  \
@@ -337,14 +356,16 @@ constexpr std::array kHandling = std::to_array<RequestHandling>({
    CONTROLLER_CALL("NowIsLaterWithModeCountdownDeferred", c.nowIsLaterWithMode(a.at(0).int64Value(), a.at(1).boolValue()))},
   {"LaterDidNotOccurWithDueToACPower", false,
    CONTROLLER_CALL("LaterDidNotOccurWithDueToACPower", c.laterDidNotOccurWithDueToACPower(a.at(0).boolValue()))},
-  {"InstalledUpdatesJournal", false, nullptr, kEmpty},
+  {"InstalledUpdatesJournal", false,
+   CONTROLLER_REPLY("InstalledUpdatesJournal", journalEntries(c.installedUpdatesJournal()))},
   {"IsAutoUpdateEnabled", false,
    CONTROLLER_REPLY("IsAutoUpdateEnabled", UpdateController::isAutoUpdatedEnabled())},
   {"ShouldPromptForAutoUpdateOptIn", false,
    CONTROLLER_REPLY("ShouldPromptForAutoUpdateOptIn", UpdateController::shouldPromptForAutoUpdateOptIn())},
   {"PromptUserToOptInForAutoUpdateWithShowNotification", false,
    CONTROLLER_CALL("PromptUserToOptInForAutoUpdateWithShowNotification", c.promptUserToOptInForAutoUpdateWithShowNotification(a.at(0).boolValue()))},
-  {"UpdateAutoInfoWithToken", false, nullptr, kEmpty},
+  {"UpdateAutoInfoWithToken", false,
+   CONTROLLER_REPLY("UpdateAutoInfoWithToken", auditInfoForToken(c, text(a, 0)))},
   {"MajorOSUpdateHasDownloadedToPath", false,
    CONTROLLER_REPLY("MajorOSUpdateHasDownloadedToPath", c.majorOSUpdateHasDownloadedToPath(text(a, 0)))},
   {"ManagedOSInstallWakeUpReceived", false,

@@ -214,7 +214,13 @@ class Writer {
         message_ << (value.date() ? value.date()->secondsSince1970 : value.doubleValue());
         return;
       case 's':
-        message_ << (value.string() ? *value.string() : std::string());
+        // Not a conditional expression: one of a reference and a temporary
+        // copies the text of every string written.
+        if (const std::string* text = value.string()) {
+          message_ << *text;
+        } else {
+          message_ << std::string();
+        }
         return;
       case 'o':
         message_ << sdbus::ObjectPath(value.string() && !value.string()->empty() ? *value.string()
@@ -241,7 +247,11 @@ class Writer {
   void writeArray(std::string_view element, const PlistValue& value) {
     if (element == "y") {
       const PlistData* data = value.data();
-      message_ << (data ? *data : PlistData{});
+      if (data != nullptr) {
+        message_ << *data;
+      } else {
+        message_ << PlistData{};
+      }
       return;
     }
     if (element.front() == '{') {
@@ -258,15 +268,16 @@ class Writer {
   }
 
   void writeDictionary(std::string_view entry, const PlistValue& value) {
-    std::string inner(entry.substr(1, entry.size() - 2));
-    std::string_view valueType = std::string_view(inner).substr(1);
+    const std::string inner(entry.substr(1, entry.size() - 2));
+    const std::string_view valueType = std::string_view(inner).substr(1);
+    const bool variants = valueType == "v";
     message_.openContainer(std::string(entry));
     if (const PlistDictionary* dictionary = value.dictionary()) {
       for (const auto& [key, element] : *dictionary) {
         if (element.isNull()) continue;
         message_.openDictEntry(inner);
         message_ << key;
-        if (valueType == "v") {
+        if (variants) {
           writeVariant(element, signatureInDictionary(key, element));
         } else {
           write(valueType, element);

@@ -17,6 +17,7 @@
 #include "store-runtime/host/PreferenceStore.h"
 #include "store-runtime/services/VendOperationQueue.h"
 #include "update-operation/UpdateOperation.h"
+#include "update-queue/journal/UpdateJournal.h"
 
 namespace larder {
 
@@ -29,11 +30,6 @@ constexpr std::string_view kBadgeNotificationObject = "updateDockTile";
 StoreClientRegistry<UpdateController>& registry() {
   static StoreClientRegistry<UpdateController> controllers;
   return controllers;
-}
-
-PlistDate now() {
-  using Seconds = std::chrono::duration<double>;
-  return PlistDate{Seconds(std::chrono::system_clock::now().time_since_epoch()).count()};
 }
 
 const PlistValue& valueOf(const PlistDictionary& info, std::string_view key) {
@@ -286,8 +282,8 @@ std::shared_ptr<UpdateOperation> UpdateController::softwareUpdateDidFinishBackgr
         });
     return nullptr;
   }
-  (void)PreferenceStore::setValue(kDefaultsLastAutoUpdateInvocationKey, now(), kDaemonDefaultsID,
-                                  PreferenceScope::User);
+  (void)PreferenceStore::setValue(kDefaultsLastAutoUpdateInvocationKey, PlistDate::now(),
+                                  kDaemonDefaultsID, PreferenceScope::User);
   recordSilentInstalls(info);
 
   auto operation = makeOperation();
@@ -323,7 +319,7 @@ void UpdateController::recordSilentInstalls(const PlistDictionary& info) {
     for (const auto& [unused, value] : *entries) {
       const PlistDictionary* entry = value.dictionary();
       if (!entry) continue;
-      PlistDictionary record{{"__isSoftwareUpdate", true}, {"installDate", now()}};
+      PlistDictionary record{{"__isSoftwareUpdate", true}, {"installDate", PlistDate::now()}};
       for (const auto& [from, to] : kJournalKeys) {
         if (entry->contains(from)) record[std::string(to)] = valueOf(*entry, from);
       }
@@ -450,18 +446,20 @@ void UpdateController::enqueue(const std::shared_ptr<UpdateOperation>& operation
   VendOperationQueue::mainQueue().addOperation(operation);
 }
 
-// --- Later parts of the service ---
+// --- The installed-updates journal ---
 
 void UpdateController::appendCriticalUpdatesToJournal(
     const std::vector<PlistDictionary>& entries) const {
-  TILL_LOG(2, "%@: %@ silently installed updates not journaled: no journal in this build", kSpeaker,
-           entries.size());
+  UpdateJournal::sharedJournal().appendCriticalUpdates(entries);
 }
 
 void UpdateController::confirmPendingUpdatesInJournal(
     const std::vector<std::string>& productKeys) const {
-  TILL_LOG(3, "%@: %@ post-logout installs not confirmed: no journal in this build", kSpeaker,
-           productKeys.size());
+  UpdateJournal::sharedJournal().confirmPendingUpdates(productKeys);
+}
+
+std::vector<PlistDictionary> UpdateController::installedUpdatesJournal() const {
+  return UpdateJournal::sharedJournal().installedUpdatesJournal();
 }
 
 }  // namespace larder

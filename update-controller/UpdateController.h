@@ -275,6 +275,12 @@ class UpdateController final : public UpdateQueueDelegate,
   // The moment passed unused; the user hears why, the lists stay.
   void laterDidNotOccurWithDueToACPower(bool dueToACPower);
 
+  // --- The installed-updates journal ---
+
+  // What was installed in the last 30 days, oldest first, without the OS
+  // updates that wait for a logout.
+  [[nodiscard]] std::vector<PlistDictionary> installedUpdatesJournal() const;
+
   // --- Audits that notifications carry the key of ---
 
   // Stores the audit as an XML property list in a file of its own; the
@@ -367,8 +373,6 @@ class UpdateController final : public UpdateQueueDelegate,
   void applyPostLogoutResults(const PlistDictionary& info, UpdateOperation& operation) const;
   void configureTimedTasks(const PlistDictionary& info, UpdateOperation& operation) const;
 
-  // The journal is not part of this build: what it would be given is
-  // logged, so that the decision can be seen.
   // Do It Later steps.
   [[nodiscard]] OSUpdateList osUpdatesToInstallLater();
   bool userAcceptsAgreement(const SysupQuaymartUpdate& update, bool firmware);
@@ -376,6 +380,8 @@ class UpdateController final : public UpdateQueueDelegate,
   void writeAppUpdatesToInstallLater(const std::vector<std::string>& bundleIdentifiers) const
       REQUIRES(installLaterLock_);
 
+  // The installed-updates journal: the background scan report's entries,
+  // and its word on the OS updates installed after a logout.
   void appendCriticalUpdatesToJournal(const std::vector<PlistDictionary>& entries) const;
   void confirmPendingUpdatesInJournal(const std::vector<std::string>& productKeys) const;
 

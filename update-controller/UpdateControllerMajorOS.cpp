@@ -79,10 +79,6 @@ double secondsNow() {
   return Seconds(std::chrono::system_clock::now().time_since_epoch()).count();
 }
 
-PlistDate now() {
-  return PlistDate{secondsNow()};
-}
-
 std::optional<std::string> stringOf(const PlistDictionary& dictionary, std::string_view key) {
   auto found = dictionary.find(key);
   if (found == dictionary.end() || !found->second.string()) return std::nullopt;
@@ -277,7 +273,7 @@ void UpdateController::majorOSUpdateAvailableWithInfoBundlePath(
              !maximum.isNull()) {
     delay = maximum.int64Value();
   }
-  PlistDate evaluationDate = now();
+  PlistDate evaluationDate = PlistDate::now();
   if (delay > 0) {
     std::random_device seed;
     std::mt19937_64 generator(seed());
@@ -491,7 +487,7 @@ void UpdateController::startMajorOSUpdateBackgroundDownload(
   // The handlers come on this queue, so they see this write.
   PlistDictionary state = readMajorOSUpdatePrefs();
   state[std::string(kDownloadStateKey)] = std::string(kStarted);
-  state[std::string(kDownloadStartDateKey)] = now();
+  state[std::string(kDownloadStartDateKey)] = PlistDate::now();
   writeMajorOSUpdatePrefs(state);
 }
 
@@ -610,8 +606,9 @@ void UpdateController::majorOSUpdateWillBeDownloadedByDaemonWithItemIdentifier(
     auto self = weakSelf.lock();
     if (!self) return;
     PlistDictionary state = self->readMajorOSUpdatePrefs();
-    state[std::string(kDaemonDownloadKey)] = PlistDictionary{
-        {"StartDate", now()}, {"ItemID", itemIdentifier}, {"VersionID", versionIdentifier}};
+    state[std::string(kDaemonDownloadKey)] = PlistDictionary{{"StartDate", PlistDate::now()},
+                                                             {"ItemID", itemIdentifier},
+                                                             {"VersionID", versionIdentifier}};
     self->writeMajorOSUpdatePrefs(state);
   });
 }

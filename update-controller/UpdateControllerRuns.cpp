@@ -12,6 +12,7 @@
 #include "store-runtime/services/VendDownloadService.h"
 #include "store-runtime/services/VendUIService.h"
 #include "update-controller/UpdateController.h"
+#include "update-queue/journal/UpdateJournal.h"
 
 namespace larder {
 
@@ -86,12 +87,7 @@ bool UpdateController::confirmRestartWithUpdatesWillDownload(bool willDownload) 
 
 void UpdateController::appendInstalledUpdatesToJournal(const std::vector<LedgerUpdateRef>& apps,
                                                        const OSUpdateList& osUpdates) {
-  for (const LedgerUpdateRef& update : apps) {
-    TILL_LOG(1, "%@: Installed update %@ (no update journal to append it to)", kSpeaker, update);
-  }
-  for (const SysupQuaymartUpdate& update : osUpdates) {
-    TILL_LOG(1, "%@: Installed OS update %@ (no update journal to append it to)", kSpeaker, update);
-  }
+  UpdateJournal::sharedJournal().appendInstalledUpdates(apps, osUpdates);
 }
 
 }  // namespace larder

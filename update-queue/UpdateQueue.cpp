@@ -15,6 +15,7 @@
 #include "store-runtime/download/VendFileManager.h"
 #include "store-runtime/services/VendOperationQueue.h"
 #include "update-queue/LoadUpdateQueueOperation.h"
+#include "update-queue/journal/UpdateJournal.h"
 
 namespace larder {
 namespace {
@@ -63,11 +64,6 @@ UpdateQueue::UpdateList updatesFromCache(const PlistDictionary& cache, std::stri
     updates.push_back(std::move(update));
   }
   return updates;
-}
-
-PlistDate now() {
-  using Seconds = std::chrono::duration<double>;
-  return PlistDate{Seconds(std::chrono::system_clock::now().time_since_epoch()).count()};
 }
 
 }  // namespace
@@ -349,9 +345,9 @@ void UpdateQueue::didFinishDownloadForUpdateWithItemIdentifier(std::uint64_t ite
 }
 
 void UpdateQueue::appendInstalledUpdateToJournal(const LedgerUpdateRef& update) {
-  // The installed-updates journal is not kept yet; until it is, the record
-  // of the installed update goes to the log, where support can find it.
-  TILL_LOG(1, "%@: Installed update %@ (no update journal to append it to)", kSpeaker, update);
+  // Called inside the queue's barrier: the journal never calls back into
+  // the queue, so this cannot wait for itself.
+  UpdateJournal::sharedJournal().appendInstalledUpdates({update}, {});
 }
 
 bool UpdateQueue::removeAvailableUpdatesWithItemIdentifier(std::uint64_t itemIdentifier,
@@ -405,7 +401,8 @@ void UpdateQueue::setAutoUpdateAbortCode(std::int64_t abortCode, std::uint64_t i
     bool matched =
         forEachAvailableUpdateWithItemIdentifier(itemIdentifier, [&](LedgerUpdate& update) {
           update.setAutoUpdateAbortCode(abortCode);
-          if (!update.firstAutoUpdateAttemptDate()) update.setFirstAutoUpdateAttemptDate(now());
+          if (!update.firstAutoUpdateAttemptDate())
+            update.setFirstAutoUpdateAttemptDate(PlistDate::now());
         });
     if (!matched) return;
     save();

@@ -1,10 +1,12 @@
 #include "platform/plist/BinaryPlistWriter.h"
 
+#include <algorithm>
 #include <array>
 #include <bit>
 #include <limits>
 #include <optional>
 #include <unordered_map>
+#include <utility>
 #include <vector>
 
 #include "platform/plist/Utf8.h"
@@ -71,6 +73,12 @@ void appendBigEndian(PlistData& out, std::uint64_t value, unsigned width) {
   }
 }
 
+void putBigEndian(std::uint8_t* at, std::uint64_t value, unsigned width) {
+  for (unsigned index = 0; index < width; ++index) {
+    at[index] = static_cast<std::uint8_t>(value >> ((width - 1 - index) * 8));
+  }
+}
+
 // Non-negative integers take the fewest bytes; 1-, 2- and 4-byte integers
 // are unsigned in this format and 8-byte ones signed, so negative values
 // always take 8.
@@ -106,6 +114,58 @@ void appendUid(PlistData& out, std::uint64_t value) {
   appendBigEndian(out, value, width);
 }
 
+// Strings already numbered, by their text. Open addressing over one flat
+// array of 8-byte slots that point into a list of the strings: a journal of
+// 10,000 entries holds some 70,000 distinct strings, and a node-based map
+// spent more time allocating its nodes than encoding them (a table of whole
+// string views spent it faulting in its pages).
+class StringNumbers {
+ public:
+  // The number of `text`, or `candidate` when it had none; then true.
+  std::pair<std::uint64_t, bool> findOrAdd(std::string_view text, std::uint64_t candidate) {
+    if ((strings_.size() + 1) * 2 > slots_.size()) grow();
+    const std::size_t hash = std::hash<std::string_view>{}(text);
+    const auto tag = static_cast<std::uint32_t>(hash >> 32);
+    for (std::size_t index = hash & mask_;; index = (index + 1) & mask_) {
+      Slot& slot = slots_[index];
+      if (slot.string == kEmpty) {
+        slot = {static_cast<std::uint32_t>(strings_.size()), tag};
+        strings_.push_back({text, candidate, hash});
+        return {candidate, true};
+      }
+      const Known& known = strings_[slot.string];
+      if (slot.tag == tag && known.text == text) return {known.number, false};
+    }
+  }
+
+ private:
+  static constexpr std::uint32_t kEmpty = std::numeric_limits<std::uint32_t>::max();
+  struct Slot {
+    std::uint32_t string = kEmpty;  // into strings_
+    std::uint32_t tag = 0;          // the hash's high half, to skip most comparisons
+  };
+  struct Known {
+    std::string_view text;
+    std::uint64_t number;
+    std::size_t hash;
+  };
+
+  void grow() {
+    slots_.assign(std::max<std::size_t>(1024, slots_.size() * 2), Slot{});
+    mask_ = slots_.size() - 1;
+    for (std::size_t string = 0; string < strings_.size(); ++string) {
+      std::size_t index = strings_[string].hash & mask_;
+      while (slots_[index].string != kEmpty) index = (index + 1) & mask_;
+      slots_[index] = {static_cast<std::uint32_t>(string),
+                       static_cast<std::uint32_t>(strings_[string].hash >> 32)};
+    }
+  }
+
+  std::vector<Slot> slots_;
+  std::vector<Known> strings_;
+  std::size_t mask_ = 0;
+};
+
 // One entry of the object table. Scalars are encoded as soon as they are
 // numbered (their bytes do not depend on the reference width), so the value
 // tree is walked once; containers keep their member references until the
@@ -120,7 +180,9 @@ class BinaryEncoder {
  public:
   PlistData encode(const PlistValue& root) {
     const PlistValue emptyDictionary{PlistDictionary{}};
-    referenceFor(root.isNull() ? emptyDictionary : root);  // object 0
+    const PlistValue& top = root.isNull() ? emptyDictionary : root;
+    reserveFor(top);
+    referenceFor(top);  // object 0
     for (std::size_t index = 0; index < containerValues_.size(); ++index) {
       collectMembers(index);
     }
@@ -130,6 +192,36 @@ class BinaryEncoder {
   }
 
  private:
+  // Room for the objects and references of a tree shaped as `root`'s
+  // first level is: growing the tables of a large list, copy after copy,
+  // cost more than this look at one element of each.
+  void reserveFor(const PlistValue& root) {
+    std::size_t values = 1;
+    auto membersOf = [](const PlistValue& value) -> std::size_t {
+      if (const PlistArray* elements = value.array()) return elements->size();
+      if (const PlistDictionary* entries = value.dictionary()) return entries->size() * 2;
+      return 0;
+    };
+    auto forEachMember = [](const PlistValue& value, auto visit) {
+      if (const PlistArray* elements = value.array()) {
+        for (const PlistValue& element : *elements) visit(element);
+      } else if (const PlistDictionary* entries = value.dictionary()) {
+        for (const auto& entry : *entries) visit(entry.second);
+      }
+    };
+    // Two levels down, each list guessed from its first element's size.
+    forEachMember(root, [&](const PlistValue& member) {
+      const std::size_t count = membersOf(member);
+      values += count;
+      if (const PlistArray* elements = member.array(); elements && !elements->empty()) {
+        values += count * membersOf(elements->front());
+      }
+    });
+    objects_.reserve(values);
+    references_.reserve(values);
+    scalarBytes_.reserve(values * 16);
+  }
+
   // Numbers the members of the container, creating objects for the ones not
   // seen before. Breadth-first over a worklist, so nesting depth costs no
   // stack.
@@ -216,9 +308,9 @@ class BinaryEncoder {
   }
 
   std::uint64_t referenceForString(std::string_view text) {
-    const auto [entry, inserted] = strings_.try_emplace(text, objects_.size());
-    if (inserted) newScalar([&] { appendString(text); });
-    return entry->second;
+    const auto [number, added] = strings_.findOrAdd(text, objects_.size());
+    if (added) newScalar([&] { appendString(text); });
+    return number;
   }
 
   std::uint64_t referenceForInteger(const PlistValue& value) {
@@ -265,7 +357,11 @@ class BinaryEncoder {
     }
     const std::uint64_t offsetTableOffset = out_.size();
     const unsigned offsetWidth = byteWidthFor(offsets.back());
-    for (const std::uint64_t offset : offsets) appendBigEndian(out_, offset, offsetWidth);
+    std::uint8_t* table = grow(offsets.size() * offsetWidth);
+    for (const std::uint64_t offset : offsets) {
+      putBigEndian(table, offset, offsetWidth);
+      table += offsetWidth;
+    }
     writeTrailer(offsetWidth, offsetTableOffset);
   }
 
@@ -273,9 +369,19 @@ class BinaryEncoder {
     appendMarker(out_, object.containerType, object.count);
     const std::size_t referencesPerEntry = object.containerType == kTypeDictionary ? 2 : 1;
     const std::size_t end = object.begin + object.count * referencesPerEntry;
+    std::uint8_t* at = grow((end - object.begin) * referenceWidth_);
     for (std::size_t index = object.begin; index < end; ++index) {
-      appendBigEndian(out_, references_[index], referenceWidth_);
+      putBigEndian(at, references_[index], referenceWidth_);
+      at += referenceWidth_;
     }
+  }
+
+  // Room for `bytes` more at the end of the output, to be filled in place:
+  // one size check for a whole reference list instead of one per byte.
+  std::uint8_t* grow(std::size_t bytes) {
+    const std::size_t at = out_.size();
+    out_.resize(at + bytes);
+    return out_.data() + at;
   }
 
   void writeTrailer(unsigned offsetWidth, std::uint64_t offsetTableOffset) {
@@ -294,7 +400,7 @@ class BinaryEncoder {
   std::vector<std::uint64_t> references_;
   std::vector<std::uint64_t> valueReferences_;
   PlistData scalarBytes_;
-  std::unordered_map<std::string_view, std::uint64_t> strings_;
+  StringNumbers strings_;
   std::unordered_map<std::uint64_t, std::uint64_t> signedIntegers_;
   std::unordered_map<std::uint64_t, std::uint64_t> unsignedIntegers_;
   std::array<std::optional<std::uint64_t>, 2> booleans_;

@@ -69,4 +69,8 @@ std::string Environment::userConfigDirectory() {
   return xdgDirectory("XDG_CONFIG_HOME", ".config") + "/larder";
 }
 
+std::string Environment::dataDirectory() {
+  return xdgDirectory("XDG_DATA_HOME", ".local/share") + "/larder";
+}
+
 }  // namespace larder

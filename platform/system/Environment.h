@@ -27,6 +27,9 @@ class Environment {
   static std::string stateDirectory();
   // $XDG_CONFIG_HOME/larder, default ~/.config/larder.
   static std::string userConfigDirectory();
+  // $XDG_DATA_HOME/larder, default ~/.local/share/larder: the user's data
+  // that is neither cache nor state (the installed-updates journal).
+  static std::string dataDirectory();
 
   // Reads a variable; empty when unset.
   static std::string variable(const char* name);

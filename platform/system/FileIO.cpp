@@ -117,7 +117,25 @@ Result<void> FileIO::createDirectories(const std::string& path) {
   return {};
 }
 
-Result<void> FileIO::writeAtomically(const std::string& path, std::span<const std::uint8_t> bytes) {
+namespace {
+
+FileIdentity identityOf(const struct stat& status) {
+  return {
+      static_cast<std::uint64_t>(status.st_dev), static_cast<std::uint64_t>(status.st_ino),
+      static_cast<std::uint64_t>(status.st_size),
+      static_cast<std::int64_t>(status.st_mtim.tv_sec) * 1'000'000'000 + status.st_mtim.tv_nsec};
+}
+
+}  // namespace
+
+std::optional<FileIdentity> FileIO::identity(const std::string& path) {
+  struct stat status {};
+  if (::stat(path.c_str(), &status) != 0) return std::nullopt;
+  return identityOf(status);
+}
+
+Result<void> FileIO::writeAtomically(const std::string& path, std::span<const std::uint8_t> bytes,
+                                     FileIdentity* written) {
   std::string parent = std::filesystem::path(path).parent_path().string();
   if (!parent.empty()) {
     if (auto created = createDirectories(parent); !created) return created;
@@ -131,6 +149,14 @@ Result<void> FileIO::writeAtomically(const std::string& path, std::span<const st
     ::unlink(temporary.c_str());
     return failure;
   }
+  // The rename keeps the inode, the size and the modification time.
+  struct stat status {};
+  if (written != nullptr && ::fstat(file.get(), &status) != 0) {
+    VendError failure = systemError("stat " + temporary);
+    ::unlink(temporary.c_str());
+    return failure;
+  }
+  if (written != nullptr) *written = identityOf(status);
   if (::close(file.release()) != 0 || ::rename(temporary.c_str(), path.c_str()) != 0) {
     VendError failure = systemError("replace " + path);
     ::unlink(temporary.c_str());

@@ -11,6 +11,17 @@
 
 namespace larder {
 
+// What tells one version of a file from another without reading it: a
+// replacement by rename brings a new inode, a rewrite in place a new
+// modification time (nanoseconds) or size.
+struct FileIdentity {
+  std::uint64_t device = 0;
+  std::uint64_t inode = 0;
+  std::uint64_t size = 0;
+  std::int64_t modifiedNanoseconds = 0;
+  bool operator==(const FileIdentity&) const = default;
+};
+
 // Whole-file reads and crash-safe writes. A failure is an error of
 // `kErrorDomain` whose code is the errno of the call that failed.
 class FileIO {
@@ -25,13 +36,20 @@ class FileIO {
   // Writes to a temporary file beside `path`, flushes it to disk and
   // renames it over `path`, so that a reader sees the old or the new
   // contents and never a torn file. Creates missing parent folders.
-  static Result<void> writeAtomically(const std::string& path, std::span<const std::uint8_t> bytes);
+  // `written`, when given, receives the identity of the new file, taken
+  // before the rename so that it is ours even if another process replaces
+  // the file right after.
+  static Result<void> writeAtomically(const std::string& path, std::span<const std::uint8_t> bytes,
+                                      FileIdentity* written = nullptr);
   static Result<void> writeAtomically(const std::string& path, std::string_view text);
 
   // Truncates and rewrites `path` itself, for files whose readers are
   // built to survive a torn write (they start empty on a file that does
   // not parse). Creates missing parent folders; the file is 0600.
   static Result<void> writeInPlace(const std::string& path, std::span<const std::uint8_t> bytes);
+
+  // The identity of the file at `path` now, or nullopt when there is none.
+  static std::optional<FileIdentity> identity(const std::string& path);
 
   static Result<void> createDirectories(const std::string& path);
 

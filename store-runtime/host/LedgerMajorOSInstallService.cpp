@@ -23,11 +23,6 @@ PlatformStateFile stateFile() {
   return PlatformStateFile::named(LedgerMajorOSInstallService::kStateFileName);
 }
 
-PlistDate currentDate() {
-  auto since = std::chrono::system_clock::now().time_since_epoch();
-  return PlistDate{std::chrono::duration<double>(since).count()};
-}
-
 }  // namespace
 
 LedgerMajorOSInstallService::LedgerMajorOSInstallService(std::string serviceName,
@@ -116,7 +111,7 @@ Result<void> LedgerMajorOSInstallService::requestInstallationWithSetupHerald(
                       PlistDictionary{{"setupHerald", setupHeraldPath},
                                       {"targetMountPoint", targetMountPoint},
                                       {"authorized", authorization.has_value()},
-                                      {"date", currentDate()}});
+                                      {"date", PlistDate::now()}});
 }
 
 void LedgerMajorOSInstallService::agentIsActiveWithReply(BoolReply reply) {
@@ -126,14 +121,14 @@ void LedgerMajorOSInstallService::agentIsActiveWithReply(BoolReply reply) {
 
 Result<void> LedgerMajorOSInstallService::userHasAllowedInstallToProceed() {
   if (Result<void> valid = checkValid(); !valid) return valid;
-  return appendRecord("installAllowedDates", PlistValue(currentDate()));
+  return appendRecord("installAllowedDates", PlistValue(PlistDate::now()));
 }
 
 void LedgerMajorOSInstallService::checkInAgent(const std::string& agentIdentifier,
                                                BoolReply reply) {
   bool recorded =
       checkValid() && appendRecord("agentCheckIns", PlistDictionary{{"agent", agentIdentifier},
-                                                                    {"date", currentDate()}});
+                                                                    {"date", PlistDate::now()}});
   if (reply) reply(recorded);
 }
 

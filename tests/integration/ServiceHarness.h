@@ -251,6 +251,7 @@ class TemporaryPlatform {
             {"XDG_CACHE_HOME", cacheHome()},
             {"XDG_STATE_HOME", stateHome()},
             {"XDG_CONFIG_HOME", home() + "/.config"},
+            {"XDG_DATA_HOME", home() + "/.local/share"},
             {"LARDER_LOG_LEVEL", "3"}};
   }
 

@@ -39,6 +39,7 @@
 #include "update-operation/UpdateOperation.h"
 #include "update-operation/VendUpdateDelegate.h"
 #include "update-queue/UpdateQueue.h"
+#include "update-queue/journal/UpdateJournal.h"
 
 namespace larder::testing {
 namespace {
@@ -68,6 +69,7 @@ class UpdateRunTest : public InProcessRuntimeTest {
     environment_.set("HOME", platform_.home());
     environment_.set("XDG_CACHE_HOME", platform_.cacheHome());
     environment_.set("XDG_STATE_HOME", platform_.stateHome());
+    environment_.set("XDG_DATA_HOME", platform_.home() + "/.local/share");
     fs::create_directories(applications());
     fs::create_directories(VendFileManager::cacheDirectoryPathWithName(kDaemonDefaultsID));
     catalogue_.addAccount(
@@ -253,6 +255,12 @@ TEST_F(UpdateRunTest, AnAppThatIsNotRunningIsStagedAndInstalledInOneRun) {
   EXPECT_EQ(queued(kNotesID), nullptr);
   EXPECT_EQ(queued(kAtlasID), nullptr);
   EXPECT_EQ(run->runState().autoInstalledAppUpdates.size(), 2U);
+  // Each installed update is in the journal, with the version it brought.
+  const UpdateJournal::Entries journal = UpdateJournal::sharedJournal().installedUpdatesJournal();
+  ASSERT_EQ(journal.size(), 2U);
+  for (const PlistDictionary& entry : journal) {
+    EXPECT_EQ(PlistValue(entry)["version"], PlistValue("2.0"));
+  }
   // The run tells the user what it updated.
   const std::vector<UserNotification> told = notifications_->deliveredNotifications();
   ASSERT_EQ(told.size(), 1U);

@@ -48,6 +48,22 @@ CLI::Validator secondsCheck(bool zeroAllowed, std::string what) {
       "SECONDS");
 }
 
+// A number of days above 0, as `history --since` takes it.
+const CLI::Validator& daysCheck() {
+  static const CLI::Validator validator(
+      [](std::string& word) -> std::string {
+        double value = 0;
+        const char* end = word.data() + word.size();
+        const auto [stop, error] = std::from_chars(word.data(), end, value);
+        if (error != std::errc() || stop != end || !std::isfinite(value) || value <= 0) {
+          return "days are a number above 0, not '" + word + "'";
+        }
+        return {};
+      },
+      "DAYS");
+  return validator;
+}
+
 }  // namespace
 
 CommandLine::CommandLine() : app_("talk to the larder store service", "larderctl") {
@@ -228,6 +244,12 @@ void CommandLine::addUpdateCommands() {
                    "an app update's item identifier, bundle identifier or title, or an OS "
                    "update's product key or title")
       ->required();
+  auto* history = app_.add_subcommand(
+      "history",
+      "list what was installed in the last 30 days, newest first, as the store application shows "
+      "it (exit status 3: nothing)");
+  history->add_option("--since", historySinceDays, "only what was installed in the last DAYS days")
+      ->check(daysCheck());
   auto* notifications = app_.add_subcommand(
       "notifications",
       "list the notifications the service delivered (exit status 3: none), or act on one as the "

@@ -81,6 +81,8 @@ class CommandLine {
   std::optional<std::string> notificationAction;
   // later
   LaterOptions later;
+  // history
+  std::optional<double> historySinceDays;
   // prefs get|set|delete
   PreferencesOptions preferences;
   // The subcommand of a command that has them ("get" of "prefs get").

@@ -14,6 +14,7 @@
 #include "tools/larderctl/DialogCommand.h"
 #include "tools/larderctl/DmapDumpCommand.h"
 #include "tools/larderctl/ExitStatus.h"
+#include "tools/larderctl/HistoryCommand.h"
 #include "tools/larderctl/InstallCommand.h"
 #include "tools/larderctl/LaterAgentCommand.h"
 #include "tools/larderctl/LaterCommand.h"
@@ -176,6 +177,10 @@ int runChosen(const CommandLine& line) {
   if (line.chose("why")) {
     ServiceClient client = connect(line.global);
     return WhyCommand(client, line.global.json).run(line.whyTarget);
+  }
+  if (line.chose("history")) {
+    ServiceClient client = connect(line.global);
+    return HistoryCommand(client, line.global.json).run(line.historySinceDays);
   }
   if (line.chose("runs")) {
     ServiceClient client = connect(line.global);

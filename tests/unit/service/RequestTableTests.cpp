@@ -83,13 +83,12 @@ constexpr std::string_view kHandledRequests =
     "CancelOSUpdates CancelOSUpdatesWithProductKeys AppUpdatesToInstallLater "
     "RemoveUpdateFromInstallLaterWithBundleID InstallAvailableUpdatesLaterWithMode "
     "CancelUpdatesToBeInstalledLater NowIsLaterWithModeCountdownDeferred "
-    "LaterDidNotOccurWithDueToACPower "
+    "LaterDidNotOccurWithDueToACPower InstalledUpdatesJournal UpdateAutoInfoWithToken "
     "WillInteractivelyPurchaseItemIdentifier DidInteractivelyPurchaseItemIdentifierSuccess "
     "MajorOSUpdateHasDownloadedToPath ManagedOSInstallWakeUpReceived "
     "DownloadSetupHeraldForTagsBundleIdentifier CheckSHDownloadStatus "
     "AccountLessDownloadHeartbeat";
 constexpr std::string_view kEmptyReplyRequests =
-    "InstalledUpdatesJournal UpdateAutoInfoWithToken "
     "CountOfBooksWithInfo SortedBooksWithInfo BookAtIndexWithInfo "
     "BookWithInfo HasSampleWithItemIdentifier PurchasedItems";
 // Some of these have a handler for the part this build has (the client type).

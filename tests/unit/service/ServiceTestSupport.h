@@ -171,9 +171,9 @@ inline void writePlist(const std::string& path, const PlistValue& value) {
 // temporary folder. The variables are put back as they were afterwards.
 class ServiceTest : public ::testing::Test {
  protected:
-  static constexpr const char* kVariables[] = {"LARDER_ROOT",     "HOME",
-                                               "XDG_CACHE_HOME",  "XDG_STATE_HOME",
-                                               "XDG_CONFIG_HOME", "__OSINSTALL_ENVIRONMENT"};
+  static constexpr const char* kVariables[] = {
+      "LARDER_ROOT",     "HOME",          "XDG_CACHE_HOME",         "XDG_STATE_HOME",
+      "XDG_CONFIG_HOME", "XDG_DATA_HOME", "__OSINSTALL_ENVIRONMENT"};
 
   void SetUp() override {
     for (const char* name : kVariables) environment_.save(name);
@@ -207,6 +207,7 @@ class ServiceTest : public ::testing::Test {
     ::setenv("XDG_CACHE_HOME", (temporary_ + "/cache").c_str(), 1);
     ::setenv("XDG_STATE_HOME", (temporary_ + "/state").c_str(), 1);
     ::setenv("XDG_CONFIG_HOME", (temporary_ + "/config").c_str(), 1);
+    ::setenv("XDG_DATA_HOME", (temporary_ + "/data").c_str(), 1);
   }
 
   [[nodiscard]] std::string rootApplications() const { return root_ + "/Applications"; }

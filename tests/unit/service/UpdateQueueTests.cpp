@@ -17,6 +17,7 @@
 #include "store-runtime/runtime/VendRuntime.h"
 #include "update-queue/SoftwareUpdatesProvider.h"
 #include "update-queue/UpdateQueue.h"
+#include "update-queue/journal/UpdateJournal.h"
 
 namespace larder::testing {
 namespace {
@@ -443,7 +444,11 @@ TEST_F(UpdateQueueTest, AnUpdateBeingDownloadedReachesTheJournalAfterACheckDropp
   queue->didFinishDownloadForUpdateWithItemIdentifier(101, true);
   // Its record is let go once the download has ended.
   queue->didFinishDownloadForUpdateWithItemIdentifier(101, true);
-  EXPECT_EQ(log.countContaining("Installed update <LedgerUpdate: itemIdentifier=101", 1), 1U);
+  // The record the download started with is what the journal keeps.
+  const UpdateJournal::Entries journal = UpdateJournal::sharedJournal().installedUpdatesJournal();
+  ASSERT_EQ(journal.size(), 1U);
+  EXPECT_EQ(PlistValue(journal[0])["ware-id"].int64Value(), 101);
+  EXPECT_TRUE(PlistValue(journal[0])["installDate"].isDate());
   EXPECT_EQ(log.countContaining("Failed to find queued update for item identifier 101 - journal "
                                 "may be incomplete",
                                 1),
@@ -453,6 +458,8 @@ TEST_F(UpdateQueueTest, AnUpdateBeingDownloadedReachesTheJournalAfterACheckDropp
       << "a download that did not install changes nothing";
   queue->didFinishDownloadForUpdateWithItemIdentifier(102, true);
   EXPECT_TRUE(queue->availableUpdates()->empty());
+  EXPECT_EQ(UpdateJournal::sharedJournal().installedUpdatesJournal().size(), 2U)
+      << "only the download that installed is journaled";
   EXPECT_EQ(log.countContaining("Removed obsolete update <LedgerUpdate: itemIdentifier=102 "
                                 "bundleID=com.example.birch"),
             1U)
